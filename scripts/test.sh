@@ -1,0 +1,17 @@
+#!/usr/bin/env bash
+# Builds vessad and runs every test (unit and end-to-end) with CTest.
+#   scripts/test.sh              the normal build
+#   scripts/test.sh address      an ASan+UBSan build in build-address/
+#   scripts/test.sh thread       a TSan build in build-thread/
+set -euo pipefail
+cd "$(dirname "$0")/.."
+scripts/setup.sh
+flavour=${1:-}
+if [[ -n "$flavour" ]]; then
+  export BUILD_DIR=build-$flavour CC=clang-14 CXX=clang++-14
+  scripts/build.sh -DVESSA_SANITIZE="$flavour"
+else
+  scripts/build.sh
+fi
+cd "${BUILD_DIR:-build}"
+ctest --output-on-failure --timeout 300 -j"$(nproc)"

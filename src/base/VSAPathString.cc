@@ -1,0 +1,31 @@
+#include "base/VSAPathString.h"
+
+#include <cstring>
+
+bool containsDotDotPathComponents(std::string_view path) {
+  size_t start = 0;
+  while (start <= path.size()) {
+    size_t end = path.find('/', start);
+    if (end == std::string_view::npos) end = path.size();
+    if (path.substr(start, end - start) == "..") return true;
+    start = end + 1;
+  }
+  return false;
+}
+
+std::string stringWithFileSystemRepresentation(const char* bytes) {
+  return bytes ? std::string(bytes) : std::string();
+}
+
+std::string stringWithFileSystemRepresentation(const char* bytes, size_t length) {
+  if (!bytes) return {};
+  return std::string(bytes, strnlen(bytes, length));
+}
+
+std::string VSAPathJoin(std::string_view base, std::string_view component) {
+  std::string out(base);
+  while (!component.empty() && component.front() == '/') component.remove_prefix(1);
+  if (out.empty() || out.back() != '/') out += '/';
+  out += component;
+  return out;
+}

@@ -1,0 +1,17 @@
+// Small path and file-name string helpers shared by every layer.
+#pragma once
+
+#include <cstddef>
+#include <string>
+#include <string_view>
+
+// True when any '/'-separated component of `path` is exactly "..".
+bool containsDotDotPathComponents(std::string_view path);
+
+// A string from raw file-system bytes. Linux file names are byte strings, so
+// the bytes are taken as they are (up to the first NUL in the first form).
+std::string stringWithFileSystemRepresentation(const char* bytes);
+std::string stringWithFileSystemRepresentation(const char* bytes, size_t length);
+
+// Joins two path pieces with exactly one '/' between them.
+std::string VSAPathJoin(std::string_view base, std::string_view component);

@@ -1,0 +1,316 @@
+#include "base/VSAWorkQueue.h"
+
+#include <pthread.h>
+#include <sys/resource.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <thread>
+#include <vector>
+
+// Where root queues hand their work: a thread pool or the main loop.
+class VSAWorkQueueExecutor {
+ public:
+  virtual ~VSAWorkQueueExecutor() = default;
+  virtual void submit(std::function<void()> job) = 0;
+};
+
+namespace {
+
+constexpr int kSerialBatch = 16;  // blocks per drain before yielding the target
+
+thread_local std::vector<const VSAWorkQueue*> tCurrentQueues;
+
+struct CurrentQueueScope {
+  explicit CurrentQueueScope(const VSAWorkQueue* q) { tCurrentQueues.push_back(q); }
+  ~CurrentQueueScope() { tCurrentQueues.pop_back(); }
+};
+
+// A pool that grows whenever every thread is busy, so that a block that waits
+// for another block can never starve it; idle threads retire after a while.
+class ThreadPool final : public VSAWorkQueueExecutor {
+ public:
+  ThreadPool(const char* name, int nice) : name_(name), nice_(nice) {}
+
+  void submit(std::function<void()> job) override {
+    std::unique_lock lock(mutex_);
+    jobs_.push_back(std::move(job));
+    if (jobs_.size() > static_cast<size_t>(idle_)) {
+      ++threads_;
+      std::thread([this] { worker(); }).detach();
+    } else {
+      cv_.notify_one();
+    }
+  }
+
+ private:
+  void worker() {
+    pthread_setname_np(pthread_self(), name_);
+    if (nice_) setpriority(PRIO_PROCESS, static_cast<id_t>(syscall(SYS_gettid)), nice_);
+    std::unique_lock lock(mutex_);
+    for (;;) {
+      while (jobs_.empty()) {
+        ++idle_;
+        bool woke = cv_.wait_for(lock, std::chrono::seconds(20), [this] { return !jobs_.empty(); });
+        --idle_;
+        if (!woke) {
+          --threads_;
+          return;
+        }
+      }
+      auto job = std::move(jobs_.front());
+      jobs_.pop_front();
+      lock.unlock();
+      job();
+      job = nullptr;
+      lock.lock();
+    }
+  }
+
+  const char* name_;
+  int nice_;
+  std::mutex mutex_;
+  std::condition_variable cv_;
+  std::deque<std::function<void()>> jobs_;
+  int idle_ = 0;
+  int threads_ = 0;
+};
+
+class MainLoop final : public VSAWorkQueueExecutor {
+ public:
+  void submit(std::function<void()> job) override {
+    std::lock_guard lock(mutex_);
+    jobs_.push_back(std::move(job));
+    cv_.notify_one();
+  }
+  void run() {
+    std::unique_lock lock(mutex_);
+    stop_ = false;
+    for (;;) {
+      cv_.wait(lock, [this] { return stop_ || !jobs_.empty(); });
+      if (stop_) return;
+      auto job = std::move(jobs_.front());
+      jobs_.pop_front();
+      lock.unlock();
+      job();
+      lock.lock();
+    }
+  }
+  void stop() {
+    std::lock_guard lock(mutex_);
+    stop_ = true;
+    cv_.notify_all();
+  }
+
+ private:
+  std::mutex mutex_;
+  std::condition_variable cv_;
+  std::deque<std::function<void()>> jobs_;
+  bool stop_ = false;
+};
+
+// Leaked on purpose: worker threads may outlive static destruction.
+ThreadPool& defaultPool() {
+  static auto* pool = new ThreadPool("vessa-worker", 0);
+  return *pool;
+}
+ThreadPool& backgroundPool() {
+  static auto* pool = new ThreadPool("vessa-bg-worker", 10);
+  return *pool;
+}
+MainLoop& mainLoop() {
+  static auto* loop = new MainLoop();
+  return *loop;
+}
+
+}  // namespace
+
+VSAWorkQueue::VSAWorkQueue(std::string label, Kind kind, Ref target, VSAWorkQueueExecutor* executor)
+    : label_(std::move(label)), kind_(kind), target_(std::move(target)), executor_(executor) {}
+
+VSAWorkQueue::~VSAWorkQueue() = default;
+
+VSAWorkQueue::Ref VSAWorkQueue::create(std::string label, Kind kind, Ref target) {
+  if (!target) target = global(Priority::Default);
+  return std::make_shared<VSAWorkQueue>(std::move(label), kind, std::move(target), nullptr);
+}
+
+VSAWorkQueue::Ref VSAWorkQueue::global(Priority priority) {
+  static auto* def = new Ref(std::make_shared<VSAWorkQueue>("com.tamsk.vessad.global.default",
+                                                            Kind::Concurrent, nullptr, &defaultPool()));
+  static auto* bg = new Ref(std::make_shared<VSAWorkQueue>(
+      "com.tamsk.vessad.global.background", Kind::Concurrent, nullptr, &backgroundPool()));
+  return priority == Priority::Background ? *bg : *def;
+}
+
+VSAWorkQueue::Ref VSAWorkQueue::main() {
+  static auto* q = new Ref(
+      std::make_shared<VSAWorkQueue>("com.tamsk.vessad.main", Kind::Serial, nullptr, &mainLoop()));
+  return *q;
+}
+
+void VSAWorkQueue::runMain() { mainLoop().run(); }
+void VSAWorkQueue::stopMain() { mainLoop().stop(); }
+
+std::string VSAWorkQueue::currentLabel() {
+  return tCurrentQueues.empty() ? std::string() : tCurrentQueues.back()->label();
+}
+
+bool VSAWorkQueue::isCurrent() const {
+  return std::find(tCurrentQueues.begin(), tCurrentQueues.end(), this) != tCurrentQueues.end();
+}
+
+void VSAWorkQueue::setTarget(Ref target) {
+  std::lock_guard lock(mutex_);
+  if (!executor_) target_ = target ? std::move(target) : global(Priority::Default);
+}
+
+void VSAWorkQueue::async(Block block) { enqueue(Item{std::move(block), false}); }
+
+void VSAWorkQueue::barrierAsync(Block block) {
+  enqueue(Item{std::move(block), kind_ == Kind::Concurrent});
+}
+
+namespace {
+void runAndWait(const std::function<void(VSAWorkQueue::Block)>& submit, VSAWorkQueue::Block block) {
+  std::mutex m;
+  std::condition_variable cv;
+  bool done = false;
+  submit([&] {
+    block();
+    std::lock_guard lock(m);
+    done = true;
+    cv.notify_one();
+  });
+  std::unique_lock lock(m);
+  cv.wait(lock, [&] { return done; });
+}
+}  // namespace
+
+void VSAWorkQueue::sync(Block block) {
+  runAndWait([this](Block b) { async(std::move(b)); }, std::move(block));
+}
+
+void VSAWorkQueue::barrierSync(Block block) {
+  runAndWait([this](Block b) { barrierAsync(std::move(b)); }, std::move(block));
+}
+
+void VSAWorkQueue::suspend() {
+  std::lock_guard lock(mutex_);
+  ++suspendCount_;
+}
+
+void VSAWorkQueue::resume() {
+  {
+    std::lock_guard lock(mutex_);
+    if (suspendCount_ == 0) {
+      std::fprintf(stderr, "VSAWorkQueue %s: over-resume\n", label_.c_str());
+      std::abort();
+    }
+    if (--suspendCount_ > 0) return;
+  }
+  if (kind_ == Kind::Serial) {
+    submitDrain();
+  } else {
+    pumpConcurrent();
+  }
+}
+
+int VSAWorkQueue::suspendCount() const {
+  std::lock_guard lock(mutex_);
+  return suspendCount_;
+}
+
+void VSAWorkQueue::enqueue(Item item) {
+  {
+    std::lock_guard lock(mutex_);
+    items_.push_back(std::move(item));
+  }
+  if (kind_ == Kind::Serial) {
+    submitDrain();
+  } else {
+    pumpConcurrent();
+  }
+}
+
+void VSAWorkQueue::submitToTarget(Block job) {
+  if (executor_) {
+    executor_->submit(std::move(job));
+  } else {
+    target_->async(std::move(job));
+  }
+}
+
+void VSAWorkQueue::runItem(const Block& block) {
+  CurrentQueueScope scope(this);
+  block();
+}
+
+// Schedules one drain of a serial queue unless one is pending or running.
+void VSAWorkQueue::submitDrain() {
+  {
+    std::lock_guard lock(mutex_);
+    if (drainScheduled_ || suspendCount_ > 0 || items_.empty()) return;
+    drainScheduled_ = true;
+  }
+  auto self = shared_from_this();
+  submitToTarget([self] { self->drainSerial(); });
+}
+
+void VSAWorkQueue::drainSerial() {
+  for (int n = 0; n < kSerialBatch; ++n) {
+    Item item;
+    {
+      std::lock_guard lock(mutex_);
+      if (suspendCount_ > 0 || items_.empty()) {
+        drainScheduled_ = false;
+        return;
+      }
+      item = std::move(items_.front());
+      items_.pop_front();
+    }
+    runItem(item.block);
+  }
+  {
+    std::lock_guard lock(mutex_);
+    drainScheduled_ = false;
+  }
+  submitDrain();
+}
+
+void VSAWorkQueue::pumpConcurrent() {
+  std::vector<Item> start;
+  {
+    std::lock_guard lock(mutex_);
+    while (suspendCount_ == 0 && !items_.empty() && !barrierRunning_) {
+      if (items_.front().barrier) {
+        if (running_ == 0) {
+          barrierRunning_ = true;
+          ++running_;
+          start.push_back(std::move(items_.front()));
+          items_.pop_front();
+        }
+        break;
+      }
+      ++running_;
+      start.push_back(std::move(items_.front()));
+      items_.pop_front();
+    }
+  }
+  auto self = shared_from_this();
+  for (Item& item : start) {
+    submitToTarget([self, item = std::move(item)] {
+      self->runItem(item.block);
+      {
+        std::lock_guard lock(self->mutex_);
+        --self->running_;
+        if (item.barrier) self->barrierRunning_ = false;
+      }
+      self->pumpConcurrent();
+    });
+  }
+}

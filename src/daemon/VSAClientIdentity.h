@@ -1,0 +1,61 @@
+// Who is asking: an IPC peer, the kernel (upcalls) or the daemon itself.
+//
+// Immutable after creation and shared freely. A peer's identity comes from
+// its audit token and the client registry (signing identifier, entitlements,
+// sandboxed flag); a peer without a registry entry has no signing identifier
+// and therefore no identity. One identity is cached: the installer service's,
+// reused while its audit token matches byte for byte.
+#pragma once
+
+#include <array>
+#include <cstdint>
+#include <memory>
+#include <string>
+
+#include "base/VSAValue.h"
+#include "platform/VSAAuditToken.h"
+#include "platform/VSAClientRegistry.h"
+#include "platform/VSAIPCConnection.h"
+
+inline constexpr const char* kVSAInstallerSigningIdentifier = "com.tamsk.mobile.installd";
+inline constexpr const char* kVSAInternalBundleIdentifier = "com.tamsk.vessad.internal";
+
+class VSAClientIdentity;
+using VSAClientIdentityRef = std::shared_ptr<const VSAClientIdentity>;
+
+class VSAClientIdentity {
+ public:
+  VSAClientIdentity(std::string bundleIdentifier, uint32_t uid, uint32_t gid, int32_t pid,
+                    VSAValue entitlements, bool sandboxed, std::array<uint8_t, 32> auditToken,
+                    bool kernel);
+
+  static VSAClientIdentityRef clientIdentityWithRelayConnection(const VSAIPCConnection& connection,
+                                                                VSAClientRegistry& registry);
+  static VSAClientIdentityRef privilegedClientIdentityWithKernel(bool kernel);
+  static VSAClientIdentityRef anonymousPrivilegedClientIdentity();
+
+  const std::string& bundleIdentifier() const { return bundleIdentifier_; }
+  uint32_t posixUID() const { return uid_; }
+  uint32_t posixGID() const { return gid_; }
+  int32_t posixPID() const { return pid_; }
+  const VSAValue& entitlements() const { return entitlements_; }
+  bool isSandboxed() const { return sandboxed_; }
+  const std::array<uint8_t, 32>& auditToken() const { return auditToken_; }
+  bool isKernel() const { return kernel_; }
+
+  // The entitlement's truth value when it is a number; false otherwise
+  // (missing, string, array or dictionary values are not granted).
+  bool boolValueOfEntitlement(const std::string& name) const;
+  const VSAValue* valueOfEntitlement(const std::string& name) const;
+  std::string description() const;
+
+ private:
+  std::string bundleIdentifier_;
+  uint32_t uid_;
+  uint32_t gid_;
+  int32_t pid_;
+  VSAValue entitlements_;
+  bool sandboxed_;
+  std::array<uint8_t, 32> auditToken_;
+  bool kernel_;
+};

@@ -1,0 +1,17 @@
+// Request handlers, one family per file. Each takes the request, a fresh
+// reply dictionary, the request's client connection and the result cell
+// (1 on entry); on failure it stores the operation's code and writes no
+// reply keys of its own.
+#pragma once
+
+#include "base/VSAError.h"
+#include "base/VSAValue.h"
+
+class VSAClientConnection;
+
+using VSACommandHandler = void (*)(const VSAValue& request, VSAValue& reply,
+                                   VSAClientConnection& connection, VSAResultCode* result);
+
+// Command 27: retired; always fails with 49.
+void VSAHandleRetiredCommand(const VSAValue& request, VSAValue& reply,
+                             VSAClientConnection& connection, VSAResultCode* result);

@@ -1,0 +1,49 @@
+#include "daemon/VSACommandTable.h"
+
+#include "daemon/VSAEntitlements.h"
+
+namespace {
+constexpr bool R = true, O = true, L = true, _ = false;
+const char* const allowed = kVSAEntitlementAllowed;
+const char* const uma = kVSAEntitlementUserManagedAssets;
+const char* const testability = kVSAEntitlementTestability;
+
+// Handlers arrive with the operations they call; a null handler answers 49.
+const std::array<VSACommandTableEntry, kVSACommandCount> kTable = {{
+    {0, nullptr, allowed, R, O, L},   // create or look up a container
+    {1, nullptr, allowed, R, _, L},   // list containers of a class
+    {2, nullptr, allowed, R, _, _},   // replace a container by another
+    {3, nullptr, allowed, R, _, _},   // stage containers for deletion
+    {4, nullptr, uma, _, _, _},       // empty death row (replies from its completion)
+    {5, nullptr, allowed, R, _, _},   // set a metadata info value
+    {6, nullptr, allowed, R, _, _},   // read a metadata info value
+    {7, nullptr, allowed, R, _, _},   // read a container's metadata
+    {8, nullptr, allowed, R, _, _},   // recreate a container's default structure
+    {9, nullptr, allowed, R, _, _},   // regenerate a container's directory UUID
+    {10, nullptr, allowed, R, _, _},  // delete a container
+    {11, nullptr, kVSAEntitlementWipeContainer, R, _, _},            // wipe data of class 4
+    {12, nullptr, kVSAEntitlementDeleteContainerContent, R, _, _},   // delete data content
+    {13, nullptr, allowed, R, O, L},  // group containers with tokens and personas
+    {14, nullptr, allowed, R, _, L},  // group container identifiers of an owner
+    {15, nullptr, allowed, R, O, L},  // path of a system container
+    {16, nullptr, allowed, R, O, L},  // group container paths of an owner
+    {17, nullptr, allowed, R, O, L},  // path of a system group container
+    {18, nullptr, allowed, R, _, _},  // record code-signing information
+    {19, nullptr, allowed, R, _, _},  // read code-signing information
+    {20, nullptr, allowed, R, _, _},  // invalidate apps without a bundle container
+    {21, nullptr, allowed, _, _, _},  // change data protection (replies from its completion)
+    {22, nullptr, allowed, R, _, _},  // recreate a container's default structure
+    {23, nullptr, allowed, R, _, L},  // disk usage of a container
+    {24, nullptr, kVSAEntitlementDataMigration, R, _, _},       // data migration
+    {25, nullptr, testability, R, _, _},                        // crash-retry test
+    {26, nullptr, kVSAEntitlementStageSharedContent, R, _, _},  // stage shared content
+    {27, VSAHandleRetiredCommand, allowed, R, _, _},            // retired
+    {28, nullptr, uma, R, O, _},      // path of a user-managed assets directory
+    {29, nullptr, uma, R, _, _},      // delete a user-managed asset
+    {30, nullptr, allowed, R, _, _},  // per-user data migration
+    {31, nullptr, testability, R, _, _},  // set or clear a test lock
+    {32, nullptr, allowed, R, O, L},      // persona unique strings of the client
+}};
+}  // namespace
+
+const std::array<VSACommandTableEntry, kVSACommandCount>& VSACommandTable() { return kTable; }

@@ -1,0 +1,166 @@
+#include "daemon/VSADaemon.h"
+
+#include <sys/stat.h>
+
+#include <cstring>
+
+#include "base/VSACrash.h"
+#include "base/VSALog.h"
+#include "base/VSAPathString.h"
+#include "platform/VSANamedSemaphore.h"
+
+#ifndef VESSA_BUILD_DATE
+#define VESSA_BUILD_DATE __DATE__
+#define VESSA_BUILD_TIME __TIME__
+#endif
+
+namespace {
+// mkdir -p for the daemon's run directory.
+void makeRunDirectory(const std::string& path) {
+  for (size_t pos = path.find('/', 1); pos != std::string::npos; pos = path.find('/', pos + 1))
+    mkdir(path.substr(0, pos).c_str(), 0755);
+  mkdir(path.c_str(), 0755);
+}
+}  // namespace
+
+VSADaemon::VSADaemon(Options options)
+    : options_(std::move(options)),
+      context_(std::make_unique<VSADaemonContext>(VSASystemRoot(options_.root))) {
+  firstBootSemaphore_ = VSANamedSemaphore::nameForRoot(kVSAFirstBootSemaphore, context_->systemRoot);
+  VSALogger::shared().setLevel(options_.logLevel);
+}
+
+VSADaemon::~VSADaemon() = default;
+
+int VSADaemon::run() {
+  makeRunDirectory(context_->systemRoot.runDirectory());
+  context_->listenerQueue = VSAWorkQueue::create("com.tamsk.vessad.listener");
+  auto initTransaction = context_->transactions->open();
+  context_->listenerQueue->async([this, initTransaction = std::move(initTransaction)]() mutable {
+    initialize();
+    initTransaction.reset();  // step 15: start-up is over
+  });
+  dispatcher_ = std::make_unique<VSARelayDispatcher>(*context_);
+  listener_ = std::make_unique<VSAIPCListener>(context_->systemRoot.socketPath(),
+                                               context_->listenerQueue, context_->transactions);
+  VSAErrorRef error;
+  if (listener_->listen(&error)) {
+    listener_->setHandler([this](const VSAIPCMessageRef& m) { dispatcher_->processRelayEvent(m); });
+    listener_->resume();
+  } else {
+    VSALogIn(VSALogCategory::Daemon, kVSALogError, "main", "unable to start relay service!");
+    VSALogIn(VSALogCategory::Daemon, kVSALogError, "main", "%@", error);
+    listener_.reset();
+  }
+  VSAWorkQueue::runMain();
+  if (stopThread_.joinable()) stopThread_.join();
+  if (listener_) listener_->stop();
+  VSALogIn(VSALogCategory::Daemon, kVSALogNotice, "main", "vessad stopped");
+  VSALogger::shared().closeRotatingLog();
+  return 0;
+}
+
+void VSADaemon::requestStop() {
+  if (stopping_.exchange(true)) return;
+  // Drain on a thread of its own: the main loop must keep running meanwhile,
+  // because start-up (which may still be under way) calls into it.
+  stopThread_ = std::thread([this] {
+    drainForShutdown();
+    VSAWorkQueue::stopMain();
+  });
+}
+
+void VSADaemon::drainForShutdown() {
+  VSALogIn(VSALogCategory::Daemon, kVSALogNotice, "main",
+           "Stopping: no new requests; waiting for %d open transactions",
+           context_->transactions->openCount());
+  if (listener_) listener_->stopAccepting();
+  if (!context_->transactions->waitUntilIdle(std::chrono::seconds(30)))
+    VSALogIn(VSALogCategory::Daemon, kVSALogError, "main",
+             "Giving up on %d open transactions after 30 seconds",
+             context_->transactions->openCount());
+}
+
+void VSADaemon::openLogs() {
+  auto& config = *context_->globalConfiguration;
+  std::string path = VSAPathJoin(config.logDirectory(), "vessad.log");
+  auto& logger = VSALogger::shared();
+  if (!logger.openRotatingLog(path, options_.logLevel)) {
+    VSALogIn(VSALogCategory::Daemon, kVSALogError, "vessad_init",
+             "Failed to set up rotating logs at path %s", path);
+  }
+  bool internal = config.isInternalImage();
+  logger.enableDiskLogging(internal ? 4 : 1, internal ? 262144 : 102400);
+  if (logger.level() >= kVSALogDebug)
+    VSALogIn(VSALogCategory::Daemon, kVSALogDebug, "vessad_init", "vessad built at %s %s started",
+             VESSA_BUILD_DATE, VESSA_BUILD_TIME);
+}
+
+bool VSADaemon::isFirstBoot() {
+  if (VSANamedSemaphore::exists(firstBootSemaphore_)) return false;
+  VSALogIn(VSALogCategory::Daemon, kVSALogNotice, "vessad_init",
+           "vessad performing first boot initialization");
+  return true;
+}
+
+void VSADaemon::initialize() {
+  VSASignpostInterval startingUp(VSALogCategory::Startup, "StartingUp");
+  openLogs();
+  context_->deathrowQueue = VSAWorkQueue::create(
+      "com.tamsk.vessad.deathrow", VSAWorkQueue::Kind::Serial,
+      VSAWorkQueue::global(VSAWorkQueue::Priority::Background));
+  context_->lockStateQueue = VSAWorkQueue::create("com.tamsk.vessad.lockstate");
+  if (!context_->deathrowQueue || !context_->lockStateQueue) VSACrash("Can't create dispatch queues.");
+  sharedConnection_ = VSAClientConnection::sharedClientConnection(*context_);
+
+  bool firstBoot = isFirstBoot();
+  if (firstBoot) {
+    VSASignpostInterval interval(VSALogCategory::Startup, "FirstBootSetup");
+    sharedConnection_->rebootKeeperSetup();
+  }
+  {
+    VSASignpostInterval interval(VSALogCategory::Startup, "BootSetup");
+    sharedConnection_->keeperSetup();
+  }
+  // The kernel upcall interface is started here once its server exists.
+
+  lockStateMonitor_ = std::make_unique<VSALockStateMonitor>(
+      context_->lockStateQueue, [lockState = context_->lockState] {
+        return lockState->currentLockState();
+      });
+  int status = context_->lockState->registerForLockStatus(
+      VSAWorkQueue::main(), [monitor = lockStateMonitor_.get()] { monitor->lockStateDidChange(); });
+  if (status != 0)
+    VSALogIn(VSALogCategory::Daemon, kVSALogError, "vessad_init",
+             "notify_register_dispatch for notification \"%s\" failed; returned %d\n",
+             kVSALockStatusNotification, status);
+  // The callback belongs to the main queue; run this first call there too.
+  VSAWorkQueue::main()->sync([monitor = lockStateMonitor_.get()] { monitor->lockStateDidChange(); });
+  startCleanups(firstBoot);
+}
+
+void VSADaemon::startCleanups(bool firstBoot) {
+  auto notifications = context_->notifications;
+  if (firstBoot) {
+    uint64_t signpost = VSASignpostBegin(VSALogCategory::Startup, "FirstBootCleanup");
+    std::string semaphore = firstBootSemaphore_;
+    sharedConnection_->rebootKeeperCleanupWithCompletion([notifications, semaphore, signpost] {
+      VSALogIn(VSALogCategory::Daemon, kVSALogNotice, "vessad_init",
+               "vessad first boot cleanup complete");
+      if (!VSANamedSemaphore::create(semaphore))
+        VSALogIn(VSALogCategory::Daemon, kVSALogError, "set_first_boot_work_completed",
+                 "Failed to create semaphore %s: %s", semaphore, std::strerror(errno));
+      if (uint32_t s = notifications->post(CONTAINER_NOTIFY_REBOOT_CLEANUP_COMPLETE))
+        VSALogIn(VSALogCategory::Startup, kVSALogError, "vessad_init",
+                 "Failed to post reboot-cleanup-complete: %u", s);
+      VSASignpostEnd(VSALogCategory::Startup, "FirstBootCleanup", signpost);
+    });
+  }
+  uint64_t signpost = VSASignpostBegin(VSALogCategory::Startup, "BootCleanup");
+  sharedConnection_->keeperCleanupWithCompletion([notifications, signpost] {
+    if (uint32_t s = notifications->post(CONTAINER_NOTIFY_CLEANUP_COMPLETE))
+      VSALogIn(VSALogCategory::Startup, kVSALogError, "vessad_init",
+               "Failed to post cleanup-complete: %u", s);
+    VSASignpostEnd(VSALogCategory::Startup, "BootCleanup", signpost);
+  });
+}

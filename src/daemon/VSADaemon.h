@@ -1,0 +1,58 @@
+// The daemon process: entry, initialisation and orderly shutdown.
+//
+// run() is the process entry: it creates the serial listener queue, queues
+// the initialisation routine on it, creates and resumes the IPC listener on
+// the same queue (so no request is served before initialisation returns) and
+// parks the calling thread in the main loop. Initialisation ("vessad_init")
+// opens the rotating log, creates the work queues, runs first-boot setup
+// (only when the first-boot semaphore is absent) and boot setup, subscribes
+// to lock-state changes and starts the two cleanups. requestStop() (from the
+// signal thread) stops accepting requests, waits for open transactions and
+// returns from run().
+#pragma once
+
+#include <atomic>
+#include <memory>
+#include <string>
+#include <thread>
+
+#include "daemon/VSAClientConnection.h"
+#include "daemon/VSADaemonContext.h"
+#include "daemon/VSALockStateMonitor.h"
+#include "daemon/VSARelayDispatcher.h"
+#include "platform/VSAIPCListener.h"
+
+inline constexpr const char* kVSAFirstBootSemaphore = "vessad.fb_check";
+
+class VSADaemon {
+ public:
+  struct Options {
+    std::string root = "/";
+    int logLevel = 5;
+  };
+
+  explicit VSADaemon(Options options);
+  ~VSADaemon();
+
+  int run();
+  // Asks run() to return once open transactions have ended. Thread-safe.
+  void requestStop();
+  VSADaemonContext& context() { return *context_; }
+
+ private:
+  void initialize();
+  void openLogs();
+  bool isFirstBoot();
+  void startCleanups(bool firstBoot);
+  void drainForShutdown();
+
+  Options options_;
+  std::unique_ptr<VSADaemonContext> context_;
+  std::unique_ptr<VSARelayDispatcher> dispatcher_;
+  std::unique_ptr<VSAIPCListener> listener_;
+  std::unique_ptr<VSAClientConnection> sharedConnection_;
+  std::unique_ptr<VSALockStateMonitor> lockStateMonitor_;
+  std::string firstBootSemaphore_;
+  std::atomic<bool> stopping_{false};
+  std::thread stopThread_;
+};

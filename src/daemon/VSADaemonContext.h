@@ -1,0 +1,47 @@
+// Everything one daemon instance is built from: its system root, the
+// platform services of that root, the global configuration and the daemon's
+// queues. The daemon creates one context at start-up; tests build their own
+// around a temporary root, so several daemons can live in one process.
+// Members are set before the first request and not replaced afterwards.
+#pragma once
+
+#include <memory>
+
+#include "base/VSAWorkQueue.h"
+#include "model/VSAGlobalConfiguration.h"
+#include "platform/VSAClientRegistry.h"
+#include "platform/VSADeviceProperties.h"
+#include "platform/VSALockStateService.h"
+#include "platform/VSANotificationCenter.h"
+#include "platform/VSASystemRoot.h"
+#include "platform/VSATransactions.h"
+
+struct VSADaemonContext {
+  explicit VSADaemonContext(const VSASystemRoot& root)
+      : systemRoot(root),
+        deviceProperties(std::make_shared<VSADeviceProperties>(root)),
+        clientRegistry(std::make_shared<VSAClientRegistry>(root)),
+        notifications(std::make_shared<VSANotificationCenter>(root)),
+        lockState(std::make_shared<VSALockStateService>(root)),
+        globalConfiguration(std::make_shared<VSAGlobalConfiguration>(root, deviceProperties)),
+        transactions(std::make_shared<VSATransactions>()) {}
+
+  VSASystemRoot systemRoot;
+  std::shared_ptr<VSADeviceProperties> deviceProperties;
+  std::shared_ptr<VSAClientRegistry> clientRegistry;
+  std::shared_ptr<VSANotificationCenter> notifications;
+  std::shared_ptr<VSALockStateService> lockState;
+  std::shared_ptr<VSAGlobalConfiguration> globalConfiguration;
+  std::shared_ptr<VSATransactions> transactions;
+
+  VSAWorkQueue::Ref listenerQueue;   // "com.tamsk.vessad.listener"
+  VSAWorkQueue::Ref deathrowQueue;   // "com.tamsk.vessad.deathrow"
+  VSAWorkQueue::Ref lockStateQueue;  // "com.tamsk.vessad.lockstate"
+
+  // Runs `work` on `queue` while holding the daemon busy (a transaction),
+  // for work that a reply does not wait for.
+  void asyncWithTransaction(const VSAWorkQueue::Ref& queue, std::function<void()> work) {
+    auto token = transactions->open();
+    queue->async([token, work = std::move(work)] { work(); });
+  }
+};

@@ -1,0 +1,6 @@
+#include "daemon/VSACommandHandlers.h"
+
+void VSAHandleRetiredCommand(const VSAValue&, VSAValue&, VSAClientConnection&,
+                             VSAResultCode* result) {
+  VSASetCode(result, VSAResult::kInvalidCommand);
+}

@@ -1,0 +1,107 @@
+#include "daemon/VSARelayDispatcher.h"
+
+#include "base/VSALog.h"
+#include "daemon/VSAClientConnection.h"
+#include "daemon/VSAGrants.h"
+
+namespace {
+constexpr const char* kOrigin = "VSAProcessRelayEvent";
+}
+
+VSARelayDispatcher::VSARelayDispatcher(VSADaemonContext& context)
+    : VSARelayDispatcher(context, VSACommandTable().data(), VSACommandTable().size()) {}
+
+VSARelayDispatcher::VSARelayDispatcher(VSADaemonContext& context,
+                                       const VSACommandTableEntry* table, size_t count)
+    : context_(context), table_(table), count_(count) {}
+
+bool VSARelayDispatcher::readCommand(const VSAValue& request, uint64_t& command) {
+  const VSAValue* value = request.get(kVSARequestCommandKey);
+  if (!value || !value->isInteger()) {
+    VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin,
+             "Request without an integer \"Command\": %@", value ? value->description() : "absent");
+    command = UINT64_MAX;
+    return false;
+  }
+  auto asUnsigned = value->uint64Value();
+  command = asUnsigned ? *asUnsigned : static_cast<uint64_t>(*value->int64Value());
+  return true;
+}
+
+const VSACommandTableEntry* VSARelayDispatcher::checkCommand(uint64_t command) const {
+  if (command >= count_) {
+    VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin, "Invalid command index: %lld",
+             static_cast<long long>(command));
+    return nullptr;
+  }
+  const VSACommandTableEntry& entry = table_[command];
+  if (entry.command != command) {
+    VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin, "Invalid command at index %llu",
+             command);
+    return nullptr;
+  }
+  if (!entry.handler) {
+    VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin, "Invalid command handler: %lld",
+             static_cast<long long>(command));
+    return nullptr;
+  }
+  return &entry;
+}
+
+void VSARelayDispatcher::processRelayEvent(const VSAIPCMessageRef& message) {
+  VSAResultCode result = VSAResult::kSuccess;
+  auto reply = message->createReply();
+  if (!reply) {
+    VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin, "Dictionary does not have reply context");
+    VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin, "Cancelling %@: %s",
+             message->connection()->description(), message->problem());
+    message->connection()->cancel();
+    return;
+  }
+  const VSAValue& request = message->body();
+  uint64_t command = 0;
+  bool haveCommand = readCommand(request, command);
+  uint64_t signpost = VSASignpostBegin(
+      VSALogCategory::Relay, "RelayEventProcessing",
+      VSAFormat(" command=%{public, signpost.description:attribute}llu ", command));
+  const VSACommandTableEntry* entry = haveCommand ? checkCommand(command) : nullptr;
+  VSAClientIdentityRef identity;
+  if (!entry) {
+    result = VSAResult::kInvalidCommand;
+  } else {
+    auto commandQueue = std::make_shared<VSACommandQueue>();
+    identity = VSAClientIdentity::clientIdentityWithRelayConnection(*message->connection(),
+                                                                    *context_.clientRegistry);
+    VSAGrants grants = VSADeriveGrants(*entry, identity.get());
+    // Caller-registered entitlements are recorded here once the code-signing
+    // mapping exists; nothing else in the request depends on that step.
+    if (!grants.admitted) {
+      VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin,
+               "connection attempt from pid %d (%@) is not entitled",
+               message->connection()->auditToken().pid,
+               identity ? identity->bundleIdentifier() : std::string("<unknown>"));
+      result = VSAResult::kNotEntitled;
+    } else {
+      VSAClientConnection connection(context_, identity, grants.entitled, grants.allowOtherIdLookup,
+                                     grants.unrestricted, grants.lookup,
+                                     grants.entitledWipeIdentifiers, commandQueue);
+      connection.setRelayMessage(message);
+      entry->handler(request, *reply, connection, &result);
+      connection.completeWithError(&result);
+    }
+  }
+  std::string client = identity ? identity->bundleIdentifier() : std::string("<unknown>");
+  VSASignpostEnd(VSALogCategory::Relay, "RelayEventProcessing", signpost,
+                 VSAFormat(" command=%{public, signpost.description:attribute}llu  "
+                           "clientIdentifier=%{private, signpost.description:attribute}@ ",
+                           command, client));
+  VSALogIn(VSALogCategory::Relay, kVSALogNotice, kOrigin, "command=%llu, client=%@, error=%llu",
+           command, client, result);
+  if (result == VSAResult::kSuccess && (command == 4 || command == 21)) return;
+  reply->set(kVSAReplyErrorKey, VSAValue(result));
+  VSAErrorRef error;
+  if (!message->sendReply(*reply, &error)) {
+    VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin, "Failed to send reply for command %llu: %@",
+             command, error);
+  }
+}

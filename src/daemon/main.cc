@@ -1,0 +1,63 @@
+// vessad: the container-keeping daemon.
+//
+//   vessad [--root DIR] [--log-level N] [--stderr]
+//
+// SIGTERM and SIGINT stop it cleanly once open transactions have ended.
+#include <signal.h>
+
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <string>
+#include <thread>
+
+#include "base/VSACrash.h"
+#include "base/VSALog.h"
+#include "daemon/VSADaemon.h"
+
+namespace {
+void usage(FILE* out) {
+  std::fprintf(out,
+               "usage: vessad [--root DIR] [--log-level N] [--stderr]\n"
+               "  --root DIR      system root standing for the device's \"/\" (default /)\n"
+               "  --log-level N   writer level: 3 error, 5 notice (default), 6 info, 7 debug\n"
+               "  --stderr        send the unified log to stderr even when journald runs\n");
+}
+}  // namespace
+
+int main(int argc, char** argv) {
+  VSADaemon::Options options;
+  for (int i = 1; i < argc; ++i) {
+    std::string a = argv[i];
+    if (a == "--root" && i + 1 < argc) {
+      options.root = argv[++i];
+    } else if (a == "--log-level" && i + 1 < argc) {
+      options.logLevel = std::atoi(argv[++i]);
+    } else if (a == "--stderr") {
+      VSALogger::shared().setUseStderr(true);
+    } else if (a == "--help" || a == "-h") {
+      usage(stdout);
+      return 0;
+    } else {
+      usage(stderr);
+      return 2;
+    }
+  }
+  VSAInstallUncaughtExceptionHandler();
+  // Signals are taken by one thread with sigwait; every other thread blocks them.
+  sigset_t set;
+  sigemptyset(&set);
+  sigaddset(&set, SIGTERM);
+  sigaddset(&set, SIGINT);
+  pthread_sigmask(SIG_BLOCK, &set, nullptr);
+  signal(SIGPIPE, SIG_IGN);
+
+  VSADaemon daemon(options);
+  std::thread([&daemon, set] {
+    int sig = 0;
+    sigwait(&set, &sig);
+    VSALogIn(VSALogCategory::Daemon, kVSALogNotice, "main", "Received signal %d", sig);
+    daemon.requestStop();
+  }).detach();
+  return daemon.run();
+}

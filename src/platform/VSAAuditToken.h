@@ -1,0 +1,31 @@
+// The identity of a peer process as the kernel reports it.
+//
+// pid, effective uid and gid come from SO_PEERCRED; the process start time
+// (from /proc/<pid>/stat) makes the token unique even when a pid is reused:
+// a token whose start time no longer matches names a process that is gone.
+// The 32-byte form is what replies and logs compare byte for byte; the
+// all-zero token stands for the daemon itself. Value type.
+#pragma once
+
+#include <array>
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <sys/types.h>
+
+struct VSAAuditToken {
+  pid_t pid = 0;
+  uid_t uid = 0;
+  gid_t gid = 0;
+  uint64_t startTime = 0;
+
+  static std::optional<VSAAuditToken> fromSocket(int fd);
+  // The start time of a live process in clock ticks since boot; 0 if gone.
+  static uint64_t processStartTime(pid_t pid);
+  // The token still names the same, living process.
+  bool isCurrent() const;
+  std::array<uint8_t, 32> bytes() const;
+  std::string description() const;
+
+  friend bool operator==(const VSAAuditToken&, const VSAAuditToken&) = default;
+};

@@ -1,0 +1,100 @@
+#include "platform/VSAClientRegistry.h"
+
+#include <dirent.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <climits>
+#include <cstdlib>
+
+#include "base/VSALog.h"
+#include "base/VSAPathString.h"
+#include "base/VSAPlist.h"
+
+VSAClientRegistry::VSAClientRegistry(VSASystemRoot root) : root_(std::move(root)) {}
+
+namespace {
+std::string canonical(const std::string& path) {
+  char buf[PATH_MAX];
+  return realpath(path.c_str(), buf) ? std::string(buf) : std::string();
+}
+}  // namespace
+
+std::optional<VSAClientRegistryEntry> VSAClientRegistry::loadEntry(const std::string& file) {
+  struct stat st;
+  if (lstat(file.c_str(), &st) != 0 || !S_ISREG(st.st_mode)) return std::nullopt;
+  if (st.st_uid != 0 || (st.st_mode & (S_IWGRP | S_IWOTH))) {
+    VSALogIn(VSALogCategory::Relay, kVSALogError, "VSAClientRegistry",
+             "Ignoring client registry entry %s: not owned by root or writable by others", file);
+    return std::nullopt;
+  }
+  VSAErrorRef error;
+  auto dict = VSA_dictionaryWithContentsOfURL(file, 0, &error);
+  auto bad = [&](const char* why) {
+    VSALogIn(VSALogCategory::Relay, kVSALogError, "VSAClientRegistry",
+             "Ignoring client registry entry %s: %s", file, why);
+    return std::nullopt;
+  };
+  if (!dict) return bad(error ? error->localizedDescription().c_str() : "unreadable");
+  const VSAValue* exe = dict->get("Executable");
+  const VSAValue* sid = dict->get("SigningIdentifier");
+  const VSAValue* ent = dict->get("Entitlements");
+  if (!exe || !exe->isString() || exe->stringValue()->empty() || exe->stringValue()->front() != '/')
+    return bad("\"Executable\" must be an absolute path");
+  if (!sid || !sid->isString() || sid->stringValue()->empty())
+    return bad("\"SigningIdentifier\" must be a string");
+  if (ent && !ent->isDictionary()) return bad("\"Entitlements\" must be a dictionary");
+  for (const char* key : {"Sandboxed", "KernelBridge"}) {
+    const VSAValue* v = dict->get(key);
+    if (v && !v->isBool()) return bad("\"Sandboxed\" and \"KernelBridge\" must be booleans");
+  }
+  VSAClientRegistryEntry entry;
+  entry.executable = canonical(root_.resolve(*exe->stringValue()));
+  if (entry.executable.empty()) return bad("the executable does not exist");
+  entry.signingIdentifier = *sid->stringValue();
+  if (ent) entry.entitlements = *ent;
+  if (auto v = dict->get("Sandboxed")) entry.sandboxed = *v->boolValue();
+  if (auto v = dict->get("KernelBridge")) entry.kernelBridge = *v->boolValue();
+  return entry;
+}
+
+void VSAClientRegistry::reloadIfChanged() {
+  std::string dir = directory();
+  struct stat st;
+  struct timespec mtime = {0, 0};
+  if (stat(dir.c_str(), &st) == 0) mtime = st.st_mtim;
+  if (mtime.tv_sec == loadedMTime_.tv_sec && mtime.tv_nsec == loadedMTime_.tv_nsec) return;
+  loadedMTime_ = mtime;
+  byExecutable_.clear();
+  DIR* d = opendir(dir.c_str());
+  if (!d) return;
+  while (struct dirent* e = readdir(d)) {
+    std::string name = e->d_name;
+    if (name.size() < 7 || name.compare(name.size() - 6, 6, ".plist") != 0 || name[0] == '.')
+      continue;
+    if (auto entry = loadEntry(VSAPathJoin(dir, name))) {
+      auto [it, inserted] = byExecutable_.emplace(entry->executable, *entry);
+      if (!inserted)
+        VSALogIn(VSALogCategory::Relay, kVSALogError, "VSAClientRegistry",
+                 "Duplicate client registry entry for %s in %s ignored", entry->executable, name);
+    }
+  }
+  closedir(d);
+}
+
+std::optional<VSAClientRegistryEntry> VSAClientRegistry::entryForExecutable(
+    const std::string& hostPath) {
+  std::lock_guard lock(mutex_);
+  reloadIfChanged();
+  auto it = byExecutable_.find(hostPath);
+  if (it == byExecutable_.end()) return std::nullopt;
+  return it->second;
+}
+
+std::optional<VSAClientRegistryEntry> VSAClientRegistry::entryForAuditToken(
+    const VSAAuditToken& token) {
+  std::string exe = canonical("/proc/" + std::to_string(token.pid) + "/exe");
+  // Check after resolving the path, so the path surely belongs to this process.
+  if (exe.empty() || !token.isCurrent()) return std::nullopt;
+  return entryForExecutable(exe);
+}

@@ -1,0 +1,28 @@
+// Transactions: the keep-alive count of work the daemon must finish before
+// it may exit.
+//
+// open() hands out a token; the transaction ends when the last copy of the
+// token is released. An orderly shutdown calls waitUntilIdle(), which returns
+// once no transaction is open. Thread-safe.
+#pragma once
+
+#include <chrono>
+#include <condition_variable>
+#include <memory>
+#include <mutex>
+
+class VSATransactions {
+ public:
+  using Token = std::shared_ptr<void>;
+
+  Token open();
+  int openCount() const;
+  // False when `timeout` passed with transactions still open.
+  bool waitUntilIdle(std::chrono::milliseconds timeout);
+
+ private:
+  void close();
+  mutable std::mutex mutex_;
+  std::condition_variable cv_;
+  int open_ = 0;
+};
