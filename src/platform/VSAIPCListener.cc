@@ -89,6 +89,11 @@ bool VSAIPCListener::listen(VSAErrorRef* error) {
   return true;
 }
 
+void VSAIPCListener::setHandler(Handler handler) {
+  std::lock_guard lock(handlerMutex_);
+  handler_ = std::move(handler);
+}
+
 void VSAIPCListener::resume() {
   if (listenFd_ < 0 || thread_.joinable()) return;
   thread_ = std::thread([this] { run(); });
@@ -228,7 +233,11 @@ void VSAIPCListener::deliver(const VSAIPCConnectionRef& connection, std::optiona
                              std::string problem) {
   auto message = std::make_shared<VSAIPCMessage>(connection, std::move(body), std::move(problem),
                                                  transactions_->open());
-  Handler handler = handler_;
+  Handler handler;
+  {
+    std::lock_guard lock(handlerMutex_);
+    handler = handler_;
+  }
   queue_->async([handler, message] {
     if (handler) handler(message);
   });

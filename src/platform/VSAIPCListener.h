@@ -34,7 +34,7 @@ class VSAIPCListener {
   VSAIPCListener& operator=(const VSAIPCListener&) = delete;
 
   bool listen(VSAErrorRef* error);
-  void setHandler(Handler handler) { handler_ = std::move(handler); }
+  void setHandler(Handler handler);
   void resume();
   // Stops accepting and reading; open connections stay up for late replies.
   void stopAccepting();
@@ -54,6 +54,7 @@ class VSAIPCListener {
   std::string socketPath_;
   VSAWorkQueue::Ref queue_;
   std::shared_ptr<VSATransactions> transactions_;
+  std::mutex handlerMutex_;
   Handler handler_;
   int listenFd_ = -1;
   int epollFd_ = -1;

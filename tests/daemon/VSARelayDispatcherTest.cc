@@ -1,0 +1,180 @@
+#include "daemon/VSARelayDispatcher.h"
+
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <climits>
+#include <filesystem>
+
+#include "base/VSAPlist.h"
+#include "daemon/VSAClientConnection.h"
+#include "daemon/VSAEntitlements.h"
+#include "platform/VSAFrameCodec.h"
+
+namespace {
+
+using namespace std::chrono_literals;
+
+class FailingCommand : public VSACommand {
+ public:
+  uint64_t command() const override { return 3; }
+  bool fromQueue(VSACommandQueue&, VSAResultCode* error) override {
+    *error = 41;
+    return false;
+  }
+};
+
+void succeed(const VSAValue&, VSAValue& reply, VSAClientConnection&, VSAResultCode*) {
+  reply.set("ReplyPath", VSAValue("/x"));
+}
+void fail(const VSAValue&, VSAValue&, VSAClientConnection&, VSAResultCode* result) { *result = 21; }
+void queueFailure(const VSAValue&, VSAValue&, VSAClientConnection& c, VSAResultCode*) {
+  c.commandQueue()->insertCommand(std::make_shared<FailingCommand>());
+}
+// Replies itself, as commands 4 and 21 do on success.
+void replyLater(const VSAValue&, VSAValue&, VSAClientConnection& c, VSAResultCode*) {
+  VSAValue reply = *c.relayMessage()->createReply();
+  reply.set("ReplyError", VSAValue(1u));
+  reply.set("Late", VSAValue(true));
+  c.relayMessage()->sendReply(reply);
+}
+
+const char* kAllowed = kVSAEntitlementAllowed;
+
+// A table with a misnumbered entry at index 2 and self-replying entries 4 and 21.
+std::array<VSACommandTableEntry, 33> testTable() {
+  std::array<VSACommandTableEntry, 33> t{};
+  for (uint64_t i = 0; i < 33; ++i) t[i] = {i, succeed, kAllowed, true, false, false};
+  t[1].handler = fail;
+  t[2].command = 7;
+  t[3].handler = queueFailure;
+  t[4] = {4, replyLater, kAllowed, false, false, false};
+  t[5].handler = nullptr;
+  t[21] = {21, fail, kAllowed, false, false, false};
+  return t;
+}
+
+class VSARelayDispatcherTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    char tmpl[] = "/tmp/vessa-dispatch-XXXXXX";
+    root_ = mkdtemp(tmpl);
+    std::filesystem::create_directories(root_ + "/etc/vessad/clients.d");
+    std::filesystem::create_directories(root_ + "/usr/bin");
+    char buf[PATH_MAX];
+    ssize_t n = readlink("/proc/self/exe", buf, sizeof buf - 1);
+    std::filesystem::create_symlink(std::string(buf, n), root_ + "/usr/bin/tester");
+    VSAErrorRef error;
+    ASSERT_TRUE(VSA_writeToURL(
+        VSAValue::Dictionary{{"Executable", VSAValue("/usr/bin/tester")},
+                             {"SigningIdentifier", VSAValue("com.example.tester")},
+                             {"Entitlements", VSAValue::Dictionary{{kAllowed, VSAValue(true)}}}},
+        root_ + "/etc/vessad/clients.d/tester.plist", 0, &error));
+    context_ = std::make_unique<VSADaemonContext>(VSASystemRoot(root_));
+    int fds[2];
+    ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, fds), 0);
+    peer_ = fds[1];
+    connection_ = std::make_shared<VSAIPCConnection>(fds[0], 1, *VSAAuditToken::fromSocket(fds[0]));
+  }
+  void TearDown() override {
+    ::close(peer_);
+    std::filesystem::remove_all(root_);
+  }
+
+  // Dispatches one request and returns the replies that reached the peer.
+  std::vector<VSAValue> dispatch(const VSAValue& body) {
+    auto message = std::make_shared<VSAIPCMessage>(connection_, body, "", context_->transactions->open());
+    dispatcher_->processRelayEvent(message);
+    message.reset();
+    std::vector<VSAValue> replies;
+    VSAFrameReader reader;
+    uint8_t buf[65536];
+    for (;;) {
+      ssize_t n = recv(peer_, buf, sizeof buf, MSG_DONTWAIT);
+      if (n <= 0) break;
+      reader.append(buf, n);
+    }
+    std::vector<uint8_t> payload;
+    while (reader.next(payload) == VSAFrameReader::Status::Frame) {
+      std::string why;
+      replies.push_back(*VSAFrameCodec::decodePayload(payload.data(), payload.size(), &why));
+    }
+    return replies;
+  }
+
+  std::string root_;
+  std::unique_ptr<VSADaemonContext> context_;
+  std::unique_ptr<VSARelayDispatcher> dispatcher_;
+  VSAIPCConnectionRef connection_;
+  int peer_ = -1;
+  std::array<VSACommandTableEntry, 33> table_ = testTable();
+};
+
+VSAValue request(uint64_t command) {
+  return VSAValue::Dictionary{{"Command", VSAValue(command)}, {"MessageID", VSAValue(77u)}};
+}
+
+TEST_F(VSARelayDispatcherTest, TableChecksAnswer49) {
+  dispatcher_ = std::make_unique<VSARelayDispatcher>(*context_, table_.data(), table_.size());
+  for (VSAValue body : {request(2), request(5), request(33), request(UINT64_MAX),
+                        VSAValue(VSAValue::Dictionary{{"Command", VSAValue(int64_t(-1))}}),
+                        VSAValue(VSAValue::Dictionary{{"Command", VSAValue("0")}}),
+                        VSAValue(VSAValue::Dictionary{{"NoCommand", VSAValue(1)}})}) {
+    auto replies = dispatch(body);
+    ASSERT_EQ(replies.size(), 1u) << body.description();
+    EXPECT_EQ(replies[0].get("ReplyError")->uint64Value(), 49u);
+  }
+}
+
+TEST_F(VSARelayDispatcherTest, ReplyCarriesHandlerKeysCodeAndMessageID) {
+  dispatcher_ = std::make_unique<VSARelayDispatcher>(*context_, table_.data(), table_.size());
+  auto ok = dispatch(request(0));
+  ASSERT_EQ(ok.size(), 1u);
+  EXPECT_EQ(ok[0].get("ReplyError")->uint64Value(), 1u);
+  EXPECT_EQ(*ok[0].get("ReplyPath")->stringValue(), "/x");
+  EXPECT_EQ(ok[0].get("MessageID")->uint64Value(), 77u);
+  auto failed = dispatch(request(1));
+  ASSERT_EQ(failed.size(), 1u);
+  EXPECT_EQ(failed[0].get("ReplyError")->uint64Value(), 21u);
+}
+
+TEST_F(VSARelayDispatcherTest, AFailingQueuedCommandBecomesTheResult) {
+  dispatcher_ = std::make_unique<VSARelayDispatcher>(*context_, table_.data(), table_.size());
+  auto replies = dispatch(request(3));
+  ASSERT_EQ(replies.size(), 1u);
+  EXPECT_EQ(replies[0].get("ReplyError")->uint64Value(), 41u);
+}
+
+TEST_F(VSARelayDispatcherTest, SelfReplyingCommandsReplyExactlyOnce) {
+  dispatcher_ = std::make_unique<VSARelayDispatcher>(*context_, table_.data(), table_.size());
+  auto late = dispatch(request(4));
+  ASSERT_EQ(late.size(), 1u);
+  EXPECT_TRUE(late[0].get("Late"));
+  auto failed = dispatch(request(21));
+  ASSERT_EQ(failed.size(), 1u);
+  EXPECT_EQ(failed[0].get("ReplyError")->uint64Value(), 21u);
+  EXPECT_TRUE(context_->transactions->waitUntilIdle(1s));
+}
+
+TEST_F(VSARelayDispatcherTest, RealTableRetiredCommandAndMissingHandlers) {
+  dispatcher_ = std::make_unique<VSARelayDispatcher>(*context_);
+  auto retired = dispatch(request(27));
+  ASSERT_EQ(retired.size(), 1u);
+  EXPECT_EQ(retired[0].get("ReplyError")->uint64Value(), 49u);
+  auto high = dispatch(request(33));
+  ASSERT_EQ(high.size(), 1u);
+  EXPECT_EQ(high[0].get("ReplyError")->uint64Value(), 49u);
+}
+
+TEST_F(VSARelayDispatcherTest, MessageWithoutReplyContextCancelsTheConnection) {
+  dispatcher_ = std::make_unique<VSARelayDispatcher>(*context_);
+  auto message = std::make_shared<VSAIPCMessage>(connection_, std::nullopt, "garbage",
+                                                 context_->transactions->open());
+  dispatcher_->processRelayEvent(message);
+  EXPECT_TRUE(connection_->isCancelled());
+  uint8_t b;
+  EXPECT_EQ(recv(peer_, &b, 1, 0), 0) << "peer sees the connection closed, no reply";
+}
+
+}  // namespace

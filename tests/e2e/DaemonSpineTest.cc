@@ -1,0 +1,203 @@
+// End to end: the real vessad on a temporary root, the real socket, the
+// real client.
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <atomic>
+#include <filesystem>
+#include <fstream>
+#include <thread>
+
+#include "base/VSAJSON.h"
+#include "e2e/VSATestDaemon.h"
+#include "platform/VSAFrameCodec.h"
+#include "platform/VSAIPCClient.h"
+#include "platform/VSALockStateService.h"
+#include "platform/VSANamedSemaphore.h"
+
+namespace {
+
+using namespace std::chrono_literals;
+
+const char* kAllowed = "com.tamsk.private.Vessa.allowed";
+
+VSAValue command(uint64_t n) { return VSAValue::Dictionary{{"Command", VSAValue(n)}}; }
+
+uint64_t replyError(const std::optional<VSAValue>& reply) {
+  if (!reply || !reply->get("ReplyError")) return 0;
+  return reply->get("ReplyError")->uint64Value().value_or(0);
+}
+
+TEST(DaemonSpine, InvalidCommandsGetOnlyReplyError49) {
+  VSATestDaemon d;
+  d.registerSelf("com.example.full", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
+  ASSERT_TRUE(d.start());
+  for (uint64_t n : {33ull, 34ull, 1000ull, 27ull}) {
+    auto reply = d.request(command(n));
+    ASSERT_TRUE(reply) << n;
+    EXPECT_EQ(replyError(reply), 49u) << n;
+    VSAValue keys = *reply;
+    keys.remove("MessageID");
+    EXPECT_EQ(keys.dictionaryValue()->size(), 1u) << reply->description();
+  }
+  // A request without "Command", or with one of the wrong type, is refused too.
+  EXPECT_EQ(replyError(d.request(VSAValue::Dictionary{{"Identifier", VSAValue("x")}})), 49u);
+  EXPECT_EQ(replyError(d.request(VSAValue::Dictionary{{"Command", VSAValue("0")}})), 49u);
+  EXPECT_EQ(d.stop(), 0);
+}
+
+TEST(DaemonSpine, EntitlementGatesThroughRealClients) {
+  VSATestDaemon d;
+  d.registerVessactl("full-client", "com.example.full", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
+  d.registerVessactl("lookup-client", "com.example.lookup",
+                     VSAValue::Dictionary{{"com.tamsk.private.Vessa.lookup",
+                                           VSAValue::Dictionary{{"com.example.other", VSAValue(true)}}}});
+  ASSERT_TRUE(d.start());
+  // Command 27 is not open and does not honour the lookup dictionary: only the
+  // full client reaches its handler (which always answers 49).
+  auto full = d.vessactl("full-client", {"--json", "Command=27"});
+  auto lookup = d.vessactl("lookup-client", {"--json", "Command=27"});
+  auto unknown = d.vessactl("", {"--json", "Command=27"});
+  std::string why;
+  auto parse = [&](const std::string& out) { return VSAJSON::parse(out, &why); };
+  EXPECT_EQ(full.status, 1);
+  EXPECT_EQ(replyError(parse(full.output)), 49u) << full.output;
+  EXPECT_EQ(replyError(parse(lookup.output)), 55u) << lookup.output;
+  EXPECT_EQ(replyError(parse(unknown.output)), 55u) << unknown.output;
+  EXPECT_EQ(unknown.status, 1);
+  std::string log = d.daemonOutput();
+  EXPECT_NE(log.find("(com.example.lookup) is not entitled"), std::string::npos);
+  EXPECT_NE(log.find("(<unknown>) is not entitled"), std::string::npos);
+  EXPECT_EQ(d.stop(), 0);
+}
+
+TEST(DaemonSpine, RequestSentDuringInitialisationIsAnsweredAfterIt) {
+  VSATestDaemon d;
+  d.registerSelf("com.example.full", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
+  // The log file is a FIFO: opening it (the first step of initialisation)
+  // blocks until somebody reads, which holds initialisation at that point.
+  std::string logDir = d.path("/private/var/root/Library/Logs/Vessa");
+  std::filesystem::create_directories(logDir);
+  ASSERT_EQ(mkfifo((logDir + "/vessad.log").c_str(), 0644), 0);
+  ASSERT_TRUE(d.start());
+  VSAIPCClient client;
+  VSAErrorRef error;
+  ASSERT_TRUE(client.connect(d.socketPath(), &error));
+  auto id = client.send(command(27), &error);
+  ASSERT_TRUE(id);
+  EXPECT_FALSE(client.waitForReply(*id, 500ms, &error)) << "answered before initialisation";
+  std::atomic<bool> stopReading{false};
+  std::thread reader([&] {
+    int fd = open((logDir + "/vessad.log").c_str(), O_RDONLY | O_NONBLOCK);
+    char buf[4096];
+    while (!stopReading) {
+      if (read(fd, buf, sizeof buf) <= 0) std::this_thread::sleep_for(2ms);
+    }
+    close(fd);
+  });
+  auto reply = client.waitForReply(*id, 10s, &error);
+  EXPECT_EQ(replyError(reply), 49u);
+  std::string out = d.daemonOutput();
+  EXPECT_LT(out.find("end StartingUp"), out.find("command=27, client="));
+  EXPECT_EQ(d.stop(), 0);
+  stopReading = true;
+  reader.join();
+}
+
+TEST(DaemonSpine, FirstBootWorkRunsOncePerBoot) {
+  VSATestDaemon d;
+  ASSERT_FALSE(VSANamedSemaphore::exists(d.firstBootSemaphore()));
+  ASSERT_TRUE(d.start());
+  ASSERT_TRUE(d.waitForNotifications(2));
+  EXPECT_EQ(d.stop(), 0);
+  EXPECT_TRUE(VSANamedSemaphore::exists(d.firstBootSemaphore()));
+  // The two cleanups finish in either order.
+  auto first = d.notifications();
+  std::sort(first.begin(), first.end());
+  EXPECT_EQ(first, (std::vector<std::string>{"com.tamsk.vessad.cleanup-complete",
+                                             "com.tamsk.vessad.reboot-cleanup-complete"}));
+  ASSERT_TRUE(d.start());
+  ASSERT_TRUE(d.waitForNotifications(3));
+  EXPECT_EQ(d.stop(), 0);
+  auto second = d.notifications();
+  ASSERT_EQ(second.size(), 3u);
+  EXPECT_EQ(second[2], "com.tamsk.vessad.cleanup-complete");
+  std::string out = d.daemonOutput();
+  size_t firstBoot = out.find("vessad performing first boot initialization");
+  ASSERT_NE(firstBoot, std::string::npos);
+  EXPECT_EQ(out.find("vessad performing first boot initialization", firstBoot + 1), std::string::npos);
+  // Losing the marker (a new boot) makes the next start a first boot again.
+  VSANamedSemaphore::remove(d.firstBootSemaphore());
+  ASSERT_TRUE(d.start());
+  ASSERT_TRUE(d.waitForNotifications(5));
+  EXPECT_EQ(d.stop(), 0);
+  auto third = d.notifications();
+  EXPECT_EQ(std::count(third.begin(), third.end(), "com.tamsk.vessad.reboot-cleanup-complete"), 2);
+}
+
+TEST(DaemonSpine, LockStateChangesReachTheRunningDaemon) {
+  VSATestDaemon d;
+  ASSERT_TRUE(d.start());
+  VSALockStateService device{VSASystemRoot(d.root())};
+  auto waitFor = [&](const std::string& text, size_t from) {
+    for (int i = 0; i < 500; ++i) {
+      size_t at = d.daemonOutput().find(text, from);
+      if (at != std::string::npos) return at;
+      std::this_thread::sleep_for(10ms);
+    }
+    return std::string::npos;
+  };
+  size_t start = waitFor("LockState=0", 0);
+  ASSERT_NE(start, std::string::npos);
+  ASSERT_TRUE(device.setLockState(1));
+  size_t locked = waitFor("LockState=1", start);
+  EXPECT_NE(locked, std::string::npos);
+  ASSERT_TRUE(device.setLockState(0));
+  EXPECT_NE(waitFor("LockState=0", locked), std::string::npos);
+  EXPECT_EQ(d.stop(), 0);
+}
+
+TEST(DaemonSpine, GarbageFramesLeaveTheDaemonServingOthers) {
+  VSATestDaemon d;
+  d.registerSelf("com.example.full", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
+  ASSERT_TRUE(d.start());
+  VSAErrorRef error;
+  VSAIPCClient good, garbage, oversized, array, truncated;
+  for (VSAIPCClient* c : {&good, &garbage, &oversized, &array, &truncated})
+    ASSERT_TRUE(c->connect(d.socketPath(), &error));
+  uint8_t junk[] = {0, 0, 0, 6, 'b', 'p', 'l', 'i', 's', 't'};
+  ASSERT_TRUE(garbage.sendRaw(junk, sizeof junk, &error));
+  uint8_t huge[] = {0x10, 0, 0, 0};
+  ASSERT_TRUE(oversized.sendRaw(huge, sizeof huge, &error));
+  auto arr = *VSAFrameCodec::encode(VSAValue(VSAValue::Array{VSAValue(1)}), &error);
+  ASSERT_TRUE(array.sendRaw(arr.data(), arr.size(), &error));
+  auto frame = *VSAFrameCodec::encode(command(27), &error);
+  ASSERT_TRUE(truncated.sendRaw(frame.data(), frame.size() - 3, &error));
+  truncated.close();
+  EXPECT_TRUE(garbage.waitForClose(5s));
+  EXPECT_TRUE(oversized.waitForClose(5s));
+  EXPECT_TRUE(array.waitForClose(5s));
+  EXPECT_EQ(replyError(good.sendRequest(command(27), 5s, &error)), 49u);
+  std::string out = d.daemonOutput();
+  EXPECT_NE(out.find("Dictionary does not have reply context"), std::string::npos);
+  EXPECT_NE(out.find("exceeds the limit"), std::string::npos);
+  EXPECT_NE(out.find("stream ended inside a frame"), std::string::npos);
+  EXPECT_EQ(d.stop(), 0);
+}
+
+TEST(DaemonSpine, StopsCleanlyAndRemovesItsSocket) {
+  VSATestDaemon d;
+  ASSERT_TRUE(d.start());
+  EXPECT_TRUE(std::filesystem::exists(d.socketPath()));
+  EXPECT_EQ(d.stop(), 0);
+  EXPECT_FALSE(std::filesystem::exists(d.socketPath()));
+  std::ifstream log(d.path("/private/var/root/Library/Logs/Vessa/vessad.log"));
+  std::string text((std::istreambuf_iterator<char>(log)), std::istreambuf_iterator<char>());
+  EXPECT_NE(text.find("vessad stopped"), std::string::npos);
+  EXPECT_NE(text.find("vessad performing first boot initialization"), std::string::npos);
+}
+
+}  // namespace

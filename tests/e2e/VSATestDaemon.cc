@@ -1,0 +1,168 @@
+#include "e2e/VSATestDaemon.h"
+
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <climits>
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+#include <thread>
+
+#include "base/VSAPlist.h"
+#include "platform/VSAIPCClient.h"
+#include "platform/VSANamedSemaphore.h"
+#include "platform/VSANotificationCenter.h"
+#include "platform/VSASystemRoot.h"
+
+namespace fs = std::filesystem;
+using namespace std::chrono_literals;
+
+VSATestDaemon::VSATestDaemon() {
+  char tmpl[] = "/tmp/vessa-e2e-XXXXXX";
+  root_ = mkdtemp(tmpl);
+  fs::create_directories(root_ + "/etc/vessad/clients.d");
+  fs::create_directories(root_ + "/usr/bin");
+  fs::create_directories(root_ + "/run/vessad");
+}
+
+VSATestDaemon::~VSATestDaemon() {
+  if (pid_ > 0) {
+    kill(pid_, SIGKILL);
+    waitpid(pid_, nullptr, 0);
+  }
+  VSANamedSemaphore::remove(firstBootSemaphore());
+  fs::remove_all(root_);
+}
+
+std::string VSATestDaemon::firstBootSemaphore() const {
+  return VSANamedSemaphore::nameForRoot("vessad.fb_check", VSASystemRoot(root_));
+}
+
+namespace {
+void writeEntry(const std::string& file, const std::string& exe, const std::string& sid,
+                const VSAValue& entitlements, bool sandboxed) {
+  VSAErrorRef error;
+  VSA_writeToURL(VSAValue::Dictionary{{"Executable", VSAValue(exe)},
+                                      {"SigningIdentifier", VSAValue(sid)},
+                                      {"Entitlements", entitlements},
+                                      {"Sandboxed", VSAValue(sandboxed)}},
+                 file, 0, &error);
+}
+}  // namespace
+
+void VSATestDaemon::registerSelf(const std::string& signingIdentifier, const VSAValue& entitlements,
+                                 bool sandboxed) {
+  char buf[PATH_MAX];
+  ssize_t n = readlink("/proc/self/exe", buf, sizeof buf - 1);
+  fs::remove(root_ + "/usr/bin/e2e-tests");
+  fs::create_symlink(std::string(buf, n), root_ + "/usr/bin/e2e-tests");
+  writeEntry(root_ + "/etc/vessad/clients.d/e2e-tests.plist", "/usr/bin/e2e-tests",
+             signingIdentifier, entitlements, sandboxed);
+}
+
+void VSATestDaemon::registerVessactl(const std::string& name, const std::string& signingIdentifier,
+                                     const VSAValue& entitlements) {
+  fs::copy_file(VESSACTL_PATH, root_ + "/usr/bin/" + name, fs::copy_options::overwrite_existing);
+  writeEntry(root_ + "/etc/vessad/clients.d/" + name + ".plist", "/usr/bin/" + name,
+             signingIdentifier, entitlements, false);
+}
+
+bool VSATestDaemon::start(bool waitForSocket, std::vector<std::string> extraArgs) {
+  std::vector<std::string> args = {VESSAD_PATH, "--root", root_, "--stderr", "--log-level", "7"};
+  args.insert(args.end(), extraArgs.begin(), extraArgs.end());
+  pid_ = fork();
+  if (pid_ == 0) {
+    int out = open((root_ + "/vessad.out").c_str(), O_WRONLY | O_CREAT | O_APPEND, 0644);
+    dup2(out, 1);
+    dup2(out, 2);
+    std::vector<char*> argv;
+    for (auto& a : args) argv.push_back(a.data());
+    argv.push_back(nullptr);
+    execv(argv[0], argv.data());
+    _exit(127);
+  }
+  if (!waitForSocket) return pid_ > 0;
+  for (int i = 0; i < 1000; ++i) {
+    VSAIPCClient probe;
+    if (probe.connect(socketPath(), nullptr)) return true;
+    std::this_thread::sleep_for(10ms);
+  }
+  return false;
+}
+
+int VSATestDaemon::stop(std::chrono::seconds timeout) {
+  if (pid_ <= 0) return -1;
+  kill(pid_, SIGTERM);
+  auto deadline = std::chrono::steady_clock::now() + timeout;
+  int status = 0;
+  while (std::chrono::steady_clock::now() < deadline) {
+    pid_t r = waitpid(pid_, &status, WNOHANG);
+    if (r == pid_) {
+      pid_ = -1;
+      return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+    }
+    std::this_thread::sleep_for(10ms);
+  }
+  kill(pid_, SIGKILL);
+  waitpid(pid_, nullptr, 0);
+  pid_ = -1;
+  return -1;
+}
+
+std::optional<VSAValue> VSATestDaemon::request(VSAValue body, std::chrono::milliseconds timeout) {
+  VSAIPCClient client;
+  if (!client.connect(socketPath(), nullptr)) return std::nullopt;
+  return client.sendRequest(std::move(body), timeout, nullptr);
+}
+
+VSATestDaemon::Run VSATestDaemon::vessactl(const std::string& client,
+                                           std::vector<std::string> args) {
+  std::string exe = client.empty() ? std::string(VESSACTL_PATH) : root_ + "/usr/bin/" + client;
+  std::vector<std::string> full = {exe, "--root", root_};
+  full.insert(full.end(), args.begin(), args.end());
+  int pipefd[2];
+  if (pipe(pipefd) != 0) return {-1, ""};
+  pid_t pid = fork();
+  if (pid == 0) {
+    dup2(pipefd[1], 1);
+    dup2(pipefd[1], 2);
+    close(pipefd[0]);
+    std::vector<char*> argv;
+    for (auto& a : full) argv.push_back(a.data());
+    argv.push_back(nullptr);
+    execv(argv[0], argv.data());
+    _exit(127);
+  }
+  close(pipefd[1]);
+  std::string out;
+  char buf[4096];
+  ssize_t n;
+  while ((n = read(pipefd[0], buf, sizeof buf)) > 0) out.append(buf, n);
+  close(pipefd[0]);
+  int status = 0;
+  waitpid(pid, &status, 0);
+  return {WIFEXITED(status) ? WEXITSTATUS(status) : -1, out};
+}
+
+std::vector<std::string> VSATestDaemon::notifications() const {
+  return VSANotificationCenter(VSASystemRoot(root_)).postedNames();
+}
+
+bool VSATestDaemon::waitForNotifications(size_t count, std::chrono::seconds timeout) {
+  auto deadline = std::chrono::steady_clock::now() + timeout;
+  while (std::chrono::steady_clock::now() < deadline) {
+    if (notifications().size() >= count) return true;
+    std::this_thread::sleep_for(10ms);
+  }
+  return false;
+}
+
+std::string VSATestDaemon::daemonOutput() const {
+  std::ifstream in(root_ + "/vessad.out");
+  std::stringstream ss;
+  ss << in.rdbuf();
+  return ss.str();
+}

@@ -1,0 +1,61 @@
+// A real vessad on a temporary system root, for end-to-end tests.
+//
+// Builds the root (client registry, run directory), starts the daemon binary
+// with --root, talks to it through the real socket and the real client, and
+// stops it with SIGTERM. Clients are registered by placing an executable in
+// the root (a symlink to this test binary, or a copy of vessactl so that
+// several distinct clients exist) and a registry entry naming it.
+#pragma once
+
+#include <sys/types.h>
+
+#include <chrono>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "base/VSAValue.h"
+
+class VSATestDaemon {
+ public:
+  VSATestDaemon();
+  ~VSATestDaemon();
+
+  const std::string& root() const { return root_; }
+  std::string path(const std::string& devicePath) const { return root_ + devicePath; }
+
+  // Registers this test process under `signingIdentifier`.
+  void registerSelf(const std::string& signingIdentifier, const VSAValue& entitlements,
+                    bool sandboxed = false);
+  // Registers a copy of vessactl installed as /usr/bin/<name>.
+  void registerVessactl(const std::string& name, const std::string& signingIdentifier,
+                        const VSAValue& entitlements);
+
+  // Starts vessad; waits for its socket unless told not to.
+  bool start(bool waitForSocket = true, std::vector<std::string> extraArgs = {});
+  // SIGTERM and wait; returns the exit status (or -1 on a signal/time-out).
+  int stop(std::chrono::seconds timeout = std::chrono::seconds(20));
+  bool running() const { return pid_ > 0; }
+  std::string socketPath() const { return root_ + "/run/vessad/com.tamsk.vessad"; }
+
+  // Sends one request from this process and returns the reply.
+  std::optional<VSAValue> request(VSAValue body, std::chrono::milliseconds timeout =
+                                                     std::chrono::seconds(10));
+  struct Run {
+    int status;
+    std::string output;
+  };
+  // Runs vessactl (`client` = a registered copy's name, or "" for the
+  // unregistered build output) with --root and the given arguments.
+  Run vessactl(const std::string& client, std::vector<std::string> args);
+
+  std::vector<std::string> notifications() const;
+  // Waits until the notification log holds `count` names.
+  bool waitForNotifications(size_t count, std::chrono::seconds timeout = std::chrono::seconds(10));
+  std::string daemonOutput() const;
+  std::string firstBootSemaphore() const;
+
+ private:
+  std::string root_;
+  pid_t pid_ = -1;
+};
