@@ -356,7 +356,12 @@ class Decoder {
       case 0x50: {
         uint64_t count;
         if (!readCount(pos, low, count) || !fits(pos, count, 1)) return false;
-        out = VSAValue(std::string(reinterpret_cast<const char*>(d_ + pos), count));
+        // One-byte strings are ASCII; stray high bytes are taken as Latin-1 so
+        // that every decoded string is valid UTF-8.
+        std::string s;
+        s.reserve(count);
+        for (uint64_t i = 0; i < count; ++i) appendUTF8(s, d_[pos + i]);
+        out = VSAValue(std::move(s));
         return true;
       }
       case 0x60:

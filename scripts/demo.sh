@@ -1,0 +1,54 @@
+#!/usr/bin/env bash
+# The daemon's main job on a demo device: provisions a system root (in DIR,
+# or a temporary directory), starts vessad on it, sends requests with
+# vessactl, shows the replies, and stops the daemon cleanly.
+#   scripts/demo.sh [DIR]
+set -euo pipefail
+cd "$(dirname "$0")/.."
+repo=$(pwd)
+scripts/setup.sh
+scripts/build.sh >/dev/null
+build=${BUILD_DIR:-build}
+
+root=${1:-$(mktemp -d /tmp/vessa-demo-XXXXXX)}
+mkdir -p "$root"
+root=$(cd "$root" && pwd)
+echo "== Provisioning a demo device in $root"
+scripts/provision-root.sh "$root" "$repo/$build/vessactl"
+
+step() { echo; echo "== $*"; }
+ctl() { echo "\$ $*" | sed -e "s|$root|\$ROOT|g" -e "s|$build/||"; "$@" || true; }
+
+step "Starting vessad --root \$ROOT"
+"$build/vessad" --root "$root" --stderr --log-level 7 >"$root/vessad.out" 2>&1 &
+daemon=$!
+trap 'kill $daemon 2>/dev/null || true' EXIT
+for _ in $(seq 100); do [[ -S "$root/run/vessad/com.tamsk.vessad" ]] && break; sleep 0.05; done
+installer="$root/usr/bin/demo-installer"
+
+step "An entitled client sends the retired command 27: the table answers 49"
+ctl "$installer" --root "$root" Command=27
+step "Command 40 is outside the 33-entry table: 49"
+ctl "$installer" --root "$root" --json Command=40
+step "An unregistered client is not entitled to command 27: 55"
+ctl "$build/vessactl" --root "$root" Command=27
+step "A request without a Command key: 49"
+ctl "$installer" --root "$root" Identifier=com.example.demo
+
+step "Locking and unlocking the device (the daemon follows the lock state)"
+echo 1 > "$root/run/vessad/lockstate"; sleep 0.2
+echo 0 > "$root/run/vessad/lockstate"; sleep 0.2
+grep -o 'lock_state_changed: LockState=[0-9]*' "$root/vessad.out"
+
+step "Notifications posted by the daemon"
+"$build/vessactl" --root "$root" notifications
+
+step "Stopping vessad (SIGTERM)"
+kill -TERM $daemon
+wait $daemon && echo "vessad exited with status 0"
+trap - EXIT
+
+step "The daemon's rotating log: $root/private/var/root/Library/Logs/Vessa/vessad.log"
+grep -v '<Debug>' "$root/private/var/root/Library/Logs/Vessa/vessad.log" | tail -n 12
+echo "(debug lines, signposts included, are in the same file on this internal build)"
+: "$root/private/var/root/Library/Logs/Vessa/vessad.log"

@@ -1,0 +1,13 @@
+#!/usr/bin/env bash
+# Builds the libFuzzer targets with clang-14 (ASan+UBSan) and runs one.
+#   scripts/fuzz.sh [TARGET] [SECONDS]     default: frame 60
+set -euo pipefail
+cd "$(dirname "$0")/.."
+scripts/setup.sh
+target=${1:-frame}
+seconds=${2:-60}
+export BUILD_DIR=build-fuzz CC=clang-14 CXX=clang++-14
+scripts/build.sh -DVESSA_FUZZ=ON
+corpus=$(mktemp -d)
+cp tests/fuzz/corpus/"$target"/* "$corpus"/ 2>/dev/null || true
+"$BUILD_DIR"/tests/fuzz/fuzz_"$target" -max_total_time="$seconds" -max_len=65536 "$corpus"

@@ -1,0 +1,40 @@
+#!/usr/bin/env bash
+# Lays out a minimal demo device under a system root:
+#   scripts/provision-root.sh ROOT VESSACTL
+# - /etc/passwd and /etc/group with root and the "mobile" user (501)
+# - /etc/vessad/device.plist (an internal build, so debug lines reach the log)
+# - a registered client "demo-installer" (a copy of vessactl holding the
+#   full-client entitlement) in /usr/bin and /etc/vessad/clients.d
+set -euo pipefail
+root=$1
+vessactl=$2
+mkdir -p "$root"/{etc/vessad/clients.d,usr/bin,run/vessad,tmp,private/var/mobile}
+cat > "$root/etc/passwd" <<'PW'
+root:x:0:0:root:/private/var/root:/bin/sh
+mobile:x:501:501:Mobile User:/private/var/mobile:/bin/sh
+PW
+cat > "$root/etc/group" <<'GR'
+root:x:0:
+mobile:x:501:
+systemusers:x:600:
+GR
+cat > "$root/etc/vessad/device.plist" <<'PL'
+<?xml version="1.0" encoding="UTF-8"?>
+<plist version="1.0"><dict>
+  <key>HasInternalContent</key><true/>
+</dict></plist>
+PL
+cp "$vessactl" "$root/usr/bin/demo-installer"
+cat > "$root/etc/vessad/clients.d/demo-installer.plist" <<'PL'
+<?xml version="1.0" encoding="UTF-8"?>
+<plist version="1.0"><dict>
+  <key>Executable</key><string>/usr/bin/demo-installer</string>
+  <key>SigningIdentifier</key><string>com.tamsk.demo.installer</string>
+  <key>Entitlements</key><dict>
+    <key>com.tamsk.private.Vessa.allowed</key><true/>
+  </dict>
+  <key>Sandboxed</key><false/>
+</dict></plist>
+PL
+chmod 0644 "$root"/etc/vessad/clients.d/*.plist
+echo "provisioned $root"
