@@ -10,6 +10,8 @@
 #include <cstdio>
 #include <ctime>
 
+std::atomic<int> gVSALogWriterLevel{kVSALogNotice};
+
 VSALogger& VSALogger::shared() {
   static auto* logger = new VSALogger();  // leaked: used until the very end
   return *logger;
@@ -56,7 +58,7 @@ bool VSALogger::openRotatingLog(const std::string& path, int writerLevel) {
     file_.reset();
     return false;
   }
-  level_.store(writerLevel > level() ? writerLevel : level());
+  if (writerLevel > level()) setLevel(writerLevel);
   return true;
 }
 

@@ -50,6 +50,9 @@ enum class VSALogCategory {
   Daemon,  // subsystem "com.tamsk.vessad"
 };
 
+// The writer level, readable without a call so that disabled lines cost one load.
+extern std::atomic<int> gVSALogWriterLevel;
+
 class VSALogger {
  public:
   static VSALogger& shared();
@@ -61,9 +64,11 @@ class VSALogger {
   void closeRotatingLog();
   void flush();
 
-  int level() const { return level_.load(std::memory_order_relaxed); }
-  void setLevel(int level) { level_.store(level, std::memory_order_relaxed); }
-  bool enabled(int level) const { return level <= this->level(); }
+  int level() const { return gVSALogWriterLevel.load(std::memory_order_relaxed); }
+  void setLevel(int level) { gVSALogWriterLevel.store(level, std::memory_order_relaxed); }
+  static bool enabled(int level) {
+    return level <= gVSALogWriterLevel.load(std::memory_order_relaxed);
+  }
   // Sends unified-log lines to stderr even when journald is present.
   void setUseStderr(bool useStderr) { forceStderr_ = useStderr; }
 
@@ -76,7 +81,6 @@ class VSALogger {
   VSALogger();
   void writeUnified(VSALogCategory category, int level, const char* origin, const std::string& m);
 
-  std::atomic<int> level_{kVSALogNotice};
   std::mutex mutex_;
   std::shared_ptr<spdlog::logger> file_;
   bool diskEnabled_ = false;
@@ -88,9 +92,8 @@ class VSALogger {
 template <typename... A>
 void VSALogIn(VSALogCategory category, int level, const char* origin, std::string_view format,
               const A&... args) {
-  VSALogger& logger = VSALogger::shared();
-  if (!logger.enabled(level)) return;
-  logger.write(category, level, origin, VSAFormat(format, args...));
+  if (!VSALogger::enabled(level)) return;
+  VSALogger::shared().write(category, level, origin, VSAFormat(format, args...));
 }
 
 template <typename... A>

@@ -1,0 +1,49 @@
+// Runs the registered Google benchmarks and prints, for each (candidate,
+// baseline) pair, the candidate's speed as a ratio of the baseline measured
+// in the same run: ratio = baseline time per iteration / candidate time.
+#pragma once
+
+#include <benchmark/benchmark.h>
+
+#include <cstdio>
+#include <map>
+#include <string>
+#include <utility>
+#include <vector>
+
+class VSARatioReporter : public benchmark::ConsoleReporter {
+ public:
+  void ReportRuns(const std::vector<Run>& runs) override {
+    for (const Run& r : runs)
+      if (r.run_type == Run::RT_Iteration) times_[r.benchmark_name()] = r.GetAdjustedRealTime();
+    ConsoleReporter::ReportRuns(runs);
+  }
+  double time(const std::string& name) const {
+    auto it = times_.find(name);
+    return it == times_.end() ? 0 : it->second;
+  }
+
+ private:
+  std::map<std::string, double> times_;
+};
+
+struct VSARatio {
+  const char* candidate;
+  const char* baseline;
+  double target;
+};
+
+inline int VSARunWithRatios(int argc, char** argv, const std::vector<VSARatio>& ratios) {
+  benchmark::Initialize(&argc, argv);
+  VSARatioReporter reporter;
+  benchmark::RunSpecifiedBenchmarks(&reporter);
+  std::printf("\n%-44s %-36s %8s %8s\n", "candidate", "baseline", "ratio", "target");
+  for (const VSARatio& r : ratios) {
+    double c = reporter.time(r.candidate), b = reporter.time(r.baseline);
+    if (c <= 0 || b <= 0) continue;
+    double ratio = b / c;
+    std::printf("%-44s %-36s %7.2fx %7.2fx %s\n", r.candidate, r.baseline, ratio, r.target,
+                ratio >= r.target ? "ok" : "BELOW TARGET");
+  }
+  return 0;
+}

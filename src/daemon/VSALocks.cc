@@ -1,0 +1,353 @@
+#include "daemon/VSALocks.h"
+
+#include <pthread.h>
+
+#include <algorithm>
+#include <atomic>
+#include <cstdlib>
+#include <cstring>
+#include <set>
+#include <string_view>
+
+#include "base/VSALog.h"
+
+namespace {
+
+struct LockRecord {
+  pthread_rwlock_t lock;
+  uint64_t refCount;
+  std::atomic<int32_t> lockState;  // 0 free, -1 write, n > 0 readers
+  std::string key;
+  uint64_t hash;
+};
+
+// Keys are mostly 36-character UUID strings: hash them eight bytes at a time
+// with independent multiplies (the chain is short; probing absorbs the odd
+// collision).
+uint64_t hashKey(std::string_view s) {
+  static constexpr uint64_t kMul[4] = {0x9E3779B97F4A7C15ull, 0xC2B2AE3D27D4EB4Full,
+                                       0x165667B19E3779F9ull, 0xD6E8FEB86659FD93ull};
+  uint64_t h = s.size() * 0xFF51AFD7ED558CCDull;
+  size_t i = 0;
+  for (; i + 8 <= s.size(); i += 8) {
+    uint64_t w;
+    std::memcpy(&w, s.data() + i, 8);
+    h += (w ^ (w >> 29)) * kMul[(i >> 3) & 3];
+  }
+  uint64_t tail = 0;
+  for (size_t k = i; k < s.size(); ++k) tail = (tail << 8) | static_cast<uint8_t>(s[k]);
+  h += tail * 0xC4CEB9FE1A85EC53ull;
+  return h ^ (h >> 32);
+}
+
+// The key -> record map: open addressing with linear probing and
+// backward-shift deletion, each record carrying its hash, so that one lock
+// or unlock hashes its key once and allocates nothing in steady state. It
+// holds exactly the keys in use.
+class LockMap {
+ public:
+  LockMap() : slots_(16, nullptr) {}
+  size_t size() const { return size_; }
+
+  LockRecord* find(std::string_view key, uint64_t hash) const {
+    for (size_t i = hash & mask();; i = (i + 1) & mask()) {
+      LockRecord* r = slots_[i];
+      if (!r) return nullptr;
+      if (r->hash == hash && r->key == key) return r;
+    }
+  }
+  void insert(LockRecord* record) {
+    if ((size_ + 1) * 4 > slots_.size() * 3) grow();
+    place(record);
+    ++size_;
+  }
+  void erase(LockRecord* record) {
+    size_t i = record->hash & mask();
+    while (slots_[i] != record) i = (i + 1) & mask();
+    // Shift later members of the probe run back into the hole.
+    for (size_t j = (i + 1) & mask(); slots_[j]; j = (j + 1) & mask()) {
+      size_t home = slots_[j]->hash & mask();
+      if (((j - home) & mask()) >= ((j - i) & mask())) {
+        slots_[i] = slots_[j];
+        i = j;
+      }
+    }
+    slots_[i] = nullptr;
+    --size_;
+  }
+
+ private:
+  size_t mask() const { return slots_.size() - 1; }
+  void place(LockRecord* record) {
+    size_t i = record->hash & mask();
+    while (slots_[i]) i = (i + 1) & mask();
+    slots_[i] = record;
+  }
+  void grow() {
+    std::vector<LockRecord*> old(slots_.size() * 2, nullptr);
+    old.swap(slots_);
+    for (LockRecord* r : old)
+      if (r) place(r);
+  }
+
+  std::vector<LockRecord*> slots_;
+  size_t size_ = 0;
+};
+
+// Records whose last holder left go to a small cache for reuse.
+constexpr size_t kCachedRecords = 64;
+
+// A condition variable that knows whether anybody waits, so that the many
+// wake-ups the protocol asks for cost nothing when nobody does.
+struct Condition {
+  pthread_cond_t cond = PTHREAD_COND_INITIALIZER;
+  int waiters = 0;
+  void wait(pthread_mutex_t* mutex) {
+    ++waiters;
+    pthread_cond_wait(&cond, mutex);
+    --waiters;
+  }
+  void signal() {
+    if (waiters) pthread_cond_signal(&cond);
+  }
+  void broadcast() {
+    if (waiters) pthread_cond_broadcast(&cond);
+  }
+};
+
+struct LockTable {
+  pthread_mutex_t mutex = PTHREAD_MUTEX_INITIALIZER;
+  Condition globalWriterCondition;
+  Condition globalReaderCondition;
+  Condition identifierWriterCondition;
+  Condition identifierReaderCondition;
+  LockMap* identifierToLockMap = nullptr;
+  std::vector<LockRecord*> freeRecords;
+  uint32_t identifierReaderCount = 0;
+  uint32_t identifierWriterCount = 0;
+  int32_t allReaderWriterState = 0;
+};
+
+LockTable gVSALocks;
+
+[[noreturn]] void assertionFailed(const char* function, const char* condition) {
+  VSALogIn(VSALogCategory::Locking, kVSALogFault, function, "Assertion failed: %s", condition);
+  VSALogger::shared().flush();
+  std::fprintf(stderr, "%s: Assertion failed: %s\n", function, condition);
+  std::abort();
+}
+
+#define VSA_LOCK_ASSERT(condition) \
+  do {                             \
+    if (!(condition)) assertionFailed(__func__, #condition); \
+  } while (0)
+
+[[noreturn]] void unknownParameter(const char* function) {
+  VSALogIn(VSALogCategory::Locking, kVSALogError, function, "Unknown parameter type!");
+  VSALogger::shared().flush();
+  std::fprintf(stderr, "%s: Unknown parameter type!\n", function);
+  std::abort();
+}
+
+const char* mode(bool writing) { return writing ? "writing" : "reading"; }
+
+void take_one_lock(const std::string& key, bool writing) {
+  pthread_mutex_lock(&gVSALocks.mutex);
+  if (writing) {
+    while (gVSALocks.allReaderWriterState != 0)
+      gVSALocks.identifierWriterCondition.wait(&gVSALocks.mutex);
+    ++gVSALocks.identifierWriterCount;
+  } else {
+    while (gVSALocks.allReaderWriterState == -1)
+      gVSALocks.identifierReaderCondition.wait(&gVSALocks.mutex);
+    ++gVSALocks.identifierReaderCount;
+  }
+  if (!gVSALocks.identifierToLockMap) gVSALocks.identifierToLockMap = new LockMap();
+  uint64_t hash = hashKey(key);
+  LockRecord* lockPtr = gVSALocks.identifierToLockMap->find(key, hash);
+  if (!lockPtr) {
+    if (!gVSALocks.freeRecords.empty()) {
+      lockPtr = gVSALocks.freeRecords.back();
+      gVSALocks.freeRecords.pop_back();
+    } else {
+      lockPtr = new LockRecord;
+      pthread_rwlock_init(&lockPtr->lock, nullptr);
+    }
+    lockPtr->refCount = 0;
+    lockPtr->lockState.store(0);
+    lockPtr->key.assign(key);
+    lockPtr->hash = hash;
+    gVSALocks.identifierToLockMap->insert(lockPtr);
+  }
+  ++lockPtr->refCount;
+  pthread_mutex_unlock(&gVSALocks.mutex);
+
+  VSALogIn(VSALogCategory::Locking, kVSALogDebug, "take_one_lock", "Waiting to lock %@ for %s", key,
+           mode(writing));
+  if (writing) {
+    pthread_rwlock_wrlock(&lockPtr->lock);
+    int32_t expected = 0;
+    VSA_LOCK_ASSERT(atomic_compare_exchange_strong(&lockPtr->lockState, &expected, -1));
+  } else {
+    pthread_rwlock_rdlock(&lockPtr->lock);
+    VSA_LOCK_ASSERT(atomic_fetch_add(&lockPtr->lockState, 1) >= 0);
+  }
+  VSALogIn(VSALogCategory::Locking, kVSALogDebug, "take_one_lock", "Got lock on identifier %@", key);
+}
+
+bool allCountersZero() {
+  return gVSALocks.identifierWriterCount == 0 && gVSALocks.identifierReaderCount == 0 &&
+         gVSALocks.allReaderWriterState == 0;
+}
+
+void unlock_one_lock(const std::string& key) {
+  pthread_mutex_lock(&gVSALocks.mutex);
+  VSA_LOCK_ASSERT(gVSALocks.identifierToLockMap);
+  LockRecord* lockPtr = gVSALocks.identifierToLockMap->find(key, hashKey(key));
+  VSA_LOCK_ASSERT(lockPtr);
+  VSA_LOCK_ASSERT(atomic_load(&lockPtr->lockState) != 0);
+  if (atomic_load(&lockPtr->lockState) != -1) {
+    VSA_LOCK_ASSERT(atomic_fetch_sub(&lockPtr->lockState, 1) > 0);
+    VSA_LOCK_ASSERT(gVSALocks.allReaderWriterState >= 0);
+    VSA_LOCK_ASSERT(gVSALocks.identifierReaderCount > 0);
+    --gVSALocks.identifierReaderCount;
+    if (allCountersZero()) gVSALocks.globalWriterCondition.signal();
+  } else {
+    int32_t expected = -1;
+    VSA_LOCK_ASSERT(atomic_compare_exchange_strong(&lockPtr->lockState, &expected, 0));
+    VSA_LOCK_ASSERT(gVSALocks.allReaderWriterState == 0);
+    VSA_LOCK_ASSERT(gVSALocks.identifierWriterCount > 0);
+    --gVSALocks.identifierWriterCount;
+    if (allCountersZero()) gVSALocks.globalWriterCondition.signal();
+    if (gVSALocks.identifierWriterCount == 0 && gVSALocks.allReaderWriterState != -1)
+      gVSALocks.globalReaderCondition.broadcast();
+  }
+  --lockPtr->refCount;
+  pthread_rwlock_unlock(&lockPtr->lock);
+  VSALogIn(VSALogCategory::Locking, kVSALogDebug, "unlock_one_lock", "Unlocked identifier %@", key);
+  if (lockPtr->refCount == 0) {
+    VSALogIn(VSALogCategory::Locking, kVSALogDebug, "unlock_one_lock",
+             "Destroying lock for identifier %@", key);
+    VSA_LOCK_ASSERT(0 == atomic_load(&lockPtr->lockState));
+    gVSALocks.identifierToLockMap->erase(lockPtr);
+    if (gVSALocks.freeRecords.size() < kCachedRecords) {
+      gVSALocks.freeRecords.push_back(lockPtr);
+    } else {
+      pthread_rwlock_destroy(&lockPtr->lock);
+      delete lockPtr;
+    }
+  }
+  pthread_mutex_unlock(&gVSALocks.mutex);
+}
+
+// The distinct keys of `param` in the order they are to be taken
+// (ascending) or released (descending).
+std::vector<std::string> orderedKeys(const VSAValue& param, bool descending, const char* function) {
+  if (const std::string* s = param.stringValue()) return {*s};
+  const VSAValue::Array* array = param.arrayValue();
+  if (!array) unknownParameter(function);
+  std::vector<std::string> keys;
+  keys.reserve(array->size());
+  for (const VSAValue& v : *array) {
+    if (!v.isString()) unknownParameter(function);
+    keys.push_back(*v.stringValue());
+  }
+  std::sort(keys.begin(), keys.end());
+  keys.erase(std::unique(keys.begin(), keys.end()), keys.end());
+  if (descending) std::reverse(keys.begin(), keys.end());
+  return keys;
+}
+
+void _lock_identifier(const VSAValue& param, bool writing) {
+  if (const std::string* key = param.stringValue()) return take_one_lock(*key, writing);
+  for (const std::string& key : orderedKeys(param, false, "_lock_identifier"))
+    take_one_lock(key, writing);
+}
+
+void _lock_all_identifiers(bool writing) {
+  VSALogIn(VSALogCategory::Locking, kVSALogDebug, "_lock_all_identifiers",
+           "Waiting to lock all identifiers for %s", mode(writing));
+  pthread_mutex_lock(&gVSALocks.mutex);
+  if (writing) {
+    while (!allCountersZero())
+      gVSALocks.globalWriterCondition.wait(&gVSALocks.mutex);
+    gVSALocks.allReaderWriterState = -1;
+  } else {
+    while (gVSALocks.identifierWriterCount != 0 || gVSALocks.allReaderWriterState == -1)
+      gVSALocks.globalReaderCondition.wait(&gVSALocks.mutex);
+    ++gVSALocks.allReaderWriterState;
+  }
+  VSALogIn(VSALogCategory::Locking, kVSALogDebug, "_lock_all_identifiers",
+           "Locked all identifiers for %s", mode(writing));
+  pthread_mutex_unlock(&gVSALocks.mutex);
+}
+
+}  // namespace
+
+void lock_identifier_read(const VSAValue& param) { _lock_identifier(param, false); }
+void lock_identifier_write(const VSAValue& param) { _lock_identifier(param, true); }
+
+void unlock_identifier(const VSAValue& param) {
+  if (const std::string* key = param.stringValue()) return unlock_one_lock(*key);
+  for (const std::string& key : orderedKeys(param, true, "unlock_identifier")) unlock_one_lock(key);
+}
+
+void lock_all_identifiers_read() { _lock_all_identifiers(false); }
+void lock_all_identifiers_write() { _lock_all_identifiers(true); }
+
+void unlock_all_identifiers() {
+  pthread_mutex_lock(&gVSALocks.mutex);
+  if (gVSALocks.allReaderWriterState != -1) {
+    VSA_LOCK_ASSERT(gVSALocks.allReaderWriterState > 0);
+    --gVSALocks.allReaderWriterState;
+    if (gVSALocks.allReaderWriterState == 0)
+      gVSALocks.identifierWriterCondition.broadcast();
+    if (allCountersZero()) gVSALocks.globalWriterCondition.signal();
+  } else {
+    gVSALocks.allReaderWriterState = 0;
+    gVSALocks.globalWriterCondition.signal();
+    gVSALocks.globalReaderCondition.broadcast();
+    gVSALocks.identifierWriterCondition.broadcast();
+    gVSALocks.identifierReaderCondition.broadcast();
+  }
+  pthread_mutex_unlock(&gVSALocks.mutex);
+  VSALogIn(VSALogCategory::Locking, kVSALogDebug, "unlock_all_identifiers",
+           "Unlocked all identifiers");
+}
+
+VSALockTableState VSALockTableSnapshot() {
+  pthread_mutex_lock(&gVSALocks.mutex);
+  VSALockTableState s{gVSALocks.identifierToLockMap ? gVSALocks.identifierToLockMap->size() : 0,
+                      gVSALocks.identifierReaderCount, gVSALocks.identifierWriterCount,
+                      gVSALocks.allReaderWriterState};
+  pthread_mutex_unlock(&gVSALocks.mutex);
+  return s;
+}
+
+VSAIdentifierLockGuard::VSAIdentifierLockGuard(VSAValue keys, bool writing, bool useLocking)
+    : keys_(std::move(keys)), held_(useLocking) {
+  if (!held_) return;
+  if (writing) {
+    lock_identifier_write(keys_);
+  } else {
+    lock_identifier_read(keys_);
+  }
+}
+
+VSAIdentifierLockGuard::~VSAIdentifierLockGuard() {
+  if (held_) unlock_identifier(keys_);
+}
+
+VSAAllIdentifiersLockGuard::VSAAllIdentifiersLockGuard(bool writing, bool useLocking)
+    : held_(useLocking) {
+  if (!held_) return;
+  if (writing) {
+    lock_all_identifiers_write();
+  } else {
+    lock_all_identifiers_read();
+  }
+}
+
+VSAAllIdentifiersLockGuard::~VSAAllIdentifiersLockGuard() {
+  if (held_) unlock_all_identifiers();
+}

@@ -1,0 +1,246 @@
+#include "daemon/VSALocks.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <chrono>
+#include <functional>
+#include <future>
+#include <random>
+#include <thread>
+#include <vector>
+
+#include "base/VSALog.h"
+#include "base/VSAUUID.h"
+
+namespace {
+
+using namespace std::chrono_literals;
+
+enum class Hold { IdRead, IdWrite, OtherRead, OtherWrite, AllRead, AllWrite };
+
+void take(Hold h) {
+  switch (h) {
+    case Hold::IdRead: lock_identifier_read(VSAValue("A")); break;
+    case Hold::IdWrite: lock_identifier_write(VSAValue("A")); break;
+    case Hold::OtherRead: lock_identifier_read(VSAValue("B")); break;
+    case Hold::OtherWrite: lock_identifier_write(VSAValue("B")); break;
+    case Hold::AllRead: lock_all_identifiers_read(); break;
+    case Hold::AllWrite: lock_all_identifiers_write(); break;
+  }
+}
+
+void release(Hold h) {
+  switch (h) {
+    case Hold::IdRead:
+    case Hold::IdWrite: unlock_identifier(VSAValue("A")); break;
+    case Hold::OtherRead:
+    case Hold::OtherWrite: unlock_identifier(VSAValue("B")); break;
+    case Hold::AllRead:
+    case Hold::AllWrite: unlock_all_identifiers(); break;
+  }
+}
+
+// Holds `held` on one thread and asks for `requested` on another: true when
+// the request is granted while `held` is still held. Either way both are
+// released in the end and the table is left empty.
+bool grantedWhileHeld(Hold held, Hold requested) {
+  std::promise<void> heldPromise, releasePromise;
+  std::thread holder([&] {
+    take(held);
+    heldPromise.set_value();
+    releasePromise.get_future().wait();
+    release(held);
+  });
+  heldPromise.get_future().wait();
+  std::atomic<bool> got{false};
+  std::thread asker([&] {
+    take(requested);
+    got = true;
+    release(requested);
+  });
+  for (int i = 0; i < 30 && !got; ++i) std::this_thread::sleep_for(5ms);
+  bool granted = got;
+  releasePromise.set_value();
+  holder.join();
+  asker.join();
+  EXPECT_TRUE(got) << "the request must be granted once the hold ends";
+  return granted;
+}
+
+TEST(VSALocks, CompatibilityTable) {
+  struct Cell {
+    Hold requested, held;
+    bool granted;
+  };
+  const Cell cells[] = {
+      {Hold::IdRead, Hold::IdRead, true},     {Hold::IdRead, Hold::IdWrite, false},
+      {Hold::IdRead, Hold::OtherWrite, true}, {Hold::IdRead, Hold::AllRead, true},
+      {Hold::IdRead, Hold::AllWrite, false},  {Hold::IdWrite, Hold::IdRead, false},
+      {Hold::IdWrite, Hold::IdWrite, false},  {Hold::IdWrite, Hold::OtherWrite, true},
+      {Hold::IdWrite, Hold::AllRead, false},  {Hold::IdWrite, Hold::AllWrite, false},
+      {Hold::AllRead, Hold::IdRead, true},    {Hold::AllRead, Hold::IdWrite, false},
+      {Hold::AllRead, Hold::OtherRead, true}, {Hold::AllRead, Hold::OtherWrite, false},
+      {Hold::AllRead, Hold::AllRead, true},   {Hold::AllRead, Hold::AllWrite, false},
+      {Hold::AllWrite, Hold::IdRead, false},  {Hold::AllWrite, Hold::IdWrite, false},
+      {Hold::AllWrite, Hold::OtherRead, false}, {Hold::AllWrite, Hold::AllRead, false},
+      {Hold::AllWrite, Hold::AllWrite, false},
+  };
+  for (const Cell& c : cells) {
+    EXPECT_EQ(grantedWhileHeld(c.held, c.requested), c.granted)
+        << "requested " << int(c.requested) << " while holding " << int(c.held);
+  }
+  VSALockTableState s = VSALockTableSnapshot();
+  EXPECT_EQ(s.recordCount, 0u);
+  EXPECT_EQ(s.identifierReaderCount, 0u);
+  EXPECT_EQ(s.identifierWriterCount, 0u);
+  EXPECT_EQ(s.allReaderWriterState, 0);
+}
+
+TEST(VSALocks, ArraysAreTakenAscendingOnceAndReleasedDescending) {
+  VSALogger::shared().setUseStderr(true);
+  VSALogger::shared().setLevel(kVSALogDebug);
+  testing::internal::CaptureStderr();
+  {
+    VSAIdentifierLockGuard guard(VSAValue(VSAValue::Array{VSAValue("B"), VSAValue("A"), VSAValue("B")}),
+                                 true);
+    EXPECT_EQ(VSALockTableSnapshot().identifierWriterCount, 2u) << "duplicates are taken once";
+  }
+  std::string log = testing::internal::GetCapturedStderr();
+  VSALogger::shared().setLevel(kVSALogNotice);
+  size_t gotA = log.find("Got lock on identifier A"), gotB = log.find("Got lock on identifier B");
+  size_t freeA = log.find("Unlocked identifier A"), freeB = log.find("Unlocked identifier B");
+  ASSERT_NE(gotA, std::string::npos);
+  ASSERT_NE(gotB, std::string::npos);
+  EXPECT_LT(gotA, gotB);
+  EXPECT_LT(freeB, freeA);
+  EXPECT_NE(log.find("Destroying lock for identifier A"), std::string::npos);
+  EXPECT_EQ(VSALockTableSnapshot().recordCount, 0u) << "the map is empty after the last release";
+}
+
+TEST(VSALocks, OppositeOrderArraysFromManyThreadsNeverDeadlock) {
+  std::atomic<bool> finished{false};
+  std::thread watchdog([&] {
+    for (int i = 0; i < 600 && !finished; ++i) std::this_thread::sleep_for(100ms);
+    if (!finished) {
+      std::fprintf(stderr, "deadlock: lock stress did not finish in 60 s\n");
+      std::abort();
+    }
+  });
+  const std::vector<std::string> keys = {"K1", "K2", "K3", "K4", "K5"};
+  std::vector<std::thread> threads;
+  std::atomic<long> critical{0};
+  for (int t = 0; t < 8; ++t) {
+    threads.emplace_back([&, t] {
+      std::mt19937 rng(t);
+      for (int i = 0; i < 2000; ++i) {
+        VSAValue::Array arr;
+        int n = 1 + rng() % 4;
+        for (int k = 0; k < n; ++k) arr.push_back(VSAValue(keys[rng() % keys.size()]));
+        if (t % 2) std::reverse(arr.begin(), arr.end());
+        switch (rng() % 10) {
+          case 0: {
+            VSAAllIdentifiersLockGuard all(true);
+            ++critical;
+            break;
+          }
+          case 1: {
+            VSAAllIdentifiersLockGuard all(false);
+            VSAIdentifierLockGuard ids(VSAValue(arr), false);
+            ++critical;
+            break;
+          }
+          default: {
+            VSAIdentifierLockGuard ids(VSAValue(arr), rng() % 2);
+            ++critical;
+          }
+        }
+      }
+    });
+  }
+  for (auto& th : threads) th.join();
+  finished = true;
+  watchdog.join();
+  EXPECT_EQ(critical.load(), 8 * 2000);
+  EXPECT_EQ(VSALockTableSnapshot().recordCount, 0u);
+}
+
+TEST(VSALocks, WaitingGlobalWriterDoesNotHoldBackIdentifierTraffic) {
+  lock_identifier_read(VSAValue("A"));
+  std::atomic<bool> writerIn{false};
+  std::thread writer([&] {
+    lock_all_identifiers_write();
+    writerIn = true;
+    unlock_all_identifiers();
+  });
+  std::this_thread::sleep_for(20ms);
+  EXPECT_FALSE(writerIn);
+  // New identifier readers and writers on other keys still get in at once.
+  auto quick = [](std::function<void()> f) {
+    auto fut = std::async(std::launch::async, f);
+    return fut.wait_for(1s) == std::future_status::ready;
+  };
+  EXPECT_TRUE(quick([] { VSAIdentifierLockGuard g(VSAValue("B"), false); }));
+  EXPECT_TRUE(quick([] { VSAIdentifierLockGuard g(VSAValue("C"), true); }));
+  EXPECT_FALSE(writerIn);
+  unlock_identifier(VSAValue("A"));
+  writer.join();
+  EXPECT_TRUE(writerIn);
+}
+
+TEST(VSALocks, GuardsWithoutLockingTakeNothing) {
+  {
+    VSAAllIdentifiersLockGuard all(true, false);
+    VSAIdentifierLockGuard ids(VSAValue("A"), true, false);
+    EXPECT_EQ(VSALockTableSnapshot().recordCount, 0u);
+    EXPECT_EQ(VSALockTableSnapshot().allReaderWriterState, 0);
+  }
+  EXPECT_EQ(VSALockTableSnapshot().allReaderWriterState, 0);
+}
+
+TEST(VSALocksDeathTest, NonStringKeyAborts) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_DEATH(lock_identifier_read(VSAValue(42)), "Unknown parameter type!");
+  EXPECT_DEATH(lock_identifier_write(VSAValue(VSAValue::Array{VSAValue("A"), VSAValue(1)})),
+               "Unknown parameter type!");
+  EXPECT_DEATH(unlock_identifier(VSAValue(VSAValue::Dictionary{})), "Unknown parameter type!");
+}
+
+TEST(VSALocksDeathTest, UnbalancedUnlockAborts) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_DEATH(unlock_identifier(VSAValue("never-locked")), "Assertion failed");
+  EXPECT_DEATH(unlock_all_identifiers(), "Assertion failed: gVSALocks.allReaderWriterState > 0");
+}
+
+}  // namespace
+
+namespace {
+
+// Many keys in use at once, released in a scrambled order: every remaining
+// key must still be found (a lost record would let a second writer in).
+TEST(VSALocks, ManyKeysSurviveGrowthAndScrambledRelease) {
+  std::vector<std::string> keys;
+  for (int i = 0; i < 1000; ++i) keys.push_back(VSAUUID::random().string());
+  VSAValue::Array all;
+  for (auto& k : keys) all.push_back(VSAValue(k));
+  lock_identifier_write(VSAValue(all));
+  EXPECT_EQ(VSALockTableSnapshot().recordCount, 1000u);
+  std::mt19937 rng(7);
+  std::shuffle(keys.begin(), keys.end(), rng);
+  for (size_t i = 0; i < keys.size(); ++i) {
+    unlock_identifier(VSAValue(keys[i]));
+    if (i % 97 == 0 && i + 1 < keys.size()) {
+      // A key still held must still exclude a writer.
+      VSAValue next(keys[i + 1]);
+      auto fut = std::async(std::launch::async, [next] { VSAIdentifierLockGuard g(next, true); });
+      EXPECT_EQ(fut.wait_for(30ms), std::future_status::timeout) << i;
+      unlock_identifier(VSAValue(keys[i + 1]));
+      fut.get();
+      lock_identifier_write(VSAValue(keys[i + 1]));
+    }
+  }
+  EXPECT_EQ(VSALockTableSnapshot().recordCount, 0u);
+  EXPECT_EQ(VSALockTableSnapshot().identifierWriterCount, 0u);
+}
+
+}  // namespace
