@@ -35,6 +35,7 @@ constexpr VSAResultCode kInvalidCommand = 49;
 constexpr VSAResultCode kNotEntitled = 55;
 constexpr VSAResultCode kDeviceLocked = 61;
 constexpr VSAResultCode kACLFailed = 63;
+constexpr VSAResultCode kInvalidUserIdentityPlist = 75;
 constexpr VSAResultCode kInvalidPersona = 76;
 constexpr VSAResultCode kQueueExhausted = 77;
 }  // namespace VSAResult

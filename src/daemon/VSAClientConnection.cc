@@ -20,7 +20,7 @@ VSAClientConnection::VSAClientConnection(VSADaemonContext& context,
 std::unique_ptr<VSAClientConnection> VSAClientConnection::sharedClientConnection(
     VSADaemonContext& context) {
   return std::make_unique<VSAClientConnection>(
-      context, VSAClientIdentity::anonymousPrivilegedClientIdentity(), true, true, true,
+      context, VSAClientIdentity::anonymousPrivilegedClientIdentity(*context.userIdentityCache), true, true, true,
       std::nullopt, std::nullopt, std::make_shared<VSACommandQueue>());
 }
 

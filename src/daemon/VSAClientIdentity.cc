@@ -10,19 +10,21 @@ VSAClientIdentityRef gInstallerIdentity;
 }  // namespace
 
 VSAClientIdentity::VSAClientIdentity(std::string bundleIdentifier, uint32_t uid, uint32_t gid,
-                                     int32_t pid, VSAValue entitlements, bool sandboxed,
+                                     int32_t pid, VSAUserIdentityRef userIdentity,
+                                     VSAValue entitlements, bool sandboxed,
                                      std::array<uint8_t, 32> auditToken, bool kernel)
     : bundleIdentifier_(std::move(bundleIdentifier)),
       uid_(uid),
       gid_(gid),
       pid_(pid),
+      userIdentity_(std::move(userIdentity)),
       entitlements_(std::move(entitlements)),
       sandboxed_(sandboxed),
       auditToken_(auditToken),
       kernel_(kernel) {}
 
 VSAClientIdentityRef VSAClientIdentity::clientIdentityWithRelayConnection(
-    const VSAIPCConnection& connection, VSAClientRegistry& registry) {
+    const VSAIPCConnection& connection, VSAClientRegistry& registry, VSAUserIdentityCache& cache) {
   const VSAAuditToken& token = connection.auditToken();
   auto entry = registry.entryForAuditToken(token);
   if (!entry) {
@@ -41,9 +43,9 @@ VSAClientIdentityRef VSAClientIdentity::clientIdentityWithRelayConnection(
   if (!entry->entitlements.isDictionary()) {
     VSALogIn(VSALogCategory::Relay, kVSALogError, __func__,
              "Missing or malformed entitlements for pid %d", token.pid);
-  } else {
+  } else if (auto user = cache.userIdentityForCurrentContextWithUID(token.uid, token.gid)) {
     identity = std::make_shared<const VSAClientIdentity>(
-        entry->signingIdentifier, token.uid, token.gid, token.pid, entry->entitlements,
+        entry->signingIdentifier, token.uid, token.gid, token.pid, user, entry->entitlements,
         entry->sandboxed, tokenBytes, false);
   }
   if (installer) {
@@ -55,14 +57,15 @@ VSAClientIdentityRef VSAClientIdentity::clientIdentityWithRelayConnection(
   return identity;
 }
 
-VSAClientIdentityRef VSAClientIdentity::privilegedClientIdentityWithKernel(bool kernel) {
+VSAClientIdentityRef VSAClientIdentity::privilegedClientIdentityWithUserIdentity(
+    const VSAUserIdentityRef& userIdentity, bool kernel) {
   return std::make_shared<const VSAClientIdentity>(kVSAInternalBundleIdentifier, 0, 0, 0,
-                                                   VSAValue::dictionary(), false,
+                                                   userIdentity, VSAValue::dictionary(), false,
                                                    std::array<uint8_t, 32>{}, kernel);
 }
 
-VSAClientIdentityRef VSAClientIdentity::anonymousPrivilegedClientIdentity() {
-  return privilegedClientIdentityWithKernel(false);
+VSAClientIdentityRef VSAClientIdentity::anonymousPrivilegedClientIdentity(VSAUserIdentityCache& cache) {
+  return privilegedClientIdentityWithUserIdentity(cache.defaultUserIdentity(), false);
 }
 
 const VSAValue* VSAClientIdentity::valueOfEntitlement(const std::string& name) const {

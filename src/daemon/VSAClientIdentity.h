@@ -13,6 +13,7 @@
 #include <string>
 
 #include "base/VSAValue.h"
+#include "model/VSAUserIdentityCache.h"
 #include "platform/VSAAuditToken.h"
 #include "platform/VSAClientRegistry.h"
 #include "platform/VSAIPCConnection.h"
@@ -25,14 +26,20 @@ using VSAClientIdentityRef = std::shared_ptr<const VSAClientIdentity>;
 
 class VSAClientIdentity {
  public:
+  // initWithBundleIdentifier:UID:GID:PID:userIdentity:entitlements:sandboxed:auditToken:kernel:
   VSAClientIdentity(std::string bundleIdentifier, uint32_t uid, uint32_t gid, int32_t pid,
-                    VSAValue entitlements, bool sandboxed, std::array<uint8_t, 32> auditToken,
-                    bool kernel);
+                    VSAUserIdentityRef userIdentity, VSAValue entitlements, bool sandboxed,
+                    std::array<uint8_t, 32> auditToken, bool kernel);
 
+  // The peer's identity; its user identity is that of the persona the
+  // calling thread serves (see VSACurrentPersonaScope). Nothing without a
+  // registry entry, entitlements or user identity.
   static VSAClientIdentityRef clientIdentityWithRelayConnection(const VSAIPCConnection& connection,
-                                                                VSAClientRegistry& registry);
-  static VSAClientIdentityRef privilegedClientIdentityWithKernel(bool kernel);
-  static VSAClientIdentityRef anonymousPrivilegedClientIdentity();
+                                                                VSAClientRegistry& registry,
+                                                                VSAUserIdentityCache& cache);
+  static VSAClientIdentityRef privilegedClientIdentityWithUserIdentity(
+      const VSAUserIdentityRef& userIdentity, bool kernel);
+  static VSAClientIdentityRef anonymousPrivilegedClientIdentity(VSAUserIdentityCache& cache);
 
   const std::string& bundleIdentifier() const { return bundleIdentifier_; }
   uint32_t posixUID() const { return uid_; }
@@ -42,6 +49,13 @@ class VSAClientIdentity {
   bool isSandboxed() const { return sandboxed_; }
   const std::array<uint8_t, 32>& auditToken() const { return auditToken_; }
   bool isKernel() const { return kernel_; }
+  const VSAUserIdentityRef& userIdentity() const { return userIdentity_; }
+  uid_t posixUIDForContainerClass(VSAContainerClass c) const {
+    return userIdentity_ ? userIdentity_->posixUIDForContainerClass(c) : uid_;
+  }
+  gid_t posixGIDForContainerClass(VSAContainerClass c) const {
+    return userIdentity_ ? userIdentity_->posixGIDForContainerClass(c) : gid_;
+  }
 
   // The entitlement's truth value when it is a number; false otherwise
   // (missing, string, array or dictionary values are not granted).
@@ -54,6 +68,7 @@ class VSAClientIdentity {
   uint32_t uid_;
   uint32_t gid_;
   int32_t pid_;
+  VSAUserIdentityRef userIdentity_;
   VSAValue entitlements_;
   bool sandboxed_;
   std::array<uint8_t, 32> auditToken_;

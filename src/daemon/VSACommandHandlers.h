@@ -15,3 +15,8 @@ using VSACommandHandler = void (*)(const VSAValue& request, VSAValue& reply,
 // Command 27: retired; always fails with 49.
 void VSAHandleRetiredCommand(const VSAValue& request, VSAValue& reply,
                              VSAClientConnection& connection, VSAResultCode* result);
+
+// Command 32: the persona unique strings of the user identities the client
+// may use ("ReplyPersonaUniqueStringsArray").
+void VSAHandlePersonaUniqueStrings(const VSAValue& request, VSAValue& reply,
+                                   VSAClientConnection& connection, VSAResultCode* result);

@@ -42,7 +42,7 @@ const std::array<VSACommandTableEntry, kVSACommandCount> kTable = {{
     {29, nullptr, uma, R, _, _},      // delete a user-managed asset
     {30, nullptr, allowed, R, _, _},  // per-user data migration
     {31, nullptr, testability, R, _, _},  // set or clear a test lock
-    {32, nullptr, allowed, R, O, L},      // persona unique strings of the client
+    {32, VSAHandlePersonaUniqueStrings, allowed, R, O, L},  // persona unique strings
 }};
 }  // namespace
 

@@ -53,7 +53,6 @@ int VSADaemon::run() {
     listener_.reset();
   }
   VSAWorkQueue::runMain();
-  if (stopThread_.joinable()) stopThread_.join();
   if (listener_) listener_->stop();
   VSALogIn(VSALogCategory::Daemon, kVSALogNotice, "main", "vessad stopped");
   VSALogger::shared().closeRotatingLog();
@@ -62,12 +61,10 @@ int VSADaemon::run() {
 
 void VSADaemon::requestStop() {
   if (stopping_.exchange(true)) return;
-  // Drain on a thread of its own: the main loop must keep running meanwhile,
-  // because start-up (which may still be under way) calls into it.
-  stopThread_ = std::thread([this] {
-    drainForShutdown();
-    VSAWorkQueue::stopMain();
-  });
+  // Drained on the caller's thread: the main loop must keep running
+  // meanwhile, because start-up (which may still be under way) calls into it.
+  drainForShutdown();
+  VSAWorkQueue::stopMain();
 }
 
 void VSADaemon::drainForShutdown() {

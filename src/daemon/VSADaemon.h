@@ -35,7 +35,8 @@ class VSADaemon {
   ~VSADaemon();
 
   int run();
-  // Asks run() to return once open transactions have ended. Thread-safe.
+  // Stops accepting requests, waits for open transactions, then makes run()
+  // return. Blocks; call it from any thread but the main one.
   void requestStop();
   VSADaemonContext& context() { return *context_; }
 
@@ -54,5 +55,4 @@ class VSADaemon {
   std::unique_ptr<VSALockStateMonitor> lockStateMonitor_;
   std::string firstBootSemaphore_;
   std::atomic<bool> stopping_{false};
-  std::thread stopThread_;
 };

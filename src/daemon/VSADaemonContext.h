@@ -9,12 +9,15 @@
 
 #include "base/VSAWorkQueue.h"
 #include "model/VSAGlobalConfiguration.h"
+#include "model/VSAUserIdentitySharedCache.h"
 #include "platform/VSAClientRegistry.h"
 #include "platform/VSADeviceProperties.h"
+#include "platform/VSALinuxPersonaService.h"
 #include "platform/VSALockStateService.h"
 #include "platform/VSANotificationCenter.h"
 #include "platform/VSASystemRoot.h"
 #include "platform/VSATransactions.h"
+#include "platform/VSAUserDatabase.h"
 
 struct VSADaemonContext {
   explicit VSADaemonContext(const VSASystemRoot& root)
@@ -23,16 +26,27 @@ struct VSADaemonContext {
         clientRegistry(std::make_shared<VSAClientRegistry>(root)),
         notifications(std::make_shared<VSANotificationCenter>(root)),
         lockState(std::make_shared<VSALockStateService>(root)),
-        globalConfiguration(std::make_shared<VSAGlobalConfiguration>(root, deviceProperties)),
-        transactions(std::make_shared<VSATransactions>()) {}
+        userDatabase(std::make_shared<VSAUserDatabase>(root)),
+        personaService(std::make_shared<VSALinuxPersonaService>(root)),
+        globalConfiguration(
+            std::make_shared<VSAGlobalConfiguration>(root, deviceProperties, userDatabase)),
+        transactions(std::make_shared<VSATransactions>()) {
+    userIdentityCache = VSAUserIdentitySharedCache::create(
+        {personaService, userDatabase, globalConfiguration->currentMobileUserId(),
+         globalConfiguration->currentMobileGroupId(),
+         VSAUserIdentityCache::personasAreSupported(*deviceProperties), transactions});
+  }
 
   VSASystemRoot systemRoot;
   std::shared_ptr<VSADeviceProperties> deviceProperties;
   std::shared_ptr<VSAClientRegistry> clientRegistry;
   std::shared_ptr<VSANotificationCenter> notifications;
   std::shared_ptr<VSALockStateService> lockState;
+  std::shared_ptr<VSAUserDatabase> userDatabase;
+  std::shared_ptr<VSAPersonaService> personaService;
   std::shared_ptr<VSAGlobalConfiguration> globalConfiguration;
   std::shared_ptr<VSATransactions> transactions;
+  std::shared_ptr<VSAUserIdentitySharedCache> userIdentityCache;
 
   VSAWorkQueue::Ref listenerQueue;   // "com.tamsk.vessad.listener"
   VSAWorkQueue::Ref deathrowQueue;   // "com.tamsk.vessad.deathrow"

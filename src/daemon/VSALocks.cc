@@ -171,8 +171,9 @@ void take_one_lock(const std::string& key, bool writing) {
       gVSALocks.freeRecords.pop_back();
     } else {
       lockPtr = new LockRecord;
-      pthread_rwlock_init(&lockPtr->lock, nullptr);
     }
+    // A recycled record gets a fresh lock: it now stands for another key.
+    pthread_rwlock_init(&lockPtr->lock, nullptr);
     lockPtr->refCount = 0;
     lockPtr->lockState.store(0);
     lockPtr->key.assign(key);
@@ -230,10 +231,10 @@ void unlock_one_lock(const std::string& key) {
              "Destroying lock for identifier %@", key);
     VSA_LOCK_ASSERT(0 == atomic_load(&lockPtr->lockState));
     gVSALocks.identifierToLockMap->erase(lockPtr);
+    pthread_rwlock_destroy(&lockPtr->lock);
     if (gVSALocks.freeRecords.size() < kCachedRecords) {
       gVSALocks.freeRecords.push_back(lockPtr);
     } else {
-      pthread_rwlock_destroy(&lockPtr->lock);
       delete lockPtr;
     }
   }

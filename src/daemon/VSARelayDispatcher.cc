@@ -70,8 +70,11 @@ void VSARelayDispatcher::processRelayEvent(const VSAIPCMessageRef& message) {
     result = VSAResult::kInvalidCommand;
   } else {
     auto commandQueue = std::make_shared<VSACommandQueue>();
-    identity = VSAClientIdentity::clientIdentityWithRelayConnection(*message->connection(),
-                                                                    *context_.clientRegistry);
+    const VSAAuditToken& token = message->connection()->auditToken();
+    // While this request is served, the thread runs as the client's persona.
+    VSACurrentPersonaScope persona(token.pid, token.startTime);
+    identity = VSAClientIdentity::clientIdentityWithRelayConnection(
+        *message->connection(), *context_.clientRegistry, *context_.userIdentityCache);
     VSAGrants grants = VSADeriveGrants(*entry, identity.get());
     // Caller-registered entitlements are recorded here once the code-signing
     // mapping exists; nothing else in the request depends on that step.

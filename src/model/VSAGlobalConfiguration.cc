@@ -27,8 +27,19 @@ int makeDirectories(const std::string& path) {
 }  // namespace
 
 VSAGlobalConfiguration::VSAGlobalConfiguration(VSASystemRoot root,
-                                               std::shared_ptr<const VSADeviceProperties> device)
-    : root_(std::move(root)), device_(std::move(device)) {}
+                                               std::shared_ptr<const VSADeviceProperties> device,
+                                               std::shared_ptr<const VSAUserDatabase> userDatabase)
+    : root_(std::move(root)), device_(std::move(device)) {
+  auto mobile = userDatabase ? userDatabase->userNamed("mobile") : std::nullopt;
+  if (mobile) {
+    mobileUID_ = mobile->uid;
+    mobileGID_ = mobile->gid;
+    VSALog(kVSALogNotice, "VSAGlobalConfiguration", "Current mobile user ID is %u, group ID is %u",
+           mobileUID_, mobileGID_);
+  } else {
+    VSALog(kVSALogError, "VSAGlobalConfiguration", "Failed to get mobile uid. This is bad");
+  }
+}
 
 std::string VSAGlobalConfiguration::rootHomeDirectory() const {
   return root_.resolve("/private/var/root/");

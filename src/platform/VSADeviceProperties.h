@@ -3,7 +3,8 @@
 // Read from `<root>/etc/vessad/device.plist` and `features.plist`; a missing
 // file or key takes the default. device.plist keys: "HasInternalContent"
 // (bool, default NO: the internal-build query), "UsesEphemeralStorage"
-// (bool, NO), "MultiUser" (bool, NO), "PersonasSupported" (bool, YES).
+// (bool, NO), "MultiUser" (bool, NO), "MultiUserFlags" (number: the host's
+// multi-user configuration flags) and "PersonasDisabled" (bool, NO).
 // features.plist is a dictionary of feature name -> bool. Read once at
 // construction; immutable afterwards.
 #pragma once
@@ -20,7 +21,6 @@ class VSADeviceProperties {
   bool hasInternalContent() const { return flag(device_, "HasInternalContent", false); }
   bool usesEphemeralStorage() const { return flag(device_, "UsesEphemeralStorage", false); }
   bool isMultiUser() const { return flag(device_, "MultiUser", false); }
-  bool personasSupported() const { return flag(device_, "PersonasSupported", true); }
   bool isFeatureEnabled(const std::string& name, bool defaultValue = false) const {
     return flag(features_, name, defaultValue);
   }

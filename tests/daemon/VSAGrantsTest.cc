@@ -7,7 +7,7 @@
 namespace {
 
 VSAClientIdentityRef identityWith(VSAValue entitlements) {
-  return std::make_shared<const VSAClientIdentity>("com.example.client", 501, 501, 42,
+  return std::make_shared<const VSAClientIdentity>("com.example.client", 501, 501, 42, nullptr,
                                                    std::move(entitlements), false,
                                                    std::array<uint8_t, 32>{}, false);
 }

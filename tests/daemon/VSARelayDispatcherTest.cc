@@ -6,6 +6,7 @@
 
 #include <climits>
 #include <filesystem>
+#include <fstream>
 
 #include "base/VSAPlist.h"
 #include "daemon/VSAClientConnection.h"
@@ -62,6 +63,7 @@ class VSARelayDispatcherTest : public ::testing::Test {
     root_ = mkdtemp(tmpl);
     std::filesystem::create_directories(root_ + "/etc/vessad/clients.d");
     std::filesystem::create_directories(root_ + "/usr/bin");
+    std::ofstream(root_ + "/etc/passwd") << "mobile:x:501:501::/private/var/mobile:/bin/sh\n";
     char buf[PATH_MAX];
     ssize_t n = readlink("/proc/self/exe", buf, sizeof buf - 1);
     std::filesystem::create_symlink(std::string(buf, n), root_ + "/usr/bin/tester");

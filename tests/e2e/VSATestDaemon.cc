@@ -26,6 +26,10 @@ VSATestDaemon::VSATestDaemon() {
   fs::create_directories(root_ + "/etc/vessad/clients.d");
   fs::create_directories(root_ + "/usr/bin");
   fs::create_directories(root_ + "/run/vessad");
+  fs::create_directories(root_ + "/private/var/mobile");
+  std::ofstream(root_ + "/etc/passwd") << "root:x:0:0:root:/private/var/root:/bin/sh\n"
+                                          "mobile:x:501:501:Mobile:/private/var/mobile:/bin/sh\n";
+  std::ofstream(root_ + "/etc/group") << "root:x:0:\nmobile:x:501:\nsystemusers:x:600:\n";
 }
 
 VSATestDaemon::~VSATestDaemon() {

@@ -144,7 +144,7 @@ TEST_F(VSAPlatformRoot, NotificationsAndDeviceProperties) {
   VSADeviceProperties props(root);
   EXPECT_TRUE(props.hasInternalContent());
   EXPECT_FALSE(props.isMultiUser()) << "a malformed flag takes its default";
-  EXPECT_TRUE(props.personasSupported());
+  EXPECT_FALSE(props.usesEphemeralStorage());
 }
 
 }  // namespace

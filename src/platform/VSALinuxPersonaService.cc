@@ -1,0 +1,143 @@
+#include "platform/VSALinuxPersonaService.h"
+
+#include <sys/stat.h>
+
+#include <fstream>
+
+#include "base/VSALog.h"
+#include "base/VSAPlist.h"
+
+namespace {
+thread_local std::optional<std::pair<pid_t, uint64_t>> tServedProcess;
+
+std::optional<VSAPersonaAttributes> parseRecord(const VSAValue& record, const VSASystemRoot& root) {
+  auto bad = [&](const char* why) {
+    VSALogIn(VSALogCategory::Unspecified, kVSALogError, "VSALinuxPersonaService",
+             "Ignoring persona record %@: %s", record, why);
+    return std::nullopt;
+  };
+  if (!record.isDictionary()) return bad("not a dictionary");
+  VSAPersonaAttributes a;
+  const VSAValue* id = record.get("PersonaID");
+  if (!id || !id->uint64Value() || *id->uint64Value() > UINT32_MAX)
+    return bad("\"PersonaID\" must be an unsigned 32-bit number");
+  a.personaID = static_cast<uint32_t>(*id->uint64Value());
+  const VSAValue* kind = record.get("Kind");
+  std::string k = kind && kind->isString() ? *kind->stringValue() : "";
+  if (k == "personal") a.kind = VSAPersonaAttributes::Kind::Personal;
+  else if (k == "enterprise") a.kind = VSAPersonaAttributes::Kind::Enterprise;
+  else if (k == "universal") a.kind = VSAPersonaAttributes::Kind::Universal;
+  else if (k == "system") a.kind = VSAPersonaAttributes::Kind::System;
+  else return bad("\"Kind\" must be personal, enterprise, universal or system");
+  if (const VSAValue* s = record.get("UniqueString")) {
+    if (!s->isString()) return bad("\"UniqueString\" must be a string");
+    a.uniqueString = *s->stringValue();
+  }
+  if (const VSAValue* list = record.get("BundleIdentifiers")) {
+    if (!list->isArray()) return bad("\"BundleIdentifiers\" must be an array of strings");
+    std::vector<std::string> ids;
+    for (const VSAValue& v : *list->arrayValue()) {
+      if (!v.isString()) return bad("\"BundleIdentifiers\" must be an array of strings");
+      ids.push_back(*v.stringValue());
+    }
+    a.bundleIdentifiers = std::move(ids);
+  }
+  if (const VSAValue* layout = record.get("LayoutPath")) {
+    if (!layout->isString() || layout->stringValue()->empty() || layout->stringValue()->front() != '/')
+      return bad("\"LayoutPath\" must be an absolute path");
+    a.layoutPath = root.resolve(*layout->stringValue());
+  }
+  return a;
+}
+}  // namespace
+
+std::string VSAPersonaAttributes::description() const {
+  static const char* kinds[] = {"personal", "enterprise", "universal", "system"};
+  return VSAFormat("<persona %u %s [%s]>", personaID, kinds[static_cast<int>(kind)],
+                   uniqueString ? *uniqueString : std::string("(none)"));
+}
+
+VSACurrentPersonaScope::VSACurrentPersonaScope(pid_t pid, uint64_t startTime)
+    : previous_(tServedProcess) {
+  tServedProcess = std::make_pair(pid, startTime);
+}
+
+VSACurrentPersonaScope::~VSACurrentPersonaScope() { tServedProcess = previous_; }
+
+std::optional<std::pair<pid_t, uint64_t>> VSACurrentPersonaScope::current() {
+  return tServedProcess;
+}
+
+VSALinuxPersonaService::VSALinuxPersonaService(VSASystemRoot root) : root_(std::move(root)) {}
+
+std::optional<std::vector<VSAPersonaAttributes>> VSALinuxPersonaService::listPersonas() {
+  VSAErrorRef error;
+  auto bytes = VSAReadFile(personasPath(), &error);
+  if (!bytes) {
+    if (error && error->domain() == kVSAPOSIXErrorDomain && error->code() == ENOENT) {
+      VSAPersonaAttributes personal;
+      personal.personaID = kVSADefaultPersonalPersonaID;
+      personal.uniqueString = kVSADefaultPersonalPersonaString;
+      return std::vector<VSAPersonaAttributes>{personal};
+    }
+    VSALog(kVSALogError, "VSALinuxPersonaService", "Cannot read %s: %@", personasPath(), error);
+    return std::nullopt;
+  }
+  auto value = VSAPlist::parse(*bytes, &error);
+  const VSAValue* list = value ? (value->isArray() ? &*value : value->get("Personas")) : nullptr;
+  if (!list || !list->isArray()) {
+    VSALog(kVSALogError, "VSALinuxPersonaService", "%s is not a list of personas", personasPath());
+    return std::nullopt;
+  }
+  std::vector<VSAPersonaAttributes> out;
+  for (const VSAValue& record : *list->arrayValue())
+    if (auto a = parseRecord(record, root_)) out.push_back(std::move(*a));
+  return out;
+}
+
+std::string VSALinuxPersonaService::processRecordPath(pid_t pid) const {
+  return root_.resolve("/run/vessad/process-personas/" + std::to_string(pid));
+}
+
+std::optional<uint32_t> VSALinuxPersonaService::recordedPersonaID(pid_t pid,
+                                                                  uint64_t startTime) const {
+  std::string path = processRecordPath(pid);
+  struct stat st;
+  if (lstat(path.c_str(), &st) != 0 || !S_ISREG(st.st_mode) || st.st_uid != 0) return std::nullopt;
+  std::ifstream in(path);
+  uint64_t recordedStart = 0;
+  uint64_t persona = 0;
+  if (!(in >> recordedStart >> persona) || recordedStart != startTime || persona > UINT32_MAX)
+    return std::nullopt;
+  return static_cast<uint32_t>(persona);
+}
+
+std::optional<VSAPersonaAttributes> VSALinuxPersonaService::currentPersona() {
+  auto served = VSACurrentPersonaScope::current();
+  if (!served) return std::nullopt;
+  auto personas = listPersonas();
+  if (!personas) return std::nullopt;
+  auto recorded = recordedPersonaID(served->first, served->second);
+  for (const VSAPersonaAttributes& a : *personas) {
+    if (recorded ? a.personaID == *recorded : a.isPersonal()) return a;
+  }
+  return std::nullopt;
+}
+
+void VSALinuxPersonaService::registerObserver(const std::string& serviceName,
+                                              std::function<void()> onChange,
+                                              std::function<void(VSAErrorRef)> completion) {
+  auto watcher = std::make_unique<VSAInotifyWatcher>(
+      root_.resolve("/etc/vessad"), std::set<std::string>{"personas.plist"},
+      VSAWorkQueue::create(serviceName),
+      [onChange = std::move(onChange)](const std::string&) { onChange(); });
+  VSAErrorRef error;
+  bool ok = watcher->start(&error);
+  if (ok) {
+    std::lock_guard lock(watcherMutex_);
+    watcher_ = std::move(watcher);
+  }
+  VSAWorkQueue::global()->async([completion = std::move(completion), error, ok] {
+    completion(ok ? nullptr : error);
+  });
+}
