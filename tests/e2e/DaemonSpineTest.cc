@@ -12,6 +12,7 @@
 #include <thread>
 
 #include "base/VSAJSON.h"
+#include "base/VSAPlist.h"
 #include "e2e/VSATestDaemon.h"
 #include "platform/VSAFrameCodec.h"
 #include "platform/VSAIPCClient.h"
@@ -198,6 +199,56 @@ TEST(DaemonSpine, StopsCleanlyAndRemovesItsSocket) {
   std::string text((std::istreambuf_iterator<char>(log)), std::istreambuf_iterator<char>());
   EXPECT_NE(text.find("vessad stopped"), std::string::npos);
   EXPECT_NE(text.find("vessad performing first boot initialization"), std::string::npos);
+}
+
+}  // namespace
+
+namespace {
+
+std::vector<std::string> personaStrings(const VSATestDaemon::Run& run) {
+  std::string why;
+  auto reply = VSAJSON::parse(run.output, &why);
+  std::vector<std::string> out;
+  if (!reply || !reply->get("ReplyPersonaUniqueStringsArray")) return out;
+  for (const VSAValue& v : *reply->get("ReplyPersonaUniqueStringsArray")->arrayValue())
+    out.push_back(*v.stringValue());
+  return out;
+}
+
+void writePersonas(VSATestDaemon& d, bool workAppInEnterprise) {
+  VSAValue enterprise = VSAValue::Dictionary{
+      {"PersonaID", VSAValue(1001)}, {"Kind", VSAValue("enterprise")},
+      {"UniqueString", VSAValue("E-1001")}, {"LayoutPath", VSAValue("/private/var/enterprise")}};
+  if (workAppInEnterprise)
+    enterprise.set("BundleIdentifiers", VSAValue(VSAValue::Array{VSAValue("com.app.work")}));
+  VSAValue list = VSAValue::Array{
+      VSAValue(VSAValue::Dictionary{{"PersonaID", VSAValue(1000)}, {"Kind", VSAValue("personal")},
+                                    {"UniqueString", VSAValue("P-1000")}}),
+      enterprise};
+  VSAErrorRef error;
+  auto bytes = VSAPlist::serialize(list, VSAPlist::Format::XML, &error);
+  VSAWriteFileAtomically(d.path("/etc/vessad/personas.plist"), *bytes, 0644, &error);
+}
+
+TEST(DaemonPersonas, EditingThePersonaFileChangesARunningDaemonsAnswers) {
+  VSATestDaemon d;
+  d.registerVessactl("work-client", "com.app.work", VSAValue::dictionary());
+  writePersonas(d, true);
+  ASSERT_TRUE(d.start());
+  EXPECT_EQ(personaStrings(d.vessactl("work-client", {"--json", "Command=32"})),
+            std::vector<std::string>{"E-1001"});
+  // The enterprise persona stops listing the app: it now runs only in the
+  // personal persona. The daemon notices the file change by itself.
+  writePersonas(d, false);
+  std::vector<std::string> now;
+  for (int i = 0; i < 200; ++i) {
+    now = personaStrings(d.vessactl("work-client", {"--json", "Command=32"}));
+    if (now == std::vector<std::string>{"P-1000"}) break;
+    std::this_thread::sleep_for(10ms);
+  }
+  EXPECT_EQ(now, std::vector<std::string>{"P-1000"});
+  EXPECT_NE(d.daemonOutput().find("Persona list update received"), std::string::npos);
+  EXPECT_EQ(d.stop(), 0);
 }
 
 }  // namespace

@@ -1,0 +1,101 @@
+#include "platform/VSALinuxPersonaService.h"
+
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <filesystem>
+#include <fstream>
+#include <thread>
+
+#include "base/VSAPlist.h"
+#include "platform/VSAAuditToken.h"
+
+namespace {
+
+using namespace std::chrono_literals;
+
+class PersonaFiles : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    char tmpl[] = "/tmp/vessa-personas-XXXXXX";
+    root_ = mkdtemp(tmpl);
+    std::filesystem::create_directories(root_ + "/etc/vessad");
+    std::filesystem::create_directories(root_ + "/run/vessad/process-personas");
+  }
+  void TearDown() override { std::filesystem::remove_all(root_); }
+  void write(const VSAValue& v) {
+    VSAErrorRef error;
+    auto bytes = VSAPlist::serialize(v, VSAPlist::Format::XML, &error);
+    ASSERT_TRUE(VSAWriteFileAtomically(root_ + "/etc/vessad/personas.plist", *bytes, 0644, &error));
+  }
+  static VSAValue record(uint64_t id, const char* kind, VSAValue unique) {
+    VSAValue r = VSAValue::Dictionary{{"PersonaID", VSAValue(id)}, {"Kind", VSAValue(kind)}};
+    if (!unique.isNull()) r.set("UniqueString", unique);
+    return r;
+  }
+  std::string root_;
+};
+
+TEST_F(PersonaFiles, MissingFileMeansOnePersonalPersona) {
+  VSALinuxPersonaService service{VSASystemRoot(root_)};
+  auto list = service.listPersonas();
+  ASSERT_TRUE(list);
+  ASSERT_EQ(list->size(), 1u);
+  EXPECT_TRUE(list->front().isPersonal());
+  EXPECT_EQ(*list->front().uniqueString, kVSADefaultPersonalPersonaString);
+}
+
+TEST_F(PersonaFiles, MalformedRecordsAreLeftOutAndGarbageGivesNoList) {
+  VSAValue enterprise = record(2, "enterprise", VSAValue("E"));
+  enterprise.set("BundleIdentifiers", VSAValue(VSAValue::Array{VSAValue("com.a")}));
+  enterprise.set("LayoutPath", VSAValue("/private/var/e"));
+  VSAValue badApps = record(3, "enterprise", VSAValue("F"));
+  badApps.set("BundleIdentifiers", VSAValue(VSAValue::Array{VSAValue(1)}));
+  write(VSAValue::Array{record(1, "personal", VSAValue("P")), enterprise, badApps,
+                        record(4, "alien", VSAValue("X")), record(5, "system", VSAValue(7)),
+                        VSAValue("not a record"),
+                        VSAValue(VSAValue::Dictionary{{"Kind", VSAValue("universal")}})});
+  VSALinuxPersonaService service{VSASystemRoot(root_)};
+  auto list = service.listPersonas();
+  ASSERT_TRUE(list);
+  ASSERT_EQ(list->size(), 2u);
+  EXPECT_EQ(list->at(1).personaID, 2u);
+  EXPECT_EQ(*list->at(1).layoutPath, root_ + "/private/var/e");
+  std::ofstream(root_ + "/etc/vessad/personas.plist") << "<plist><dict>";
+  EXPECT_FALSE(service.listPersonas());
+}
+
+TEST_F(PersonaFiles, CurrentPersonaComesFromTheServedProcessRecord) {
+  write(VSAValue::Dictionary{{"Personas", VSAValue::Array{record(1, "personal", VSAValue("P")),
+                                                          record(2, "enterprise", VSAValue("E"))}}});
+  VSALinuxPersonaService service{VSASystemRoot(root_)};
+  EXPECT_FALSE(service.currentPersona()) << "a thread serving nobody has no persona";
+  uint64_t start = VSAAuditToken::processStartTime(getpid());
+  {
+    VSACurrentPersonaScope scope(getpid(), start);
+    EXPECT_EQ(service.currentPersona()->personaID, 1u) << "no record: personal";
+    std::ofstream(service.processRecordPath(getpid())) << start << " 2\n";
+    EXPECT_EQ(service.currentPersona()->personaID, 2u);
+  }
+  {
+    // A record written for an earlier process with the same pid is stale.
+    VSACurrentPersonaScope scope(getpid(), start + 1);
+    EXPECT_EQ(service.currentPersona()->personaID, 1u);
+  }
+  EXPECT_FALSE(VSACurrentPersonaScope::current());
+}
+
+TEST_F(PersonaFiles, ObserverHearsFileChanges) {
+  VSALinuxPersonaService service{VSASystemRoot(root_)};
+  std::atomic<int> changes{0};
+  std::atomic<bool> registered{false};
+  service.registerObserver("test.personaobserver", [&] { ++changes; },
+                           [&](VSAErrorRef e) { registered = !e; });
+  write(VSAValue::Array{record(1, "personal", VSAValue("P"))});
+  for (int i = 0; i < 200 && changes == 0; ++i) std::this_thread::sleep_for(5ms);
+  EXPECT_TRUE(registered);
+  EXPECT_GE(changes.load(), 1);
+}
+
+}  // namespace
