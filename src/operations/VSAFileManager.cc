@@ -1,0 +1,313 @@
+#include "operations/VSAFileManager.h"
+
+#include <cstring>
+
+#include "base/VSALog.h"
+#include "base/VSAPathString.h"
+
+namespace {
+constexpr const char* kOrigin = "VSAFileManager";
+
+// Logs `message` and turns it into a POSIX-domain error for `err`.
+template <typename... A>
+VSAErrorRef fail(int err, const char* function, const char* format, const A&... args) {
+  std::string message = VSAFormat(format, args...);
+  VSALogIn(VSALogCategory::FS, kVSALogError, function, "%s", message);
+  return VSAError::posix(err, function, __LINE__, message);
+}
+
+std::vector<std::string> components(const std::string& path) {
+  std::vector<std::string> out;
+  if (!path.empty() && path[0] == '/') out.push_back("/");
+  size_t start = 0;
+  while (start < path.size()) {
+    size_t end = path.find('/', start);
+    if (end == std::string::npos) end = path.size();
+    if (end > start) out.push_back(path.substr(start, end - start));
+    start = end + 1;
+  }
+  return out;
+}
+
+std::string stripPrivate(const std::string& path) {
+  return path.rfind("/private/", 0) == 0 ? path.substr(8) : path;
+}
+
+// Walks `path` counting depth from `start`; false when it climbs below it.
+bool validateSymlink(const std::string& path, int start, int* end) {
+  int depth = start;
+  for (const std::string& c : components(path)) {
+    if (c == "..") {
+      if (--depth < start) return false;
+    } else if (c != "." && c != "/" && !c.empty()) {
+      ++depth;
+    }
+  }
+  if (end) *end = depth;
+  return true;
+}
+
+std::string dirname(const std::string& path) {
+  size_t slash = path.find_last_of('/');
+  if (slash == std::string::npos) return ".";
+  return slash == 0 ? "/" : path.substr(0, slash);
+}
+}  // namespace
+
+VSAFileManager::VSAFileManager(std::shared_ptr<VSAFileSystem> fileSystem,
+                               std::shared_ptr<const VSAUserDatabase> userDatabase)
+    : fs_(std::move(fileSystem)), userDatabase_(std::move(userDatabase)) {}
+
+std::optional<std::string> VSAFileManager::realPathAllowingMissing(const std::string& path) {
+  std::string resolved;
+  int rc = fs_->realpath(path, &resolved);
+  if (rc == 0) return resolved;
+  if (rc == ENOENT) {
+    auto parts = components(path);
+    for (size_t keep = parts.size() - 1; keep >= 1; --keep) {
+      std::string prefix;
+      for (size_t i = 0; i < keep; ++i) prefix = i == 0 ? parts[0] : VSAPathJoin(prefix, parts[i]);
+      if (!itemExistsAtURL(prefix) || fs_->realpath(prefix, &resolved) != 0) continue;
+      std::string rest;
+      for (size_t i = keep; i < parts.size(); ++i) rest = rest.empty() ? parts[i] : rest + "/" + parts[i];
+      VSALogIn(VSALogCategory::FS, kVSALogDebug, kOrigin,
+               "Realpathed %@ ; appending non-existing components %@", resolved, rest);
+      return VSAPathJoin(resolved, rest);
+    }
+  }
+  VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "Failed to realpath %s : %s at %s", path,
+           std::strerror(rc), path);
+  return std::nullopt;
+}
+
+std::optional<std::string> VSAFileManager::realPathForURL(const std::string& path,
+                                                          const std::string& base) {
+  const char* fn = "realPathForURL";
+  auto reject = [&](const std::string& message) {
+    VSALogIn(VSALogCategory::FS, kVSALogError, fn, "%s", message);
+    return std::nullopt;
+  };
+  if (path.empty() || base.empty())
+    return reject(VSAFormat("The base path %@ and/or suspicious path %@ were nil", base, path));
+  // "/private" is where /var and /tmp really live: compare without it.
+  std::string b = stripPrivate(base), p = stripPrivate(path);
+  if (p.rfind(b, 0) != 0)
+    return reject(VSAFormat("supiscious path %@ does not contain base path %@ as a prefix", path, base));
+  if (containsDotDotPathComponents(p))
+    return reject(VSAFormat("The suspicious path %@ contains '..' paths, which are invalid", path));
+  std::string target;
+  int rc = fs_->readlink(path, &target);
+  if (rc == 0) {
+    if (!target.empty() && target[0] == '/')
+      return reject(VSAFormat("Rejecting %@ -> %s, as absolute symlinks are not allowed", path, target));
+    // Follow the link from its own directory, counting depth below the base:
+    // it may never climb above the base, and may not end on the base itself.
+    std::string relative = p.substr(b.size());
+    if (!validateSymlink(relative, 0, nullptr))
+      return reject(VSAFormat("Failed to retrieve depth of %@", path));
+    std::string joined = VSAPathJoin(dirname(relative), target);
+    int end = 0;
+    if (!validateSymlink(joined, 0, &end) || end == 0)
+      return reject(VSAFormat("Rejecting %@ -> %@, as it is points outside or to the base %@", path,
+                              target, base));
+  } else if (rc != EINVAL && rc != ENOENT) {
+    return reject(VSAFormat("Readlink failed: %s", std::strerror(rc)));
+  }
+  auto realBase = realPathAllowingMissing(base);
+  if (!realBase) return reject(VSAFormat("Failed to retrieve realpath for base path %@ ", base));
+  auto realPath = realPathAllowingMissing(path);
+  if (!realPath) return reject(VSAFormat("Failed to retrieve realpath for suspicious path %@", path));
+  auto bc = components(*realBase), pc = components(*realPath);
+  if (bc.size() < 2 || pc.size() < 2)
+    return reject(VSAFormat("Rejecting %@ with base %@ because real component counts don't make "
+                            "sense (reals %@ ; %@)", path, base, *realPath, *realBase));
+  size_t bi = bc[1] == "private" ? 2 : 1, pi = pc[1] == "private" ? 2 : 1;
+  if (bc.size() - bi > pc.size() - pi)
+    return reject(VSAFormat("Rejecting %@ with base %@ because base component count is greater "
+                            "than child component count (reals %@ ; %@)", path, base, *realPath, *realBase));
+  for (; bi < bc.size(); ++bi, ++pi) {
+    if (bc[bi] != pc[pi])
+      return reject(VSAFormat("Rejecting %@ with base %@ (reals %@ ; %@) because components "
+                              "diverge at %@ != %@", path, base, *realPath, *realBase, bc[bi], pc[pi]));
+  }
+  return realPath;
+}
+
+bool VSAFileManager::createDirectoryAtURL(const std::string& path, bool intermediates, mode_t mode,
+                                          uid_t owner, uint32_t protectionClass, VSAErrorRef* error) {
+  const char* fn = "createDirectoryAtURL";
+  if (intermediates) {
+    auto parts = components(path);
+    std::string partial;
+    for (size_t i = 0; i < parts.size(); ++i) {
+      partial = i == 0 ? parts[0] : VSAPathJoin(partial, parts[i]);
+      if (partial == "/") continue;
+      int rc = fs_->mkdir(partial, mode);
+      struct stat st;
+      if (rc == EEXIST && fs_->lstat(partial, &st) == 0 && !S_ISDIR(st.st_mode)) rc = ENOTDIR;
+      if (rc != 0 && rc != EEXIST) {
+        VSASetError(error, fail(rc, fn, "mkpath_np of %s failed: %s", path, std::strerror(rc)));
+        return false;
+      }
+    }
+  } else if (int rc = fs_->mkdir(path, mode); rc != 0 && rc != EEXIST) {
+    VSASetError(error, fail(rc, fn, "mkdir of %s failed: %s", path, std::strerror(rc)));
+    return false;
+  }
+  if (protectionClass != kVSANoProtectionClass) {
+    if (int rc = fs_->setProtectionClass(path, static_cast<int>(protectionClass))) {
+      VSASetError(error, fail(rc, fn, "Failed to setclass(%d) on directory %s: %s",
+                              static_cast<int>(protectionClass), path, std::strerror(rc)));
+      return false;
+    }
+  }
+  if (owner != 0) {
+    if (int rc = fs_->lchown(path, owner, owner)) {
+      VSASetError(error, fail(rc, fn, "Failed to chown(%d,%d) %s: %s", owner, owner, path,
+                              std::strerror(rc)));
+      return false;
+    }
+  }
+  return true;
+}
+
+bool VSAFileManager::moveItemAtURL(const std::string& from, const std::string& to, VSAErrorRef* e) {
+  return moveItem(from, to, true, e);
+}
+bool VSAFileManager::moveItemIfExistsAtURL(const std::string& from, const std::string& to,
+                                           VSAErrorRef* e) {
+  return moveItem(from, to, false, e);
+}
+bool VSAFileManager::copyItemAtURL(const std::string& from, const std::string& to, VSAErrorRef* e) {
+  return copyItem(from, to, true, e);
+}
+bool VSAFileManager::copyItemIfExistsAtURL(const std::string& from, const std::string& to,
+                                           VSAErrorRef* e) {
+  return copyItem(from, to, false, e);
+}
+
+bool VSAFileManager::moveItem(const std::string& from, const std::string& to, bool failIfSrcMissing,
+                              VSAErrorRef* error) {
+  const char* fn = "moveItemAtURL";
+  if (!failIfSrcMissing) {
+    struct stat st;
+    int rc = fs_->lstat(from, &st);
+    if (rc == ENOENT) return true;
+    if (rc != 0) {
+      VSASetError(error, fail(rc, fn, "stat of %@ failed: %s", from, std::strerror(rc)));
+      return false;
+    }
+  }
+  int rc = fs_->rename(from, to);
+  if (rc == 0) return true;
+  if (rc == EXDEV) {
+    if (!copyItem(from, to, true, error)) return false;
+    VSAErrorRef removeError;
+    if (!removeItemAtURL(from, &removeError))
+      VSALogIn(VSALogCategory::FS, kVSALogError, fn,
+               "Failed to remove move source after copy at %@ : %@", from, removeError);
+    return true;
+  }
+  VSASetError(error, fail(rc, fn, "rename of %@ to %@ failed: %s", from, to, std::strerror(rc)));
+  return false;
+}
+
+bool VSAFileManager::copyItem(const std::string& from, const std::string& to, bool failIfSrcMissing,
+                              VSAErrorRef* error) {
+  const char* fn = "copyItemAtURL";
+  if (!failIfSrcMissing) {
+    struct stat st;
+    int rc = fs_->lstat(from, &st);
+    if (rc == ENOENT) return true;
+    if (rc != 0) {
+      VSASetError(error, fail(rc, fn, "stat of %@ failed: %s", from, std::strerror(rc)));
+      return false;
+    }
+  }
+  std::string failed;
+  if (int rc = copyTree(from, to, &failed)) {
+    VSASetError(error, fail(rc, fn, "copyfile of %@ to %@ failed: %s", from, to,
+                            std::strerror(rc)));
+    return false;
+  }
+  return true;
+}
+
+bool VSAFileManager::dataProtectionClassOfItemAtURL(const std::string& path, int* protectionClass,
+                                                    VSAErrorRef* error) {
+  if (int rc = fs_->getProtectionClass(path, protectionClass)) {
+    VSASetError(error, fail(rc, "dataProtectionClassOfItemAtURL",
+                            "Failed to getclass of file %s: %s", path, std::strerror(rc)));
+    return false;
+  }
+  return true;
+}
+
+bool VSAFileManager::setDataProtectionClassOfItemAtURL(const std::string& path, int protectionClass,
+                                                       const std::function<bool(int)>& ifPredicate,
+                                                       VSAErrorRef* error) {
+  if (ifPredicate) {
+    int current = 0;
+    if (!dataProtectionClassOfItemAtURL(path, &current, error)) return false;
+    if (!ifPredicate(current)) return true;
+  }
+  if (int rc = fs_->setProtectionClass(path, protectionClass)) {
+    VSASetError(error, fail(rc, "setDataProtectionClassOfItemAtURL",
+                            "Failed to setclass(%d) on file %s: %s", protectionClass, path,
+                            std::strerror(rc)));
+    return false;
+  }
+  return true;
+}
+
+bool VSAFileManager::itemExistsAtURL(const std::string& path) {
+  struct stat st;
+  int rc = fs_->lstat(path, &st);
+  if (rc != 0 && rc != ENOENT)
+    VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "Failed to determine if %@ exists: %s",
+             path, std::strerror(rc));
+  return rc == 0;
+}
+
+bool VSAFileManager::itemDoesNotExistAtURL(const std::string& path) {
+  struct stat st;
+  int rc = fs_->lstat(path, &st);
+  if (rc != 0 && rc != ENOENT)
+    VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "Failed to determine if %@ exists: %s",
+             path, std::strerror(rc));
+  return rc == ENOENT;
+}
+
+std::optional<std::vector<VSADirectoryItem>> VSAFileManager::urlsForItemsInDirectoryAtURL(
+    const std::string& path, VSAErrorRef* error) {
+  std::vector<VSADirectoryEntry> entries;
+  if (int rc = fs_->readDirectory(path, &entries)) {
+    VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "opendir of %s failed: %s", path,
+             std::strerror(rc));
+    VSASetError(error, fail(rc, "urlsForItemsInDirectoryAtURL", "_IterateDirectory for %@ returned %s",
+                            path, std::strerror(rc)));
+    return std::nullopt;
+  }
+  std::vector<VSADirectoryItem> items;
+  for (const auto& e : entries) {
+    if (e.name.empty() || e.name[0] == '.') continue;
+    items.push_back({VSAPathJoin(path, e.name), e.type == VSADirectoryEntry::Type::Directory});
+  }
+  return items;
+}
+
+std::optional<std::string> VSAFileManager::createTemporaryDirectoryInDirectoryURL(
+    const std::string& directory, VSAErrorRef* error, const std::string& prefix) {
+  std::string out;
+  std::string templ = VSAPathJoin(directory, prefix + "XXXXXX");
+  if (int rc = fs_->mkdtemp(templ, &out)) {
+    VSASetError(error, fail(rc, "createTemporaryDirectoryInDirectoryURL",
+                            "Failed to create temp dir at path %s : %s", templ, std::strerror(rc)));
+    return std::nullopt;
+  }
+  return out;
+}
+
+std::string VSAFileManager::homeDirectoryURLForPOSIXUID(uid_t uid) const {
+  return userDatabase_->homeDirectoryForUID(uid);
+}

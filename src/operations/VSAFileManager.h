@@ -1,0 +1,102 @@
+// The one place where the daemon touches the file system (through the
+// injected VSAFileSystem): safe resolution of client paths inside a
+// container, directory creation with mode, owner and protection class, move,
+// copy and recursive removal, ownership and ACL normalisation of trees,
+// protection classes, listing, walking, temporary directories, disk usage
+// and home directories.
+//
+// Every operation is synchronous and may be called from any thread; the
+// manager holds no state of its own. Failures come back as POSIX-domain
+// errors (or code 63 for system-container ACLs) carrying the message that is
+// also logged. Tree operations log per-entry failures and go on.
+#pragma once
+
+#include <sys/stat.h>
+
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "base/VSAError.h"
+#include "platform/VSAFileSystem.h"
+#include "platform/VSAUserDatabase.h"
+
+inline constexpr const char* kVSAMetadataFileName = ".com.tamsk.vessa_keeper.metadata.plist";
+inline constexpr uint32_t kVSANoProtectionClass = 0xFFFFFFFF;
+inline constexpr uid_t kVSANobodyID = 4294967294u;  // owner of system container items
+
+struct VSADirectoryItem {
+  std::string path;
+  bool isDirectory = false;
+};
+
+class VSAFileManager {
+ public:
+  enum class WalkPhase { Directory, DirectoryEnd, Item };
+  using WalkBlock = std::function<bool(const std::string& path, const struct stat& st, WalkPhase)>;
+
+  VSAFileManager(std::shared_ptr<VSAFileSystem> fileSystem,
+                 std::shared_ptr<const VSAUserDatabase> userDatabase);
+
+  VSAFileSystem& fileSystem() const { return *fs_; }
+
+  // The resolved path of `path` if it stays strictly inside `base`, else nothing.
+  std::optional<std::string> realPathForURL(const std::string& path, const std::string& base);
+
+  bool createDirectoryAtURL(const std::string& path, bool withIntermediateDirectories, mode_t mode,
+                            uid_t owner, uint32_t protectionClass, VSAErrorRef* error);
+  bool moveItemAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
+  bool moveItemIfExistsAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
+  bool copyItemAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
+  bool copyItemIfExistsAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
+  // Recursive; a missing item is success; immutable items are unlocked and removed.
+  bool removeItemAtURL(const std::string& path, VSAErrorRef* error);
+  bool standardizeOwnershipAtURL(const std::string& path, uid_t uid, gid_t gid, VSAErrorRef* error);
+
+  bool setTopLevelSystemContainerACLAtURL(const std::string& path, VSAErrorRef* error);
+  bool standardizeACLsAtURL(const std::string& path, bool isSystemContainer, VSAErrorRef* error);
+  bool standardizeACLsForSystemContainerAtURL(const std::string& path, VSAErrorRef* error) {
+    return standardizeACLsAtURL(path, true, error);
+  }
+  bool standardizeAllSystemContainerACLsAtURL(const std::string& path, VSAErrorRef* error);
+
+  bool dataProtectionClassOfItemAtURL(const std::string& path, int* protectionClass,
+                                      VSAErrorRef* error);
+  // With a predicate, the class changes only when the predicate accepts the current one.
+  bool setDataProtectionClassOfItemAtURL(const std::string& path, int protectionClass,
+                                         const std::function<bool(int)>& ifPredicate,
+                                         VSAErrorRef* error);
+
+  bool itemExistsAtURL(const std::string& path);
+  bool itemDoesNotExistAtURL(const std::string& path);
+  // Visible entries (names not starting with ".") of one directory.
+  std::optional<std::vector<VSADirectoryItem>> urlsForItemsInDirectoryAtURL(const std::string& path,
+                                                                           VSAErrorRef* error);
+  // Walks a tree on one device; directories are reported before and after
+  // their contents. The block stops the walk by returning false.
+  bool traverseDirectory(const std::string& path, VSAErrorRef* error, const WalkBlock& block);
+  std::optional<std::string> createTemporaryDirectoryInDirectoryURL(
+      const std::string& directory, VSAErrorRef* error, const std::string& withNamePrefix = "temp.");
+
+  // Total apparent size of a tree in bytes (a full walk).
+  uint64_t diskUsageForURL(const std::string& path);
+  std::string homeDirectoryURLForPOSIXUID(uid_t uid) const;
+
+ private:
+  bool moveItem(const std::string& from, const std::string& to, bool failIfSrcMissing,
+                VSAErrorRef* error);
+  bool copyItem(const std::string& from, const std::string& to, bool failIfSrcMissing,
+                VSAErrorRef* error);
+  int copyTree(const std::string& from, const std::string& to, std::string* failedPath);
+  void removeTree(const std::string& path, const struct stat* st, int* slot);
+  int removeImmutable(const std::string& path, bool directory);
+  bool walk(const std::string& path, const struct stat& st, dev_t device, const WalkBlock& block,
+            std::string* failure, int* failureErrno);
+  std::optional<std::string> realPathAllowingMissing(const std::string& path);
+  std::optional<gid_t> systemUsersGroup(VSAErrorRef* error);
+
+  std::shared_ptr<VSAFileSystem> fs_;
+  std::shared_ptr<const VSAUserDatabase> userDatabase_;
+};

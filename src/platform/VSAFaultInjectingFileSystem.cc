@@ -1,0 +1,162 @@
+#include "platform/VSAFaultInjectingFileSystem.h"
+
+VSAFaultInjectingFileSystem::VSAFaultInjectingFileSystem(std::shared_ptr<VSAFileSystem> inner)
+    : inner_(std::move(inner)) {}
+
+void VSAFaultInjectingFileSystem::failNth(Op op, int n, int error) {
+  std::lock_guard lock(mutex_);
+  rules_.push_back({op, n - 1, error});
+}
+
+void VSAFaultInjectingFileSystem::failAll(Op op, int error) {
+  std::lock_guard lock(mutex_);
+  rules_.push_back({op, -1, error});
+}
+
+void VSAFaultInjectingFileSystem::reset() {
+  std::lock_guard lock(mutex_);
+  rules_.clear();
+  counts_.fill(0);
+}
+
+int VSAFaultInjectingFileSystem::callCount(Op op) const {
+  std::lock_guard lock(mutex_);
+  return counts_[static_cast<size_t>(op)];
+}
+
+int VSAFaultInjectingFileSystem::totalCalls() const {
+  std::lock_guard lock(mutex_);
+  int total = 0;
+  for (int c : counts_) total += c;
+  return total;
+}
+
+int VSAFaultInjectingFileSystem::injected(Op op) {
+  std::lock_guard lock(mutex_);
+  ++counts_[static_cast<size_t>(op)];
+  for (auto it = rules_.begin(); it != rules_.end(); ++it) {
+    if (it->op != op) continue;
+    if (it->remaining < 0) return it->error;
+    if (it->remaining-- == 0) {
+      int error = it->error;
+      rules_.erase(it);
+      return error;
+    }
+  }
+  return 0;
+}
+
+int VSAFaultInjectingFileSystem::lstat(const std::string& path, struct stat* st) {
+  if (int e = injected(Op::Lstat)) return e;
+  return inner_->lstat(path, st);
+}
+
+int VSAFaultInjectingFileSystem::mkdir(const std::string& path, mode_t mode) {
+  if (int e = injected(Op::Mkdir)) return e;
+  return inner_->mkdir(path, mode);
+}
+
+int VSAFaultInjectingFileSystem::lchown(const std::string& path, uid_t uid, gid_t gid) {
+  if (int e = injected(Op::Chown)) return e;
+  return inner_->lchown(path, uid, gid);
+}
+
+int VSAFaultInjectingFileSystem::chmod(const std::string& path, mode_t mode) {
+  if (int e = injected(Op::Chmod)) return e;
+  return inner_->chmod(path, mode);
+}
+
+int VSAFaultInjectingFileSystem::rename(const std::string& from, const std::string& to) {
+  if (int e = injected(Op::Rename)) return e;
+  return inner_->rename(from, to);
+}
+
+int VSAFaultInjectingFileSystem::readlink(const std::string& path, std::string* target) {
+  if (int e = injected(Op::Readlink)) return e;
+  return inner_->readlink(path, target);
+}
+
+int VSAFaultInjectingFileSystem::realpath(const std::string& path, std::string* resolved) {
+  if (int e = injected(Op::Realpath)) return e;
+  return inner_->realpath(path, resolved);
+}
+
+int VSAFaultInjectingFileSystem::unlink(const std::string& path) {
+  if (int e = injected(Op::Unlink)) return e;
+  return inner_->unlink(path);
+}
+
+int VSAFaultInjectingFileSystem::rmdir(const std::string& path) {
+  if (int e = injected(Op::Rmdir)) return e;
+  return inner_->rmdir(path);
+}
+
+int VSAFaultInjectingFileSystem::readDirectory(const std::string& path, std::vector<VSADirectoryEntry>* entries) {
+  if (int e = injected(Op::ReadDirectory)) return e;
+  return inner_->readDirectory(path, entries);
+}
+
+int VSAFaultInjectingFileSystem::getxattr(const std::string& path, const std::string& name, std::string* value) {
+  if (int e = injected(Op::GetXattr)) return e;
+  return inner_->getxattr(path, name, value);
+}
+
+int VSAFaultInjectingFileSystem::setxattr(const std::string& path, const std::string& name, const std::string& value) {
+  if (int e = injected(Op::SetXattr)) return e;
+  return inner_->setxattr(path, name, value);
+}
+
+int VSAFaultInjectingFileSystem::listxattr(const std::string& path, std::vector<std::string>* names) {
+  if (int e = injected(Op::ListXattr)) return e;
+  return inner_->listxattr(path, names);
+}
+
+int VSAFaultInjectingFileSystem::getFlags(const std::string& path, int* flags) {
+  if (int e = injected(Op::GetFlags)) return e;
+  return inner_->getFlags(path, flags);
+}
+
+int VSAFaultInjectingFileSystem::setFlags(const std::string& path, int flags) {
+  if (int e = injected(Op::SetFlags)) return e;
+  return inner_->setFlags(path, flags);
+}
+
+int VSAFaultInjectingFileSystem::copyData(const std::string& from, const std::string& to, mode_t mode) {
+  if (int e = injected(Op::CopyData)) return e;
+  return inner_->copyData(from, to, mode);
+}
+
+int VSAFaultInjectingFileSystem::symlink(const std::string& target, const std::string& path) {
+  if (int e = injected(Op::Symlink)) return e;
+  return inner_->symlink(target, path);
+}
+
+int VSAFaultInjectingFileSystem::writeFile(const std::string& path, const std::vector<uint8_t>& bytes, mode_t mode) {
+  if (int e = injected(Op::WriteFile)) return e;
+  return inner_->writeFile(path, bytes, mode);
+}
+
+int VSAFaultInjectingFileSystem::readFile(const std::string& path, std::vector<uint8_t>* bytes) {
+  if (int e = injected(Op::ReadFile)) return e;
+  return inner_->readFile(path, bytes);
+}
+
+int VSAFaultInjectingFileSystem::mkdtemp(const std::string& templ, std::string* path) {
+  if (int e = injected(Op::Mkdtemp)) return e;
+  return inner_->mkdtemp(templ, path);
+}
+
+int VSAFaultInjectingFileSystem::setSystemContainerACL(const std::string& path, VSASystemContainerACL kind, gid_t gid) {
+  if (int e = injected(Op::SetACL)) return e;
+  return inner_->setSystemContainerACL(path, kind, gid);
+}
+
+int VSAFaultInjectingFileSystem::getProtectionClass(const std::string& path, int* protectionClass) {
+  if (int e = injected(Op::GetClass)) return e;
+  return inner_->getProtectionClass(path, protectionClass);
+}
+
+int VSAFaultInjectingFileSystem::setProtectionClass(const std::string& path, int protectionClass) {
+  if (int e = injected(Op::SetClass)) return e;
+  return inner_->setProtectionClass(path, protectionClass);
+}

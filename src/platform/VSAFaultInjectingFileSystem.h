@@ -1,0 +1,63 @@
+// A file system that forwards to another one and fails chosen calls.
+//
+// failNth(op, n, errno) makes the n-th call (counting from 1, from now on)
+// of `op` fail with `errno` without reaching the real file system; failAll
+// fails every call of `op`. Call counts per operation let a test enumerate
+// the steps of an operation and fail each in turn. Thread-safe.
+#pragma once
+
+#include <array>
+#include <memory>
+#include <mutex>
+#include <vector>
+
+#include "platform/VSAFileSystem.h"
+
+class VSAFaultInjectingFileSystem : public VSAFileSystem {
+ public:
+  explicit VSAFaultInjectingFileSystem(std::shared_ptr<VSAFileSystem> inner);
+
+  void failNth(Op op, int n, int error);
+  void failAll(Op op, int error);
+  void reset();
+  int callCount(Op op) const;
+  int totalCalls() const;
+
+  int lstat(const std::string& path, struct stat* st) override;
+  int mkdir(const std::string& path, mode_t mode) override;
+  int lchown(const std::string& path, uid_t uid, gid_t gid) override;
+  int chmod(const std::string& path, mode_t mode) override;
+  int rename(const std::string& from, const std::string& to) override;
+  int readlink(const std::string& path, std::string* target) override;
+  int realpath(const std::string& path, std::string* resolved) override;
+  int unlink(const std::string& path) override;
+  int rmdir(const std::string& path) override;
+  int readDirectory(const std::string& path, std::vector<VSADirectoryEntry>* entries) override;
+  int getxattr(const std::string& path, const std::string& name, std::string* value) override;
+  int setxattr(const std::string& path, const std::string& name, const std::string& value) override;
+  int listxattr(const std::string& path, std::vector<std::string>* names) override;
+  int getFlags(const std::string& path, int* flags) override;
+  int setFlags(const std::string& path, int flags) override;
+  int copyData(const std::string& from, const std::string& to, mode_t mode) override;
+  int symlink(const std::string& target, const std::string& path) override;
+  int writeFile(const std::string& path, const std::vector<uint8_t>& bytes, mode_t mode) override;
+  int readFile(const std::string& path, std::vector<uint8_t>* bytes) override;
+  int mkdtemp(const std::string& templ, std::string* path) override;
+  int setSystemContainerACL(const std::string& path, VSASystemContainerACL kind, gid_t gid) override;
+  int getProtectionClass(const std::string& path, int* protectionClass) override;
+  int setProtectionClass(const std::string& path, int protectionClass) override;
+
+ private:
+  // Counts the call; answers the errno to fail it with, or 0 to forward it.
+  int injected(Op op);
+
+  struct Rule {
+    Op op;
+    int remaining;  // calls to let through first; -1: fail every call
+    int error;
+  };
+  std::shared_ptr<VSAFileSystem> inner_;
+  mutable std::mutex mutex_;
+  std::array<int, static_cast<size_t>(Op::Count)> counts_{};
+  std::vector<Rule> rules_;
+};

@@ -1,0 +1,77 @@
+// The file-system interface: every file-system call of the daemon goes
+// through one of these, so that tests can inject failures (see
+// VSAFaultInjectingFileSystem) and prove that a failure at any step loses
+// nothing. Calls never follow a final symbolic link unless they say so, take
+// host paths and return 0 or an errno. Implementations are thread-safe.
+#pragma once
+
+#include <sys/stat.h>
+#include <sys/types.h>
+
+#include <cerrno>
+#include <cstdint>
+#include <string>
+#include <vector>
+
+struct VSADirectoryEntry {
+  std::string name;
+  enum class Type { Directory, File, Symlink, Other } type = Type::Other;
+};
+
+// The three ACLs of system containers (all granting the "systemusers" group).
+enum class VSASystemContainerACL { TopLevel, Directory, File };
+
+class VSAFileSystem {
+ public:
+  // Operation names, for failure injection.
+  enum class Op {
+    Lstat, Mkdir, Chown, Chmod, Rename, Readlink, Realpath, Unlink, Rmdir, ReadDirectory,
+    GetXattr, SetXattr, ListXattr, GetFlags, SetFlags, CopyData, Symlink, WriteFile, ReadFile,
+    Mkdtemp, SetACL, GetClass, SetClass, Count
+  };
+
+  virtual ~VSAFileSystem() = default;
+
+  virtual int lstat(const std::string& path, struct stat* st) = 0;
+  virtual int mkdir(const std::string& path, mode_t mode) = 0;
+  virtual int lchown(const std::string& path, uid_t uid, gid_t gid) = 0;
+  // Changes the mode of a non-link item (links have no mode of their own).
+  virtual int chmod(const std::string& path, mode_t mode) = 0;
+  virtual int rename(const std::string& from, const std::string& to) = 0;
+  virtual int readlink(const std::string& path, std::string* target) = 0;
+  virtual int realpath(const std::string& path, std::string* resolved) = 0;
+  virtual int unlink(const std::string& path) = 0;
+  virtual int rmdir(const std::string& path) = 0;
+  // Every entry but "." and "..", with its type.
+  virtual int readDirectory(const std::string& path, std::vector<VSADirectoryEntry>* entries) = 0;
+  virtual int getxattr(const std::string& path, const std::string& name, std::string* value) = 0;
+  virtual int setxattr(const std::string& path, const std::string& name,
+                       const std::string& value) = 0;
+  virtual int listxattr(const std::string& path, std::vector<std::string>* names) = 0;
+  // Inode flags (FS_IMMUTABLE_FL ...); ENOTTY/EOPNOTSUPP where unsupported.
+  virtual int getFlags(const std::string& path, int* flags) = 0;
+  virtual int setFlags(const std::string& path, int flags) = 0;
+  // Creates `to` (which must not exist) with the data of regular file
+  // `from`, cloning extents where the file system can.
+  virtual int copyData(const std::string& from, const std::string& to, mode_t mode) = 0;
+  virtual int symlink(const std::string& target, const std::string& path) = 0;
+  // Creates or truncates `path` with `bytes` and syncs it.
+  virtual int writeFile(const std::string& path, const std::vector<uint8_t>& bytes, mode_t mode) = 0;
+  virtual int readFile(const std::string& path, std::vector<uint8_t>* bytes) = 0;
+  // `templ` ends in "XXXXXX"; the created directory's path comes back in `path`.
+  virtual int mkdtemp(const std::string& templ, std::string* path) = 0;
+  // Writes one of the system-container ACLs granting group `gid`.
+  virtual int setSystemContainerACL(const std::string& path, VSASystemContainerACL kind,
+                                    gid_t gid) = 0;
+
+  // Data-protection class of a file or directory (0 when none was set).
+  // While the device is locked, changing the class of an item of class 1-3
+  // fails with kDeviceLockedError.
+  virtual int getProtectionClass(const std::string& path, int* protectionClass) = 0;
+  virtual int setProtectionClass(const std::string& path, int protectionClass) = 0;
+
+  static constexpr int kDeviceLockedError = EAGAIN;
+  // The inode flag that forbids changing or removing an item.
+  static constexpr int kImmutableFlag = 0x00000010;
+  static const char* opName(Op op);
+};
