@@ -4,7 +4,7 @@
 
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
-#include "operations/VSAFileManager.h"
+#include "platform/VSAFileManager.h"
 
 namespace {
 constexpr const char* kOrigin = "VSAFileManager";

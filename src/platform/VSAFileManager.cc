@@ -1,4 +1,4 @@
-#include "operations/VSAFileManager.h"
+#include "platform/VSAFileManager.h"
 
 #include <cstring>
 

@@ -1,4 +1,4 @@
-#include "operations/VSAFileManager.h"
+#include "platform/VSAFileManager.h"
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>
