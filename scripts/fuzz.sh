@@ -1,6 +1,6 @@
 #!/usr/bin/env bash
 # Builds the libFuzzer targets with clang-14 (ASan+UBSan) and runs one.
-#   scripts/fuzz.sh [TARGET] [SECONDS]     default: frame 60
+#   scripts/fuzz.sh [TARGET] [SECONDS]     TARGET: frame (default) or paths; default 60 s
 set -euo pipefail
 cd "$(dirname "$0")/.."
 scripts/setup.sh

@@ -12,6 +12,8 @@
 #include "model/VSAUserIdentitySharedCache.h"
 #include "platform/VSAClientRegistry.h"
 #include "platform/VSADeviceProperties.h"
+#include "platform/VSAFileManager.h"
+#include "platform/VSALinuxFileSystem.h"
 #include "platform/VSALinuxPersonaService.h"
 #include "platform/VSALockStateService.h"
 #include "platform/VSANotificationCenter.h"
@@ -28,8 +30,11 @@ struct VSADaemonContext {
         lockState(std::make_shared<VSALockStateService>(root)),
         userDatabase(std::make_shared<VSAUserDatabase>(root)),
         personaService(std::make_shared<VSALinuxPersonaService>(root)),
-        globalConfiguration(
-            std::make_shared<VSAGlobalConfiguration>(root, deviceProperties, userDatabase)),
+        fileSystem(std::make_shared<VSALinuxFileSystem>(
+            [lockState = lockState] { return lockState->currentLockState() == 1; })),
+        fileManager(std::make_shared<VSAFileManager>(fileSystem, userDatabase)),
+        globalConfiguration(std::make_shared<VSAGlobalConfiguration>(root, deviceProperties,
+                                                                     userDatabase, fileManager)),
         transactions(std::make_shared<VSATransactions>()) {
     userIdentityCache = VSAUserIdentitySharedCache::create(
         {personaService, userDatabase, globalConfiguration->currentMobileUserId(),
@@ -44,6 +49,8 @@ struct VSADaemonContext {
   std::shared_ptr<VSALockStateService> lockState;
   std::shared_ptr<VSAUserDatabase> userDatabase;
   std::shared_ptr<VSAPersonaService> personaService;
+  std::shared_ptr<VSAFileSystem> fileSystem;
+  std::shared_ptr<VSAFileManager> fileManager;
   std::shared_ptr<VSAGlobalConfiguration> globalConfiguration;
   std::shared_ptr<VSATransactions> transactions;
   std::shared_ptr<VSAUserIdentitySharedCache> userIdentityCache;

@@ -1,50 +1,88 @@
-// The daemon's global directory layout (the one module that owns paths).
+// The daemon's global directory layout and the device's mobile user.
 //
-// Every directory is a device path resolved below the system root and is
-// created (with missing parents, mode 0755) each time it is asked for, so a
-// directory removed behind the daemon's back comes back on the next request;
-// creation failures are logged and the path is still returned.
-// Thread-safe: immutable apart from the internal-image answer, which is
-// computed once on first read.
+// The one module that owns paths: every directory is a device path resolved
+// below the system root, computed once, and (re)created on each request with
+// mode 0755 (and the owner and protection class its row names), so a
+// directory removed behind the daemon's back comes back the next time it is
+// asked for; creation failures are logged and the path is still returned.
+// Per-user layouts come from getPerUserConfigurationForUserIdentity, one
+// object per user identity identifier. Thread-safe (a monitor guards the map
+// and the container-directory call; lock order: global before per-user).
 #pragma once
 
-#include <atomic>
+#include <map>
 #include <memory>
 #include <mutex>
 #include <optional>
 #include <string>
+#include <vector>
 
+#include "model/VSAContainerClass.h"
+#include "model/VSAUserIdentity.h"
 #include "platform/VSADeviceProperties.h"
+#include "platform/VSAFileManager.h"
 #include "platform/VSASystemRoot.h"
 #include "platform/VSAUserDatabase.h"
+
+class VSAPerUserConfiguration;
 
 class VSAGlobalConfiguration {
  public:
   // Reads the "mobile" account once, here.
   VSAGlobalConfiguration(VSASystemRoot root, std::shared_ptr<const VSADeviceProperties> device,
-                         std::shared_ptr<const VSAUserDatabase> userDatabase);
+                         std::shared_ptr<const VSAUserDatabase> userDatabase,
+                         std::shared_ptr<VSAFileManager> fileManager);
+  ~VSAGlobalConfiguration();
 
   const VSASystemRoot& systemRoot() const { return root_; }
-  // "/private/var/root/" on the device.
-  std::string rootHomeDirectory() const;
-  // root home + "Library/Logs/Vessa", created afresh on each call.
-  std::string logDirectory() const;
-
-  // uid and gid of the "mobile" account (0 when it is missing, logged).
+  VSAFileManager& fileManager() const { return *fileManager_; }
   uid_t currentMobileUserId() const { return mobileUID_; }
   gid_t currentMobileGroupId() const { return mobileGID_; }
-
-  // Whether this operating-system variant has internal content; the first
-  // read asks the platform and overrides any value set before it.
   bool isInternalImage();
   void setIsInternalImage(bool value);
+
+  std::string rootHomeDirectory() const;  // "/private/var/root/"
+  std::string sharedContainersDirectory();
+  std::string bundleDirectory();
+  std::string transientBundleDirectory();
+  std::string libraryDirectory();
+  std::string pendingUpdatesDirectory();
+  std::string replaceDirectory();
+  std::string cachesDirectory();
+  std::string deathrowDirectory();
+  std::string stagingDirectory();
+  std::string transientDirectory();
+  std::string logDirectory();
+  std::optional<std::string> legacyTransientBundleDirectory();
+
+  static const std::vector<std::string>& appUserDataItemNames();
+  static const std::vector<std::string>& excludedFromAppUserData();
+
+  // The base directory of containers of `contentClass` for `userIdentity`.
+  std::optional<std::string> containerDirectoryURLForUserIdentity(
+      const VSAUserIdentityRef& userIdentity, VSAContainerClass contentClass, bool transient);
+  // Bundle and system classes only; nothing for any other class.
+  std::optional<std::string> globalContainerBaseURLWithContentClass(VSAContainerClass contentClass,
+                                                                    bool transient);
+  std::string stagingDirectoryURLForUserIdentity(const VSAUserIdentityRef& userIdentity,
+                                                 VSAContainerClass contentClass);
+  bool migrationFileExistsWithName(const std::string& name);
+  std::shared_ptr<VSAPerUserConfiguration> getPerUserConfigurationForUserIdentity(
+      const VSAUserIdentityRef& userIdentity);
+
+  // Creates `path` (mode 0755, parents too); logs `failureFormat` on failure.
+  std::string ensureDirectory(const std::string& path, uid_t owner, uint32_t protectionClass,
+                              const char* failureFormat);
 
  private:
   VSASystemRoot root_;
   std::shared_ptr<const VSADeviceProperties> device_;
+  std::shared_ptr<VSAFileManager> fileManager_;
   uid_t mobileUID_ = 0;
   gid_t mobileGID_ = 0;
-  std::mutex mutex_;
+  std::recursive_mutex monitor_;
   bool internalImageComputed_ = false;
   bool internalImage_ = false;
+  std::mutex perUserMutex_;
+  std::map<std::string, std::shared_ptr<VSAPerUserConfiguration>> perUser_;
 };

@@ -1,0 +1,207 @@
+#include "model/VSAMetadata.h"
+
+#include "base/VSALog.h"
+#include "base/VSAPathString.h"
+#include "base/VSAPlist.h"
+#include "model/VSAGlobalConfiguration.h"
+#include "model/VSAUserIdentityCache.h"
+
+namespace {
+constexpr const char* kIdentifierKey = "VSAMetadataIdentifier";
+constexpr const char* kUUIDKey = "VSAMetadataUUID";
+constexpr const char* kClassKey = "VSAMetadataContentClass";
+constexpr const char* kUserIdentityKey = "VSAMetadataUserIdentity";
+constexpr const char* kPersonaKey = "VSAMetadataPersona";
+constexpr const char* kInfoKey = "VSAMetadataInfo";
+constexpr const char* kAssetsKey = "VSAMetadataUserManagedAssetsDirName";
+constexpr const char* kVersionKey = "VSAMetadataVersion";
+
+std::string parentOf(const std::string& path) {
+  size_t slash = path.find_last_of('/');
+  if (slash == std::string::npos) return ".";
+  return slash == 0 ? "/" : path.substr(0, slash);
+}
+
+template <typename... A>
+VSAMetadataRef invalid(VSAErrorRef* error, VSAResultCode code, const char* format, const A&... args) {
+  auto e = VSAError::make(code, nullptr, "readAndValidateMetadataAtFileUrl", __LINE__, format, args...);
+  VSALogIn(VSALogCategory::Metadata, kVSALogError, "readAndValidateMetadataAtFileUrl", "%@",
+           e->message());
+  VSASetError(error, e);
+  return nullptr;
+}
+
+std::string shown(const VSAValue* v) { return v ? v->description() : std::string("(null)"); }
+}  // namespace
+
+VSAMetadata::VSAMetadata(VSAConcreteContainerIdentityRef containerIdentity,
+                         std::optional<VSAValue> info, std::string url,
+                         std::optional<std::string> userManagedAssetsDirName)
+    : identity_(std::move(containerIdentity)),
+      info_(std::move(info)),
+      url_(std::move(url)),
+      assetsDirName_(std::move(userManagedAssetsDirName)) {}
+
+void VSAMetadata::setUserIdentity(const VSAUserIdentityRef& userIdentity) {
+  identity_ = std::make_shared<const VSAConcreteContainerIdentity>(
+      identity_->uuid(), userIdentity, identity_->identifier(), identity_->containerClass());
+}
+
+void VSAMetadata::setUuid(const VSAUUID& uuid) {
+  identity_ = std::make_shared<const VSAConcreteContainerIdentity>(
+      uuid, identity_->userIdentity(), identity_->identifier(), identity_->containerClass());
+}
+
+VSAValue VSAMetadata::plist() const {
+  VSAValue d = VSAValue::dictionary();
+  if (info_) d.set(kInfoKey, *info_);
+  d.set(kClassKey, VSAValue(static_cast<uint64_t>(containerClass())));
+  if (VSAUserIdentity::isUserIdentityRequiredForContainerClass(containerClass()) && userIdentity())
+    d.set(kUserIdentityKey, userIdentity()->plist());
+  d.set(kIdentifierKey, VSAValue(identifier()));
+  d.set(kUUIDKey, VSAValue(uuid().string()));
+  d.set(kVersionKey, VSAValue("2"));
+  if (assetsDirName_) d.set(kAssetsKey, VSAValue(*assetsDirName_));
+  return d;
+}
+
+bool VSAMetadata::writeMetadataToDiskWithError(VSAGlobalConfiguration& configuration,
+                                               VSAErrorRef* error) {
+  return writeMetadataToFileURL(VSAPathJoin(url_, kVSAMetadataFileName), configuration, error);
+}
+
+bool VSAMetadata::writeMetadataToFileURL(const std::string& fileURL,
+                                         VSAGlobalConfiguration& configuration, VSAErrorRef* error) {
+  const char* fn = "writeMetadataToFileURL";
+  VSAValue dict = plist();
+  std::string staging = configuration.stagingDirectoryURLForUserIdentity(userIdentity(), containerClass());
+  std::string temp = VSAPathJoin(staging, VSAFormat("temp_metadata-%@.plist", uuid()));
+  VSALogIn(VSALogCategory::Metadata, kVSALogDebug, fn, "[%s] Writing metadata to [%@]: %@ => %@", fn,
+           fileURL, *this, dict);
+  VSAFileManager& fm = configuration.fileManager();
+  VSAErrorRef underlying;
+  auto bytes = VSAPlist::serialize(dict, VSAPlist::Format::Binary, &underlying);
+  int rc = bytes ? fm.fileSystem().writeFile(temp, *bytes, 0644) : EINVAL;
+  if (rc != 0) {
+    if (!underlying) underlying = VSAError::posix(rc, fn, __LINE__);
+    fm.fileSystem().unlink(temp);
+    auto e = VSAError::make(VSAResult::kWriteFailed, underlying, fn, __LINE__,
+                            "Failed to write metadata dictionary to URL %@ : %@:%ld", temp,
+                            underlying->domain(), underlying->code());
+    VSALogIn(VSALogCategory::Metadata, kVSALogError, fn, "%@", e->message());
+    VSASetError(error, e);
+    return false;
+  }
+  if (!fm.moveItemAtURL(temp, fileURL, &underlying)) {
+    fm.fileSystem().unlink(temp);
+    auto e = VSAError::make(VSAResult::kWriteFailed, underlying, fn, __LINE__,
+                            "Failed to move metadata from staging: %@ to final: %@", temp, fileURL);
+    VSALogIn(VSALogCategory::Metadata, kVSALogError, fn, "%@", e->message());
+    VSASetError(error, e);
+    return false;
+  }
+  return true;
+}
+
+VSAMetadataRef VSAMetadata::readAndValidateMetadataAtUrl(const std::string& containerURL,
+                                                         const VSAUserIdentityRef& forUserIdentity,
+                                                         bool checkClassPath,
+                                                         VSAGlobalConfiguration& configuration,
+                                                         VSAUserIdentityCache& cache,
+                                                         VSAErrorRef* error) {
+  return readAndValidateMetadataAtFileUrl(VSAPathJoin(containerURL, kVSAMetadataFileName),
+                                          forUserIdentity, checkClassPath, configuration, cache, error);
+}
+
+VSAMetadataRef VSAMetadata::readAndValidateMetadataAtFileUrl(
+    const std::string& file, const VSAUserIdentityRef& expected, bool checkClassPath,
+    VSAGlobalConfiguration& configuration, VSAUserIdentityCache& cache, VSAErrorRef* error) {
+  const VSAResultCode bad = VSAResult::kInvalidUpdateFile;  // 29
+  std::vector<uint8_t> bytes;
+  std::optional<VSAValue> dict;
+  if (configuration.fileManager().fileSystem().readFile(file, &bytes) == 0)
+    dict = VSAPlist::parse(bytes, nullptr);
+  if (!dict || !dict->isDictionary())
+    return invalid(error, VSAResult::kMetadataUnreadable, "Failed to read metadata at URL %@", file);
+  const VSAValue* identifier = dict->get(kIdentifierKey);
+  if (!identifier || !identifier->isString())
+    return invalid(error, bad, "Invalid metadata Identifier: %@ at %@", shown(identifier), file);
+  const VSAValue* uuidText = dict->get(kUUIDKey);
+  if (!uuidText || !uuidText->isString())
+    return invalid(error, bad, "Invalid metadata UUID String: %@ at %@", shown(uuidText), file);
+  auto uuid = VSAUUID::parse(*uuidText->stringValue());
+  if (!uuid) return invalid(error, bad, "Invalid metadata UUID: %@ at %@", shown(uuidText), file);
+  const VSAValue* cls = dict->get(kClassKey);
+  if (!cls || !cls->isNumber())
+    return invalid(error, bad, "Invalid metadata Class: %@ at %@", shown(cls), file);
+  int64_t classValue = cls->int64Value().value_or(-1);
+  if (classValue < 1 || classValue > 13)
+    return invalid(error, bad, "Invalid metadata Content Class: %ld at %@", classValue, file);
+  VSAContainerClass c = static_cast<VSAContainerClass>(classValue);
+
+  VSAUserIdentityRef owner;
+  if (!VSAUserIdentity::isUserIdentityRequiredForContainerClass(c)) {
+    owner = cache.defaultUserIdentity();
+  } else {
+    uid_t expectedUID = expected ? expected->posixUIDForContainerClass(c) : 0;
+    if (VSAContainerClassIsPerUser(c)) {
+      const VSAValue* persona = dict->get(kPersonaKey);
+      if (!persona) {
+        dict->set(kPersonaKey, VSAValue(static_cast<uint64_t>(expectedUID)));  // memory only
+      } else if (persona->uint64Value() != static_cast<uint64_t>(expectedUID)) {
+        return invalid(error, bad, "Incorrect UserId: %@, expecting: %u for %@ at %@",
+                       shown(persona), expectedUID, *identifier->stringValue(), file);
+      }
+    }
+    const VSAValue* stored = dict->get(kUserIdentityKey);
+    if (!stored) {
+      uint64_t n = dict->get(kPersonaKey)->uint64Value().value_or(0);
+      if (n == 499) n = 0;
+      owner = cache.userIdentityForPersonalPersonaWithUID(static_cast<uid_t>(n), static_cast<gid_t>(n));
+    } else {
+      VSAResultCode code = VSAResult::kSuccess;
+      owner = VSAUserIdentity::userIdentityWithPlist(*stored, cache, &code);
+      if (!owner)
+        return invalid(error, bad, "Invalid metadata User Identity: %@ for %@ at %@: %llu",
+                       *stored, *identifier->stringValue(), file, code);
+      if (!VSAUserIdentityEqual(owner, expected))
+        return invalid(error, bad, "Incorrect User Identity: %@, expecting: %@ for %@ at %@: %llu",
+                       owner, expected, *identifier->stringValue(), file, code);
+    }
+  }
+  const VSAValue* info = dict->get(kInfoKey);
+  if (info && !info->isDictionary())
+    return invalid(error, bad, "Invalid metadata Info: %@ at %@", *info, file);
+  const VSAValue* assets = dict->get(kAssetsKey);
+  if (assets && !assets->isString())
+    return invalid(error, bad, "Invalid metadata User Managed Dir Name String: %@ at %@", *assets, file);
+  std::string container = parentOf(file);
+  if (checkClassPath) {
+    std::string classDir = parentOf(container);
+    std::string expectedDir =
+        VSAPathJoin(parentOf(parentOf(classDir)), VSAContainerClassPathComponent(c));
+    if (classDir != expectedDir)
+      return invalid(error, bad, "Invalid metadata-URLs should match: %@ : %@", file, expectedDir);
+  }
+  VSAResultCode code = VSAResult::kSuccess;
+  auto identity = VSAConcreteContainerIdentity::containerIdentityWithUUID(
+      *uuid, owner, *identifier->stringValue(), c, &code);
+  if (!identity) return invalid(error, bad, "Could not create user identity from %@: %llu", file, code);
+  auto metadata = std::make_shared<VSAMetadata>(
+      identity, info ? std::optional<VSAValue>(*info) : std::nullopt, container,
+      assets ? std::optional<std::string>(*assets->stringValue()) : std::nullopt);
+  VSALogIn(VSALogCategory::Metadata, kVSALogDebug, "readAndValidateMetadataAtFileUrl",
+           "[%s] Read metadata from [%@]: %@ <= %@", "readAndValidateMetadataAtFileUrl", file,
+           *metadata, *dict);
+  return metadata;
+}
+
+std::string VSAMetadata::description() const {
+  return VSAFormat(
+      "<%@: %p; userIdentity = %@, uuid = %@, containerClass = %llu, identifier = %@, info = %@, "
+      "url = %@, userManagedAssetsDirName = %@>",
+      "VSAMetadata", static_cast<const void*>(this),
+      userIdentity() ? userIdentity()->shortDescription() : std::string("(null)"), uuid(),
+      containerClass(), identifier(), info_ ? info_->description() : std::string("(null)"), url_,
+      assetsDirName_ ? *assetsDirName_ : std::string("(null)"));
+}

@@ -1,0 +1,78 @@
+// A container's identity as recorded in its metadata file,
+// ".com.tamsk.vessa_keeper.metadata.plist" directly inside the container.
+//
+// The file is a binary property list, always written through a temporary
+// file in the staging directory for the container's owner and class and then
+// moved over the old one: it is never written in place, so a failure at any
+// step leaves the previous file intact. Reading validates every field in a
+// fixed order (codes 12 and 29 with the exact messages) and optionally that
+// the container sits in the directory of its class. Not synchronised: one
+// object belongs to one request.
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "base/VSAError.h"
+#include "base/VSAValue.h"
+#include "model/VSAConcreteContainerIdentity.h"
+
+class VSAGlobalConfiguration;
+class VSAUserIdentityCache;
+class VSAMetadata;
+using VSAMetadataRef = std::shared_ptr<VSAMetadata>;
+
+class VSAMetadata {
+ public:
+  // initWithContainerIdentity:info:url:userManagedAssetsDirName:
+  VSAMetadata(VSAConcreteContainerIdentityRef containerIdentity, std::optional<VSAValue> info,
+              std::string url, std::optional<std::string> userManagedAssetsDirName);
+
+  const VSAConcreteContainerIdentityRef& containerIdentity() const { return identity_; }
+  const VSAUserIdentityRef& userIdentity() const { return identity_->userIdentity(); }
+  const std::string& identifier() const { return identity_->identifier(); }
+  VSAContainerClass containerClass() const { return identity_->containerClass(); }
+  const VSAUUID& uuid() const { return identity_->uuid(); }
+  const std::optional<VSAValue>& info() const { return info_; }
+  const std::string& url() const { return url_; }
+  const std::optional<std::string>& userManagedAssetsDirName() const { return assetsDirName_; }
+  bool existed() const { return existed_; }
+  bool transient() const { return transient_; }
+
+  void setUserIdentity(const VSAUserIdentityRef& userIdentity);
+  void setUuid(const VSAUUID& uuid);
+  void setInfo(std::optional<VSAValue> info) { info_ = std::move(info); }
+  void setUrl(std::string url) { url_ = std::move(url); }
+  void setExisted(bool v) { existed_ = v; }
+  void setTransient(bool v) { transient_ = v; }
+
+  // The dictionary written to the file.
+  VSAValue plist() const;
+  bool writeMetadataToDiskWithError(VSAGlobalConfiguration& configuration, VSAErrorRef* error);
+  bool writeMetadataToFileURL(const std::string& fileURL, VSAGlobalConfiguration& configuration,
+                              VSAErrorRef* error);
+
+  static VSAMetadataRef readAndValidateMetadataAtUrl(const std::string& containerURL,
+                                                     const VSAUserIdentityRef& forUserIdentity,
+                                                     bool checkClassPath,
+                                                     VSAGlobalConfiguration& configuration,
+                                                     VSAUserIdentityCache& cache,
+                                                     VSAErrorRef* error);
+  static VSAMetadataRef readAndValidateMetadataAtFileUrl(const std::string& fileURL,
+                                                         const VSAUserIdentityRef& forUserIdentity,
+                                                         bool checkClassPath,
+                                                         VSAGlobalConfiguration& configuration,
+                                                         VSAUserIdentityCache& cache,
+                                                         VSAErrorRef* error);
+
+  std::string description() const;
+
+ private:
+  VSAConcreteContainerIdentityRef identity_;
+  std::optional<VSAValue> info_;
+  std::string url_;
+  std::optional<std::string> assetsDirName_;
+  bool existed_ = false;
+  bool transient_ = false;
+};
