@@ -160,3 +160,13 @@ int VSAFaultInjectingFileSystem::setProtectionClass(const std::string& path, int
   if (int e = injected(Op::SetClass)) return e;
   return inner_->setProtectionClass(path, protectionClass);
 }
+
+int VSAFaultInjectingFileSystem::directoryStatistics(const std::string& path, uint64_t* bytes) {
+  if (int e = injected(Op::DirectoryStatistics)) return e;
+  return inner_->directoryStatistics(path, bytes);
+}
+
+int VSAFaultInjectingFileSystem::maintainDirectoryStatistics(const std::string& path) {
+  if (int e = injected(Op::MaintainStatistics)) return e;
+  return inner_->maintainDirectoryStatistics(path);
+}

@@ -46,6 +46,8 @@ class VSAFaultInjectingFileSystem : public VSAFileSystem {
   int setSystemContainerACL(const std::string& path, VSASystemContainerACL kind, gid_t gid) override;
   int getProtectionClass(const std::string& path, int* protectionClass) override;
   int setProtectionClass(const std::string& path, int protectionClass) override;
+  int directoryStatistics(const std::string& path, uint64_t* bytes) override;
+  int maintainDirectoryStatistics(const std::string& path) override;
 
  private:
   // Counts the call; answers the errno to fail it with, or 0 to forward it.

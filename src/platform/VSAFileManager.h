@@ -82,6 +82,9 @@ class VSAFileManager {
 
   // Total apparent size of a tree in bytes (a full walk).
   uint64_t diskUsageForURL(const std::string& path);
+  // The file system's statistics for the tree; on first use it asks the
+  // file system to keep them; any failure falls back to the full walk.
+  uint64_t fastDiskUsageForURL(const std::string& path);
   std::string homeDirectoryURLForPOSIXUID(uid_t uid) const;
 
  private:

@@ -322,3 +322,22 @@ uint64_t VSAFileManager::diskUsageForURL(const std::string& path) {
            nodes, total, path);
   return total;
 }
+
+uint64_t VSAFileManager::fastDiskUsageForURL(const std::string& path) {
+  uint64_t bytes = 0;
+  int rc = fs_->directoryStatistics(path, &bytes);
+  if (rc != 0) {
+    if (int m = fs_->maintainDirectoryStatistics(path)) {
+      VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin,
+               "Failed to set maintain-dir-stats on %s: (err %d) %s", path, m, std::strerror(m));
+    } else {
+      VSALogIn(VSALogCategory::FS, kVSALogNotice, kOrigin, "Enabled fast directory sizing on [%s]",
+               path);
+      rc = fs_->directoryStatistics(path, &bytes);
+    }
+  }
+  if (rc == 0) return bytes;
+  VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "Failed to get dirstats on %s: (err %d) %s",
+           path, rc, std::strerror(rc));
+  return diskUsageForURL(path);
+}

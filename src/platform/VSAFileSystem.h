@@ -27,7 +27,7 @@ class VSAFileSystem {
   enum class Op {
     Lstat, Mkdir, Chown, Chmod, Rename, Readlink, Realpath, Unlink, Rmdir, ReadDirectory,
     GetXattr, SetXattr, ListXattr, GetFlags, SetFlags, CopyData, Symlink, WriteFile, ReadFile,
-    Mkdtemp, SetACL, GetClass, SetClass, Count
+    Mkdtemp, SetACL, GetClass, SetClass, DirectoryStatistics, MaintainStatistics, Count
   };
 
   virtual ~VSAFileSystem() = default;
@@ -69,6 +69,13 @@ class VSAFileSystem {
   // fails with kDeviceLockedError.
   virtual int getProtectionClass(const std::string& path, int* protectionClass) = 0;
   virtual int setProtectionClass(const std::string& path, int protectionClass) = 0;
+
+  // Directory statistics (fast sizing): the bytes used by the tree below
+  // `path` as the file system accounts them, without walking it. Fails
+  // (ENOTSUP, ESRCH, ...) where the file system keeps no such count.
+  virtual int directoryStatistics(const std::string& path, uint64_t* bytes) = 0;
+  // Asks the file system to keep statistics for the tree below `path` from now on.
+  virtual int maintainDirectoryStatistics(const std::string& path) = 0;
 
   static constexpr int kDeviceLockedError = EAGAIN;
   // The inode flag that forbids changing or removing an item.

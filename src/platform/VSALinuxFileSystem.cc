@@ -5,6 +5,8 @@
 #include <linux/fs.h>
 #include <sys/acl.h>
 #include <sys/ioctl.h>
+#include <sys/quota.h>
+#include <sys/sysmacros.h>
 #include <sys/sendfile.h>
 #include <sys/xattr.h>
 #include <unistd.h>
@@ -12,6 +14,8 @@
 #include <climits>
 #include <cstdlib>
 #include <cstring>
+#include <fstream>
+#include <sstream>
 
 namespace {
 int err(int rc) { return rc == 0 ? 0 : errno; }
@@ -27,7 +31,7 @@ const char* VSAFileSystem::opName(Op op) {
                                 "readlink", "realpath", "unlink",    "rmdir",      "readdir",
                                 "getxattr", "setxattr", "listxattr", "getflags",   "setflags",
                                 "copydata", "symlink",  "writefile", "readfile",   "mkdtemp",
-                                "setacl",   "getclass", "setclass"};
+                                "setacl",   "getclass", "setclass",   "dirstats", "maintaindirstats"};
   return names[static_cast<int>(op)];
 }
 
@@ -276,4 +280,63 @@ int VSALinuxFileSystem::setProtectionClass(const std::string& path, int protecti
   if (rc != 0) return rc;
   if (current >= 1 && current <= 3 && isLocked_ && isLocked_()) return kDeviceLockedError;
   return setxattr(path, kVSAProtectionClassXattr, std::to_string(protectionClass));
+}
+
+namespace {
+// The block device holding `path`, from the mount table.
+std::string deviceOf(const std::string& path) {
+  struct stat st;
+  if (::stat(path.c_str(), &st) != 0) return {};
+  std::ifstream in("/proc/self/mountinfo");
+  std::string line;
+  while (std::getline(in, line)) {
+    std::istringstream fields(line);
+    std::string id, parent, majmin;
+    fields >> id >> parent >> majmin;
+    unsigned maj = 0, min = 0;
+    if (std::sscanf(majmin.c_str(), "%u:%u", &maj, &min) != 2) continue;
+    if (makedev(maj, min) != st.st_dev) continue;
+    size_t dash = line.find(" - ");
+    if (dash == std::string::npos) continue;
+    std::istringstream tail(line.substr(dash + 3));
+    std::string type, source;
+    tail >> type >> source;
+    return source;
+  }
+  return {};
+}
+}  // namespace
+
+int VSALinuxFileSystem::directoryStatistics(const std::string& path, uint64_t* bytes) {
+  int fd = openNoFollow(path);
+  if (fd < 0) return errno;
+  struct fsxattr attr {};
+  int rc = ioctl(fd, FS_IOC_FSGETXATTR, &attr) == 0 ? 0 : errno;
+  ::close(fd);
+  if (rc != 0) return rc;
+  if (attr.fsx_projid == 0 || !(attr.fsx_xflags & FS_XFLAG_PROJINHERIT)) return ENODATA;
+  std::string device = deviceOf(path);
+  if (device.empty()) return ENODEV;
+  struct dqblk quota {};
+  if (quotactl(QCMD(Q_GETQUOTA, PRJQUOTA), device.c_str(), static_cast<int>(attr.fsx_projid),
+               reinterpret_cast<caddr_t>(&quota)) != 0)
+    return errno;
+  *bytes = quota.dqb_curspace;
+  return 0;
+}
+
+int VSALinuxFileSystem::maintainDirectoryStatistics(const std::string& path) {
+  int fd = openNoFollow(path);
+  if (fd < 0) return errno;
+  struct stat st;
+  struct fsxattr attr {};
+  int rc = (fstat(fd, &st) == 0 && ioctl(fd, FS_IOC_FSGETXATTR, &attr) == 0) ? 0 : errno;
+  if (rc == 0) {
+    // The directory's inode number names its project: unique on this device.
+    attr.fsx_projid = static_cast<uint32_t>(st.st_ino & 0x7FFFFFFF) | 1;
+    attr.fsx_xflags |= FS_XFLAG_PROJINHERIT;
+    rc = ioctl(fd, FS_IOC_FSSETXATTR, &attr) == 0 ? 0 : errno;
+  }
+  ::close(fd);
+  return rc;
 }

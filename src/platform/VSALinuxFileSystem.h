@@ -39,6 +39,9 @@ class VSALinuxFileSystem : public VSAFileSystem {
   int setSystemContainerACL(const std::string& path, VSASystemContainerACL kind, gid_t gid) override;
   int getProtectionClass(const std::string& path, int* protectionClass) override;
   int setProtectionClass(const std::string& path, int protectionClass) override;
+  // Project quotas: a tree's statistics are its project's usage.
+  int directoryStatistics(const std::string& path, uint64_t* bytes) override;
+  int maintainDirectoryStatistics(const std::string& path) override;
 
  private:
   std::function<bool()> isLocked_;

@@ -241,3 +241,24 @@ TEST_F(FileManager, ListingHidesDotNamesAndWalkReportsEverything) {
 }
 
 }  // namespace
+
+namespace {
+
+TEST_F(FileManager, FastSizingFallsBackToTheFullWalk) {
+  file(base_ + "/Documents/a", std::string(1000, 'x'));
+  uint64_t full = fm_->diskUsageForURL(base_);
+  // The statistics query fails (as it does without project quotas): the
+  // answer is the full walk's, after one attempt to turn statistics on.
+  faults_->failAll(Op::DirectoryStatistics, ESRCH);
+  EXPECT_EQ(fm_->fastDiskUsageForURL(base_), full);
+  EXPECT_EQ(faults_->callCount(Op::MaintainStatistics), 1);
+  faults_->reset();
+  uint64_t bytes = 0;
+  auto linux = std::make_shared<VSALinuxFileSystem>();
+  if (linux->maintainDirectoryStatistics(base_) != 0 ||
+      linux->directoryStatistics(base_, &bytes) != 0)
+    GTEST_SKIP() << "this file system keeps no project quota accounting";
+  EXPECT_GT(fm_->fastDiskUsageForURL(base_), 0u);
+}
+
+}  // namespace
