@@ -75,7 +75,8 @@ int main(int argc, char** argv) {
   bool removed = fm.removeItemAtURL(base + "/b", &error);
   auto t2 = Clock::now();
   double rm = seconds(t0, t1), ourRemove = seconds(t1, t2);
-  std::printf("removal: vessad %.3fs (%s), rm -rf %.3fs\n", ourRemove, removed ? "ok" : "FAILED", rm);
+  std::printf("removal: vessad %.3fs (%s), rm -rf %.3fs\n", ourRemove, removed ? "ok" : "FAILED",
+              rm);
 
   std::printf("\n%-28s %8s %8s\n", "measure", "ratio", "target");
   std::printf("%-28s %7.2fx %7.2fx %s\n", "disk usage vs du -sb", du / ours, 0.8,

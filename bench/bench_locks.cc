@@ -31,7 +31,8 @@ static void BM_AllIdentifiersReadLockUnlock(benchmark::State& state) {
 BENCHMARK(BM_AllIdentifiersReadLockUnlock);
 
 int main(int argc, char** argv) {
-  return VSARunWithRatios(argc, argv,
-                          {{"BM_IdentifierReadLockUnlock", "BM_SharedMutexReadLockUnlock", 0.25},
-                           {"BM_AllIdentifiersReadLockUnlock", "BM_SharedMutexReadLockUnlock", 0.25}});
+  return VSARunWithRatios(
+      argc, argv,
+      {{"BM_IdentifierReadLockUnlock", "BM_SharedMutexReadLockUnlock", 0.25},
+       {"BM_AllIdentifiersReadLockUnlock", "BM_SharedMutexReadLockUnlock", 0.25}});
 }

@@ -21,51 +21,72 @@
 
 namespace {
 
-const char* kCommandNames[kVSACommandCount] = {
-    "create or look up a container", "list containers of a class", "replace a container",
-    "stage containers for deletion", "empty death row", "set a metadata info value",
-    "read a metadata info value", "read a container's metadata", "recreate default structure",
-    "regenerate directory UUID", "delete a container", "wipe data content (class 4)",
-    "delete data content", "group containers with tokens", "group container identifiers",
-    "path of a system container", "group container paths", "path of a system group container",
-    "record code-signing information", "read code-signing information",
-    "invalidate apps without bundle container", "change data protection class",
-    "recreate default structure", "disk usage of a container", "run the data migration",
-    "crash-retry test", "stage shared content", "retired", "user-managed assets path",
-    "delete a user-managed asset", "run the per-user data migration", "set or clear a test lock",
-    "persona unique strings"};
+const char* kCommandNames[kVSACommandCount] = {"create or look up a container",
+                                               "list containers of a class",
+                                               "replace a container",
+                                               "stage containers for deletion",
+                                               "empty death row",
+                                               "set a metadata info value",
+                                               "read a metadata info value",
+                                               "read a container's metadata",
+                                               "recreate default structure",
+                                               "regenerate directory UUID",
+                                               "delete a container",
+                                               "wipe data content (class 4)",
+                                               "delete data content",
+                                               "group containers with tokens",
+                                               "group container identifiers",
+                                               "path of a system container",
+                                               "group container paths",
+                                               "path of a system group container",
+                                               "record code-signing information",
+                                               "read code-signing information",
+                                               "invalidate apps without bundle container",
+                                               "change data protection class",
+                                               "recreate default structure",
+                                               "disk usage of a container",
+                                               "run the data migration",
+                                               "crash-retry test",
+                                               "stage shared content",
+                                               "retired",
+                                               "user-managed assets path",
+                                               "delete a user-managed asset",
+                                               "run the per-user data migration",
+                                               "set or clear a test lock",
+                                               "persona unique strings"};
 
 void usage(FILE* out) {
   std::fprintf(out,
-      "usage: vessactl [options] KEY[:TYPE]=VALUE ...\n"
-      "       vessactl [--root DIR] notifications\n"
-      "\n"
-      "Sends one request to vessad and prints the reply.\n"
-      "\n"
-      "options:\n"
-      "  --root DIR       system root of the daemon (default /); the socket is\n"
-      "                   DIR/run/vessad/com.tamsk.vessad\n"
-      "  --socket PATH    talk to this socket instead\n"
-      "  --file FILE      read the request from a property list or JSON file;\n"
-      "                   KEY=VALUE arguments are added on top\n"
-      "  --json           print the reply as JSON\n"
-      "  --timeout SEC    how long to wait for the reply (default 30)\n"
-      "  -h, --help       this text\n"
-      "\n"
-      "VALUE types are inferred (123 -> u64, -5 -> i64, true/false -> bool, a UUID\n"
-      "-> uuid, anything else -> str) or given as KEY:TYPE=VALUE with TYPE one of\n"
-      "u64 i64 bool str uuid real json (a JSON value, for arrays and dictionaries).\n"
-      "\n"
-      "Exit status: 0 when ReplyError is 1, 1 for any other result code,\n"
-      "2 for usage, file or connection errors.\n"
-      "\n"
-      "Commands (key Command):\n");
+               "usage: vessactl [options] KEY[:TYPE]=VALUE ...\n"
+               "       vessactl [--root DIR] notifications\n"
+               "\n"
+               "Sends one request to vessad and prints the reply.\n"
+               "\n"
+               "options:\n"
+               "  --root DIR       system root of the daemon (default /); the socket is\n"
+               "                   DIR/run/vessad/com.tamsk.vessad\n"
+               "  --socket PATH    talk to this socket instead\n"
+               "  --file FILE      read the request from a property list or JSON file;\n"
+               "                   KEY=VALUE arguments are added on top\n"
+               "  --json           print the reply as JSON\n"
+               "  --timeout SEC    how long to wait for the reply (default 30)\n"
+               "  -h, --help       this text\n"
+               "\n"
+               "VALUE types are inferred (123 -> u64, -5 -> i64, true/false -> bool, a UUID\n"
+               "-> uuid, anything else -> str) or given as KEY:TYPE=VALUE with TYPE one of\n"
+               "u64 i64 bool str uuid real json (a JSON value, for arrays and dictionaries).\n"
+               "\n"
+               "Exit status: 0 when ReplyError is 1, 1 for any other result code,\n"
+               "2 for usage, file or connection errors.\n"
+               "\n"
+               "Commands (key Command):\n");
   for (size_t i = 0; i < kVSACommandCount; ++i)
     std::fprintf(out, "  %2zu  %s%s\n", i, kCommandNames[i],
                  VSACommandTable()[i].handler ? "" : "  (not available yet)");
   std::fprintf(out,
-      "\nnotifications    print the notifications the daemon posted, oldest first\n"
-      "\nexample: vessactl --root /tmp/demo Command=0 Identifier=com.example.app ContainerClass=2\n");
+               "\nnotifications    print the notifications the daemon posted, oldest first\n"
+               "\nexample: vessactl --root /tmp/demo Command=0 Identifier=com.example.app "
+               "ContainerClass=2\n");
 }
 
 bool parseTyped(const std::string& type, const std::string& text, VSAValue& out, std::string& why) {
@@ -73,7 +94,8 @@ bool parseTyped(const std::string& type, const std::string& text, VSAValue& out,
   errno = 0;
   if (type == "u64") {
     unsigned long long v = std::strtoull(text.c_str(), &end, 0);
-    if (text.empty() || *end || errno || text[0] == '-') return why = "not an unsigned integer", false;
+    if (text.empty() || *end || errno || text[0] == '-')
+      return why = "not an unsigned integer", false;
     out = VSAValue(static_cast<uint64_t>(v));
   } else if (type == "i64") {
     long long v = std::strtoll(text.c_str(), &end, 0);
@@ -84,9 +106,12 @@ bool parseTyped(const std::string& type, const std::string& text, VSAValue& out,
     if (text.empty() || *end) return why = "not a number", false;
     out = VSAValue(v);
   } else if (type == "bool") {
-    if (text == "true" || text == "yes" || text == "1") out = VSAValue(true);
-    else if (text == "false" || text == "no" || text == "0") out = VSAValue(false);
-    else return why = "not a boolean", false;
+    if (text == "true" || text == "yes" || text == "1")
+      out = VSAValue(true);
+    else if (text == "false" || text == "no" || text == "0")
+      out = VSAValue(false);
+    else
+      return why = "not a boolean", false;
   } else if (type == "uuid") {
     auto u = VSAUUID::parse(text);
     if (!u) return why = "not a UUID", false;
@@ -110,7 +135,8 @@ VSAValue inferValue(const std::string& text) {
       parseTyped("u64", text, v, why))
     return v;
   if (text.size() > 1 && text[0] == '-' &&
-      text.find_first_not_of("0123456789", 1) == std::string::npos && parseTyped("i64", text, v, why))
+      text.find_first_not_of("0123456789", 1) == std::string::npos &&
+      parseTyped("i64", text, v, why))
     return v;
   if (text == "true" || text == "false") return VSAValue(text == "true");
   if (auto u = VSAUUID::parse(text)) return VSAValue(*u);
@@ -166,15 +192,24 @@ int main(int argc, char** argv) {
       }
       return argv[++i];
     };
-    if (a == "--root") root = next();
-    else if (a == "--socket") socketPath = next();
-    else if (a == "--file") file = next();
-    else if (a == "--json") json = true;
-    else if (a == "--timeout") timeout = std::atoi(next().c_str());
-    else if (a == "-h" || a == "--help") return usage(stdout), 0;
-    else if (a == "notifications") return printNotifications(root);
-    else if (a.find('=') != std::string::npos) pairs.push_back(a);
-    else return usage(stderr), 2;
+    if (a == "--root")
+      root = next();
+    else if (a == "--socket")
+      socketPath = next();
+    else if (a == "--file")
+      file = next();
+    else if (a == "--json")
+      json = true;
+    else if (a == "--timeout")
+      timeout = std::atoi(next().c_str());
+    else if (a == "-h" || a == "--help")
+      return usage(stdout), 0;
+    else if (a == "notifications")
+      return printNotifications(root);
+    else if (a.find('=') != std::string::npos)
+      pairs.push_back(a);
+    else
+      return usage(stderr), 2;
   }
   if (!file.empty()) {
     auto fromFile = readRequestFile(file);

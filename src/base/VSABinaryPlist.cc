@@ -4,6 +4,8 @@
 #include <cstring>
 #include <limits>
 
+#include "base/VSAPathString.h"
+
 namespace {
 
 // ---- UTF-8 / UTF-16 -------------------------------------------------------
@@ -53,24 +55,6 @@ bool utf8ToUTF16(const std::string& s, std::vector<uint16_t>& out) {
     i += extra + 1;
   }
   return true;
-}
-
-void appendUTF8(std::string& out, uint32_t cp) {
-  if (cp < 0x80) {
-    out += static_cast<char>(cp);
-  } else if (cp < 0x800) {
-    out += static_cast<char>(0xC0 | (cp >> 6));
-    out += static_cast<char>(0x80 | (cp & 0x3F));
-  } else if (cp < 0x10000) {
-    out += static_cast<char>(0xE0 | (cp >> 12));
-    out += static_cast<char>(0x80 | ((cp >> 6) & 0x3F));
-    out += static_cast<char>(0x80 | (cp & 0x3F));
-  } else {
-    out += static_cast<char>(0xF0 | (cp >> 18));
-    out += static_cast<char>(0x80 | ((cp >> 12) & 0x3F));
-    out += static_cast<char>(0x80 | ((cp >> 6) & 0x3F));
-    out += static_cast<char>(0x80 | (cp & 0x3F));
-  }
 }
 
 // ---- Encoder --------------------------------------------------------------
@@ -131,7 +115,9 @@ class Encoder {
     return index;
   }
 
-  static int bytesFor(uint64_t v) { return v <= 0xFF ? 1 : v <= 0xFFFF ? 2 : v <= 0xFFFFFFFFu ? 4 : 8; }
+  static int bytesFor(uint64_t v) {
+    return v <= 0xFF ? 1 : v <= 0xFFFF ? 2 : v <= 0xFFFFFFFFu ? 4 : 8;
+  }
 
   static void putBE(uint8_t* p, uint64_t v, int size) {
     for (int i = size - 1; i >= 0; --i) {
@@ -276,7 +262,8 @@ class Decoder {
   }
 
   bool readTrailer() {
-    if (n_ < 8 + 32 + 1 || std::memcmp(d_, "bplist0", 7) != 0) return bad("not a binary property list");
+    if (n_ < 8 + 32 + 1 || std::memcmp(d_, "bplist0", 7) != 0)
+      return bad("not a binary property list");
     size_t t = n_ - 32;
     offsetSize_ = d_[t + 6];
     refSize_ = d_[t + 7];
@@ -287,7 +274,8 @@ class Decoder {
     if (!validSize(offsetSize_) || !validSize(refSize_)) return bad("bad trailer sizes");
     if (numObjects_ == 0 || top_ >= numObjects_) return bad("bad object count");
     if (tableOffset_ < 8 || tableOffset_ > t) return bad("bad offset table position");
-    if (numObjects_ > (t - tableOffset_) / offsetSize_) return bad("offset table overruns the file");
+    if (numObjects_ > (t - tableOffset_) / offsetSize_)
+      return bad("offset table overruns the file");
     return true;
   }
 
@@ -329,10 +317,14 @@ class Decoder {
     uint8_t high = marker & 0xF0, low = marker & 0x0F;
     switch (high) {
       case 0x00:
-        if (marker == 0x00) out = VSAValue();
-        else if (marker == 0x08) out = VSAValue(false);
-        else if (marker == 0x09) out = VSAValue(true);
-        else return bad("unsupported simple value");
+        if (marker == 0x00)
+          out = VSAValue();
+        else if (marker == 0x08)
+          out = VSAValue(false);
+        else if (marker == 0x09)
+          out = VSAValue(true);
+        else
+          return bad("unsupported simple value");
         return true;
       case 0x10:
         return readInteger(pos, low, out);
@@ -342,8 +334,9 @@ class Decoder {
         if ((size != 4 && size != 8) || (high == 0x30 && size != 8)) return bad("bad real size");
         if (!fits(pos, size, 1)) return false;
         uint64_t bits = readBE(pos, size);
-        double v = size == 4 ? static_cast<double>(std::bit_cast<float>(static_cast<uint32_t>(bits)))
-                             : std::bit_cast<double>(bits);
+        double v = size == 4
+                       ? static_cast<double>(std::bit_cast<float>(static_cast<uint32_t>(bits)))
+                       : std::bit_cast<double>(bits);
         out = high == 0x20 ? VSAValue(v) : VSAValue(VSADate{v});
         return true;
       }
@@ -360,7 +353,7 @@ class Decoder {
         // that every decoded string is valid UTF-8.
         std::string s;
         s.reserve(count);
-        for (uint64_t i = 0; i < count; ++i) appendUTF8(s, d_[pos + i]);
+        for (uint64_t i = 0; i < count; ++i) VSAAppendUTF8(s, d_[pos + i]);
         out = VSAValue(std::move(s));
         return true;
       }
@@ -385,9 +378,12 @@ class Decoder {
       if (*out.int64Value() >= 0) out = VSAValue(*out.uint64Value());
     } else {
       uint64_t hi = readBE(pos, 8), lo = readBE(pos + 8, 8);
-      if (hi == 0) out = VSAValue(lo);
-      else if (hi == ~0ull && (lo >> 63)) out = VSAValue(static_cast<int64_t>(lo));
-      else return bad("integer out of range");
+      if (hi == 0)
+        out = VSAValue(lo);
+      else if (hi == ~0ull && (lo >> 63))
+        out = VSAValue(static_cast<int64_t>(lo));
+      else
+        return bad("integer out of range");
     }
     return true;
   }
@@ -408,7 +404,7 @@ class Decoder {
       } else if (u >= 0xDC00 && u <= 0xDFFF) {
         return bad("unpaired surrogate");
       }
-      appendUTF8(s, u);
+      VSAAppendUTF8(s, u);
     }
     out = VSAValue(std::move(s));
     return true;

@@ -63,8 +63,8 @@ class VSAError {
   // A POSIX-domain error for an errno value.
   static VSAErrorRef posix(int err, const char* function, uint64_t line, std::string message = {});
   // An error of any domain (used for the general domain's property-list codes).
-  static VSAErrorRef inDomain(const char* domain, int64_t code, const char* function,
-                              uint64_t line, std::string message);
+  static VSAErrorRef inDomain(const char* domain, int64_t code, const char* function, uint64_t line,
+                              std::string message);
 
   const std::string& domain() const { return domain_; }
   int64_t code() const { return code_; }

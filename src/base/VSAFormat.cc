@@ -89,11 +89,12 @@ std::string VSAFormatArgs(std::string_view format, const std::vector<VSAFormatAr
       i = close == std::string_view::npos ? format.size() : close + 1;
     }
     std::string flags;
-    while (i < format.size() && std::string_view("-+ #0123456789.").find(format[i]) !=
-                                    std::string_view::npos) {
+    while (i < format.size() &&
+           std::string_view("-+ #0123456789.").find(format[i]) != std::string_view::npos) {
       flags += format[i++];
     }
-    while (i < format.size() && std::string_view("hlqLjzt").find(format[i]) != std::string_view::npos) {
+    while (i < format.size() &&
+           std::string_view("hlqLjzt").find(format[i]) != std::string_view::npos) {
       ++i;
     }
     if (i >= format.size()) break;

@@ -72,7 +72,10 @@ VSAFormatArg makeArg(const T& value) {
     }
     a.pointer = value;
     if constexpr (!VSADescribable<P>) a.kind = VSAFormatArg::Kind::Pointer;
-  } else if constexpr (requires { value.get(); *value; }) {  // shared_ptr / unique_ptr
+  } else if constexpr (requires {
+                         value.get();
+                         *value;
+                       }) {  // shared_ptr / unique_ptr
     a.pointer = value.get();
     a.text = value ? makeArg(*value).text : "(null)";
   } else if constexpr (std::is_same_v<D, std::nullptr_t>) {

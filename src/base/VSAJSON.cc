@@ -4,6 +4,8 @@
 #include <cstdio>
 #include <cstdlib>
 
+#include "base/VSAPathString.h"
+
 namespace {
 
 class Parser {
@@ -61,7 +63,8 @@ class Parser {
     size_t start = i_;
     if (i_ < t_.size() && t_[i_] == '-') ++i_;
     bool real = false;
-    while (i_ < t_.size() && std::string_view("0123456789.eE+-").find(t_[i_]) != std::string_view::npos) {
+    while (i_ < t_.size() &&
+           std::string_view("0123456789.eE+-").find(t_[i_]) != std::string_view::npos) {
       if (t_[i_] == '.' || t_[i_] == 'e' || t_[i_] == 'E') real = true;
       ++i_;
     }
@@ -90,29 +93,16 @@ class Parser {
     for (int k = 0; k < 4; ++k) {
       char c = t_[i_++];
       v <<= 4;
-      if (c >= '0' && c <= '9') v |= c - '0';
-      else if (c >= 'a' && c <= 'f') v |= c - 'a' + 10;
-      else if (c >= 'A' && c <= 'F') v |= c - 'A' + 10;
-      else return bad("bad \\u escape");
+      if (c >= '0' && c <= '9')
+        v |= c - '0';
+      else if (c >= 'a' && c <= 'f')
+        v |= c - 'a' + 10;
+      else if (c >= 'A' && c <= 'F')
+        v |= c - 'A' + 10;
+      else
+        return bad("bad \\u escape");
     }
     return true;
-  }
-  static void utf8(std::string& s, uint32_t cp) {
-    if (cp < 0x80) {
-      s += static_cast<char>(cp);
-    } else if (cp < 0x800) {
-      s += static_cast<char>(0xC0 | (cp >> 6));
-      s += static_cast<char>(0x80 | (cp & 0x3F));
-    } else if (cp < 0x10000) {
-      s += static_cast<char>(0xE0 | (cp >> 12));
-      s += static_cast<char>(0x80 | ((cp >> 6) & 0x3F));
-      s += static_cast<char>(0x80 | (cp & 0x3F));
-    } else {
-      s += static_cast<char>(0xF0 | (cp >> 18));
-      s += static_cast<char>(0x80 | ((cp >> 12) & 0x3F));
-      s += static_cast<char>(0x80 | ((cp >> 6) & 0x3F));
-      s += static_cast<char>(0x80 | (cp & 0x3F));
-    }
   }
   bool string(std::string& s) {
     ++i_;  // opening quote
@@ -127,14 +117,30 @@ class Parser {
       if (i_ >= t_.size()) break;
       char e = t_[i_++];
       switch (e) {
-        case '"': s += '"'; break;
-        case '\\': s += '\\'; break;
-        case '/': s += '/'; break;
-        case 'b': s += '\b'; break;
-        case 'f': s += '\f'; break;
-        case 'n': s += '\n'; break;
-        case 'r': s += '\r'; break;
-        case 't': s += '\t'; break;
+        case '"':
+          s += '"';
+          break;
+        case '\\':
+          s += '\\';
+          break;
+        case '/':
+          s += '/';
+          break;
+        case 'b':
+          s += '\b';
+          break;
+        case 'f':
+          s += '\f';
+          break;
+        case 'n':
+          s += '\n';
+          break;
+        case 'r':
+          s += '\r';
+          break;
+        case 't':
+          s += '\t';
+          break;
         case 'u': {
           uint32_t cp;
           if (!hex4(cp)) return false;
@@ -147,7 +153,7 @@ class Parser {
           } else if (cp >= 0xDC00 && cp <= 0xDFFF) {
             return bad("unpaired surrogate");
           }
-          utf8(s, cp);
+          VSAAppendUTF8(s, cp);
           break;
         }
         default:
@@ -225,11 +231,21 @@ void quote(std::string& out, const std::string& s) {
   out += '"';
   for (unsigned char c : s) {
     switch (c) {
-      case '"': out += "\\\""; break;
-      case '\\': out += "\\\\"; break;
-      case '\n': out += "\\n"; break;
-      case '\r': out += "\\r"; break;
-      case '\t': out += "\\t"; break;
+      case '"':
+        out += "\\\"";
+        break;
+      case '\\':
+        out += "\\\\";
+        break;
+      case '\n':
+        out += "\\n";
+        break;
+      case '\r':
+        out += "\\r";
+        break;
+      case '\t':
+        out += "\\t";
+        break;
       default:
         if (c < 0x20) {
           char buf[8];
@@ -247,10 +263,18 @@ void print(std::string& out, const VSAValue& v, bool pretty, int indent) {
   std::string nl = pretty ? "\n" + std::string((indent + 1) * 2, ' ') : "";
   std::string end = pretty ? "\n" + std::string(indent * 2, ' ') : "";
   switch (v.type()) {
-    case VSAValue::Type::Null: out += "null"; break;
-    case VSAValue::Type::Bool: out += *v.boolValue() ? "true" : "false"; break;
-    case VSAValue::Type::Int: out += std::to_string(*v.int64Value()); break;
-    case VSAValue::Type::UInt: out += std::to_string(*v.uint64Value()); break;
+    case VSAValue::Type::Null:
+      out += "null";
+      break;
+    case VSAValue::Type::Bool:
+      out += *v.boolValue() ? "true" : "false";
+      break;
+    case VSAValue::Type::Int:
+      out += std::to_string(*v.int64Value());
+      break;
+    case VSAValue::Type::UInt:
+      out += std::to_string(*v.uint64Value());
+      break;
     case VSAValue::Type::Real: {
       double d = *v.doubleValue();
       if (!std::isfinite(d)) {
@@ -262,8 +286,12 @@ void print(std::string& out, const VSAValue& v, bool pretty, int indent) {
       out += buf;
       break;
     }
-    case VSAValue::Type::String: quote(out, *v.stringValue()); break;
-    case VSAValue::Type::UUID: quote(out, v.uuidValue()->string()); break;
+    case VSAValue::Type::String:
+      quote(out, *v.stringValue());
+      break;
+    case VSAValue::Type::UUID:
+      quote(out, v.uuidValue()->string());
+      break;
     case VSAValue::Type::Data: {
       static const char* hex = "0123456789abcdef";
       out += "{\"$data\": \"";

@@ -28,20 +28,34 @@ const char* VSALogger::subsystemName(VSALogCategory category) {
 
 const char* VSALogger::categoryName(VSALogCategory category) {
   switch (category) {
-    case VSALogCategory::Unspecified: return "unspecified";
-    case VSALogCategory::Cache: return "cache";
-    case VSALogCategory::Sandbox: return "sandbox";
-    case VSALogCategory::Relay: return "relay";
-    case VSALogCategory::Locking: return "locking";
-    case VSALogCategory::Database: return "database";
-    case VSALogCategory::Upcall: return "upcall";
-    case VSALogCategory::Lifecycle: return "lifecycle";
-    case VSALogCategory::FS: return "fs";
-    case VSALogCategory::Startup: return "startup";
-    case VSALogCategory::Test: return "test";
-    case VSALogCategory::Metadata: return "metadata";
-    case VSALogCategory::CodeSignMapping: return "codesignmapping";
-    case VSALogCategory::Daemon: return "daemon";
+    case VSALogCategory::Unspecified:
+      return "unspecified";
+    case VSALogCategory::Cache:
+      return "cache";
+    case VSALogCategory::Sandbox:
+      return "sandbox";
+    case VSALogCategory::Relay:
+      return "relay";
+    case VSALogCategory::Locking:
+      return "locking";
+    case VSALogCategory::Database:
+      return "database";
+    case VSALogCategory::Upcall:
+      return "upcall";
+    case VSALogCategory::Lifecycle:
+      return "lifecycle";
+    case VSALogCategory::FS:
+      return "fs";
+    case VSALogCategory::Startup:
+      return "startup";
+    case VSALogCategory::Test:
+      return "test";
+    case VSALogCategory::Metadata:
+      return "metadata";
+    case VSALogCategory::CodeSignMapping:
+      return "codesignmapping";
+    case VSALogCategory::Daemon:
+      return "daemon";
   }
   return "unspecified";
 }
@@ -66,10 +80,12 @@ void VSALogger::enableDiskLogging(int diskLevel, size_t sizeLimit) {
   std::lock_guard lock(mutex_);
   if (!file_) return;
   // Re-create the sink with the requested size limit on the same file.
-  auto old = std::dynamic_pointer_cast<spdlog::sinks::rotating_file_sink_mt>(file_->sinks().front());
+  auto old =
+      std::dynamic_pointer_cast<spdlog::sinks::rotating_file_sink_mt>(file_->sinks().front());
   if (old) {
     try {
-      auto sink = std::make_shared<spdlog::sinks::rotating_file_sink_mt>(old->filename(), sizeLimit, 3);
+      auto sink =
+          std::make_shared<spdlog::sinks::rotating_file_sink_mt>(old->filename(), sizeLimit, 3);
       file_->sinks().front() = sink;
       file_->set_pattern("%Y-%m-%d %H:%M:%S.%e %v");
     } catch (const std::exception&) {
@@ -95,11 +111,16 @@ void VSALogger::flush() {
 namespace {
 const char* levelName(int level) {
   switch (level) {
-    case kVSALogFault: return "Fault";
-    case kVSALogError: return "Error";
-    case kVSALogNotice: return "Notice";
-    case kVSALogInfo: return "Info";
-    default: return "Debug";
+    case kVSALogFault:
+      return "Fault";
+    case kVSALogError:
+      return "Error";
+    case kVSALogNotice:
+      return "Notice";
+    case kVSALogInfo:
+      return "Info";
+    default:
+      return "Debug";
   }
 }
 }  // namespace

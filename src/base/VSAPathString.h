@@ -2,6 +2,7 @@
 #pragma once
 
 #include <cstddef>
+#include <cstdint>
 #include <string>
 #include <string_view>
 
@@ -12,6 +13,9 @@ bool containsDotDotPathComponents(std::string_view path);
 // the bytes are taken as they are (up to the first NUL in the first form).
 std::string stringWithFileSystemRepresentation(const char* bytes);
 std::string stringWithFileSystemRepresentation(const char* bytes, size_t length);
+
+// Appends the UTF-8 encoding of code point `cp` (at most U+10FFFF).
+void VSAAppendUTF8(std::string& out, uint32_t cp);
 
 // Joins two path pieces with exactly one '/' between them.
 std::string VSAPathJoin(std::string_view base, std::string_view component);

@@ -33,9 +33,9 @@ plist_t toPlistNode(const VSAValue& v) {
     case VSAValue::Type::Date: {
       // libplist counts dates from the same 2001 reference date.
       double s = v.dateValue()->secondsSinceReferenceDate;
-      double whole = s < 0 ? -static_cast<double>(static_cast<int64_t>(-s)) : static_cast<int64_t>(s);
-      return plist_new_date(static_cast<int32_t>(whole),
-                            static_cast<int32_t>((s - whole) * 1e6));
+      double whole =
+          s < 0 ? -static_cast<double>(static_cast<int64_t>(-s)) : static_cast<int64_t>(s);
+      return plist_new_date(static_cast<int32_t>(whole), static_cast<int32_t>((s - whole) * 1e6));
     }
     case VSAValue::Type::UUID:
       return plist_new_string(v.uuidValue()->string().c_str());
@@ -46,7 +46,8 @@ plist_t toPlistNode(const VSAValue& v) {
     }
     case VSAValue::Type::Dictionary: {
       plist_t d = plist_new_dict();
-      for (const auto& [k, c] : *v.dictionaryValue()) plist_dict_set_item(d, k.c_str(), toPlistNode(c));
+      for (const auto& [k, c] : *v.dictionaryValue())
+        plist_dict_set_item(d, k.c_str(), toPlistNode(c));
       return d;
     }
   }
@@ -88,7 +89,8 @@ bool fromPlistNode(plist_t node, int depth, VSAValue& out) {
       char* p = nullptr;
       uint64_t n = 0;
       plist_get_data_val(node, &p, &n);
-      out = VSAValue(VSAValue::Data(reinterpret_cast<uint8_t*>(p), reinterpret_cast<uint8_t*>(p) + n));
+      out = VSAValue(
+          VSAValue::Data(reinterpret_cast<uint8_t*>(p), reinterpret_cast<uint8_t*>(p) + n));
       free(p);
       return true;
     }
@@ -139,8 +141,10 @@ bool fromPlistNode(plist_t node, int depth, VSAValue& out) {
 
 VSAErrorRef parseError(const std::string& why) {
   return VSAError::inDomain(kVSACocoaErrorDomain, kVSAPropertyListReadCorruptError, __func__,
-                            __LINE__, "The data couldn't be read because it isn't in the correct "
-                            "format (" + why + ").");
+                            __LINE__,
+                            "The data couldn't be read because it isn't in the correct "
+                            "format (" +
+                                why + ").");
 }
 
 }  // namespace
@@ -276,9 +280,9 @@ std::optional<VSAValue> VSA_dictionaryWithContentsOfURL(const std::string& path,
   auto value = VSAPlist::parse(*bytes, error);
   if (!value) return std::nullopt;
   if (!value->isDictionary()) {
-    VSASetError(error, VSAError::inDomain(kVSACocoaErrorDomain, kVSAFileReadCorruptFileError,
-                                          __func__, __LINE__,
-                                          "The file isn't in the correct format."));
+    VSASetError(error,
+                VSAError::inDomain(kVSACocoaErrorDomain, kVSAFileReadCorruptFileError, __func__,
+                                   __LINE__, "The file isn't in the correct format."));
     return std::nullopt;
   }
   return value;

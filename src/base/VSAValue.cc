@@ -66,7 +66,9 @@ std::optional<VSADate> VSAValue::dateValue() const {
 const std::string* VSAValue::stringValue() const { return std::get_if<std::string>(&v_); }
 const VSAValue::Data* VSAValue::dataValue() const { return std::get_if<Data>(&v_); }
 const VSAValue::Array* VSAValue::arrayValue() const { return std::get_if<Array>(&v_); }
-const VSAValue::Dictionary* VSAValue::dictionaryValue() const { return std::get_if<Dictionary>(&v_); }
+const VSAValue::Dictionary* VSAValue::dictionaryValue() const {
+  return std::get_if<Dictionary>(&v_);
+}
 VSAValue::Array* VSAValue::mutableArray() { return std::get_if<Array>(&v_); }
 VSAValue::Dictionary* VSAValue::mutableDictionary() { return std::get_if<Dictionary>(&v_); }
 

@@ -140,8 +140,8 @@ VSAWorkQueue::Ref VSAWorkQueue::create(std::string label, Kind kind, Ref target)
 }
 
 VSAWorkQueue::Ref VSAWorkQueue::global(Priority priority) {
-  static auto* def = new Ref(std::make_shared<VSAWorkQueue>("com.tamsk.vessad.global.default",
-                                                            Kind::Concurrent, nullptr, &defaultPool()));
+  static auto* def = new Ref(std::make_shared<VSAWorkQueue>(
+      "com.tamsk.vessad.global.default", Kind::Concurrent, nullptr, &defaultPool()));
   static auto* bg = new Ref(std::make_shared<VSAWorkQueue>(
       "com.tamsk.vessad.global.background", Kind::Concurrent, nullptr, &backgroundPool()));
   return priority == Priority::Background ? *bg : *def;

@@ -20,8 +20,8 @@ VSAClientConnection::VSAClientConnection(VSADaemonContext& context,
 std::unique_ptr<VSAClientConnection> VSAClientConnection::sharedClientConnection(
     VSADaemonContext& context) {
   return std::make_unique<VSAClientConnection>(
-      context, VSAClientIdentity::anonymousPrivilegedClientIdentity(*context.userIdentityCache), true, true, true,
-      std::nullopt, std::nullopt, std::make_shared<VSACommandQueue>());
+      context, VSAClientIdentity::anonymousPrivilegedClientIdentity(*context.userIdentityCache),
+      true, true, true, std::nullopt, std::nullopt, std::make_shared<VSACommandQueue>());
 }
 
 bool VSAClientConnection::completeWithError(VSAResultCode* error) {

@@ -40,7 +40,9 @@ class VSAClientConnection {
   bool allowGroupIdLookup() const { return allowGroupIdLookup_; }
   bool unrestricted() const { return unrestricted_; }
   const std::optional<VSAValue>& lookup() const { return lookup_; }
-  const std::optional<VSAValue>& entitledWipeIdentifiers() const { return entitledWipeIdentifiers_; }
+  const std::optional<VSAValue>& entitledWipeIdentifiers() const {
+    return entitledWipeIdentifiers_;
+  }
   const std::shared_ptr<VSACommandQueue>& commandQueue() const { return commandQueue_; }
   void setUnrestricted(bool v) { unrestricted_ = v; }
   void setAllowOtherIdLookup(bool v) { allowOtherIdLookup_ = v; }

@@ -28,8 +28,8 @@ VSAClientIdentityRef VSAClientIdentity::clientIdentityWithRelayConnection(
   const VSAAuditToken& token = connection.auditToken();
   auto entry = registry.entryForAuditToken(token);
   if (!entry) {
-    VSALogIn(VSALogCategory::Relay, kVSALogError, __func__, "Failed to copy signing ID for pid %d : %@",
-             token.pid, "no client registry entry");
+    VSALogIn(VSALogCategory::Relay, kVSALogError, __func__,
+             "Failed to copy signing ID for pid %d : %@", token.pid, "no client registry entry");
     return nullptr;
   }
   auto tokenBytes = token.bytes();
@@ -52,8 +52,8 @@ VSAClientIdentityRef VSAClientIdentity::clientIdentityWithRelayConnection(
     std::lock_guard lock(gInstallerCacheLock);
     gInstallerIdentity = identity;
   }
-  VSALogIn(VSALogCategory::Relay, kVSALogInfo, __func__, "[%s] Relay client identity: %@",
-           __func__, identity);
+  VSALogIn(VSALogCategory::Relay, kVSALogInfo, __func__, "[%s] Relay client identity: %@", __func__,
+           identity);
   return identity;
 }
 
@@ -64,7 +64,8 @@ VSAClientIdentityRef VSAClientIdentity::privilegedClientIdentityWithUserIdentity
                                                    std::array<uint8_t, 32>{}, kernel);
 }
 
-VSAClientIdentityRef VSAClientIdentity::anonymousPrivilegedClientIdentity(VSAUserIdentityCache& cache) {
+VSAClientIdentityRef VSAClientIdentity::anonymousPrivilegedClientIdentity(
+    VSAUserIdentityCache& cache) {
   return privilegedClientIdentityWithUserIdentity(cache.defaultUserIdentity(), false);
 }
 
@@ -79,7 +80,8 @@ bool VSAClientIdentity::boolValueOfEntitlement(const std::string& name) const {
 }
 
 std::string VSAClientIdentity::description() const {
-  return VSAFormat("<VSAClientIdentity: uid = %u, gid = %u, pid = %d, sandboxed = %d, "
-                   "bundleIdentifier = %@>",
-                   uid_, gid_, pid_, sandboxed_, bundleIdentifier_);
+  return VSAFormat(
+      "<VSAClientIdentity: uid = %u, gid = %u, pid = %d, sandboxed = %d, "
+      "bundleIdentifier = %@>",
+      uid_, gid_, pid_, sandboxed_, bundleIdentifier_);
 }

@@ -21,8 +21,8 @@ const std::array<VSACommandTableEntry, kVSACommandCount> kTable = {{
     {8, nullptr, allowed, R, _, _},   // recreate a container's default structure
     {9, nullptr, allowed, R, _, _},   // regenerate a container's directory UUID
     {10, nullptr, allowed, R, _, _},  // delete a container
-    {11, nullptr, kVSAEntitlementWipeContainer, R, _, _},            // wipe data of class 4
-    {12, nullptr, kVSAEntitlementDeleteContainerContent, R, _, _},   // delete data content
+    {11, nullptr, kVSAEntitlementWipeContainer, R, _, _},           // wipe data of class 4
+    {12, nullptr, kVSAEntitlementDeleteContainerContent, R, _, _},  // delete data content
     {13, nullptr, allowed, R, O, L},  // group containers with tokens and personas
     {14, nullptr, allowed, R, _, L},  // group container identifiers of an owner
     {15, nullptr, allowed, R, O, L},  // path of a system container
@@ -38,9 +38,9 @@ const std::array<VSACommandTableEntry, kVSACommandCount> kTable = {{
     {25, nullptr, testability, R, _, _},                        // crash-retry test
     {26, nullptr, kVSAEntitlementStageSharedContent, R, _, _},  // stage shared content
     {27, VSAHandleRetiredCommand, allowed, R, _, _},            // retired
-    {28, nullptr, uma, R, O, _},      // path of a user-managed assets directory
-    {29, nullptr, uma, R, _, _},      // delete a user-managed asset
-    {30, nullptr, allowed, R, _, _},  // per-user data migration
+    {28, nullptr, uma, R, O, _},          // path of a user-managed assets directory
+    {29, nullptr, uma, R, _, _},          // delete a user-managed asset
+    {30, nullptr, allowed, R, _, _},      // per-user data migration
     {31, nullptr, testability, R, _, _},  // set or clear a test lock
     {32, VSAHandlePersonaUniqueStrings, allowed, R, O, L},  // persona unique strings
 }};

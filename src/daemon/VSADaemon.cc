@@ -26,7 +26,8 @@ void makeRunDirectory(const std::string& path) {
 VSADaemon::VSADaemon(Options options)
     : options_(std::move(options)),
       context_(std::make_unique<VSADaemonContext>(VSASystemRoot(options_.root))) {
-  firstBootSemaphore_ = VSANamedSemaphore::nameForRoot(kVSAFirstBootSemaphore, context_->systemRoot);
+  firstBootSemaphore_ =
+      VSANamedSemaphore::nameForRoot(kVSAFirstBootSemaphore, context_->systemRoot);
   VSALogger::shared().setLevel(options_.logLevel);
 }
 
@@ -103,11 +104,12 @@ bool VSADaemon::isFirstBoot() {
 void VSADaemon::initialize() {
   VSASignpostInterval startingUp(VSALogCategory::Startup, "StartingUp");
   openLogs();
-  context_->deathrowQueue = VSAWorkQueue::create(
-      "com.tamsk.vessad.deathrow", VSAWorkQueue::Kind::Serial,
-      VSAWorkQueue::global(VSAWorkQueue::Priority::Background));
+  context_->deathrowQueue =
+      VSAWorkQueue::create("com.tamsk.vessad.deathrow", VSAWorkQueue::Kind::Serial,
+                           VSAWorkQueue::global(VSAWorkQueue::Priority::Background));
   context_->lockStateQueue = VSAWorkQueue::create("com.tamsk.vessad.lockstate");
-  if (!context_->deathrowQueue || !context_->lockStateQueue) VSACrash("Can't create dispatch queues.");
+  if (!context_->deathrowQueue || !context_->lockStateQueue)
+    VSACrash("Can't create dispatch queues.");
   sharedConnection_ = VSAClientConnection::sharedClientConnection(*context_);
 
   bool firstBoot = isFirstBoot();
@@ -122,9 +124,8 @@ void VSADaemon::initialize() {
   // The kernel upcall interface is started here once its server exists.
 
   lockStateMonitor_ = std::make_unique<VSALockStateMonitor>(
-      context_->lockStateQueue, [lockState = context_->lockState] {
-        return lockState->currentLockState();
-      });
+      context_->lockStateQueue,
+      [lockState = context_->lockState] { return lockState->currentLockState(); });
   int status = context_->lockState->registerForLockStatus(
       VSAWorkQueue::main(), [monitor = lockStateMonitor_.get()] { monitor->lockStateDidChange(); });
   if (status != 0)
@@ -132,7 +133,8 @@ void VSADaemon::initialize() {
              "notify_register_dispatch for notification \"%s\" failed; returned %d\n",
              kVSALockStatusNotification, status);
   // The callback belongs to the main queue; run this first call there too.
-  VSAWorkQueue::main()->sync([monitor = lockStateMonitor_.get()] { monitor->lockStateDidChange(); });
+  VSAWorkQueue::main()->sync(
+      [monitor = lockStateMonitor_.get()] { monitor->lockStateDidChange(); });
   startCleanups(firstBoot);
 }
 

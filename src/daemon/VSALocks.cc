@@ -137,8 +137,8 @@ LockTable gVSALocks;
   std::abort();
 }
 
-#define VSA_LOCK_ASSERT(condition) \
-  do {                             \
+#define VSA_LOCK_ASSERT(condition)                           \
+  do {                                                       \
     if (!(condition)) assertionFailed(__func__, #condition); \
   } while (0)
 
@@ -193,7 +193,8 @@ void take_one_lock(const std::string& key, bool writing) {
     pthread_rwlock_rdlock(&lockPtr->lock);
     VSA_LOCK_ASSERT(atomic_fetch_add(&lockPtr->lockState, 1) >= 0);
   }
-  VSALogIn(VSALogCategory::Locking, kVSALogDebug, "take_one_lock", "Got lock on identifier %@", key);
+  VSALogIn(VSALogCategory::Locking, kVSALogDebug, "take_one_lock", "Got lock on identifier %@",
+           key);
 }
 
 bool allCountersZero() {
@@ -270,8 +271,7 @@ void _lock_all_identifiers(bool writing) {
            "Waiting to lock all identifiers for %s", mode(writing));
   pthread_mutex_lock(&gVSALocks.mutex);
   if (writing) {
-    while (!allCountersZero())
-      gVSALocks.globalWriterCondition.wait(&gVSALocks.mutex);
+    while (!allCountersZero()) gVSALocks.globalWriterCondition.wait(&gVSALocks.mutex);
     gVSALocks.allReaderWriterState = -1;
   } else {
     while (gVSALocks.identifierWriterCount != 0 || gVSALocks.allReaderWriterState == -1)
@@ -301,8 +301,7 @@ void unlock_all_identifiers() {
   if (gVSALocks.allReaderWriterState != -1) {
     VSA_LOCK_ASSERT(gVSALocks.allReaderWriterState > 0);
     --gVSALocks.allReaderWriterState;
-    if (gVSALocks.allReaderWriterState == 0)
-      gVSALocks.identifierWriterCondition.broadcast();
+    if (gVSALocks.allReaderWriterState == 0) gVSALocks.identifierWriterCondition.broadcast();
     if (allCountersZero()) gVSALocks.globalWriterCondition.signal();
   } else {
     gVSALocks.allReaderWriterState = 0;

@@ -11,8 +11,8 @@ constexpr const char* kOrigin = "VSAProcessRelayEvent";
 VSARelayDispatcher::VSARelayDispatcher(VSADaemonContext& context)
     : VSARelayDispatcher(context, VSACommandTable().data(), VSACommandTable().size()) {}
 
-VSARelayDispatcher::VSARelayDispatcher(VSADaemonContext& context,
-                                       const VSACommandTableEntry* table, size_t count)
+VSARelayDispatcher::VSARelayDispatcher(VSADaemonContext& context, const VSACommandTableEntry* table,
+                                       size_t count)
     : context_(context), table_(table), count_(count) {}
 
 bool VSARelayDispatcher::readCommand(const VSAValue& request, uint64_t& command) {
@@ -52,7 +52,8 @@ void VSARelayDispatcher::processRelayEvent(const VSAIPCMessageRef& message) {
   VSAResultCode result = VSAResult::kSuccess;
   auto reply = message->createReply();
   if (!reply) {
-    VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin, "Dictionary does not have reply context");
+    VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin,
+             "Dictionary does not have reply context");
     VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin, "Cancelling %@: %s",
              message->connection()->description(), message->problem());
     message->connection()->cancel();
@@ -104,7 +105,7 @@ void VSARelayDispatcher::processRelayEvent(const VSAIPCMessageRef& message) {
   reply->set(kVSAReplyErrorKey, VSAValue(result));
   VSAErrorRef error;
   if (!message->sendReply(*reply, &error)) {
-    VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin, "Failed to send reply for command %llu: %@",
-             command, error);
+    VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin,
+             "Failed to send reply for command %llu: %@", command, error);
   }
 }

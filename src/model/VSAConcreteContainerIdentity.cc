@@ -15,9 +15,8 @@ VSAConcreteContainerIdentityRef VSAConcreteContainerIdentity::containerIdentityW
     VSASetCode(error, VSAResult::kInvalidArgument);
     return nullptr;
   }
-  return std::make_shared<const VSAConcreteContainerIdentity>(*parsed, userIdentity,
-                                                              *identifier->stringValue(),
-                                                              containerClass);
+  return std::make_shared<const VSAConcreteContainerIdentity>(
+      *parsed, userIdentity, *identifier->stringValue(), containerClass);
 }
 
 VSAConcreteContainerIdentityRef VSAConcreteContainerIdentity::containerIdentityWithUUID(

@@ -2,10 +2,11 @@
 
 namespace {
 const char* const kPathComponents[] = {
-    "Undefined",         "Bundle/Application", "Data/Application",  "Bundle/PlexaPlugin",
-    "Data/PlexaPlugin",  "Bundle/VPNPlugin",   "Data/VPNPlugin",    "Shared/AppGroup",
-    "Bundle/Framework",  "Data/RelayService",  "Data/InternalDaemon", "Data/TempDir",
-    "Data/System",       "Shared/SystemGroup", "MAX"};
+    "Undefined",          "Bundle/Application",  "Data/Application",
+    "Bundle/PlexaPlugin", "Data/PlexaPlugin",    "Bundle/VPNPlugin",
+    "Data/VPNPlugin",     "Shared/AppGroup",     "Bundle/Framework",
+    "Data/RelayService",  "Data/InternalDaemon", "Data/TempDir",
+    "Data/System",        "Shared/SystemGroup",  "MAX"};
 }
 
 const char* VSAContainerClassPathComponent(VSAContainerClass c) {
@@ -21,5 +22,6 @@ bool VSAContainerClassIsSystem(VSAContainerClass c) { return c == 12 || c == 13;
 bool VSAContainerClassIsGroup(VSAContainerClass c) { return c == 7 || c == 13; }
 
 bool VSAContainerClassIsPerUser(VSAContainerClass c) {
-  return VSAContainerClassIsValid(c) && !VSAContainerClassIsBundle(c) && !VSAContainerClassIsSystem(c);
+  return VSAContainerClassIsValid(c) && !VSAContainerClassIsBundle(c) &&
+         !VSAContainerClassIsSystem(c);
 }

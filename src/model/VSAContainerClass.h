@@ -12,8 +12,9 @@
 // functions; thread-safe.
 #pragma once
 
-#include <cstdint>
 #include <sys/types.h>
+
+#include <cstdint>
 
 using VSAContainerClass = uint64_t;
 
@@ -26,8 +27,8 @@ inline constexpr VSAContainerClass kVSAContainerClassMax = 13;
 
 // "Bundle/Application" ...; only for 0..14.
 const char* VSAContainerClassPathComponent(VSAContainerClass containerClass);
-bool VSAContainerClassIsValid(VSAContainerClass c);   // 1..13
-bool VSAContainerClassIsBundle(VSAContainerClass c);  // 1, 3, 5, 8
-bool VSAContainerClassIsSystem(VSAContainerClass c);  // 12, 13
-bool VSAContainerClassIsPerUser(VSAContainerClass c); // 2, 4, 6, 7, 9, 10, 11
-bool VSAContainerClassIsGroup(VSAContainerClass c);   // 7, 13
+bool VSAContainerClassIsValid(VSAContainerClass c);    // 1..13
+bool VSAContainerClassIsBundle(VSAContainerClass c);   // 1, 3, 5, 8
+bool VSAContainerClassIsSystem(VSAContainerClass c);   // 12, 13
+bool VSAContainerClassIsPerUser(VSAContainerClass c);  // 2, 4, 6, 7, 9, 10, 11
+bool VSAContainerClassIsGroup(VSAContainerClass c);    // 7, 13

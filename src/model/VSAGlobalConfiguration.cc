@@ -47,7 +47,8 @@ std::string VSAGlobalConfiguration::bundleDirectory() {
 
 std::string VSAGlobalConfiguration::transientBundleDirectory() {
   return ensureDirectory(VSAPathJoin(sharedContainersDirectory(), "Temp"), 33,
-                         kVSANoProtectionClass, "Failed to create transient bundle dir at \"%@\": %@");
+                         kVSANoProtectionClass,
+                         "Failed to create transient bundle dir at \"%@\": %@");
 }
 
 std::string VSAGlobalConfiguration::libraryDirectory() {
@@ -141,7 +142,8 @@ bool VSAGlobalConfiguration::migrationFileExistsWithName(const std::string& name
   return fileManager_->itemExistsAtURL(VSAPathJoin(libraryDirectory(), name));
 }
 
-std::shared_ptr<VSAPerUserConfiguration> VSAGlobalConfiguration::getPerUserConfigurationForUserIdentity(
+std::shared_ptr<VSAPerUserConfiguration>
+VSAGlobalConfiguration::getPerUserConfigurationForUserIdentity(
     const VSAUserIdentityRef& userIdentity) {
   if (!userIdentity) return nullptr;
   std::lock_guard lock(perUserMutex_);

@@ -23,8 +23,10 @@ std::string parentOf(const std::string& path) {
 }
 
 template <typename... A>
-VSAMetadataRef invalid(VSAErrorRef* error, VSAResultCode code, const char* format, const A&... args) {
-  auto e = VSAError::make(code, nullptr, "readAndValidateMetadataAtFileUrl", __LINE__, format, args...);
+VSAMetadataRef invalid(VSAErrorRef* error, VSAResultCode code, const char* format,
+                       const A&... args) {
+  auto e =
+      VSAError::make(code, nullptr, "readAndValidateMetadataAtFileUrl", __LINE__, format, args...);
   VSALogIn(VSALogCategory::Metadata, kVSALogError, "readAndValidateMetadataAtFileUrl", "%@",
            e->message());
   VSASetError(error, e);
@@ -71,13 +73,15 @@ bool VSAMetadata::writeMetadataToDiskWithError(VSAGlobalConfiguration& configura
 }
 
 bool VSAMetadata::writeMetadataToFileURL(const std::string& fileURL,
-                                         VSAGlobalConfiguration& configuration, VSAErrorRef* error) {
+                                         VSAGlobalConfiguration& configuration,
+                                         VSAErrorRef* error) {
   const char* fn = "writeMetadataToFileURL";
   VSAValue dict = plist();
-  std::string staging = configuration.stagingDirectoryURLForUserIdentity(userIdentity(), containerClass());
+  std::string staging =
+      configuration.stagingDirectoryURLForUserIdentity(userIdentity(), containerClass());
   std::string temp = VSAPathJoin(staging, VSAFormat("temp_metadata-%@.plist", uuid()));
-  VSALogIn(VSALogCategory::Metadata, kVSALogDebug, fn, "[%s] Writing metadata to [%@]: %@ => %@", fn,
-           fileURL, *this, dict);
+  VSALogIn(VSALogCategory::Metadata, kVSALogDebug, fn, "[%s] Writing metadata to [%@]: %@ => %@",
+           fn, fileURL, *this, dict);
   VSAFileManager& fm = configuration.fileManager();
   VSAErrorRef underlying;
   auto bytes = VSAPlist::serialize(dict, VSAPlist::Format::Binary, &underlying);
@@ -103,14 +107,12 @@ bool VSAMetadata::writeMetadataToFileURL(const std::string& fileURL,
   return true;
 }
 
-VSAMetadataRef VSAMetadata::readAndValidateMetadataAtUrl(const std::string& containerURL,
-                                                         const VSAUserIdentityRef& forUserIdentity,
-                                                         bool checkClassPath,
-                                                         VSAGlobalConfiguration& configuration,
-                                                         VSAUserIdentityCache& cache,
-                                                         VSAErrorRef* error) {
+VSAMetadataRef VSAMetadata::readAndValidateMetadataAtUrl(
+    const std::string& containerURL, const VSAUserIdentityRef& forUserIdentity, bool checkClassPath,
+    VSAGlobalConfiguration& configuration, VSAUserIdentityCache& cache, VSAErrorRef* error) {
   return readAndValidateMetadataAtFileUrl(VSAPathJoin(containerURL, kVSAMetadataFileName),
-                                          forUserIdentity, checkClassPath, configuration, cache, error);
+                                          forUserIdentity, checkClassPath, configuration, cache,
+                                          error);
 }
 
 VSAMetadataRef VSAMetadata::readAndValidateMetadataAtFileUrl(
@@ -122,7 +124,8 @@ VSAMetadataRef VSAMetadata::readAndValidateMetadataAtFileUrl(
   if (configuration.fileManager().fileSystem().readFile(file, &bytes) == 0)
     dict = VSAPlist::parse(bytes, nullptr);
   if (!dict || !dict->isDictionary())
-    return invalid(error, VSAResult::kMetadataUnreadable, "Failed to read metadata at URL %@", file);
+    return invalid(error, VSAResult::kMetadataUnreadable, "Failed to read metadata at URL %@",
+                   file);
   const VSAValue* identifier = dict->get(kIdentifierKey);
   if (!identifier || !identifier->isString())
     return invalid(error, bad, "Invalid metadata Identifier: %@ at %@", shown(identifier), file);
@@ -157,13 +160,14 @@ VSAMetadataRef VSAMetadata::readAndValidateMetadataAtFileUrl(
     if (!stored) {
       uint64_t n = dict->get(kPersonaKey)->uint64Value().value_or(0);
       if (n == 499) n = 0;
-      owner = cache.userIdentityForPersonalPersonaWithUID(static_cast<uid_t>(n), static_cast<gid_t>(n));
+      owner =
+          cache.userIdentityForPersonalPersonaWithUID(static_cast<uid_t>(n), static_cast<gid_t>(n));
     } else {
       VSAResultCode code = VSAResult::kSuccess;
       owner = VSAUserIdentity::userIdentityWithPlist(*stored, cache, &code);
       if (!owner)
-        return invalid(error, bad, "Invalid metadata User Identity: %@ for %@ at %@: %llu",
-                       *stored, *identifier->stringValue(), file, code);
+        return invalid(error, bad, "Invalid metadata User Identity: %@ for %@ at %@: %llu", *stored,
+                       *identifier->stringValue(), file, code);
       if (!VSAUserIdentityEqual(owner, expected))
         return invalid(error, bad, "Incorrect User Identity: %@, expecting: %@ for %@ at %@: %llu",
                        owner, expected, *identifier->stringValue(), file, code);
@@ -174,7 +178,8 @@ VSAMetadataRef VSAMetadata::readAndValidateMetadataAtFileUrl(
     return invalid(error, bad, "Invalid metadata Info: %@ at %@", *info, file);
   const VSAValue* assets = dict->get(kAssetsKey);
   if (assets && !assets->isString())
-    return invalid(error, bad, "Invalid metadata User Managed Dir Name String: %@ at %@", *assets, file);
+    return invalid(error, bad, "Invalid metadata User Managed Dir Name String: %@ at %@", *assets,
+                   file);
   std::string container = parentOf(file);
   if (checkClassPath) {
     std::string classDir = parentOf(container);
@@ -186,7 +191,8 @@ VSAMetadataRef VSAMetadata::readAndValidateMetadataAtFileUrl(
   VSAResultCode code = VSAResult::kSuccess;
   auto identity = VSAConcreteContainerIdentity::containerIdentityWithUUID(
       *uuid, owner, *identifier->stringValue(), c, &code);
-  if (!identity) return invalid(error, bad, "Could not create user identity from %@: %llu", file, code);
+  if (!identity)
+    return invalid(error, bad, "Could not create user identity from %@: %llu", file, code);
   auto metadata = std::make_shared<VSAMetadata>(
       identity, info ? std::optional<VSAValue>(*info) : std::nullopt, container,
       assets ? std::optional<std::string>(*assets->stringValue()) : std::nullopt);

@@ -59,12 +59,9 @@ class VSAMetadata {
                                                      VSAGlobalConfiguration& configuration,
                                                      VSAUserIdentityCache& cache,
                                                      VSAErrorRef* error);
-  static VSAMetadataRef readAndValidateMetadataAtFileUrl(const std::string& fileURL,
-                                                         const VSAUserIdentityRef& forUserIdentity,
-                                                         bool checkClassPath,
-                                                         VSAGlobalConfiguration& configuration,
-                                                         VSAUserIdentityCache& cache,
-                                                         VSAErrorRef* error);
+  static VSAMetadataRef readAndValidateMetadataAtFileUrl(
+      const std::string& fileURL, const VSAUserIdentityRef& forUserIdentity, bool checkClassPath,
+      VSAGlobalConfiguration& configuration, VSAUserIdentityCache& cache, VSAErrorRef* error);
 
   std::string description() const;
 

@@ -22,15 +22,18 @@ std::string VSAPerUserConfiguration::userBaseDirectory() {
 }
 
 std::string VSAPerUserConfiguration::stagingDirectory() {
-  return ensure(VSAPathJoin(userBaseDirectory(), "Staging"), "Failed to create staging dir at \"%@\": %@");
+  return ensure(VSAPathJoin(userBaseDirectory(), "Staging"),
+                "Failed to create staging dir at \"%@\": %@");
 }
 
 std::string VSAPerUserConfiguration::transientDirectory() {
-  return ensure(VSAPathJoin(userBaseDirectory(), "Temp"), "Failed to create transient dir at \"%@\": %@");
+  return ensure(VSAPathJoin(userBaseDirectory(), "Temp"),
+                "Failed to create transient dir at \"%@\": %@");
 }
 
 std::string VSAPerUserConfiguration::libraryDirectory() {
-  return ensure(VSAPathJoin(home_, "Library/Vessa"), "Failed to create user library dir at \"%@\": %@");
+  return ensure(VSAPathJoin(home_, "Library/Vessa"),
+                "Failed to create user library dir at \"%@\": %@");
 }
 
 std::string VSAPerUserConfiguration::oldLoggingPath() const {

@@ -34,7 +34,8 @@ VSAUserIdentityRef VSAUserIdentity::bare() {
   return std::make_shared<const VSAUserIdentity>(0, 0, std::string(), std::nullopt, 0, 0);
 }
 
-std::string VSAUserIdentity::identifierForPOSIXUID(uid_t uid, const std::optional<std::string>& unique,
+std::string VSAUserIdentity::identifierForPOSIXUID(uid_t uid,
+                                                   const std::optional<std::string>& unique,
                                                    uint32_t personaType) {
   if (personaType == kVSAPersonaTypeEnterprise && unique) return *unique;
   return std::to_string(uid);
@@ -67,10 +68,14 @@ VSAValue VSAUserIdentity::plist() const {
 
 const char* VSAUserIdentity::descriptionForPersonaType(uint32_t type) {
   switch (type) {
-    case kVSAPersonaTypePersonal: return "personal";
-    case kVSAPersonaTypeEnterprise: return "enterprise";
-    case kVSAPersonaTypeUnspecific: return "unspecific";
-    default: return "unknown";
+    case kVSAPersonaTypePersonal:
+      return "personal";
+    case kVSAPersonaTypeEnterprise:
+      return "enterprise";
+    case kVSAPersonaTypeUnspecific:
+      return "unspecific";
+    default:
+      return "unknown";
   }
 }
 
@@ -84,8 +89,8 @@ std::string VSAUserIdentity::description() const {
       "<%@: %p; posixUID = %u, posixGID = %u, identifier = %@, homeDirectoryURL = %@, personaType "
       "= %@, personaUniqueString = %@, kernelPersonaID = %d>",
       "VSAUserIdentity", static_cast<const void*>(this), uid_, gid_, identifier_, home_,
-      descriptionForPersonaType(personaType_), uniqueString_ ? *uniqueString_ : std::string("(null)"),
-      kernelPersonaID_);
+      descriptionForPersonaType(personaType_),
+      uniqueString_ ? *uniqueString_ : std::string("(null)"), kernelPersonaID_);
 }
 
 bool VSAUserIdentityEqual(const VSAUserIdentityRef& a, const VSAUserIdentityRef& b) {
@@ -98,11 +103,16 @@ namespace {
 const char* typeName(const VSAValue* v) {
   if (!v) return "(null)";
   switch (v->type()) {
-    case VSAValue::Type::String: return "NSString";
-    case VSAValue::Type::Array: return "NSArray";
-    case VSAValue::Type::Dictionary: return "NSDictionary";
-    case VSAValue::Type::Data: return "NSData";
-    default: return "NSNumber";
+    case VSAValue::Type::String:
+      return "NSString";
+    case VSAValue::Type::Array:
+      return "NSArray";
+    case VSAValue::Type::Dictionary:
+      return "NSDictionary";
+    case VSAValue::Type::Data:
+      return "NSData";
+    default:
+      return "NSNumber";
   }
 }
 

@@ -41,7 +41,8 @@ class VSAUserIdentity {
   // the strings "1" and "2" gives the bare identity and no error
   // (deliberately lenient); malformed fields fail with 75, an identity the
   // cache cannot produce with code 1.
-  static VSAUserIdentityRef userIdentityWithPlist(const VSAValue& plist, VSAUserIdentityCache& cache,
+  static VSAUserIdentityRef userIdentityWithPlist(const VSAValue& plist,
+                                                  VSAUserIdentityCache& cache,
                                                   VSAResultCode* error);
   // The never-initialised identity that a plist of unknown version reads as.
   static VSAUserIdentityRef bare();

@@ -71,9 +71,9 @@ void VSAUserIdentityCache::registerForUpdates() {
 
 VSAUserIdentityRef VSAUserIdentityCache::defaultUserIdentity() {
   std::call_once(defaultOnce_, [this] {
-    default_ = VSAUserIdentity::make(deps_.mobileUID, deps_.mobileGID,
-                                     homeDirectoryForUID(deps_.mobileUID), std::nullopt,
-                                     kVSAPersonaTypePersonal, static_cast<int32_t>(deps_.mobileUID));
+    default_ = VSAUserIdentity::make(
+        deps_.mobileUID, deps_.mobileGID, homeDirectoryForUID(deps_.mobileUID), std::nullopt,
+        kVSAPersonaTypePersonal, static_cast<int32_t>(deps_.mobileUID));
   });
   return default_;
 }
@@ -90,11 +90,12 @@ VSAUserIdentityRef VSAUserIdentityCache::userIdentityWithPersonaAttributes(
     const VSAPersonaAttributes* a, uid_t uid, gid_t gid, bool forceUnspecific) {
   std::optional<std::string> unique = a ? a->uniqueString : std::nullopt;
   int32_t personaID = a ? static_cast<int32_t>(a->personaID) : static_cast<int32_t>(uid);
-  std::string home = a && a->isEnterprise() && a->layoutPath ? *a->layoutPath : homeDirectoryForUID(uid);
-  uint32_t type = forceUnspecific                  ? kVSAPersonaTypeUnspecific
-                  : (a && a->isPersonal())         ? kVSAPersonaTypePersonal
-                  : (a && a->isEnterprise())       ? kVSAPersonaTypeEnterprise
-                                                   : kVSAPersonaTypeUnspecific;
+  std::string home =
+      a && a->isEnterprise() && a->layoutPath ? *a->layoutPath : homeDirectoryForUID(uid);
+  uint32_t type = forceUnspecific            ? kVSAPersonaTypeUnspecific
+                  : (a && a->isPersonal())   ? kVSAPersonaTypePersonal
+                  : (a && a->isEnterprise()) ? kVSAPersonaTypeEnterprise
+                                             : kVSAPersonaTypeUnspecific;
   return VSAUserIdentity::make(uid, gid, std::move(home), std::move(unique), type, personaID);
 }
 
@@ -107,7 +108,8 @@ VSAUserIdentityRef VSAUserIdentityCache::userIdentityWithPersonaAttributes(
 VSAUserIdentityRef VSAUserIdentityCache::updateUserIdentity(const VSAUserIdentityRef& identity,
                                                             uid_t uid, gid_t gid) {
   if (!identity) return nullptr;
-  std::string home = identity->isEnterprise() ? identity->homeDirectoryURL() : homeDirectoryForUID(uid);
+  std::string home =
+      identity->isEnterprise() ? identity->homeDirectoryURL() : homeDirectoryForUID(uid);
   return VSAUserIdentity::make(uid, gid, std::move(home), identity->personaUniqueString(),
                                identity->personaType(), identity->kernelPersonaID());
 }

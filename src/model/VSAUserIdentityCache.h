@@ -105,7 +105,9 @@ class VSAUserIdentityCache : public std::enable_shared_from_this<VSAUserIdentity
                                                        bool forceUnspecific = false);
   // _updateUserIdentity:withUID:GID: a re-based copy.
   VSAUserIdentityRef updateUserIdentity(const VSAUserIdentityRef& identity, uid_t uid, gid_t gid);
-  std::string homeDirectoryForUID(uid_t uid) const { return deps_.userDatabase->homeDirectoryForUID(uid); }
+  std::string homeDirectoryForUID(uid_t uid) const {
+    return deps_.userDatabase->homeDirectoryForUID(uid);
+  }
   std::string description() const { return "<VSAUserIdentityCache>"; }
 
  protected:

@@ -17,7 +17,8 @@ VSAUserIdentityRef VSAUserIdentityCache::userIdentityForPersonalPersona() {
   return userIdentityForPersonalPersonaWithUID(deps_.mobileUID, deps_.mobileGID);
 }
 
-VSAUserIdentityRef VSAUserIdentityCache::userIdentityForPersonalPersonaWithUID(uid_t uid, gid_t gid) {
+VSAUserIdentityRef VSAUserIdentityCache::userIdentityForPersonalPersonaWithUID(uid_t uid,
+                                                                               gid_t gid) {
   applyUIDFloor(uid, gid);
   return rebasedIfNeeded(snapshot()->personal, uid, gid);
 }
@@ -49,7 +50,8 @@ VSAUserIdentityRef VSAUserIdentityCache::userIdentityForCurrentContext() {
   return userIdentityForCurrentContextWithUID(deps_.mobileUID, deps_.mobileGID);
 }
 
-VSAUserIdentityRef VSAUserIdentityCache::userIdentityForCurrentContextWithUID(uid_t uid, gid_t gid) {
+VSAUserIdentityRef VSAUserIdentityCache::userIdentityForCurrentContextWithUID(uid_t uid,
+                                                                              gid_t gid) {
   applyUIDFloor(uid, gid);
   VSAUserIdentityRef result;
   if (!personasAreSupported()) {
@@ -69,7 +71,8 @@ VSAUserIdentityRef VSAUserIdentityCache::userIdentityForCurrentContextWithUID(ui
     result = rebasedIfNeeded(unspecificUserIdentity(), uid, gid);
     VSALog(kVSALogDebug, kOrigin, "(%d/%d) No persona (<%p>) or no unique string [%@], using: %@",
            uid, gid, persona ? static_cast<const void*>(&*persona) : nullptr,
-           persona && persona->uniqueString ? *persona->uniqueString : std::string("(null)"), result);
+           persona && persona->uniqueString ? *persona->uniqueString : std::string("(null)"),
+           result);
   }
   return result;
 }

@@ -46,10 +46,14 @@ bool VSAAuditToken::isCurrent() const {
 
 std::array<uint8_t, 32> VSAAuditToken::bytes() const {
   std::array<uint8_t, 32> out{};
-  uint32_t words[8] = {static_cast<uint32_t>(uid), static_cast<uint32_t>(uid),
-                       static_cast<uint32_t>(gid), static_cast<uint32_t>(uid),
-                       static_cast<uint32_t>(gid), static_cast<uint32_t>(pid),
-                       static_cast<uint32_t>(startTime >> 32), static_cast<uint32_t>(startTime)};
+  uint32_t words[8] = {static_cast<uint32_t>(uid),
+                       static_cast<uint32_t>(uid),
+                       static_cast<uint32_t>(gid),
+                       static_cast<uint32_t>(uid),
+                       static_cast<uint32_t>(gid),
+                       static_cast<uint32_t>(pid),
+                       static_cast<uint32_t>(startTime >> 32),
+                       static_cast<uint32_t>(startTime)};
   std::memcpy(out.data(), words, sizeof words);
   return out;
 }

@@ -7,11 +7,12 @@
 // all-zero token stands for the daemon itself. Value type.
 #pragma once
 
+#include <sys/types.h>
+
 #include <array>
 #include <cstdint>
 #include <optional>
 #include <string>
-#include <sys/types.h>
 
 struct VSAAuditToken {
   pid_t pid = 0;

@@ -91,22 +91,26 @@ int VSAFaultInjectingFileSystem::rmdir(const std::string& path) {
   return inner_->rmdir(path);
 }
 
-int VSAFaultInjectingFileSystem::readDirectory(const std::string& path, std::vector<VSADirectoryEntry>* entries) {
+int VSAFaultInjectingFileSystem::readDirectory(const std::string& path,
+                                               std::vector<VSADirectoryEntry>* entries) {
   if (int e = injected(Op::ReadDirectory)) return e;
   return inner_->readDirectory(path, entries);
 }
 
-int VSAFaultInjectingFileSystem::getxattr(const std::string& path, const std::string& name, std::string* value) {
+int VSAFaultInjectingFileSystem::getxattr(const std::string& path, const std::string& name,
+                                          std::string* value) {
   if (int e = injected(Op::GetXattr)) return e;
   return inner_->getxattr(path, name, value);
 }
 
-int VSAFaultInjectingFileSystem::setxattr(const std::string& path, const std::string& name, const std::string& value) {
+int VSAFaultInjectingFileSystem::setxattr(const std::string& path, const std::string& name,
+                                          const std::string& value) {
   if (int e = injected(Op::SetXattr)) return e;
   return inner_->setxattr(path, name, value);
 }
 
-int VSAFaultInjectingFileSystem::listxattr(const std::string& path, std::vector<std::string>* names) {
+int VSAFaultInjectingFileSystem::listxattr(const std::string& path,
+                                           std::vector<std::string>* names) {
   if (int e = injected(Op::ListXattr)) return e;
   return inner_->listxattr(path, names);
 }
@@ -121,7 +125,8 @@ int VSAFaultInjectingFileSystem::setFlags(const std::string& path, int flags) {
   return inner_->setFlags(path, flags);
 }
 
-int VSAFaultInjectingFileSystem::copyData(const std::string& from, const std::string& to, mode_t mode) {
+int VSAFaultInjectingFileSystem::copyData(const std::string& from, const std::string& to,
+                                          mode_t mode) {
   if (int e = injected(Op::CopyData)) return e;
   return inner_->copyData(from, to, mode);
 }
@@ -131,7 +136,8 @@ int VSAFaultInjectingFileSystem::symlink(const std::string& target, const std::s
   return inner_->symlink(target, path);
 }
 
-int VSAFaultInjectingFileSystem::writeFile(const std::string& path, const std::vector<uint8_t>& bytes, mode_t mode) {
+int VSAFaultInjectingFileSystem::writeFile(const std::string& path,
+                                           const std::vector<uint8_t>& bytes, mode_t mode) {
   if (int e = injected(Op::WriteFile)) return e;
   return inner_->writeFile(path, bytes, mode);
 }
@@ -146,7 +152,8 @@ int VSAFaultInjectingFileSystem::mkdtemp(const std::string& templ, std::string* 
   return inner_->mkdtemp(templ, path);
 }
 
-int VSAFaultInjectingFileSystem::setSystemContainerACL(const std::string& path, VSASystemContainerACL kind, gid_t gid) {
+int VSAFaultInjectingFileSystem::setSystemContainerACL(const std::string& path,
+                                                       VSASystemContainerACL kind, gid_t gid) {
   if (int e = injected(Op::SetACL)) return e;
   return inner_->setSystemContainerACL(path, kind, gid);
 }

@@ -43,7 +43,8 @@ class VSAFaultInjectingFileSystem : public VSAFileSystem {
   int writeFile(const std::string& path, const std::vector<uint8_t>& bytes, mode_t mode) override;
   int readFile(const std::string& path, std::vector<uint8_t>* bytes) override;
   int mkdtemp(const std::string& templ, std::string* path) override;
-  int setSystemContainerACL(const std::string& path, VSASystemContainerACL kind, gid_t gid) override;
+  int setSystemContainerACL(const std::string& path, VSASystemContainerACL kind,
+                            gid_t gid) override;
   int getProtectionClass(const std::string& path, int* protectionClass) override;
   int setProtectionClass(const std::string& path, int protectionClass) override;
   int directoryStatistics(const std::string& path, uint64_t* bytes) override;

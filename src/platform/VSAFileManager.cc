@@ -4,17 +4,10 @@
 
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
+#include "platform/VSAFileManagerErrors.h"
 
 namespace {
 constexpr const char* kOrigin = "VSAFileManager";
-
-// Logs `message` and turns it into a POSIX-domain error for `err`.
-template <typename... A>
-VSAErrorRef fail(int err, const char* function, const char* format, const A&... args) {
-  std::string message = VSAFormat(format, args...);
-  VSALogIn(VSALogCategory::FS, kVSALogError, function, "%s", message);
-  return VSAError::posix(err, function, __LINE__, message);
-}
 
 std::vector<std::string> components(const std::string& path) {
   std::vector<std::string> out;
@@ -69,7 +62,8 @@ std::optional<std::string> VSAFileManager::realPathAllowingMissing(const std::st
       for (size_t i = 0; i < keep; ++i) prefix = i == 0 ? parts[0] : VSAPathJoin(prefix, parts[i]);
       if (!itemExistsAtURL(prefix) || fs_->realpath(prefix, &resolved) != 0) continue;
       std::string rest;
-      for (size_t i = keep; i < parts.size(); ++i) rest = rest.empty() ? parts[i] : rest + "/" + parts[i];
+      for (size_t i = keep; i < parts.size(); ++i)
+        rest = rest.empty() ? parts[i] : rest + "/" + parts[i];
       VSALogIn(VSALogCategory::FS, kVSALogDebug, kOrigin,
                "Realpathed %@ ; appending non-existing components %@", resolved, rest);
       return VSAPathJoin(resolved, rest);
@@ -92,14 +86,16 @@ std::optional<std::string> VSAFileManager::realPathForURL(const std::string& pat
   // "/private" is where /var and /tmp really live: compare without it.
   std::string b = stripPrivate(base), p = stripPrivate(path);
   if (p.rfind(b, 0) != 0)
-    return reject(VSAFormat("supiscious path %@ does not contain base path %@ as a prefix", path, base));
+    return reject(
+        VSAFormat("supiscious path %@ does not contain base path %@ as a prefix", path, base));
   if (containsDotDotPathComponents(p))
     return reject(VSAFormat("The suspicious path %@ contains '..' paths, which are invalid", path));
   std::string target;
   int rc = fs_->readlink(path, &target);
   if (rc == 0) {
     if (!target.empty() && target[0] == '/')
-      return reject(VSAFormat("Rejecting %@ -> %s, as absolute symlinks are not allowed", path, target));
+      return reject(
+          VSAFormat("Rejecting %@ -> %s, as absolute symlinks are not allowed", path, target));
     // Follow the link from its own directory, counting depth below the base:
     // it may never climb above the base, and may not end on the base itself.
     std::string relative = p.substr(b.size());
@@ -116,25 +112,33 @@ std::optional<std::string> VSAFileManager::realPathForURL(const std::string& pat
   auto realBase = realPathAllowingMissing(base);
   if (!realBase) return reject(VSAFormat("Failed to retrieve realpath for base path %@ ", base));
   auto realPath = realPathAllowingMissing(path);
-  if (!realPath) return reject(VSAFormat("Failed to retrieve realpath for suspicious path %@", path));
+  if (!realPath)
+    return reject(VSAFormat("Failed to retrieve realpath for suspicious path %@", path));
   auto bc = components(*realBase), pc = components(*realPath);
   if (bc.size() < 2 || pc.size() < 2)
-    return reject(VSAFormat("Rejecting %@ with base %@ because real component counts don't make "
-                            "sense (reals %@ ; %@)", path, base, *realPath, *realBase));
+    return reject(
+        VSAFormat("Rejecting %@ with base %@ because real component counts don't make "
+                  "sense (reals %@ ; %@)",
+                  path, base, *realPath, *realBase));
   size_t bi = bc[1] == "private" ? 2 : 1, pi = pc[1] == "private" ? 2 : 1;
   if (bc.size() - bi > pc.size() - pi)
-    return reject(VSAFormat("Rejecting %@ with base %@ because base component count is greater "
-                            "than child component count (reals %@ ; %@)", path, base, *realPath, *realBase));
+    return reject(
+        VSAFormat("Rejecting %@ with base %@ because base component count is greater "
+                  "than child component count (reals %@ ; %@)",
+                  path, base, *realPath, *realBase));
   for (; bi < bc.size(); ++bi, ++pi) {
     if (bc[bi] != pc[pi])
-      return reject(VSAFormat("Rejecting %@ with base %@ (reals %@ ; %@) because components "
-                              "diverge at %@ != %@", path, base, *realPath, *realBase, bc[bi], pc[pi]));
+      return reject(
+          VSAFormat("Rejecting %@ with base %@ (reals %@ ; %@) because components "
+                    "diverge at %@ != %@",
+                    path, base, *realPath, *realBase, bc[bi], pc[pi]));
   }
   return realPath;
 }
 
 bool VSAFileManager::createDirectoryAtURL(const std::string& path, bool intermediates, mode_t mode,
-                                          uid_t owner, uint32_t protectionClass, VSAErrorRef* error) {
+                                          uid_t owner, uint32_t protectionClass,
+                                          VSAErrorRef* error) {
   const char* fn = "createDirectoryAtURL";
   if (intermediates) {
     auto parts = components(path);
@@ -146,25 +150,28 @@ bool VSAFileManager::createDirectoryAtURL(const std::string& path, bool intermed
       struct stat st;
       if (rc == EEXIST && fs_->lstat(partial, &st) == 0 && !S_ISDIR(st.st_mode)) rc = ENOTDIR;
       if (rc != 0 && rc != EEXIST) {
-        VSASetError(error, fail(rc, fn, "mkpath_np of %s failed: %s", path, std::strerror(rc)));
+        VSASetError(error, VSAFileManagerFail(rc, fn, "mkpath_np of %s failed: %s", path,
+                                              std::strerror(rc)));
         return false;
       }
     }
   } else if (int rc = fs_->mkdir(path, mode); rc != 0 && rc != EEXIST) {
-    VSASetError(error, fail(rc, fn, "mkdir of %s failed: %s", path, std::strerror(rc)));
+    VSASetError(error,
+                VSAFileManagerFail(rc, fn, "mkdir of %s failed: %s", path, std::strerror(rc)));
     return false;
   }
   if (protectionClass != kVSANoProtectionClass) {
     if (int rc = fs_->setProtectionClass(path, static_cast<int>(protectionClass))) {
-      VSASetError(error, fail(rc, fn, "Failed to setclass(%d) on directory %s: %s",
-                              static_cast<int>(protectionClass), path, std::strerror(rc)));
+      VSASetError(error,
+                  VSAFileManagerFail(rc, fn, "Failed to setclass(%d) on directory %s: %s",
+                                     static_cast<int>(protectionClass), path, std::strerror(rc)));
       return false;
     }
   }
   if (owner != 0) {
     if (int rc = fs_->lchown(path, owner, owner)) {
-      VSASetError(error, fail(rc, fn, "Failed to chown(%d,%d) %s: %s", owner, owner, path,
-                              std::strerror(rc)));
+      VSASetError(error, VSAFileManagerFail(rc, fn, "Failed to chown(%d,%d) %s: %s", owner, owner,
+                                            path, std::strerror(rc)));
       return false;
     }
   }
@@ -186,18 +193,24 @@ bool VSAFileManager::copyItemIfExistsAtURL(const std::string& from, const std::s
   return copyItem(from, to, false, e);
 }
 
+// For the "if exists" variants: a missing source is reported through
+// `missing`; any other lstat failure is an error.
+bool VSAFileManager::checkSource(const std::string& from, const char* fn, bool* missing,
+                                 VSAErrorRef* error) {
+  struct stat st;
+  int rc = fs_->lstat(from, &st);
+  *missing = rc == ENOENT;
+  if (rc == 0 || rc == ENOENT) return true;
+  VSASetError(error, VSAFileManagerFail(rc, fn, "stat of %@ failed: %s", from, std::strerror(rc)));
+  return false;
+}
+
 bool VSAFileManager::moveItem(const std::string& from, const std::string& to, bool failIfSrcMissing,
                               VSAErrorRef* error) {
   const char* fn = "moveItemAtURL";
-  if (!failIfSrcMissing) {
-    struct stat st;
-    int rc = fs_->lstat(from, &st);
-    if (rc == ENOENT) return true;
-    if (rc != 0) {
-      VSASetError(error, fail(rc, fn, "stat of %@ failed: %s", from, std::strerror(rc)));
-      return false;
-    }
-  }
+  bool missing = false;
+  if (!failIfSrcMissing && !checkSource(from, fn, &missing, error)) return false;
+  if (missing) return true;
   int rc = fs_->rename(from, to);
   if (rc == 0) return true;
   if (rc == EXDEV) {
@@ -208,26 +221,21 @@ bool VSAFileManager::moveItem(const std::string& from, const std::string& to, bo
                "Failed to remove move source after copy at %@ : %@", from, removeError);
     return true;
   }
-  VSASetError(error, fail(rc, fn, "rename of %@ to %@ failed: %s", from, to, std::strerror(rc)));
+  VSASetError(error, VSAFileManagerFail(rc, fn, "rename of %@ to %@ failed: %s", from, to,
+                                        std::strerror(rc)));
   return false;
 }
 
 bool VSAFileManager::copyItem(const std::string& from, const std::string& to, bool failIfSrcMissing,
                               VSAErrorRef* error) {
   const char* fn = "copyItemAtURL";
-  if (!failIfSrcMissing) {
-    struct stat st;
-    int rc = fs_->lstat(from, &st);
-    if (rc == ENOENT) return true;
-    if (rc != 0) {
-      VSASetError(error, fail(rc, fn, "stat of %@ failed: %s", from, std::strerror(rc)));
-      return false;
-    }
-  }
+  bool missing = false;
+  if (!failIfSrcMissing && !checkSource(from, fn, &missing, error)) return false;
+  if (missing) return true;
   std::string failed;
   if (int rc = copyTree(from, to, &failed)) {
-    VSASetError(error, fail(rc, fn, "copyfile of %@ to %@ failed: %s", from, to,
-                            std::strerror(rc)));
+    VSASetError(error, VSAFileManagerFail(rc, fn, "copyfile of %@ to %@ failed: %s", from, to,
+                                          std::strerror(rc)));
     return false;
   }
   return true;
@@ -236,8 +244,9 @@ bool VSAFileManager::copyItem(const std::string& from, const std::string& to, bo
 bool VSAFileManager::dataProtectionClassOfItemAtURL(const std::string& path, int* protectionClass,
                                                     VSAErrorRef* error) {
   if (int rc = fs_->getProtectionClass(path, protectionClass)) {
-    VSASetError(error, fail(rc, "dataProtectionClassOfItemAtURL",
-                            "Failed to getclass of file %s: %s", path, std::strerror(rc)));
+    VSASetError(error,
+                VSAFileManagerFail(rc, "dataProtectionClassOfItemAtURL",
+                                   "Failed to getclass of file %s: %s", path, std::strerror(rc)));
     return false;
   }
   return true;
@@ -252,9 +261,9 @@ bool VSAFileManager::setDataProtectionClassOfItemAtURL(const std::string& path, 
     if (!ifPredicate(current)) return true;
   }
   if (int rc = fs_->setProtectionClass(path, protectionClass)) {
-    VSASetError(error, fail(rc, "setDataProtectionClassOfItemAtURL",
-                            "Failed to setclass(%d) on file %s: %s", protectionClass, path,
-                            std::strerror(rc)));
+    VSASetError(error, VSAFileManagerFail(rc, "setDataProtectionClassOfItemAtURL",
+                                          "Failed to setclass(%d) on file %s: %s", protectionClass,
+                                          path, std::strerror(rc)));
     return false;
   }
   return true;
@@ -284,8 +293,9 @@ std::optional<std::vector<VSADirectoryItem>> VSAFileManager::urlsForItemsInDirec
   if (int rc = fs_->readDirectory(path, &entries)) {
     VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "opendir of %s failed: %s", path,
              std::strerror(rc));
-    VSASetError(error, fail(rc, "urlsForItemsInDirectoryAtURL", "_IterateDirectory for %@ returned %s",
-                            path, std::strerror(rc)));
+    VSASetError(
+        error, VSAFileManagerFail(rc, "urlsForItemsInDirectoryAtURL",
+                                  "_IterateDirectory for %@ returned %s", path, std::strerror(rc)));
     return std::nullopt;
   }
   std::vector<VSADirectoryItem> items;
@@ -301,8 +311,9 @@ std::optional<std::string> VSAFileManager::createTemporaryDirectoryInDirectoryUR
   std::string out;
   std::string templ = VSAPathJoin(directory, prefix + "XXXXXX");
   if (int rc = fs_->mkdtemp(templ, &out)) {
-    VSASetError(error, fail(rc, "createTemporaryDirectoryInDirectoryURL",
-                            "Failed to create temp dir at path %s : %s", templ, std::strerror(rc)));
+    VSASetError(error, VSAFileManagerFail(rc, "createTemporaryDirectoryInDirectoryURL",
+                                          "Failed to create temp dir at path %s : %s", templ,
+                                          std::strerror(rc)));
     return std::nullopt;
   }
   return out;

@@ -73,12 +73,13 @@ class VSAFileManager {
   bool itemDoesNotExistAtURL(const std::string& path);
   // Visible entries (names not starting with ".") of one directory.
   std::optional<std::vector<VSADirectoryItem>> urlsForItemsInDirectoryAtURL(const std::string& path,
-                                                                           VSAErrorRef* error);
+                                                                            VSAErrorRef* error);
   // Walks a tree on one device; directories are reported before and after
   // their contents. The block stops the walk by returning false.
   bool traverseDirectory(const std::string& path, VSAErrorRef* error, const WalkBlock& block);
   std::optional<std::string> createTemporaryDirectoryInDirectoryURL(
-      const std::string& directory, VSAErrorRef* error, const std::string& withNamePrefix = "temp.");
+      const std::string& directory, VSAErrorRef* error,
+      const std::string& withNamePrefix = "temp.");
 
   // Total apparent size of a tree in bytes (a full walk).
   uint64_t diskUsageForURL(const std::string& path);
@@ -88,6 +89,7 @@ class VSAFileManager {
   std::string homeDirectoryURLForPOSIXUID(uid_t uid) const;
 
  private:
+  bool checkSource(const std::string& from, const char* fn, bool* missing, VSAErrorRef* error);
   bool moveItem(const std::string& from, const std::string& to, bool failIfSrcMissing,
                 VSAErrorRef* error);
   bool copyItem(const std::string& from, const std::string& to, bool failIfSrcMissing,

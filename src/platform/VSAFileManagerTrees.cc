@@ -5,16 +5,10 @@
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
 #include "platform/VSAFileManager.h"
+#include "platform/VSAFileManagerErrors.h"
 
 namespace {
 constexpr const char* kOrigin = "VSAFileManager";
-
-template <typename... A>
-VSAErrorRef fail(int err, const char* function, const char* format, const A&... args) {
-  std::string message = VSAFormat(format, args...);
-  VSALogIn(VSALogCategory::FS, kVSALogError, function, "%s", message);
-  return VSAError::posix(err, function, __LINE__, message);
-}
 
 template <typename... A>
 VSAErrorRef failACL(const char* function, const char* format, const A&... args) {
@@ -57,22 +51,26 @@ bool VSAFileManager::traverseDirectory(const std::string& path, VSAErrorRef* err
                                        const WalkBlock& block) {
   struct stat st;
   if (int rc = fs_->lstat(path, &st)) {
-    VSASetError(error, fail(rc, "traverseDirectory", "fts_open failed for %s with error %s", path,
-                            std::strerror(rc)));
+    VSASetError(error,
+                VSAFileManagerFail(rc, "traverseDirectory", "fts_open failed for %s with error %s",
+                                   path, std::strerror(rc)));
     return false;
   }
   std::string failedPath;
   int failedErrno = 0;
   size_t entries = 0;
-  bool completed = walk(path, st, st.st_dev, [&](const std::string& p, const struct stat& s, WalkPhase w) {
-    ++entries;
-    return block(p, s, w);
-  }, &failedPath, &failedErrno);
+  bool completed = walk(
+      path, st, st.st_dev,
+      [&](const std::string& p, const struct stat& s, WalkPhase w) {
+        ++entries;
+        return block(p, s, w);
+      },
+      &failedPath, &failedErrno);
   VSALogIn(VSALogCategory::FS, kVSALogDebug, "TraversingDirectory", "%zu entries under %s", entries,
            path);
   if (failedErrno) {
-    VSASetError(error, fail(failedErrno, "traverseDirectory", "Error for path %s: %s", path,
-                            std::strerror(failedErrno)));
+    VSASetError(error, VSAFileManagerFail(failedErrno, "traverseDirectory", "Error for path %s: %s",
+                                          path, std::strerror(failedErrno)));
     return false;
   }
   (void)completed;  // a walk stopped by the block is not an error
@@ -94,8 +92,9 @@ int VSAFileManager::removeImmutable(const std::string& path, bool directory) {
   }
   VSALogIn(VSALogCategory::FS, kVSALogNotice, kOrigin, "Unset UF_IMMUTABLE on %s", path);
   int rc = directory ? fs_->rmdir(path) : fs_->unlink(path);
-  if (rc) VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "unlink of %s failed: %s", path,
-                   std::strerror(rc));
+  if (rc)
+    VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "unlink of %s failed: %s", path,
+             std::strerror(rc));
   return rc;
 }
 
@@ -145,22 +144,23 @@ void VSAFileManager::removeTree(const std::string& path, const struct stat* st, 
 
 bool VSAFileManager::removeItemAtURL(const std::string& path, VSAErrorRef* error) {
   if (path.empty()) {
-    VSASetError(error, fail(EFAULT, "removeItemAtURL", "nil url passed to -removeItemAtURL:error:"));
+    VSASetError(error, VSAFileManagerFail(EFAULT, "removeItemAtURL",
+                                          "nil url passed to -removeItemAtURL:error:"));
     return false;
   }
   struct stat st;
   int rc = fs_->lstat(path, &st);
   if (rc == ENOENT) return true;
   if (rc != 0) {
-    VSASetError(error, fail(rc, "removeItemAtURL", "removefile of %@ failed: %s", path,
-                            std::strerror(rc)));
+    VSASetError(error, VSAFileManagerFail(rc, "removeItemAtURL", "removefile of %@ failed: %s",
+                                          path, std::strerror(rc)));
     return false;
   }
   int slot = 0;
   removeTree(path, &st, &slot);
   if (slot != 0) {
-    VSASetError(error, fail(slot, "removeItemAtURL", "removefile of %@ failed: %s", path,
-                            std::strerror(slot)));
+    VSASetError(error, VSAFileManagerFail(slot, "removeItemAtURL", "removefile of %@ failed: %s",
+                                          path, std::strerror(slot)));
     return false;
   }
   return true;
@@ -216,15 +216,16 @@ bool VSAFileManager::standardizeOwnershipAtURL(const std::string& path, uid_t ui
       VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "Could not chmod %s: %s", p,
                std::strerror(rc));
   };
-  bool ok = traverseDirectory(path, error, [&](const std::string& p, const struct stat& s, WalkPhase w) {
-    if (p != path && w != WalkPhase::DirectoryEnd && !holdsMetadata(p)) normalise(p, s, true);
-    return true;
-  });
+  bool ok =
+      traverseDirectory(path, error, [&](const std::string& p, const struct stat& s, WalkPhase w) {
+        if (p != path && w != WalkPhase::DirectoryEnd && !holdsMetadata(p)) normalise(p, s, true);
+        return true;
+      });
   if (!ok) return false;
   struct stat root;
   if (int rc = fs_->lstat(path, &root)) {
-    VSASetError(error, fail(rc, "standardizeOwnershipAtURL", "Could not stat %s: %s", path,
-                            std::strerror(rc)));
+    VSASetError(error, VSAFileManagerFail(rc, "standardizeOwnershipAtURL", "Could not stat %s: %s",
+                                          path, std::strerror(rc)));
     return false;
   }
   normalise(path, root, false);
@@ -239,7 +240,8 @@ std::optional<gid_t> VSAFileManager::systemUsersGroup(VSAErrorRef* error) {
   return gid;
 }
 
-bool VSAFileManager::setTopLevelSystemContainerACLAtURL(const std::string& path, VSAErrorRef* error) {
+bool VSAFileManager::setTopLevelSystemContainerACLAtURL(const std::string& path,
+                                                        VSAErrorRef* error) {
   auto gid = systemUsersGroup(error);
   if (!gid) return false;
   if (int rc = fs_->setSystemContainerACL(path, VSASystemContainerACL::TopLevel, *gid)) {
@@ -254,29 +256,30 @@ bool VSAFileManager::standardizeACLsAtURL(const std::string& path, bool isSystem
                                           VSAErrorRef* error) {
   auto gid = systemUsersGroup(error);
   if (!gid) return false;
-  return traverseDirectory(path, error, [&](const std::string& p, const struct stat& s, WalkPhase w) {
-    if (w == WalkPhase::DirectoryEnd || holdsMetadata(p)) return true;
-    if (p == path && isSystemContainer && S_ISDIR(s.st_mode)) {
-      if (int rc = fs_->setSystemContainerACL(p, VSASystemContainerACL::TopLevel, *gid))
-        VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "Failed to set top level ACL on dir %s: %s",
-                 p, std::strerror(rc));
-      return true;
-    }
-    if (!S_ISLNK(s.st_mode)) {
-      bool dir = S_ISDIR(s.st_mode);
-      // The ACL also sets the owner, group and other permissions to none:
-      // access to system containers comes from the "systemusers" entry alone.
-      if (int rc = fs_->setSystemContainerACL(
-              p, dir ? VSASystemContainerACL::Directory : VSASystemContainerACL::File, *gid))
-        VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin,
-                 dir ? "Failed to set ACL on dir %s: %s" : "Failed to set ACL on file %s: %s", p,
-                 std::strerror(rc));
-    }
-    if (int rc = fs_->lchown(p, kVSANobodyID, kVSANobodyID))
-      VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "Could not chown %s: %s", p,
-               std::strerror(rc));
-    return true;
-  });
+  return traverseDirectory(
+      path, error, [&](const std::string& p, const struct stat& s, WalkPhase w) {
+        if (w == WalkPhase::DirectoryEnd || holdsMetadata(p)) return true;
+        if (p == path && isSystemContainer && S_ISDIR(s.st_mode)) {
+          if (int rc = fs_->setSystemContainerACL(p, VSASystemContainerACL::TopLevel, *gid))
+            VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin,
+                     "Failed to set top level ACL on dir %s: %s", p, std::strerror(rc));
+          return true;
+        }
+        if (!S_ISLNK(s.st_mode)) {
+          bool dir = S_ISDIR(s.st_mode);
+          // The ACL also sets the owner, group and other permissions to none:
+          // access to system containers comes from the "systemusers" entry alone.
+          if (int rc = fs_->setSystemContainerACL(
+                  p, dir ? VSASystemContainerACL::Directory : VSASystemContainerACL::File, *gid))
+            VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin,
+                     dir ? "Failed to set ACL on dir %s: %s" : "Failed to set ACL on file %s: %s",
+                     p, std::strerror(rc));
+        }
+        if (int rc = fs_->lchown(p, kVSANobodyID, kVSANobodyID))
+          VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "Could not chown %s: %s", p,
+                   std::strerror(rc));
+        return true;
+      });
 }
 
 bool VSAFileManager::standardizeAllSystemContainerACLsAtURL(const std::string& path,
@@ -299,8 +302,8 @@ bool VSAFileManager::standardizeAllSystemContainerACLsAtURL(const std::string& p
   for (const auto& item : *items) {
     VSAErrorRef itemError;
     if (!standardizeACLsAtURL(item.path, true, &itemError)) {
-      VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "Failed to set system container ACL at %@: %@",
-               item.path, itemError);
+      VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin,
+               "Failed to set system container ACL at %@: %@", item.path, itemError);
       VSASetError(error, itemError);
       ok = false;
     }

@@ -25,9 +25,32 @@ class VSAFileSystem {
  public:
   // Operation names, for failure injection.
   enum class Op {
-    Lstat, Mkdir, Chown, Chmod, Rename, Readlink, Realpath, Unlink, Rmdir, ReadDirectory,
-    GetXattr, SetXattr, ListXattr, GetFlags, SetFlags, CopyData, Symlink, WriteFile, ReadFile,
-    Mkdtemp, SetACL, GetClass, SetClass, DirectoryStatistics, MaintainStatistics, Count
+    Lstat,
+    Mkdir,
+    Chown,
+    Chmod,
+    Rename,
+    Readlink,
+    Realpath,
+    Unlink,
+    Rmdir,
+    ReadDirectory,
+    GetXattr,
+    SetXattr,
+    ListXattr,
+    GetFlags,
+    SetFlags,
+    CopyData,
+    Symlink,
+    WriteFile,
+    ReadFile,
+    Mkdtemp,
+    SetACL,
+    GetClass,
+    SetClass,
+    DirectoryStatistics,
+    MaintainStatistics,
+    Count
   };
 
   virtual ~VSAFileSystem() = default;
@@ -56,7 +79,8 @@ class VSAFileSystem {
   virtual int copyData(const std::string& from, const std::string& to, mode_t mode) = 0;
   virtual int symlink(const std::string& target, const std::string& path) = 0;
   // Creates or truncates `path` with `bytes` and syncs it.
-  virtual int writeFile(const std::string& path, const std::vector<uint8_t>& bytes, mode_t mode) = 0;
+  virtual int writeFile(const std::string& path, const std::vector<uint8_t>& bytes,
+                        mode_t mode) = 0;
   virtual int readFile(const std::string& path, std::vector<uint8_t>* bytes) = 0;
   // `templ` ends in "XXXXXX"; the created directory's path comes back in `path`.
   virtual int mkdtemp(const std::string& templ, std::string* path) = 0;

@@ -25,8 +25,8 @@ bool VSAIPCClient::connect(const std::string& socketPath, VSAErrorRef* error) {
   if (fd_ < 0 || ::connect(fd_, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) {
     int err = errno;
     close();
-    VSASetError(error, VSA_POSIX_ERROR(err, "cannot connect to " + socketPath + ": " +
-                                                std::strerror(err)));
+    VSASetError(
+        error, VSA_POSIX_ERROR(err, "cannot connect to " + socketPath + ": " + std::strerror(err)));
     return false;
   }
   return true;

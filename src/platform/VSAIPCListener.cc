@@ -48,8 +48,8 @@ bool socketIsServed(const sockaddr_un& addr) {
 }  // namespace
 
 bool VSAIPCListener::listen(VSAErrorRef* error) {
-  if (sd_listen_fds(0) >= 1 && sd_is_socket_unix(SD_LISTEN_FDS_START, SOCK_STREAM, 1,
-                                                  socketPath_.c_str(), 0) > 0) {
+  if (sd_listen_fds(0) >= 1 &&
+      sd_is_socket_unix(SD_LISTEN_FDS_START, SOCK_STREAM, 1, socketPath_.c_str(), 0) > 0) {
     listenFd_ = SD_LISTEN_FDS_START;  // socket activation: systemd owns the file
   } else {
     sockaddr_un addr;

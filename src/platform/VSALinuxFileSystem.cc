@@ -6,8 +6,8 @@
 #include <sys/acl.h>
 #include <sys/ioctl.h>
 #include <sys/quota.h>
-#include <sys/sysmacros.h>
 #include <sys/sendfile.h>
+#include <sys/sysmacros.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
@@ -27,11 +27,11 @@ int openNoFollow(const std::string& path) {
 }  // namespace
 
 const char* VSAFileSystem::opName(Op op) {
-  static const char* names[] = {"lstat",    "mkdir",    "chown",     "chmod",      "rename",
-                                "readlink", "realpath", "unlink",    "rmdir",      "readdir",
-                                "getxattr", "setxattr", "listxattr", "getflags",   "setflags",
-                                "copydata", "symlink",  "writefile", "readfile",   "mkdtemp",
-                                "setacl",   "getclass", "setclass",   "dirstats", "maintaindirstats"};
+  static const char* names[] = {
+      "lstat",    "mkdir",    "chown",    "chmod",           "rename",   "readlink",  "realpath",
+      "unlink",   "rmdir",    "readdir",  "getxattr",        "setxattr", "listxattr", "getflags",
+      "setflags", "copydata", "symlink",  "writefile",       "readfile", "mkdtemp",   "setacl",
+      "getclass", "setclass", "dirstats", "maintaindirstats"};
   return names[static_cast<int>(op)];
 }
 
@@ -99,7 +99,10 @@ int VSALinuxFileSystem::readDirectory(const std::string& path,
     if (type == DT_UNKNOWN) {
       struct stat st;
       if (fstatat(fd, e->d_name, &st, AT_SYMLINK_NOFOLLOW) == 0)
-        type = S_ISDIR(st.st_mode) ? DT_DIR : S_ISLNK(st.st_mode) ? DT_LNK : S_ISREG(st.st_mode) ? DT_REG : DT_UNKNOWN;
+        type = S_ISDIR(st.st_mode)   ? DT_DIR
+               : S_ISLNK(st.st_mode) ? DT_LNK
+               : S_ISREG(st.st_mode) ? DT_REG
+                                     : DT_UNKNOWN;
     }
     entry.type = type == DT_DIR   ? VSADirectoryEntry::Type::Directory
                  : type == DT_REG ? VSADirectoryEntry::Type::File
@@ -247,9 +250,8 @@ int VSALinuxFileSystem::setSystemContainerACL(const std::string& path, VSASystem
   // "systemusers" entry alone (the mask keeps that entry effective).
   std::string g = std::to_string(gid);
   std::string all = "u::---,g::---,o::---,m::rwx,g:" + g + ":rwx";
-  std::string access = kind == VSASystemContainerACL::TopLevel
-                           ? "u::---,g::---,o::---,m::rwx,g:" + g + ":-w-"
-                           : all;
+  std::string access =
+      kind == VSASystemContainerACL::TopLevel ? "u::---,g::---,o::---,m::rwx,g:" + g + ":-w-" : all;
   acl_t a = acl_from_text(access.c_str());
   if (!a) return errno;
   int rc = acl_set_file(path.c_str(), ACL_TYPE_ACCESS, a) == 0 ? 0 : errno;

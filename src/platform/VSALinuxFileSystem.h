@@ -36,7 +36,8 @@ class VSALinuxFileSystem : public VSAFileSystem {
   int writeFile(const std::string& path, const std::vector<uint8_t>& bytes, mode_t mode) override;
   int readFile(const std::string& path, std::vector<uint8_t>* bytes) override;
   int mkdtemp(const std::string& templ, std::string* path) override;
-  int setSystemContainerACL(const std::string& path, VSASystemContainerACL kind, gid_t gid) override;
+  int setSystemContainerACL(const std::string& path, VSASystemContainerACL kind,
+                            gid_t gid) override;
   int getProtectionClass(const std::string& path, int* protectionClass) override;
   int setProtectionClass(const std::string& path, int protectionClass) override;
   // Project quotas: a tree's statistics are its project's usage.

@@ -24,11 +24,16 @@ std::optional<VSAPersonaAttributes> parseRecord(const VSAValue& record, const VS
   a.personaID = static_cast<uint32_t>(*id->uint64Value());
   const VSAValue* kind = record.get("Kind");
   std::string k = kind && kind->isString() ? *kind->stringValue() : "";
-  if (k == "personal") a.kind = VSAPersonaAttributes::Kind::Personal;
-  else if (k == "enterprise") a.kind = VSAPersonaAttributes::Kind::Enterprise;
-  else if (k == "universal") a.kind = VSAPersonaAttributes::Kind::Universal;
-  else if (k == "system") a.kind = VSAPersonaAttributes::Kind::System;
-  else return bad("\"Kind\" must be personal, enterprise, universal or system");
+  if (k == "personal")
+    a.kind = VSAPersonaAttributes::Kind::Personal;
+  else if (k == "enterprise")
+    a.kind = VSAPersonaAttributes::Kind::Enterprise;
+  else if (k == "universal")
+    a.kind = VSAPersonaAttributes::Kind::Universal;
+  else if (k == "system")
+    a.kind = VSAPersonaAttributes::Kind::System;
+  else
+    return bad("\"Kind\" must be personal, enterprise, universal or system");
   if (const VSAValue* s = record.get("UniqueString")) {
     if (!s->isString()) return bad("\"UniqueString\" must be a string");
     a.uniqueString = *s->stringValue();
@@ -43,7 +48,8 @@ std::optional<VSAPersonaAttributes> parseRecord(const VSAValue& record, const VS
     a.bundleIdentifiers = std::move(ids);
   }
   if (const VSAValue* layout = record.get("LayoutPath")) {
-    if (!layout->isString() || layout->stringValue()->empty() || layout->stringValue()->front() != '/')
+    if (!layout->isString() || layout->stringValue()->empty() ||
+        layout->stringValue()->front() != '/')
       return bad("\"LayoutPath\" must be an absolute path");
     a.layoutPath = root.resolve(*layout->stringValue());
   }
@@ -137,7 +143,6 @@ void VSALinuxPersonaService::registerObserver(const std::string& serviceName,
     std::lock_guard lock(watcherMutex_);
     watcher_ = std::move(watcher);
   }
-  VSAWorkQueue::global()->async([completion = std::move(completion), error, ok] {
-    completion(ok ? nullptr : error);
-  });
+  VSAWorkQueue::global()->async(
+      [completion = std::move(completion), error, ok] { completion(ok ? nullptr : error); });
 }

@@ -9,11 +9,12 @@
 // VSACurrentPersonaScope); a thread serving nobody has no current persona.
 #pragma once
 
+#include <sys/types.h>
+
 #include <cstdint>
 #include <functional>
 #include <optional>
 #include <string>
-#include <sys/types.h>
 #include <vector>
 
 #include "base/VSAError.h"

@@ -30,7 +30,8 @@ bool parseID(const std::string& text, unsigned long& out) {
 }
 }  // namespace
 
-std::optional<VSAUserAccount> VSAUserDatabase::find(const std::string* name, const uid_t* uid) const {
+std::optional<VSAUserAccount> VSAUserDatabase::find(const std::string* name,
+                                                    const uid_t* uid) const {
   if (root_.isHostRoot()) {
     struct passwd pw, *result = nullptr;
     char buf[16384];
@@ -46,7 +47,8 @@ std::optional<VSAUserAccount> VSAUserDatabase::find(const std::string* name, con
     unsigned long u, g;
     if (f.size() < 7 || !parseID(f[2], u) || !parseID(f[3], g)) continue;
     if ((name && f[0] == *name) || (uid && u == *uid))
-      return VSAUserAccount{f[0], static_cast<uid_t>(u), static_cast<gid_t>(g), root_.resolve(f[5])};
+      return VSAUserAccount{f[0], static_cast<uid_t>(u), static_cast<gid_t>(g),
+                            root_.resolve(f[5])};
   }
   return std::nullopt;
 }
@@ -63,7 +65,8 @@ std::optional<gid_t> VSAUserDatabase::groupNamed(const std::string& name) const 
   if (root_.isHostRoot()) {
     struct group gr, *result = nullptr;
     char buf[16384];
-    if (getgrnam_r(name.c_str(), &gr, buf, sizeof buf, &result) != 0 || !result) return std::nullopt;
+    if (getgrnam_r(name.c_str(), &gr, buf, sizeof buf, &result) != 0 || !result)
+      return std::nullopt;
     return gr.gr_gid;
   }
   std::ifstream in(root_.resolve("/etc/group"));

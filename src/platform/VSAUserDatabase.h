@@ -6,9 +6,10 @@
 // database and are returned resolved below the root. Thread-safe.
 #pragma once
 
+#include <sys/types.h>
+
 #include <optional>
 #include <string>
-#include <sys/types.h>
 
 #include "platform/VSASystemRoot.h"
 

@@ -1,15 +1,15 @@
-#include "base/VSABinaryPlist.h"
-
 #include <gtest/gtest.h>
 
 #include <cstring>
 #include <limits>
 
+#include "base/VSABinaryPlist.h"
 #include "base/VSAPlist.h"
 
 namespace {
 
-VSAValue roundTrip(const VSAValue& v, VSABinaryPlist::UUIDForm form = VSABinaryPlist::UUIDForm::Data) {
+VSAValue roundTrip(const VSAValue& v,
+                   VSABinaryPlist::UUIDForm form = VSABinaryPlist::UUIDForm::Data) {
   std::string why;
   auto bytes = VSABinaryPlist::encode(v, form, &why);
   EXPECT_TRUE(bytes) << why;
@@ -32,8 +32,8 @@ TEST(VSABinaryPlist, IntegerExtremesKeepValueAndSign) {
     ASSERT_TRUE(back.int64Value()) << v;
     EXPECT_EQ(*back.int64Value(), v);
   }
-  for (uint64_t v : {uint64_t(0), uint64_t(255), uint64_t(256), uint64_t(65536),
-                     uint64_t(1) << 32, uint64_t(i64max) + 1, u64max}) {
+  for (uint64_t v : {uint64_t(0), uint64_t(255), uint64_t(256), uint64_t(65536), uint64_t(1) << 32,
+                     uint64_t(i64max) + 1, u64max}) {
     VSAValue back = roundTrip(VSAValue(v));
     ASSERT_TRUE(back.uint64Value()) << v;
     EXPECT_EQ(*back.uint64Value(), v);
@@ -82,14 +82,18 @@ TEST(VSABinaryPlist, LargeCollectionsUseWideReferencesAndCounts) {
 
 TEST(VSABinaryPlist, InvalidUTF8IsRefusedByTheEncoder) {
   std::string why;
-  EXPECT_FALSE(VSABinaryPlist::encode(VSAValue(std::string("\xC3\x28")), VSABinaryPlist::UUIDForm::Data, &why));
-  EXPECT_FALSE(VSABinaryPlist::encode(VSAValue(std::string("\xED\xA0\x80")), VSABinaryPlist::UUIDForm::Data, &why));
+  EXPECT_FALSE(VSABinaryPlist::encode(VSAValue(std::string("\xC3\x28")),
+                                      VSABinaryPlist::UUIDForm::Data, &why));
+  EXPECT_FALSE(VSABinaryPlist::encode(VSAValue(std::string("\xED\xA0\x80")),
+                                      VSABinaryPlist::UUIDForm::Data, &why));
   EXPECT_FALSE(why.empty());
 }
 
 TEST(VSABinaryPlist, EveryTruncationIsRejectedWithoutCrashing) {
-  auto bytes = encode(VSAValue::Dictionary{{"Command", VSAValue(3u)}, {"Identifier", VSAValue("com.a")},
-                                           {"List", VSAValue(VSAValue::Array{VSAValue(1), VSAValue(2)})}});
+  auto bytes =
+      encode(VSAValue::Dictionary{{"Command", VSAValue(3u)},
+                                  {"Identifier", VSAValue("com.a")},
+                                  {"List", VSAValue(VSAValue::Array{VSAValue(1), VSAValue(2)})}});
   for (size_t n = 0; n < bytes.size(); ++n) {
     std::string why;
     EXPECT_FALSE(VSABinaryPlist::decode(bytes.data(), n, &why)) << n;
@@ -97,8 +101,9 @@ TEST(VSABinaryPlist, EveryTruncationIsRejectedWithoutCrashing) {
 }
 
 TEST(VSABinaryPlist, EveryByteFlipDecodesOrFailsCleanly) {
-  auto bytes = encode(VSAValue::Dictionary{{"A", VSAValue(VSAValue::Array{VSAValue("x"), VSAValue(-5)})},
-                                           {"B", VSAValue(VSAValue::Data{1, 2, 3})}});
+  auto bytes =
+      encode(VSAValue::Dictionary{{"A", VSAValue(VSAValue::Array{VSAValue("x"), VSAValue(-5)})},
+                                  {"B", VSAValue(VSAValue::Data{1, 2, 3})}});
   for (size_t i = 0; i < bytes.size(); ++i) {
     for (uint8_t flip : {0x01, 0x0F, 0x80, 0xFF}) {
       auto copy = bytes;

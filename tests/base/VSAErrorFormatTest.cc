@@ -29,13 +29,15 @@ TEST(VSAFormat, ObjectsNumbersAndAnnotations) {
             " command=4 ");
   EXPECT_EQ(VSAFormat("100%% %5s|%-4d|", "ab", 7), "100%    ab|7   |");
   EXPECT_EQ(VSAFormat("%@ and %d"), "(missing) and (missing)");
-  EXPECT_EQ(VSAFormat("%@", VSAValue(VSAValue::Dictionary{{"a", VSAValue(1)}})), "{\n    a = 1;\n}");
+  EXPECT_EQ(VSAFormat("%@", VSAValue(VSAValue::Dictionary{{"a", VSAValue(1)}})),
+            "{\n    a = 1;\n}");
 }
 
 TEST(VSAError, DescriptionWithAndWithoutUnderlyingError) {
   auto posix = VSA_POSIX_ERROR(ENOENT);
   auto plain = VSA_ERROR(34, "Failed to move metadata from staging: %@ to final: %@", "/a", "/b");
-  EXPECT_EQ(plain->localizedDescription(), "34: Failed to move metadata from staging: /a to final: /b");
+  EXPECT_EQ(plain->localizedDescription(),
+            "34: Failed to move metadata from staging: /a to final: /b");
   auto wrapped = VSA_ERROR_UNDERLYING(34, posix, "Failed to write %s", "x");
   EXPECT_EQ(wrapped->localizedDescription(),
             "34: Failed to write x (" + posix->description() + ")");
@@ -55,9 +57,10 @@ TEST(VSAError, OptionalOutParametersMayBeNull) {
 }
 
 TEST(VSACrash, UncaughtExceptionText) {
-  EXPECT_EQ(VSAUncaughtExceptionText("com.tamsk.vessad.listener", "std::runtime_error", "boom", "f1\n"),
-            "** INTERNAL ERROR: Uncaught Exception **\nException: <com.tamsk.vessad.listener> "
-            "std::runtime_error: boom\nStack:\nf1\n");
+  EXPECT_EQ(
+      VSAUncaughtExceptionText("com.tamsk.vessad.listener", "std::runtime_error", "boom", "f1\n"),
+      "** INTERNAL ERROR: Uncaught Exception **\nException: <com.tamsk.vessad.listener> "
+      "std::runtime_error: boom\nStack:\nf1\n");
   EXPECT_EQ(VSAUncaughtExceptionText("", "", "why", ""),
             "** INTERNAL ERROR: Uncaught Exception **\nException: why\nStack:\n");
 }
@@ -101,7 +104,8 @@ TEST(VSAValue, LenientAccessorsAndNumericEquality) {
 TEST(VSAJSON, ParsesAndPrints) {
   std::string why;
   auto v = VSAJSON::parse(R"({"Command": 0, "Neg": -2, "Real": 1.5, "S": "a\u00e9\ud83d\ude00",
-                               "L": [true, null], "D": {}})", &why);
+                               "L": [true, null], "D": {}})",
+                          &why);
   ASSERT_TRUE(v) << why;
   EXPECT_EQ(v->get("Command")->uint64Value(), 0u);
   EXPECT_EQ(v->get("Neg")->int64Value(), -2);
@@ -109,7 +113,7 @@ TEST(VSAJSON, ParsesAndPrints) {
   auto again = VSAJSON::parse(VSAJSON::print(*v), &why);
   ASSERT_TRUE(again) << why;
   EXPECT_EQ(*again, *v);
-  for (const char* bad : {"{", "[1,]", "{\"a\" 1}", "\"\\ud800\"", "01x", "", "[[[[" })
+  for (const char* bad : {"{", "[1,]", "{\"a\" 1}", "\"\\ud800\"", "01x", "", "[[[["})
     EXPECT_FALSE(VSAJSON::parse(bad, &why)) << bad;
 }
 

@@ -1,5 +1,3 @@
-#include "base/VSAPlist.h"
-
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -9,6 +7,7 @@
 #include <fstream>
 
 #include "base/VSAPathString.h"
+#include "base/VSAPlist.h"
 
 namespace {
 
@@ -83,7 +82,8 @@ TEST_F(VSAPlistFiles, FailedWriteLeavesTheOldFileIntact) {
 TEST_F(VSAPlistFiles, NonDictionaryRootFailsWithCode2048) {
   std::string path = VSAPathJoin(dir_, "array.plist");
   VSAErrorRef error;
-  auto bytes = VSAPlist::serialize(VSAValue(VSAValue::Array{VSAValue(1)}), VSAPlist::Format::Binary, &error);
+  auto bytes =
+      VSAPlist::serialize(VSAValue(VSAValue::Array{VSAValue(1)}), VSAPlist::Format::Binary, &error);
   ASSERT_TRUE(VSAWriteFileAtomically(path, *bytes, 0644, &error));
   EXPECT_FALSE(VSA_dictionaryWithContentsOfURL(path, 0, &error));
   ASSERT_TRUE(error);

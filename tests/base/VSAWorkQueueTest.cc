@@ -1,5 +1,3 @@
-#include "base/VSAWorkQueue.h"
-
 #include <gtest/gtest.h>
 
 #include <atomic>
@@ -8,6 +6,8 @@
 #include <mutex>
 #include <thread>
 #include <vector>
+
+#include "base/VSAWorkQueue.h"
 
 namespace {
 
@@ -68,20 +68,32 @@ TEST(VSAWorkQueue, ConcurrentQueueRunsInParallelAndBarrierExcludes) {
   std::promise<void> p1, p2;
   auto f1 = p1.get_future().share(), f2 = p2.get_future().share();
   std::atomic<int> done{0};
-  q->async([&] { p1.set_value(); if (f2.wait_for(5s) == std::future_status::ready) ++done; });
-  q->async([&] { p2.set_value(); if (f1.wait_for(5s) == std::future_status::ready) ++done; });
+  q->async([&] {
+    p1.set_value();
+    if (f2.wait_for(5s) == std::future_status::ready) ++done;
+  });
+  q->async([&] {
+    p2.set_value();
+    if (f1.wait_for(5s) == std::future_status::ready) ++done;
+  });
   std::atomic<int> running{0};
   std::atomic<bool> barrierSawOthers{false}, afterBarrierEarly{false};
   std::atomic<bool> barrierDone{false};
   for (int i = 0; i < 20; ++i)
-    q->async([&] { ++running; std::this_thread::sleep_for(1ms); --running; });
+    q->async([&] {
+      ++running;
+      std::this_thread::sleep_for(1ms);
+      --running;
+    });
   q->barrierAsync([&] {
     if (running.load() != 0 || done.load() != 2) barrierSawOthers = true;
     std::this_thread::sleep_for(5ms);
     barrierDone = true;
   });
   for (int i = 0; i < 20; ++i)
-    q->async([&] { if (!barrierDone) afterBarrierEarly = true; });
+    q->async([&] {
+      if (!barrierDone) afterBarrierEarly = true;
+    });
   q->barrierSync([] {});
   EXPECT_EQ(done.load(), 2);
   EXPECT_FALSE(barrierSawOthers);

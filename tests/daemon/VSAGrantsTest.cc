@@ -1,8 +1,7 @@
-#include "daemon/VSAGrants.h"
-
 #include <gtest/gtest.h>
 
 #include "daemon/VSAEntitlements.h"
+#include "daemon/VSAGrants.h"
 
 namespace {
 
@@ -85,7 +84,8 @@ TEST(VSAGrants, WipeListComesFromItsEntitlementArray) {
   EXPECT_TRUE(g.entitled && g.admitted);
   ASSERT_TRUE(g.entitledWipeIdentifiers);
   EXPECT_EQ(g.entitledWipeIdentifiers->arrayValue()->size(), 1u);
-  auto boolWiper = identityWith(VSAValue::Dictionary{{kVSAEntitlementWipeContainer, VSAValue(true)}});
+  auto boolWiper =
+      identityWith(VSAValue::Dictionary{{kVSAEntitlementWipeContainer, VSAValue(true)}});
   g = VSADeriveGrants(entry(11), boolWiper.get());
   EXPECT_FALSE(g.entitled);
   EXPECT_FALSE(g.admitted);

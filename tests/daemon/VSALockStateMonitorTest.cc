@@ -1,8 +1,8 @@
-#include "daemon/VSALockStateMonitor.h"
-
 #include <gtest/gtest.h>
 
 #include <vector>
+
+#include "daemon/VSALockStateMonitor.h"
 
 namespace {
 

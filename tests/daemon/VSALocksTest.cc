@@ -1,5 +1,3 @@
-#include "daemon/VSALocks.h"
-
 #include <gtest/gtest.h>
 
 #include <atomic>
@@ -12,6 +10,7 @@
 
 #include "base/VSALog.h"
 #include "base/VSAUUID.h"
+#include "daemon/VSALocks.h"
 
 namespace {
 
@@ -21,23 +20,41 @@ enum class Hold { IdRead, IdWrite, OtherRead, OtherWrite, AllRead, AllWrite };
 
 void take(Hold h) {
   switch (h) {
-    case Hold::IdRead: lock_identifier_read(VSAValue("A")); break;
-    case Hold::IdWrite: lock_identifier_write(VSAValue("A")); break;
-    case Hold::OtherRead: lock_identifier_read(VSAValue("B")); break;
-    case Hold::OtherWrite: lock_identifier_write(VSAValue("B")); break;
-    case Hold::AllRead: lock_all_identifiers_read(); break;
-    case Hold::AllWrite: lock_all_identifiers_write(); break;
+    case Hold::IdRead:
+      lock_identifier_read(VSAValue("A"));
+      break;
+    case Hold::IdWrite:
+      lock_identifier_write(VSAValue("A"));
+      break;
+    case Hold::OtherRead:
+      lock_identifier_read(VSAValue("B"));
+      break;
+    case Hold::OtherWrite:
+      lock_identifier_write(VSAValue("B"));
+      break;
+    case Hold::AllRead:
+      lock_all_identifiers_read();
+      break;
+    case Hold::AllWrite:
+      lock_all_identifiers_write();
+      break;
   }
 }
 
 void release(Hold h) {
   switch (h) {
     case Hold::IdRead:
-    case Hold::IdWrite: unlock_identifier(VSAValue("A")); break;
+    case Hold::IdWrite:
+      unlock_identifier(VSAValue("A"));
+      break;
     case Hold::OtherRead:
-    case Hold::OtherWrite: unlock_identifier(VSAValue("B")); break;
+    case Hold::OtherWrite:
+      unlock_identifier(VSAValue("B"));
+      break;
     case Hold::AllRead:
-    case Hold::AllWrite: unlock_all_identifiers(); break;
+    case Hold::AllWrite:
+      unlock_all_identifiers();
+      break;
   }
 }
 
@@ -74,15 +91,15 @@ TEST(VSALocks, CompatibilityTable) {
     bool granted;
   };
   const Cell cells[] = {
-      {Hold::IdRead, Hold::IdRead, true},     {Hold::IdRead, Hold::IdWrite, false},
-      {Hold::IdRead, Hold::OtherWrite, true}, {Hold::IdRead, Hold::AllRead, true},
-      {Hold::IdRead, Hold::AllWrite, false},  {Hold::IdWrite, Hold::IdRead, false},
-      {Hold::IdWrite, Hold::IdWrite, false},  {Hold::IdWrite, Hold::OtherWrite, true},
-      {Hold::IdWrite, Hold::AllRead, false},  {Hold::IdWrite, Hold::AllWrite, false},
-      {Hold::AllRead, Hold::IdRead, true},    {Hold::AllRead, Hold::IdWrite, false},
-      {Hold::AllRead, Hold::OtherRead, true}, {Hold::AllRead, Hold::OtherWrite, false},
-      {Hold::AllRead, Hold::AllRead, true},   {Hold::AllRead, Hold::AllWrite, false},
-      {Hold::AllWrite, Hold::IdRead, false},  {Hold::AllWrite, Hold::IdWrite, false},
+      {Hold::IdRead, Hold::IdRead, true},       {Hold::IdRead, Hold::IdWrite, false},
+      {Hold::IdRead, Hold::OtherWrite, true},   {Hold::IdRead, Hold::AllRead, true},
+      {Hold::IdRead, Hold::AllWrite, false},    {Hold::IdWrite, Hold::IdRead, false},
+      {Hold::IdWrite, Hold::IdWrite, false},    {Hold::IdWrite, Hold::OtherWrite, true},
+      {Hold::IdWrite, Hold::AllRead, false},    {Hold::IdWrite, Hold::AllWrite, false},
+      {Hold::AllRead, Hold::IdRead, true},      {Hold::AllRead, Hold::IdWrite, false},
+      {Hold::AllRead, Hold::OtherRead, true},   {Hold::AllRead, Hold::OtherWrite, false},
+      {Hold::AllRead, Hold::AllRead, true},     {Hold::AllRead, Hold::AllWrite, false},
+      {Hold::AllWrite, Hold::IdRead, false},    {Hold::AllWrite, Hold::IdWrite, false},
       {Hold::AllWrite, Hold::OtherRead, false}, {Hold::AllWrite, Hold::AllRead, false},
       {Hold::AllWrite, Hold::AllWrite, false},
   };
@@ -102,8 +119,8 @@ TEST(VSALocks, ArraysAreTakenAscendingOnceAndReleasedDescending) {
   VSALogger::shared().setLevel(kVSALogDebug);
   testing::internal::CaptureStderr();
   {
-    VSAIdentifierLockGuard guard(VSAValue(VSAValue::Array{VSAValue("B"), VSAValue("A"), VSAValue("B")}),
-                                 true);
+    VSAIdentifierLockGuard guard(
+        VSAValue(VSAValue::Array{VSAValue("B"), VSAValue("A"), VSAValue("B")}), true);
     EXPECT_EQ(VSALockTableSnapshot().identifierWriterCount, 2u) << "duplicates are taken once";
   }
   std::string log = testing::internal::GetCapturedStderr();

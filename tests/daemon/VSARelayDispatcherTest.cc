@@ -1,5 +1,3 @@
-#include "daemon/VSARelayDispatcher.h"
-
 #include <gtest/gtest.h>
 #include <sys/socket.h>
 #include <unistd.h>
@@ -11,6 +9,7 @@
 #include "base/VSAPlist.h"
 #include "daemon/VSAClientConnection.h"
 #include "daemon/VSAEntitlements.h"
+#include "daemon/VSARelayDispatcher.h"
 #include "platform/VSAFrameCodec.h"
 
 namespace {
@@ -86,7 +85,8 @@ class VSARelayDispatcherTest : public ::testing::Test {
 
   // Dispatches one request and returns the replies that reached the peer.
   std::vector<VSAValue> dispatch(const VSAValue& body) {
-    auto message = std::make_shared<VSAIPCMessage>(connection_, body, "", context_->transactions->open());
+    auto message =
+        std::make_shared<VSAIPCMessage>(connection_, body, "", context_->transactions->open());
     dispatcher_->processRelayEvent(message);
     message.reset();
     std::vector<VSAValue> replies;

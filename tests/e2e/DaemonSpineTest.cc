@@ -52,10 +52,12 @@ TEST(DaemonSpine, InvalidCommandsGetOnlyReplyError49) {
 
 TEST(DaemonSpine, EntitlementGatesThroughRealClients) {
   VSATestDaemon d;
-  d.registerVessactl("full-client", "com.example.full", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
-  d.registerVessactl("lookup-client", "com.example.lookup",
-                     VSAValue::Dictionary{{"com.tamsk.private.Vessa.lookup",
-                                           VSAValue::Dictionary{{"com.example.other", VSAValue(true)}}}});
+  d.registerVessactl("full-client", "com.example.full",
+                     VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
+  d.registerVessactl(
+      "lookup-client", "com.example.lookup",
+      VSAValue::Dictionary{{"com.tamsk.private.Vessa.lookup",
+                            VSAValue::Dictionary{{"com.example.other", VSAValue(true)}}}});
   ASSERT_TRUE(d.start());
   // Command 27 is not open and does not honour the lookup dictionary: only the
   // full client reaches its handler (which always answers 49).
@@ -129,7 +131,8 @@ TEST(DaemonSpine, FirstBootWorkRunsOncePerBoot) {
   std::string out = d.daemonOutput();
   size_t firstBoot = out.find("vessad performing first boot initialization");
   ASSERT_NE(firstBoot, std::string::npos);
-  EXPECT_EQ(out.find("vessad performing first boot initialization", firstBoot + 1), std::string::npos);
+  EXPECT_EQ(out.find("vessad performing first boot initialization", firstBoot + 1),
+            std::string::npos);
   // Losing the marker (a new boot) makes the next start a first boot again.
   VSANamedSemaphore::remove(d.firstBootSemaphore());
   ASSERT_TRUE(d.start());
@@ -216,15 +219,17 @@ std::vector<std::string> personaStrings(const VSATestDaemon::Run& run) {
 }
 
 void writePersonas(VSATestDaemon& d, bool workAppInEnterprise) {
-  VSAValue enterprise = VSAValue::Dictionary{
-      {"PersonaID", VSAValue(1001)}, {"Kind", VSAValue("enterprise")},
-      {"UniqueString", VSAValue("E-1001")}, {"LayoutPath", VSAValue("/private/var/enterprise")}};
+  VSAValue enterprise = VSAValue::Dictionary{{"PersonaID", VSAValue(1001)},
+                                             {"Kind", VSAValue("enterprise")},
+                                             {"UniqueString", VSAValue("E-1001")},
+                                             {"LayoutPath", VSAValue("/private/var/enterprise")}};
   if (workAppInEnterprise)
     enterprise.set("BundleIdentifiers", VSAValue(VSAValue::Array{VSAValue("com.app.work")}));
-  VSAValue list = VSAValue::Array{
-      VSAValue(VSAValue::Dictionary{{"PersonaID", VSAValue(1000)}, {"Kind", VSAValue("personal")},
-                                    {"UniqueString", VSAValue("P-1000")}}),
-      enterprise};
+  VSAValue list =
+      VSAValue::Array{VSAValue(VSAValue::Dictionary{{"PersonaID", VSAValue(1000)},
+                                                    {"Kind", VSAValue("personal")},
+                                                    {"UniqueString", VSAValue("P-1000")}}),
+                      enterprise};
   VSAErrorRef error;
   auto bytes = VSAPlist::serialize(list, VSAPlist::Format::XML, &error);
   VSAWriteFileAtomically(d.path("/etc/vessad/personas.plist"), *bytes, 0644, &error);

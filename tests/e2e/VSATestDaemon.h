@@ -39,8 +39,8 @@ class VSATestDaemon {
   std::string socketPath() const { return root_ + "/run/vessad/com.tamsk.vessad"; }
 
   // Sends one request from this process and returns the reply.
-  std::optional<VSAValue> request(VSAValue body, std::chrono::milliseconds timeout =
-                                                     std::chrono::seconds(10));
+  std::optional<VSAValue> request(VSAValue body,
+                                  std::chrono::milliseconds timeout = std::chrono::seconds(10));
   struct Run {
     int status;
     std::string output;

@@ -19,7 +19,8 @@ struct Tree {
     char tmpl[] = "/tmp/vessa-fuzz-paths-XXXXXX";
     root = mkdtemp(tmpl);
     base = root + "/container";
-    for (const char* d : {"/container", "/container/a", "/container/a/b", "/container/c", "/outside"})
+    for (const char* d :
+         {"/container", "/container/a", "/container/a/b", "/container/c", "/outside"})
       mkdir((root + d).c_str(), 0755);
     symlink("../c", (base + "/a/up").c_str());            // stays inside
     symlink("../../outside", (base + "/a/out").c_str());  // climbs out
@@ -40,7 +41,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   auto resolved = tree->fm.realPathForURL(tree->base + "/" + suffix, tree->base);
   if (resolved) {
     const std::string& r = *resolved;
-    if (r.size() <= tree->realBase.size() + 1 || r.compare(0, tree->realBase.size() + 1, tree->realBase + "/") != 0)
+    if (r.size() <= tree->realBase.size() + 1 ||
+        r.compare(0, tree->realBase.size() + 1, tree->realBase + "/") != 0)
       __builtin_trap();  // escaped the container or resolved to the container itself
   }
   return 0;

@@ -50,7 +50,8 @@ class Layout : public ::testing::Test {
     VSAUUID uuid = VSAUUID::random();
     std::string dir = base + "/" + uuid.string();
     fs::create_directories(dir);
-    auto identity = VSAConcreteContainerIdentity::containerIdentityWithUUID(uuid, owner, "com.app", c, nullptr);
+    auto identity =
+        VSAConcreteContainerIdentity::containerIdentityWithUUID(uuid, owner, "com.app", c, nullptr);
     auto m = std::make_shared<VSAMetadata>(identity, VSAValue::Dictionary{{"k", VSAValue(1)}}, dir,
                                            std::nullopt);
     VSAErrorRef error;
@@ -66,14 +67,18 @@ class Layout : public ::testing::Test {
     VSAWriteFileAtomically(dir + "/" + kVSAMetadataFileName, *bytes, 0644, nullptr);
   }
   // Reads back after changing one key of the file; returns the error message.
-  std::string readAfter(const VSAMetadataRef& m, const std::string& key, std::optional<VSAValue> value,
-                        VSAResultCode* code, const VSAUserIdentityRef& as = nullptr, bool check = true) {
+  std::string readAfter(const VSAMetadataRef& m, const std::string& key,
+                        std::optional<VSAValue> value, VSAResultCode* code,
+                        const VSAUserIdentityRef& as = nullptr, bool check = true) {
     VSAValue v = readPlist(m->url());
-    if (value) v.set(key, *value); else v.remove(key);
+    if (value)
+      v.set(key, *value);
+    else
+      v.remove(key);
     writePlist(m->url(), v);
     VSAErrorRef error;
     auto back = VSAMetadata::readAndValidateMetadataAtUrl(m->url(), as ? as : personal_, check,
-                                                         *config_, *cache_, &error);
+                                                          *config_, *cache_, &error);
     if (back) return "";
     *code = error->resultCode(0);
     return error->message();
@@ -96,7 +101,8 @@ TEST_F(Layout, DirectoriesArePlacedOwnedAndRecreated) {
   EXPECT_EQ(st.st_mode & 0777, 0755u);
   lstat(config_->transientBundleDirectory().c_str(), &st);
   EXPECT_EQ(st.st_uid, 33u);
-  EXPECT_EQ(config_->deathrowDirectory(), root_ + "/private/var/root/Library/Caches/com.tamsk.vessad/Dead");
+  EXPECT_EQ(config_->deathrowDirectory(),
+            root_ + "/private/var/root/Library/Caches/com.tamsk.vessad/Dead");
   auto data = config_->containerDirectoryURLForUserIdentity(personal_, 2, false);
   EXPECT_EQ(*data, root_ + "/private/var/mobile/Containers/Data/Application");
   lstat(data->c_str(), &st);
@@ -113,10 +119,12 @@ TEST_F(Layout, DirectoriesArePlacedOwnedAndRecreated) {
   EXPECT_FALSE(config_->globalContainerBaseURLWithContentClass(2, false));
   EXPECT_FALSE(config_->legacyTransientBundleDirectory());
   // The unspecific identity of the same uid shares the personal layout object.
-  EXPECT_EQ(config_->getPerUserConfigurationForUserIdentity(cache_->unspecificUserIdentity()), perUser);
+  EXPECT_EQ(config_->getPerUserConfigurationForUserIdentity(cache_->unspecificUserIdentity()),
+            perUser);
   EXPECT_EQ(config_->stagingDirectoryURLForUserIdentity(personal_, 7),
             root_ + "/private/var/mobile/Containers/Staging");
-  EXPECT_EQ(config_->stagingDirectoryURLForUserIdentity(personal_, 12), config_->stagingDirectory());
+  EXPECT_EQ(config_->stagingDirectoryURLForUserIdentity(personal_, 12),
+            config_->stagingDirectory());
   EXPECT_FALSE(config_->migrationFileExistsWithName("marker"));
   std::ofstream(config_->libraryDirectory() + "/marker") << "";
   EXPECT_TRUE(config_->migrationFileExistsWithName("marker"));
@@ -128,7 +136,8 @@ TEST_F(Layout, MetadataRoundTripsAndIsNeverWrittenInPlace) {
   EXPECT_EQ(*raw.get("VSAMetadataVersion")->stringValue(), "2");
   EXPECT_TRUE(raw.get("VSAMetadataUserIdentity"));
   VSAErrorRef error;
-  auto back = VSAMetadata::readAndValidateMetadataAtUrl(m->url(), personal_, true, *config_, *cache_, &error);
+  auto back = VSAMetadata::readAndValidateMetadataAtUrl(m->url(), personal_, true, *config_,
+                                                        *cache_, &error);
   ASSERT_TRUE(back) << error->description();
   EXPECT_TRUE(back->containerIdentity()->isEqual(*m->containerIdentity()));
   EXPECT_EQ(back->info()->get("k")->int64Value(), 1);
@@ -137,7 +146,8 @@ TEST_F(Layout, MetadataRoundTripsAndIsNeverWrittenInPlace) {
   auto b = makeContainer(1, cache_->defaultUserIdentity());
   EXPECT_FALSE(readPlist(b->url()).get("VSAMetadataUserIdentity"));
   auto other = cache_->userIdentityForPersonalPersonaWithUID(502, 502);
-  auto bundleBack = VSAMetadata::readAndValidateMetadataAtUrl(b->url(), other, true, *config_, *cache_, &error);
+  auto bundleBack =
+      VSAMetadata::readAndValidateMetadataAtUrl(b->url(), other, true, *config_, *cache_, &error);
   ASSERT_TRUE(bundleBack);
   EXPECT_TRUE(VSAUserIdentityEqual(bundleBack->userIdentity(), cache_->defaultUserIdentity()));
 }
@@ -157,7 +167,8 @@ TEST_F(Layout, AFailedMetadataWriteLeavesTheOldFileIntact) {
     std::ifstream again(m->url() + "/" + kVSAMetadataFileName, std::ios::binary);
     std::vector<uint8_t> now(std::istreambuf_iterator<char>(again), {});
     EXPECT_EQ(now, before) << VSAFileSystem::opName(op);
-    for (auto& e : fs::directory_iterator(config_->stagingDirectoryURLForUserIdentity(personal_, 2)))
+    for (auto& e :
+         fs::directory_iterator(config_->stagingDirectoryURLForUserIdentity(personal_, 2)))
       ADD_FAILURE() << "left behind " << e.path();
   }
   VSAResultCode code = 0;
@@ -179,7 +190,8 @@ TEST_F(Layout, EveryValidationFailureHasItsCodeAndMessage) {
       {"VSAMetadataContentClass", VSAValue("2"), "Invalid metadata Class: 2 at "},
       {"VSAMetadataContentClass", VSAValue(14), "Invalid metadata Content Class: 14 at "},
       {"VSAMetadataContentClass", VSAValue(0), "Invalid metadata Content Class: 0 at "},
-      {"VSAMetadataPersona", VSAValue(502), "Incorrect UserId: 502, expecting: 501 for com.app at "},
+      {"VSAMetadataPersona", VSAValue(502),
+       "Incorrect UserId: 502, expecting: 501 for com.app at "},
       {"VSAMetadataInfo", VSAValue("x"), "Invalid metadata Info: x at "},
       {"VSAMetadataUserManagedAssetsDirName", VSAValue(1),
        "Invalid metadata User Managed Dir Name String: 1 at "},
@@ -213,7 +225,8 @@ TEST_F(Layout, LegacyFilesWithoutAUserIdentity) {
   EXPECT_NE(readAfter(m, "VSAMetadataPersona", VSAValue(499), &code), "");
   v.set("VSAMetadataPersona", VSAValue(501));
   writePlist(m->url(), v);
-  auto back = VSAMetadata::readAndValidateMetadataAtUrl(m->url(), personal_, true, *config_, *cache_, &error);
+  auto back = VSAMetadata::readAndValidateMetadataAtUrl(m->url(), personal_, true, *config_,
+                                                        *cache_, &error);
   ASSERT_TRUE(back);
   EXPECT_EQ(back->userIdentity()->posixUID(), 501u);
   EXPECT_EQ(back->userIdentity()->personaType(), kVSAPersonaTypePersonal);
@@ -225,9 +238,11 @@ TEST_F(Layout, ClassPathCheckCatchesADataContainerUnderABundleTree) {
   std::string moved = bundleDir + "/" + m->uuid().string();
   fs::rename(m->url(), moved);
   VSAErrorRef error;
-  EXPECT_FALSE(VSAMetadata::readAndValidateMetadataAtUrl(moved, personal_, true, *config_, *cache_, &error));
+  EXPECT_FALSE(
+      VSAMetadata::readAndValidateMetadataAtUrl(moved, personal_, true, *config_, *cache_, &error));
   EXPECT_EQ(error->message().rfind("Invalid metadata-URLs should match: ", 0), 0u);
-  EXPECT_TRUE(VSAMetadata::readAndValidateMetadataAtUrl(moved, personal_, false, *config_, *cache_, &error));
+  EXPECT_TRUE(VSAMetadata::readAndValidateMetadataAtUrl(moved, personal_, false, *config_, *cache_,
+                                                        &error));
 }
 
 }  // namespace

@@ -119,7 +119,8 @@ TEST_F(UserIdentities, UidFloorAndRebasing) {
   EXPECT_EQ(other->posixUID(), 502u);
   EXPECT_EQ(other->homeDirectoryURL(), root_ + "/private/var/u502");
   auto work = cache->userIdentityForPersonaUniqueString(std::string("E-1001"), 502, 502);
-  EXPECT_EQ(work->homeDirectoryURL(), root_ + "/private/var/enterprise") << "enterprise keeps its home";
+  EXPECT_EQ(work->homeDirectoryURL(), root_ + "/private/var/enterprise")
+      << "enterprise keeps its home";
 }
 
 TEST_F(UserIdentities, PlistReadingRules) {
@@ -134,37 +135,46 @@ TEST_F(UserIdentities, PlistReadingRules) {
   // Type 1 with an unknown string fails with code 1.
   code = 99;
   EXPECT_FALSE(VSAUserIdentity::userIdentityWithPlist(
-      VSAValue::Dictionary{{"version", VSAValue("2")}, {"posixUID", VSAValue(501)},
-                           {"posixGID", VSAValue(501)}, {"type", VSAValue(1)},
+      VSAValue::Dictionary{{"version", VSAValue("2")},
+                           {"posixUID", VSAValue(501)},
+                           {"posixGID", VSAValue(501)},
+                           {"type", VSAValue(1)},
                            {"personaUniqueString", VSAValue("unknown")}},
       *cache, &code));
   EXPECT_EQ(code, 1u);
   // Type 2 reads back as the personal identity.
-  auto unspecific = VSAUserIdentity::make(501, 501, "/x", "P-1000", kVSAPersonaTypeUnspecific, 1000);
+  auto unspecific =
+      VSAUserIdentity::make(501, 501, "/x", "P-1000", kVSAPersonaTypeUnspecific, 1000);
   auto back = VSAUserIdentity::userIdentityWithPlist(unspecific->plist(), *cache, &code);
   ASSERT_TRUE(back);
   EXPECT_EQ(back->personaType(), kVSAPersonaTypePersonal);
   // Wrong types fail with 75.
   code = 1;
   EXPECT_FALSE(VSAUserIdentity::userIdentityWithPlist(
-      VSAValue::Dictionary{{"version", VSAValue("2")}, {"posixUID", VSAValue("501")}}, *cache, &code));
+      VSAValue::Dictionary{{"version", VSAValue("2")}, {"posixUID", VSAValue("501")}}, *cache,
+      &code));
   EXPECT_EQ(code, 75u);
   code = 1;
-  EXPECT_FALSE(VSAUserIdentity::userIdentityWithPlist(
-      VSAValue::Dictionary{{"version", VSAValue("2")}, {"posixUID", VSAValue(501)},
-                           {"posixGID", VSAValue(501)}, {"type", VSAValue(3)}},
-      *cache, &code));
+  EXPECT_FALSE(
+      VSAUserIdentity::userIdentityWithPlist(VSAValue::Dictionary{{"version", VSAValue("2")},
+                                                                  {"posixUID", VSAValue(501)},
+                                                                  {"posixGID", VSAValue(501)},
+                                                                  {"type", VSAValue(3)}},
+                                             *cache, &code));
   EXPECT_EQ(code, 75u);
   // Version 1 with a known persona identifier.
   auto v1 = VSAUserIdentity::userIdentityWithPlist(
-      VSAValue::Dictionary{{"version", VSAValue("1")}, {"posixUID", VSAValue(501)},
-                           {"posixGID", VSAValue(501)}, {"personaIdentifier", VSAValue("E-1001")}},
+      VSAValue::Dictionary{{"version", VSAValue("1")},
+                           {"posixUID", VSAValue(501)},
+                           {"posixGID", VSAValue(501)},
+                           {"personaIdentifier", VSAValue("E-1001")}},
       *cache, &code);
   ASSERT_TRUE(v1);
   EXPECT_EQ(v1->identifier(), "E-1001");
   // An enterprise identity round-trips.
   auto work = cache->userIdentityForPersonaUniqueString(std::string("E-1001"), 501, 501);
-  EXPECT_TRUE(VSAUserIdentityEqual(VSAUserIdentity::userIdentityWithPlist(work->plist(), *cache, &code), work));
+  EXPECT_TRUE(VSAUserIdentityEqual(
+      VSAUserIdentity::userIdentityWithPlist(work->plist(), *cache, &code), work));
 }
 
 TEST_F(UserIdentities, UnsupportedPersonasAnswerThePersonalIdentity) {
@@ -245,7 +255,7 @@ TEST_F(UserIdentities, FlushNotifiesObserversOfEachEnterpriseIdentityAndRebuilds
   cache->addObserver(observer);
   (void)cache->unspecificUserIdentity();  // build
   int before = personas_->listCalls;
-  personas_->personas->pop_back();        // the universal persona goes away
+  personas_->personas->pop_back();  // the universal persona goes away
   cache->flush();
   std::sort(observer->invalidated.begin(), observer->invalidated.end());
   EXPECT_EQ(observer->invalidated, (std::vector<std::string>{"E-1001", "E-1002"}));
@@ -275,13 +285,16 @@ TEST_F(UserIdentities, ContainerIdentityValidationOrderAndEquality) {
   VSAValue id("com.app");
   VSAResultCode code = 1;
   for (VSAContainerClass bad : {0ull, 14ull, 200ull}) {
-    EXPECT_FALSE(VSAContainerIdentity::containerIdentityWithUserIdentity(personal, &id, bad, &code));
+    EXPECT_FALSE(
+        VSAContainerIdentity::containerIdentityWithUserIdentity(personal, &id, bad, &code));
     EXPECT_EQ(code, 11u);
   }
   VSAValue number(5);
-  EXPECT_FALSE(VSAContainerIdentity::containerIdentityWithUserIdentity(personal, &number, 2, &code));
+  EXPECT_FALSE(
+      VSAContainerIdentity::containerIdentityWithUserIdentity(personal, &number, 2, &code));
   EXPECT_EQ(code, 11u);
-  EXPECT_FALSE(VSAContainerIdentity::containerIdentityWithUserIdentity(personal, nullptr, 0, &code));
+  EXPECT_FALSE(
+      VSAContainerIdentity::containerIdentityWithUserIdentity(personal, nullptr, 0, &code));
   EXPECT_EQ(code, 18u) << "a missing identifier is reported before the class";
   EXPECT_FALSE(VSAContainerIdentity::containerIdentityWithUserIdentity(nullptr, nullptr, 0, &code));
   EXPECT_EQ(code, 11u) << "a missing owner wins";
@@ -297,15 +310,18 @@ TEST_F(UserIdentities, ContainerIdentityValidationOrderAndEquality) {
   EXPECT_TRUE(a->isEqual(*b)) << "personal vs unspecific owner of one uid";
   EXPECT_EQ(a->hash(), b->hash());
   VSAUUID u1 = VSAUUID::random(), u2 = VSAUUID::random();
-  auto c1 = VSAConcreteContainerIdentity::containerIdentityWithUUID(u1, personal, "com.app", 2, &code);
-  auto c2 = VSAConcreteContainerIdentity::containerIdentityWithUUID(u2, personal, "com.app", 2, &code);
+  auto c1 =
+      VSAConcreteContainerIdentity::containerIdentityWithUUID(u1, personal, "com.app", 2, &code);
+  auto c2 =
+      VSAConcreteContainerIdentity::containerIdentityWithUUID(u2, personal, "com.app", 2, &code);
   EXPECT_FALSE(c1->isEqual(*c2));
   EXPECT_TRUE(a->isEqual(*c1));
   EXPECT_TRUE(a->isEqual(*c2));
   EXPECT_FALSE(c1->isEqual(*a));
   EXPECT_TRUE(c1->isEqual(*c1));
   VSAValue text(u1.string());
-  EXPECT_FALSE(VSAConcreteContainerIdentity::containerIdentityWithUUID(&text, personal, &id, 2, &code));
+  EXPECT_FALSE(
+      VSAConcreteContainerIdentity::containerIdentityWithUUID(&text, personal, &id, 2, &code));
   EXPECT_EQ(code, 11u) << "a UUID must be a UUID value";
   EXPECT_NE(c1->description().find(u1.string()), std::string::npos);
 }

@@ -1,11 +1,11 @@
-#include "operations/VSACommandQueue.h"
-
 #include <gtest/gtest.h>
 
 #include <atomic>
 #include <functional>
 #include <thread>
 #include <vector>
+
+#include "operations/VSACommandQueue.h"
 
 namespace {
 

@@ -1,5 +1,3 @@
-#include "platform/VSAFileManager.h"
-
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <sys/xattr.h>
@@ -9,6 +7,7 @@
 #include <fstream>
 
 #include "platform/VSAFaultInjectingFileSystem.h"
+#include "platform/VSAFileManager.h"
 #include "platform/VSALinuxFileSystem.h"
 
 namespace fs = std::filesystem;
@@ -27,8 +26,8 @@ class FileManager : public ::testing::Test {
     fs::create_directories(base_ + "/Documents/sub");
     faults_ = std::make_shared<VSAFaultInjectingFileSystem>(
         std::make_shared<VSALinuxFileSystem>([this] { return locked_; }));
-    fm_ = std::make_unique<VSAFileManager>(
-        faults_, std::make_shared<VSAUserDatabase>(VSASystemRoot(root_)));
+    fm_ = std::make_unique<VSAFileManager>(faults_,
+                                           std::make_shared<VSAUserDatabase>(VSASystemRoot(root_)));
   }
   void TearDown() override {
     std::error_code ec;
@@ -48,7 +47,8 @@ class FileManager : public ::testing::Test {
 
 TEST_F(FileManager, ClientPathsStayInsideTheBase) {
   file(base_ + "/Documents/a.txt");
-  EXPECT_EQ(fm_->realPathForURL(base_ + "/Documents/a.txt", base_), real(base_ + "/Documents/a.txt"));
+  EXPECT_EQ(fm_->realPathForURL(base_ + "/Documents/a.txt", base_),
+            real(base_ + "/Documents/a.txt"));
   // ".." is refused before any file-system access.
   int before = faults_->totalCalls();
   EXPECT_FALSE(fm_->realPathForURL(base_ + "/Documents/../../x", base_));
@@ -95,11 +95,13 @@ TEST_F(FileManager, CreatingAnExistingDirectoryStillAppliesOwnerAndClass) {
   int cls = 0;
   ASSERT_TRUE(fm_->dataProtectionClassOfItemAtURL(dir, &cls, &error));
   EXPECT_EQ(cls, 3);
-  ASSERT_TRUE(fm_->createDirectoryAtURL(base_ + "/x/y/z", true, 0700, 0, kVSANoProtectionClass, &error));
+  ASSERT_TRUE(
+      fm_->createDirectoryAtURL(base_ + "/x/y/z", true, 0700, 0, kVSANoProtectionClass, &error));
   ASSERT_EQ(lstat((base_ + "/x/y/z").c_str(), &st), 0);
   EXPECT_EQ(st.st_mode & 0777, 0700u);
   file(base_ + "/plainfile");
-  EXPECT_FALSE(fm_->createDirectoryAtURL(base_ + "/plainfile/d", true, 0755, 0, kVSANoProtectionClass, &error));
+  EXPECT_FALSE(fm_->createDirectoryAtURL(base_ + "/plainfile/d", true, 0755, 0,
+                                         kVSANoProtectionClass, &error));
 }
 
 TEST_F(FileManager, ProtectionClassRefusesChangesWhileLocked) {
@@ -112,8 +114,13 @@ TEST_F(FileManager, ProtectionClassRefusesChangesWhileLocked) {
   // The predicate sees the current class and can decline the change.
   locked_ = false;
   int seen = -1;
-  ASSERT_TRUE(fm_->setDataProtectionClassOfItemAtURL(base_ + "/f", 4,
-                                                     [&](int c) { seen = c; return false; }, &error));
+  ASSERT_TRUE(fm_->setDataProtectionClassOfItemAtURL(
+      base_ + "/f", 4,
+      [&](int c) {
+        seen = c;
+        return false;
+      },
+      &error));
   EXPECT_EQ(seen, 2);
   int cls = 0;
   fm_->dataProtectionClassOfItemAtURL(base_ + "/f", &cls, &error);
@@ -142,7 +149,8 @@ TEST_F(FileManager, RemovalClearsTheImmutableFlag) {
   if (linux->getFlags(base_ + "/Documents/locked", &flags) != 0 ||
       linux->setFlags(base_ + "/Documents/locked", flags | VSAFileSystem::kImmutableFlag) != 0)
     GTEST_SKIP() << "this file system or user cannot set the immutable flag";
-  ASSERT_NE(unlink((base_ + "/Documents/locked").c_str()), 0) << "the flag really protects the file";
+  ASSERT_NE(unlink((base_ + "/Documents/locked").c_str()), 0)
+      << "the flag really protects the file";
   VSAErrorRef error;
   EXPECT_TRUE(fm_->removeItemAtURL(base_, &error)) << (error ? error->description() : "");
   EXPECT_FALSE(fs::exists(base_));
@@ -200,8 +208,10 @@ TEST_F(FileManager, NormalisationLeavesTheMetadataFileAlone) {
   // System-container ACLs: the tree gets the ACLs and owner -2, the metadata file does not.
   ASSERT_TRUE(fm_->standardizeACLsForSystemContainerAtURL(base_, &error)) << error->description();
   char buf[256];
-  EXPECT_GT(getxattr((base_ + "/Documents/data").c_str(), "system.posix_acl_access", buf, sizeof buf), 0);
-  EXPECT_GT(getxattr((base_ + "/Documents").c_str(), "system.posix_acl_default", buf, sizeof buf), 0)
+  EXPECT_GT(
+      getxattr((base_ + "/Documents/data").c_str(), "system.posix_acl_access", buf, sizeof buf), 0);
+  EXPECT_GT(getxattr((base_ + "/Documents").c_str(), "system.posix_acl_default", buf, sizeof buf),
+            0)
       << "directories pass the ACL on to new children";
   EXPECT_GT(getxattr(base_.c_str(), "system.posix_acl_default", buf, sizeof buf), 0);
   EXPECT_LT(getxattr(metadata.c_str(), "system.posix_acl_access", buf, sizeof buf), 0);
@@ -212,7 +222,8 @@ TEST_F(FileManager, NormalisationLeavesTheMetadataFileAlone) {
   EXPECT_EQ(st.st_mode & 0777, 0600u);
   // A new file in an ACL'd directory inherits the systemusers entry.
   file(base_ + "/Documents/new");
-  EXPECT_GT(getxattr((base_ + "/Documents/new").c_str(), "system.posix_acl_access", buf, sizeof buf), 0);
+  EXPECT_GT(
+      getxattr((base_ + "/Documents/new").c_str(), "system.posix_acl_access", buf, sizeof buf), 0);
 }
 
 TEST_F(FileManager, ListingHidesDotNamesAndWalkReportsEverything) {
@@ -226,11 +237,13 @@ TEST_F(FileManager, ListingHidesDotNamesAndWalkReportsEverything) {
   EXPECT_EQ(names, (std::set<std::string>{"Documents", "visible"}));
   EXPECT_FALSE(fm_->urlsForItemsInDirectoryAtURL(base_ + "/none", &error));
   int dirs = 0, ends = 0, others = 0;
-  ASSERT_TRUE(fm_->traverseDirectory(base_, &error, [&](const std::string&, const struct stat&,
-                                                        VSAFileManager::WalkPhase w) {
-    (w == VSAFileManager::WalkPhase::Directory ? dirs : w == VSAFileManager::WalkPhase::DirectoryEnd ? ends : others)++;
-    return true;
-  }));
+  ASSERT_TRUE(fm_->traverseDirectory(
+      base_, &error, [&](const std::string&, const struct stat&, VSAFileManager::WalkPhase w) {
+        (w == VSAFileManager::WalkPhase::Directory      ? dirs
+         : w == VSAFileManager::WalkPhase::DirectoryEnd ? ends
+                                                        : others)++;
+        return true;
+      }));
   EXPECT_EQ(dirs, 3);
   EXPECT_EQ(ends, 3);
   EXPECT_EQ(others, 2);

@@ -1,5 +1,3 @@
-#include "platform/VSALinuxPersonaService.h"
-
 #include <gtest/gtest.h>
 #include <unistd.h>
 
@@ -10,6 +8,7 @@
 
 #include "base/VSAPlist.h"
 #include "platform/VSAAuditToken.h"
+#include "platform/VSALinuxPersonaService.h"
 
 namespace {
 
@@ -67,8 +66,9 @@ TEST_F(PersonaFiles, MalformedRecordsAreLeftOutAndGarbageGivesNoList) {
 }
 
 TEST_F(PersonaFiles, CurrentPersonaComesFromTheServedProcessRecord) {
-  write(VSAValue::Dictionary{{"Personas", VSAValue::Array{record(1, "personal", VSAValue("P")),
-                                                          record(2, "enterprise", VSAValue("E"))}}});
+  write(
+      VSAValue::Dictionary{{"Personas", VSAValue::Array{record(1, "personal", VSAValue("P")),
+                                                        record(2, "enterprise", VSAValue("E"))}}});
   VSALinuxPersonaService service{VSASystemRoot(root_)};
   EXPECT_FALSE(service.currentPersona()) << "a thread serving nobody has no persona";
   uint64_t start = VSAAuditToken::processStartTime(getpid());
@@ -90,8 +90,8 @@ TEST_F(PersonaFiles, ObserverHearsFileChanges) {
   VSALinuxPersonaService service{VSASystemRoot(root_)};
   std::atomic<int> changes{0};
   std::atomic<bool> registered{false};
-  service.registerObserver("test.personaobserver", [&] { ++changes; },
-                           [&](VSAErrorRef e) { registered = !e; });
+  service.registerObserver(
+      "test.personaobserver", [&] { ++changes; }, [&](VSAErrorRef e) { registered = !e; });
   write(VSAValue::Array{record(1, "personal", VSAValue("P"))});
   for (int i = 0; i < 200 && changes == 0; ++i) std::this_thread::sleep_for(5ms);
   EXPECT_TRUE(registered);

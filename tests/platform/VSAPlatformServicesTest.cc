@@ -62,7 +62,8 @@ TEST_F(VSAPlatformRoot, ClientRegistryMatchesTheRealExecutable) {
              VSAValue::Dictionary{
                  {"Executable", VSAValue("/usr/bin/tester")},
                  {"SigningIdentifier", VSAValue("com.example.tester")},
-                 {"Entitlements", VSAValue::Dictionary{{"com.tamsk.private.Vessa.allowed", VSAValue(true)}}},
+                 {"Entitlements",
+                  VSAValue::Dictionary{{"com.tamsk.private.Vessa.allowed", VSAValue(true)}}},
                  {"Sandboxed", VSAValue(true)},
              });
   VSAClientRegistry registry{VSASystemRoot(root_)};
@@ -124,7 +125,8 @@ TEST_F(VSAPlatformRoot, NamedSemaphoreIsPerRoot) {
   VSASystemRoot root(root_);
   std::string name = VSANamedSemaphore::nameForRoot("vessad.fb_check", root);
   EXPECT_NE(name, "vessad.fb_check");
-  EXPECT_EQ(VSANamedSemaphore::nameForRoot("vessad.fb_check", VSASystemRoot("/")), "vessad.fb_check");
+  EXPECT_EQ(VSANamedSemaphore::nameForRoot("vessad.fb_check", VSASystemRoot("/")),
+            "vessad.fb_check");
   EXPECT_FALSE(VSANamedSemaphore::exists(name));
   ASSERT_TRUE(VSANamedSemaphore::create(name));
   EXPECT_TRUE(VSANamedSemaphore::exists(name));
@@ -137,10 +139,12 @@ TEST_F(VSAPlatformRoot, NotificationsAndDeviceProperties) {
   VSANotificationCenter center(root);
   EXPECT_EQ(center.post("a.b"), 0u);
   EXPECT_EQ(center.post(CONTAINER_NOTIFY_CLEANUP_COMPLETE), 0u);
-  EXPECT_EQ(center.postedNames(), (std::vector<std::string>{"a.b", CONTAINER_NOTIFY_CLEANUP_COMPLETE}));
+  EXPECT_EQ(center.postedNames(),
+            (std::vector<std::string>{"a.b", CONTAINER_NOTIFY_CLEANUP_COMPLETE}));
   EXPECT_FALSE(VSADeviceProperties(root).hasInternalContent());
-  writePlist(root_ + "/etc/vessad/device.plist",
-             VSAValue::Dictionary{{"HasInternalContent", VSAValue(true)}, {"MultiUser", VSAValue("x")}});
+  writePlist(
+      root_ + "/etc/vessad/device.plist",
+      VSAValue::Dictionary{{"HasInternalContent", VSAValue(true)}, {"MultiUser", VSAValue("x")}});
   VSADeviceProperties props(root);
   EXPECT_TRUE(props.hasInternalContent());
   EXPECT_FALSE(props.isMultiUser()) << "a malformed flag takes its default";
