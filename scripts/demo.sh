@@ -35,6 +35,9 @@ ctl "$build/vessactl" --root "$root" Command=27
 step "A request without a Command key: 49"
 ctl "$installer" --root "$root" Identifier=com.example.demo
 
+step "Personas the installer may use (it is listed by the universal persona, so all of them)"
+ctl "$installer" --root "$root" --json Command=32
+
 step "Locking and unlocking the device (the daemon follows the lock state)"
 echo 1 > "$root/run/vessad/lockstate"; sleep 0.2
 echo 0 > "$root/run/vessad/lockstate"; sleep 0.2

@@ -3,6 +3,7 @@
 #   scripts/provision-root.sh ROOT VESSACTL
 # - /etc/passwd and /etc/group with root and the "mobile" user (501)
 # - /etc/vessad/device.plist (an internal build, so debug lines reach the log)
+# - /etc/vessad/personas.plist: a personal, an enterprise and a universal persona
 # - a registered client "demo-installer" (a copy of vessactl holding the
 #   full-client entitlement) in /usr/bin and /etc/vessad/clients.d
 set -euo pipefail
@@ -24,6 +25,21 @@ cat > "$root/etc/vessad/device.plist" <<'PL'
   <key>HasInternalContent</key><true/>
 </dict></plist>
 PL
+cat > "$root/etc/vessad/personas.plist" <<'PL'
+<?xml version="1.0" encoding="UTF-8"?>
+<plist version="1.0"><array>
+  <dict><key>PersonaID</key><integer>1000</integer><key>Kind</key><string>personal</string>
+        <key>UniqueString</key><string>PERSONAL-1000</string></dict>
+  <dict><key>PersonaID</key><integer>1001</integer><key>Kind</key><string>enterprise</string>
+        <key>UniqueString</key><string>WORK-1001</string>
+        <key>LayoutPath</key><string>/private/var/enterprise/1001</string>
+        <key>BundleIdentifiers</key><array><string>com.example.work</string></array></dict>
+  <dict><key>PersonaID</key><integer>1002</integer><key>Kind</key><string>universal</string>
+        <key>UniqueString</key><string>SHARED-1002</string>
+        <key>BundleIdentifiers</key><array><string>com.tamsk.demo.installer</string></array></dict>
+</array></plist>
+PL
+mkdir -p "$root/private/var/enterprise/1001"
 cp "$vessactl" "$root/usr/bin/demo-installer"
 cat > "$root/etc/vessad/clients.d/demo-installer.plist" <<'PL'
 <?xml version="1.0" encoding="UTF-8"?>

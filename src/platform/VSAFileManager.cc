@@ -126,6 +126,11 @@ std::optional<std::string> VSAFileManager::realPathForURL(const std::string& pat
         VSAFormat("Rejecting %@ with base %@ because base component count is greater "
                   "than child component count (reals %@ ; %@)",
                   path, base, *realPath, *realBase));
+  if (bc.size() - bi == pc.size() - pi)
+    return reject(
+        VSAFormat("Rejecting %@ with base %@ because it resolves to the base itself "
+                  "(reals %@ ; %@)",
+                  path, base, *realPath, *realBase));
   for (; bi < bc.size(); ++bi, ++pi) {
     if (bc[bi] != pc[pi])
       return reject(

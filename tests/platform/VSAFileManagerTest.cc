@@ -55,6 +55,10 @@ TEST_F(FileManager, ClientPathsStayInsideTheBase) {
   EXPECT_EQ(faults_->totalCalls(), before);
   EXPECT_FALSE(fm_->realPathForURL(root_ + "/elsewhere", base_));
   EXPECT_FALSE(fm_->realPathForURL("", base_));
+  // Only paths strictly inside the base are answered, never the base itself.
+  EXPECT_FALSE(fm_->realPathForURL(base_ + "/", base_));
+  EXPECT_FALSE(fm_->realPathForURL(base_ + "/.", base_));
+  EXPECT_FALSE(fm_->realPathForURL(base_ + "/Documents/sub/../..", base_));
   // Relative link that stays inside: accepted; climbing out or to the base: refused.
   fs::create_directories(base_ + "/a");
   file(base_ + "/c");
