@@ -7,6 +7,7 @@
 #include <cstdlib>
 #include <string>
 
+#include "base/VSALog.h"
 #include "platform/VSAFileManager.h"
 #include "platform/VSALinuxFileSystem.h"
 
@@ -16,6 +17,7 @@ struct Tree {
   VSAFileManager fm{std::make_shared<VSALinuxFileSystem>(),
                     std::make_shared<VSAUserDatabase>(VSASystemRoot("/"))};
   Tree() {
+    VSALogger::shared().setLevel(0);  // rejections are expected; logging them only slows the run
     char tmpl[] = "/tmp/vessa-fuzz-paths-XXXXXX";
     root = mkdtemp(tmpl);
     base = root + "/container";
