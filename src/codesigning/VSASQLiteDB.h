@@ -1,0 +1,74 @@
+// The code-signing database: `containers.sqlite3` in the library directory.
+//
+// One row per code-signing identifier (flags and data container class), its
+// code-signing info dictionary as a binary property-list blob, and the child
+// (plug-in) identifiers linked to a parent. Every statement is prepared per
+// call and finalised on every path; multi-statement changes run inside
+// BEGIN/COMMIT and roll back on failure. The file is opened in exclusive
+// locking mode: a second daemon on the same root cannot use it and stops at
+// start-up instead of corrupting it. Not thread-safe: all calls come from the
+// code-signing mapping's serial queue.
+#pragma once
+
+#include <functional>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "base/VSAError.h"
+#include "codesigning/VSACodeSigningEntry.h"
+
+struct sqlite3;
+
+class VSASQLiteDB {
+ public:
+  // initWithParentDirectoryURL: opens (and creates) <directory>/containers.sqlite3.
+  explicit VSASQLiteDB(const std::string& parentDirectory);
+  ~VSASQLiteDB();
+  VSASQLiteDB(const VSASQLiteDB&) = delete;
+  VSASQLiteDB& operator=(const VSASQLiteDB&) = delete;
+
+  // Opens and initialises the file; ends the process when it cannot.
+  static sqlite3* openDBWithURL(const std::string& path);
+  void closeDB();
+  const std::string& url() const { return url_; }
+
+  bool addCodeSigningEntry(const VSACodeSigningEntry* entry, const std::string* identifier,
+                           VSAErrorRef* error);
+  std::optional<VSACodeSigningEntry> codeSigningEntryWithIdentifier(const std::string& identifier,
+                                                                    VSAErrorRef* error);
+  bool deleteCodeSigningEntryWithIdentifier(const std::string* identifier, VSAErrorRef* error);
+  bool invalidateCodeSigningWithIdentifier(const std::string& identifier, VSAErrorRef* error);
+  bool invalidateCodeSigningForIdentifierAndAllChildren(const std::string& identifier,
+                                                        VSAErrorRef* error);
+  bool deleteAllAdvanceCopiesOfCodeSigningEntriesWithError(VSAErrorRef* error);
+  std::optional<std::string> parentIdentifierForChildIdentifier(const std::string& child,
+                                                                VSAErrorRef* error);
+  std::optional<std::vector<std::string>> childIdentifiersForParentIdentifier(
+      const std::string& parent, VSAErrorRef* error);
+  std::optional<std::vector<std::string>> identifiersWithError(VSAErrorRef* error);
+  // Calls `block` once per identifier; answers an error, or null when the walk completed.
+  VSAErrorRef enumerateIdentifiersAndCodeSigningInfoUsingBlock(
+      const std::function<void(const std::string&, const VSACodeSigningEntry&)>& block);
+
+ private:
+  class Statement;
+  bool _sqliteExec(const char* sql, VSAErrorRef* error);
+  bool _insertCodeSigningInfo(const VSACodeSigningEntry& entry, const std::string& identifier,
+                              VSAErrorRef* error);
+  bool _performInsertOrUpdateQuery(const char* sql, const VSACodeSigningEntry& entry,
+                                   const std::string& identifier, VSAErrorRef* error);
+  bool _insertCodeSigningData(const VSACodeSigningEntry& entry, const std::string& identifier,
+                              VSAErrorRef* error);
+  bool _performSingleParameterQuery(const char* sql, const std::string& input, int expectedChanges,
+                                    VSAErrorRef* error);
+  bool _performTwoParameterQuery(const char* sql, const std::string& one, const std::string& two,
+                                 int expectedChanges, VSAErrorRef* error);
+  std::optional<VSACodeSigningEntry> _codeSigningEntryFromStatementRow(Statement& statement,
+                                                                       VSAErrorRef* error);
+  bool fillChildren(VSACodeSigningEntry& entry, const std::string& identifier, VSAErrorRef* error);
+  bool transaction(const std::function<bool(VSAErrorRef*)>& body, VSAErrorRef* error);
+
+  std::string url_;
+  sqlite3* db_ = nullptr;
+};

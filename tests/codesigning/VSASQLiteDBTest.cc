@@ -1,0 +1,171 @@
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <filesystem>
+
+#include "codesigning/VSASQLiteDB.h"
+
+namespace {
+
+class CodeSigningDB : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    char tmpl[] = "/tmp/vessa-db-XXXXXX";
+    dir_ = mkdtemp(tmpl);
+    db_ = std::make_unique<VSASQLiteDB>(dir_);
+  }
+  void TearDown() override {
+    db_.reset();
+    std::filesystem::remove_all(dir_);
+  }
+  static VSACodeSigningEntry entry(const char* team, std::vector<std::string> children = {}) {
+    VSACodeSigningEntry e(VSAValue::Dictionary{{"TeamIdentifier", VSAValue(team)}}, 2);
+    if (!children.empty()) e.setChildBundleIdentifiers(children);
+    return e;
+  }
+  bool add(const VSACodeSigningEntry& e, const std::string& id) {
+    VSAErrorRef error;
+    bool ok = db_->addCodeSigningEntry(&e, &id, &error);
+    EXPECT_TRUE(ok) << (error ? error->description() : "");
+    return ok;
+  }
+  std::string dir_;
+  std::unique_ptr<VSASQLiteDB> db_;
+};
+
+TEST(VSACodeSigningEntry, SerialisationEqualityAndHash) {
+  VSACodeSigningEntry a(VSAValue::Dictionary{{"k", VSAValue(1)}}, 0);
+  a.setChildBundleIdentifiers(std::vector<std::string>{"x", "y"});
+  a.setAdvanceCopy(true);
+  VSACodeSigningEntry back = VSACodeSigningEntry::initWithSerializedDictionary(a.serialize());
+  EXPECT_TRUE(back.isEqual(a));
+  VSACodeSigningEntry reordered = a;
+  reordered.setChildBundleIdentifiers(std::vector<std::string>{"y", "x"});
+  EXPECT_FALSE(reordered.isEqual(a)) << "child order matters";
+  VSACodeSigningEntry classed = a;
+  classed.setDataContainerClass(7);
+  EXPECT_EQ(classed.hash(), a.hash() + 16);
+  classed.setDataContainerClass(2);
+  EXPECT_EQ(classed.hash(), a.hash() + 16) << "whatever the class's value";
+  EXPECT_NE(a.description().find("advanceCopy: Y"), std::string::npos);
+  VSACodeSigningEntry empty =
+      VSACodeSigningEntry::initWithSerializedDictionary(VSAValue::dictionary());
+  EXPECT_FALSE(empty.isInvalid() || empty.isPlaceholder() || empty.childBundleIdentifiers());
+}
+
+TEST_F(CodeSigningDB, UpdateThenInsertAndReplace) {
+  ASSERT_TRUE(add(entry("A", {"com.p.child1", "com.p.child2"}), "com.p"));
+  VSAErrorRef error;
+  auto got = db_->codeSigningEntryWithIdentifier("com.p", &error);
+  ASSERT_TRUE(got);
+  EXPECT_EQ(*got->codeSigningInfo().get("TeamIdentifier")->stringValue(), "A");
+  EXPECT_EQ(got->dataContainerClass(), 2u);
+  EXPECT_EQ(got->childBundleIdentifiers()->size(), 2u);
+  // Re-adding replaces blob and flags but keeps child links it no longer lists.
+  auto second = entry("B", {"com.p.child1"});
+  second.setInvalid(true);
+  ASSERT_TRUE(add(second, "com.p"));
+  got = db_->codeSigningEntryWithIdentifier("com.p", &error);
+  EXPECT_EQ(*got->codeSigningInfo().get("TeamIdentifier")->stringValue(), "B");
+  EXPECT_TRUE(got->isInvalid());
+  EXPECT_EQ(got->childBundleIdentifiers()->size(), 2u);
+  EXPECT_EQ(*db_->parentIdentifierForChildIdentifier("com.p.child2", &error), "com.p");
+  EXPECT_EQ(db_->identifiersWithError(&error)->size(), 1u);
+}
+
+TEST_F(CodeSigningDB, NotFoundAndNoChildren) {
+  VSAErrorRef error;
+  EXPECT_FALSE(db_->codeSigningEntryWithIdentifier("none", &error));
+  EXPECT_EQ(error->code(), 67);
+  EXPECT_EQ(error->message(), "Identifier: \"none\" Not Found in DB");
+  ASSERT_TRUE(add(entry("A"), "com.lonely"));
+  auto got = db_->codeSigningEntryWithIdentifier("com.lonely", &error);
+  ASSERT_TRUE(got);
+  EXPECT_FALSE(got->childBundleIdentifiers()) << "no children: not set, not an error";
+  EXPECT_FALSE(db_->parentIdentifierForChildIdentifier("com.lonely", &error));
+  EXPECT_EQ(error->code(), 67);
+}
+
+TEST_F(CodeSigningDB, DeletingAParentCascadesLinksNotChildren) {
+  ASSERT_TRUE(add(entry("A", {"com.p.child"}), "com.p"));
+  ASSERT_TRUE(add(entry("C"), "com.p.child"));
+  VSAErrorRef error;
+  std::string parent = "com.p";
+  ASSERT_TRUE(db_->deleteCodeSigningEntryWithIdentifier(&parent, &error));
+  EXPECT_FALSE(db_->parentIdentifierForChildIdentifier("com.p.child", &error));
+  EXPECT_TRUE(db_->codeSigningEntryWithIdentifier("com.p.child", &error));
+  std::string unknown = "com.unknown";
+  EXPECT_FALSE(db_->deleteCodeSigningEntryWithIdentifier(&unknown, &error));
+  EXPECT_EQ(error->code(), 68);
+  EXPECT_TRUE(db_->invalidateCodeSigningWithIdentifier("com.unknown", &error))
+      << "invalidating an unknown identifier succeeds";
+  EXPECT_FALSE(db_->deleteCodeSigningEntryWithIdentifier(nullptr, &error));
+  EXPECT_EQ(error->code(), 38);
+  EXPECT_EQ(error->message()[0], '\b');
+}
+
+TEST_F(CodeSigningDB, AdvanceCopiesArePurgedByTheirBit) {
+  auto advance = entry("A");
+  advance.setAdvanceCopy(true);
+  auto placeholder = entry("B");
+  placeholder.setPlaceholder(true);
+  ASSERT_TRUE(add(advance, "com.advance"));
+  ASSERT_TRUE(add(placeholder, "com.placeholder"));
+  VSAErrorRef error;
+  ASSERT_TRUE(db_->deleteAllAdvanceCopiesOfCodeSigningEntriesWithError(&error));
+  EXPECT_FALSE(db_->codeSigningEntryWithIdentifier("com.advance", &error));
+  auto kept = db_->codeSigningEntryWithIdentifier("com.placeholder", &error);
+  ASSERT_TRUE(kept);
+  EXPECT_TRUE(kept->isPlaceholder());
+  EXPECT_FALSE(kept->isAdvanceCopy());
+}
+
+TEST_F(CodeSigningDB, InvalidateWithChildrenAndEnumerate) {
+  ASSERT_TRUE(add(entry("A", {"com.p.c1", "com.p.c2"}), "com.p"));
+  ASSERT_TRUE(add(entry("C"), "com.p.c1"));
+  ASSERT_TRUE(add(entry("D"), "com.p.c2"));
+  ASSERT_TRUE(add(entry("Q'uote\"d"), "odd 'id\" ;--"));
+  VSAErrorRef error;
+  ASSERT_TRUE(db_->invalidateCodeSigningForIdentifierAndAllChildren("com.p", &error));
+  int seen = 0, invalid = 0;
+  EXPECT_FALSE(db_->enumerateIdentifiersAndCodeSigningInfoUsingBlock(
+      [&](const std::string& id, const VSACodeSigningEntry& e) {
+        ++seen;
+        invalid += e.isInvalid();
+        if (id == "com.p") {
+          EXPECT_EQ(e.childBundleIdentifiers()->size(), 2u);
+        }
+      }));
+  EXPECT_EQ(seen, 4);
+  EXPECT_EQ(invalid, 3);
+  EXPECT_TRUE(db_->codeSigningEntryWithIdentifier("odd 'id\" ;--", &error))
+      << "identifiers are bound, not spliced";
+}
+
+TEST_F(CodeSigningDB, ReopeningKeepsTheRows) {
+  ASSERT_TRUE(add(entry("A"), "com.keep"));
+  db_.reset();
+  db_ = std::make_unique<VSASQLiteDB>(dir_);
+  VSAErrorRef error;
+  EXPECT_TRUE(db_->codeSigningEntryWithIdentifier("com.keep", &error));
+}
+
+TEST_F(CodeSigningDB, ASecondOpenerOfTheFileStopsInsteadOfSharingIt) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_DEATH(VSASQLiteDB second(dir_), "Failed to (initialize|open) database, err = ");
+  VSAErrorRef error;
+  ASSERT_TRUE(add(entry("A"), "com.after")) << "the first opener is unaffected";
+}
+
+TEST_F(CodeSigningDB, CorruptFileStopsAtOpen) {
+  db_.reset();
+  std::filesystem::remove_all(dir_);
+  std::filesystem::create_directories(dir_);
+  FILE* f = fopen((dir_ + "/containers.sqlite3").c_str(), "wb");
+  fputs("this is not a database, but it is long enough to look like a header................", f);
+  fclose(f);
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_DEATH(VSASQLiteDB broken(dir_), "Failed to initialize database, err = ");
+}
+
+}  // namespace
