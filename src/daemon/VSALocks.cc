@@ -128,7 +128,8 @@ struct LockTable {
   int32_t allReaderWriterState = 0;
 };
 
-LockTable gVSALocks;
+// Never destroyed: lock calls may come from threads still running at exit.
+LockTable& gVSALocks = *new LockTable();
 
 [[noreturn]] void assertionFailed(const char* function, const char* condition) {
   VSALogIn(VSALogCategory::Locking, kVSALogFault, function, "Assertion failed: %s", condition);
