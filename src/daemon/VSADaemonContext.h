@@ -8,8 +8,10 @@
 #include <memory>
 
 #include "base/VSAWorkQueue.h"
+#include "codesigning/VSAWhitelist.h"
 #include "model/VSAGlobalConfiguration.h"
 #include "model/VSAUserIdentitySharedCache.h"
+#include "platform/VSAApplicationTerminationService.h"
 #include "platform/VSAClientRegistry.h"
 #include "platform/VSADeviceProperties.h"
 #include "platform/VSAFileManager.h"
@@ -35,7 +37,13 @@ struct VSADaemonContext {
         fileManager(std::make_shared<VSAFileManager>(fileSystem, userDatabase)),
         globalConfiguration(std::make_shared<VSAGlobalConfiguration>(root, deviceProperties,
                                                                      userDatabase, fileManager)),
-        transactions(std::make_shared<VSATransactions>()) {
+        transactions(std::make_shared<VSATransactions>()),
+        whitelist(VSAWhitelist::load(root.resolve("/etc/vessad/whitelist.plist"),
+                                     globalConfiguration->isInternalImage())) {
+    // A device may come without a termination service ("HasTerminationService" NO).
+    if (deviceProperties->deviceDictionary().get("HasTerminationService") == nullptr ||
+        deviceProperties->deviceDictionary().get("HasTerminationService")->boolValue().value_or(true))
+      terminationService = std::make_shared<VSAApplicationTerminationService>(root, clientRegistry);
     userIdentityCache = VSAUserIdentitySharedCache::create(
         {personaService, userDatabase, globalConfiguration->currentMobileUserId(),
          globalConfiguration->currentMobileGroupId(),
@@ -54,6 +62,8 @@ struct VSADaemonContext {
   std::shared_ptr<VSAGlobalConfiguration> globalConfiguration;
   std::shared_ptr<VSATransactions> transactions;
   std::shared_ptr<VSAUserIdentitySharedCache> userIdentityCache;
+  std::shared_ptr<VSAWhitelist> whitelist;
+  std::shared_ptr<VSAApplicationTerminationService> terminationService;  // may be null
 
   VSAWorkQueue::Ref listenerQueue;   // "com.tamsk.vessad.listener"
   VSAWorkQueue::Ref deathrowQueue;   // "com.tamsk.vessad.deathrow"
