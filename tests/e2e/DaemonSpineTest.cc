@@ -257,3 +257,43 @@ TEST(DaemonPersonas, EditingThePersonaFileChangesARunningDaemonsAnswers) {
 }
 
 }  // namespace
+
+namespace {
+
+// SIGTERM while a request is still waiting to be served: the daemon stops
+// accepting, answers what it already received, and only then exits.
+TEST(DaemonShutdown, WaitsForOpenTransactionsBeforeExiting) {
+  VSATestDaemon d;
+  d.registerSelf("com.example.full", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
+  std::string logDir = d.path("/private/var/root/Library/Logs/Vessa");
+  std::filesystem::create_directories(logDir);
+  ASSERT_EQ(mkfifo((logDir + "/vessad.log").c_str(), 0644), 0);  // holds initialisation
+  ASSERT_TRUE(d.start());
+  VSAIPCClient client;
+  VSAErrorRef error;
+  ASSERT_TRUE(client.connect(d.socketPath(), &error));
+  auto id = client.send(command(27), &error);
+  ASSERT_TRUE(id);
+  std::this_thread::sleep_for(200ms);
+  std::thread stopper([&] { EXPECT_EQ(d.stop(), 0); });
+  std::this_thread::sleep_for(300ms);
+  // The stop is waiting on the request's transaction; release initialisation.
+  std::atomic<bool> stopReading{false};
+  std::thread reader([&] {
+    int fd = open((logDir + "/vessad.log").c_str(), O_RDONLY | O_NONBLOCK);
+    char buf[4096];
+    while (!stopReading)
+      if (read(fd, buf, sizeof buf) <= 0) std::this_thread::sleep_for(2ms);
+    close(fd);
+  });
+  EXPECT_EQ(replyError(client.waitForReply(*id, 10s, &error)), 49u)
+      << "the request received before SIGTERM is still answered";
+  stopper.join();
+  stopReading = true;
+  reader.join();
+  EXPECT_FALSE(std::filesystem::exists(d.socketPath()));
+  VSAIPCClient late;
+  EXPECT_FALSE(late.connect(d.socketPath(), &error)) << "nothing listens after the stop";
+}
+
+}  // namespace
