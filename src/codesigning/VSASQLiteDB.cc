@@ -195,29 +195,30 @@ bool isNotFound(const VSAErrorRef& e) {
 
 bool VSASQLiteDB::_performSingleParameterQuery(const char* sql, const std::string& input,
                                                int expectedChanges, VSAErrorRef* error) {
-  Statement s(*this, sql, "delete", error);
-  if (!s || !s.bindText(1, input, "identifier", error) || s.step(error) != SQLITE_DONE)
-    return false;
-  int changes = sqlite3_changes(db_);
-  if (expectedChanges >= 0 && changes != expectedChanges) {
-    VSASetError(error, dbError(VSAResult::kUnexpectedChangeCount, "_performSingleParameterQuery",
-                               "sqlite3_changes for %s in %@: %d, but expecting %d", sql, url_,
-                               changes, expectedChanges));
-    return false;
-  }
-  return true;
+  return performTextQuery(sql, "delete", {{input, "identifier"}}, expectedChanges, error);
 }
 
 bool VSASQLiteDB::_performTwoParameterQuery(const char* sql, const std::string& one,
                                             const std::string& two, int expectedChanges,
                                             VSAErrorRef* error) {
-  Statement s(*this, sql, "insert", error);
-  if (!s || !s.bindText(1, one, "child_code_signing_id_text", error) ||
-      !s.bindText(2, two, "code_signing_id_text", error) || s.step(error) != SQLITE_DONE)
-    return false;
+  return performTextQuery(sql, "insert",
+                          {{one, "child_code_signing_id_text"}, {two, "code_signing_id_text"}},
+                          expectedChanges, error);
+}
+
+// Prepares, binds the texts in order, steps once and, unless
+// `expectedChanges` is -1, checks the change count.
+bool VSASQLiteDB::performTextQuery(const char* sql, const char* kind,
+                                   const std::vector<std::pair<std::string, const char*>>& texts,
+                                   int expectedChanges, VSAErrorRef* error) {
+  Statement s(*this, sql, kind, error);
+  if (!s) return false;
+  for (size_t i = 0; i < texts.size(); ++i)
+    if (!s.bindText(static_cast<int>(i + 1), texts[i].first, texts[i].second, error)) return false;
+  if (s.step(error) != SQLITE_DONE) return false;
   int changes = sqlite3_changes(db_);
   if (expectedChanges >= 0 && changes != expectedChanges) {
-    VSASetError(error, dbError(VSAResult::kUnexpectedChangeCount, "_performTwoParameterQuery",
+    VSASetError(error, dbError(VSAResult::kUnexpectedChangeCount, "performTextQuery",
                                "sqlite3_changes for %s in %@: %d, but expecting %d", sql, url_,
                                changes, expectedChanges));
     return false;

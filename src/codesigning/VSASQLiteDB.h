@@ -62,6 +62,9 @@ class VSASQLiteDB {
                               VSAErrorRef* error);
   bool _performSingleParameterQuery(const char* sql, const std::string& input, int expectedChanges,
                                     VSAErrorRef* error);
+  bool performTextQuery(const char* sql, const char* kind,
+                        const std::vector<std::pair<std::string, const char*>>& texts,
+                        int expectedChanges, VSAErrorRef* error);
   bool _performTwoParameterQuery(const char* sql, const std::string& one, const std::string& two,
                                  int expectedChanges, VSAErrorRef* error);
   std::optional<VSACodeSigningEntry> _codeSigningEntryFromStatementRow(Statement& statement,

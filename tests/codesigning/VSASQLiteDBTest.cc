@@ -3,6 +3,7 @@
 
 #include <filesystem>
 
+#include "VSATestTempDir.h"
 #include "codesigning/VSASQLiteDB.h"
 
 namespace {
@@ -10,8 +11,7 @@ namespace {
 class CodeSigningDB : public ::testing::Test {
  protected:
   void SetUp() override {
-    char tmpl[] = "/tmp/vessa-db-XXXXXX";
-    dir_ = mkdtemp(tmpl);
+    dir_ = temp_.path();
     db_ = std::make_unique<VSASQLiteDB>(dir_);
   }
   void TearDown() override {
@@ -29,6 +29,7 @@ class CodeSigningDB : public ::testing::Test {
     EXPECT_TRUE(ok) << (error ? error->description() : "");
     return ok;
   }
+  VSATestTempDir temp_{"vessa-db"};
   std::string dir_;
   std::unique_ptr<VSASQLiteDB> db_;
 };

@@ -5,6 +5,7 @@
 
 #include <filesystem>
 
+#include "VSATestTempDir.h"
 #include "base/VSAPlist.h"
 #include "daemon/VSAApplicationTerminationAssertion.h"
 
@@ -15,8 +16,7 @@ namespace {
 class Termination : public ::testing::Test {
  protected:
   void SetUp() override {
-    char tmpl[] = "/tmp/vessa-term-XXXXXX";
-    root_ = mkdtemp(tmpl);
+    root_ = temp_.path();
     fs::create_directories(root_ + "/etc/vessad/clients.d");
     fs::create_directories(root_ + "/usr/bin");
     fs::create_directories(root_ + "/run/vessad");
@@ -28,7 +28,7 @@ class Termination : public ::testing::Test {
     service_ = std::make_unique<VSAApplicationTerminationService>(
         root, std::make_shared<VSAClientRegistry>(root));
   }
-  void TearDown() override { fs::remove_all(root_); }
+  VSATestTempDir temp_{"vessa-term"};
   std::string root_;
   std::unique_ptr<VSAApplicationTerminationService> service_;
 };

@@ -80,11 +80,8 @@ TEST(DaemonSpine, EntitlementGatesThroughRealClients) {
 TEST(DaemonSpine, RequestSentDuringInitialisationIsAnsweredAfterIt) {
   VSATestDaemon d;
   d.registerSelf("com.example.full", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
-  // The log file is a FIFO: opening it (the first step of initialisation)
-  // blocks until somebody reads, which holds initialisation at that point.
-  std::string logDir = d.path("/private/var/root/Library/Logs/Vessa");
-  std::filesystem::create_directories(logDir);
-  ASSERT_EQ(mkfifo((logDir + "/vessad.log").c_str(), 0644), 0);
+  // Initialisation is held at its first step (opening the log).
+  VSAInitialisationHold hold(d.root());
   ASSERT_TRUE(d.start());
   VSAIPCClient client;
   VSAErrorRef error;
@@ -92,22 +89,12 @@ TEST(DaemonSpine, RequestSentDuringInitialisationIsAnsweredAfterIt) {
   auto id = client.send(command(27), &error);
   ASSERT_TRUE(id);
   EXPECT_FALSE(client.waitForReply(*id, 500ms, &error)) << "answered before initialisation";
-  std::atomic<bool> stopReading{false};
-  std::thread reader([&] {
-    int fd = open((logDir + "/vessad.log").c_str(), O_RDONLY | O_NONBLOCK);
-    char buf[4096];
-    while (!stopReading) {
-      if (read(fd, buf, sizeof buf) <= 0) std::this_thread::sleep_for(2ms);
-    }
-    close(fd);
-  });
+  hold.release();
   auto reply = client.waitForReply(*id, 10s, &error);
   EXPECT_EQ(replyError(reply), 49u);
   std::string out = d.daemonOutput();
   EXPECT_LT(out.find("end StartingUp"), out.find("command=27, client="));
   EXPECT_EQ(d.stop(), 0);
-  stopReading = true;
-  reader.join();
 }
 
 TEST(DaemonSpine, FirstBootWorkRunsOncePerBoot) {
@@ -265,9 +252,7 @@ namespace {
 TEST(DaemonShutdown, WaitsForOpenTransactionsBeforeExiting) {
   VSATestDaemon d;
   d.registerSelf("com.example.full", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
-  std::string logDir = d.path("/private/var/root/Library/Logs/Vessa");
-  std::filesystem::create_directories(logDir);
-  ASSERT_EQ(mkfifo((logDir + "/vessad.log").c_str(), 0644), 0);  // holds initialisation
+  VSAInitialisationHold hold(d.root());
   ASSERT_TRUE(d.start());
   VSAIPCClient client;
   VSAErrorRef error;
@@ -278,19 +263,10 @@ TEST(DaemonShutdown, WaitsForOpenTransactionsBeforeExiting) {
   std::thread stopper([&] { EXPECT_EQ(d.stop(), 0); });
   std::this_thread::sleep_for(300ms);
   // The stop is waiting on the request's transaction; release initialisation.
-  std::atomic<bool> stopReading{false};
-  std::thread reader([&] {
-    int fd = open((logDir + "/vessad.log").c_str(), O_RDONLY | O_NONBLOCK);
-    char buf[4096];
-    while (!stopReading)
-      if (read(fd, buf, sizeof buf) <= 0) std::this_thread::sleep_for(2ms);
-    close(fd);
-  });
+  hold.release();
   EXPECT_EQ(replyError(client.waitForReply(*id, 10s, &error)), 49u)
       << "the request received before SIGTERM is still answered";
   stopper.join();
-  stopReading = true;
-  reader.join();
   EXPECT_FALSE(std::filesystem::exists(d.socketPath()));
   VSAIPCClient late;
   EXPECT_FALSE(late.connect(d.socketPath(), &error)) << "nothing listens after the stop";

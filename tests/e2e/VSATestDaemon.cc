@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <signal.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -9,6 +10,7 @@
 #include <filesystem>
 #include <fstream>
 #include <sstream>
+#include <stdexcept>
 #include <thread>
 
 #include "base/VSAPlist.h"
@@ -169,4 +171,27 @@ std::string VSATestDaemon::daemonOutput() const {
   std::stringstream ss;
   ss << in.rdbuf();
   return ss.str();
+}
+
+VSAInitialisationHold::VSAInitialisationHold(const std::string& root) {
+  std::string dir = root + "/private/var/root/Library/Logs/Vessa";
+  fs::create_directories(dir);
+  fifo_ = dir + "/vessad.log";
+  if (mkfifo(fifo_.c_str(), 0644) != 0) throw std::runtime_error("mkfifo failed");
+}
+
+void VSAInitialisationHold::release() {
+  if (reader_.joinable()) return;
+  reader_ = std::thread([this] {
+    int fd = open(fifo_.c_str(), O_RDONLY | O_NONBLOCK);
+    char buf[4096];
+    while (!stop_)
+      if (read(fd, buf, sizeof buf) <= 0) std::this_thread::sleep_for(2ms);
+    close(fd);
+  });
+}
+
+VSAInitialisationHold::~VSAInitialisationHold() {
+  stop_ = true;
+  if (reader_.joinable()) reader_.join();
 }

@@ -9,12 +9,28 @@
 
 #include <sys/types.h>
 
+#include <atomic>
 #include <chrono>
 #include <optional>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "base/VSAValue.h"
+
+// Makes the daemon's log file a FIFO, so that initialisation (whose first
+// step opens the log) blocks until release() starts draining it.
+class VSAInitialisationHold {
+ public:
+  explicit VSAInitialisationHold(const std::string& root);
+  ~VSAInitialisationHold();
+  void release();
+
+ private:
+  std::string fifo_;
+  std::atomic<bool> stop_{false};
+  std::thread reader_;
+};
 
 class VSATestDaemon {
  public:

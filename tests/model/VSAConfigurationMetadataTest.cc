@@ -5,6 +5,7 @@
 #include <filesystem>
 #include <fstream>
 
+#include "VSATestTempDir.h"
 #include "base/VSAPlist.h"
 #include "model/FakePersonaService.h"
 #include "model/VSAGlobalConfiguration.h"
@@ -23,8 +24,7 @@ namespace {
 class Layout : public ::testing::Test {
  protected:
   void SetUp() override {
-    char tmpl[] = "/tmp/vessa-layout-XXXXXX";
-    root_ = mkdtemp(tmpl);
+    root_ = temp_.path();
     fs::create_directories(root_ + "/etc");
     fs::create_directories(root_ + "/private/var/mobile");
     fs::create_directories(root_ + "/private/var/u502");
@@ -42,7 +42,6 @@ class Layout : public ::testing::Test {
     cache_ = VSAUserIdentityCache::create({personas, users, 501, 501, true, nullptr});
     personal_ = cache_->userIdentityForPersonalPersona();
   }
-  void TearDown() override { fs::remove_all(root_); }
 
   // A container of `c` for `owner` with a metadata file; returns the metadata.
   VSAMetadataRef makeContainer(VSAContainerClass c, const VSAUserIdentityRef& owner) {
@@ -84,6 +83,7 @@ class Layout : public ::testing::Test {
     return error->message();
   }
 
+  VSATestTempDir temp_{"vessa-layout"};
   std::string root_;
   std::shared_ptr<VSAFaultInjectingFileSystem> faults_;
   std::unique_ptr<VSAGlobalConfiguration> config_;

@@ -4,6 +4,7 @@
 #include <filesystem>
 #include <fstream>
 
+#include "VSATestTempDir.h"
 #include "model/FakePersonaService.h"
 #include "model/VSAConcreteContainerIdentity.h"
 #include "model/VSAContainerIdentity.h"
@@ -17,8 +18,7 @@ using namespace std::chrono_literals;
 class UserIdentities : public ::testing::Test {
  protected:
   void SetUp() override {
-    char tmpl[] = "/tmp/vessa-users-XXXXXX";
-    root_ = mkdtemp(tmpl);
+    root_ = temp_.path();
     std::filesystem::create_directories(root_ + "/etc");
     std::filesystem::create_directories(root_ + "/private/var/mobile");
     std::filesystem::create_directories(root_ + "/private/var/u502");
@@ -33,7 +33,6 @@ class UserIdentities : public ::testing::Test {
         FakePersonaService::persona(Kind::Universal, 1003, "U-1003", {"com.app.shared"}),
     };
   }
-  void TearDown() override { std::filesystem::remove_all(root_); }
 
   std::shared_ptr<VSAUserIdentityCache> makeCache(bool supported = true,
                                                   VSAUserIdentityCache::Options options = {}) {
@@ -43,6 +42,7 @@ class UserIdentities : public ::testing::Test {
         std::move(options));
   }
 
+  VSATestTempDir temp_{"vessa-users"};
   std::string root_;
   std::shared_ptr<FakePersonaService> personas_;
 };

@@ -6,6 +6,7 @@
 #include <filesystem>
 #include <fstream>
 
+#include "VSATestTempDir.h"
 #include "platform/VSAFaultInjectingFileSystem.h"
 #include "platform/VSAFileManager.h"
 #include "platform/VSALinuxFileSystem.h"
@@ -18,8 +19,7 @@ namespace {
 class FileManager : public ::testing::Test {
  protected:
   void SetUp() override {
-    char tmpl[] = "/tmp/vessa-fm-XXXXXX";
-    root_ = mkdtemp(tmpl);
+    root_ = temp_.path();
     fs::create_directories(root_ + "/etc");
     std::ofstream(root_ + "/etc/group") << "systemusers:x:600:\n";
     base_ = root_ + "/container";
@@ -29,16 +29,13 @@ class FileManager : public ::testing::Test {
     fm_ = std::make_unique<VSAFileManager>(faults_,
                                            std::make_shared<VSAUserDatabase>(VSASystemRoot(root_)));
   }
-  void TearDown() override {
-    std::error_code ec;
-    fs::remove_all(root_, ec);
-  }
   void file(const std::string& path, const std::string& text = "x") {
     fs::create_directories(fs::path(path).parent_path());
     std::ofstream(path) << text;
   }
   std::string real(const std::string& p) { return fs::canonical(p).string(); }
 
+  VSATestTempDir temp_{"vessa-fm"};
   std::string root_, base_;
   bool locked_ = false;
   std::shared_ptr<VSAFaultInjectingFileSystem> faults_;

@@ -6,6 +6,7 @@
 #include <fstream>
 #include <thread>
 
+#include "VSATestTempDir.h"
 #include "base/VSAPlist.h"
 #include "platform/VSAAuditToken.h"
 #include "platform/VSALinuxPersonaService.h"
@@ -17,12 +18,10 @@ using namespace std::chrono_literals;
 class PersonaFiles : public ::testing::Test {
  protected:
   void SetUp() override {
-    char tmpl[] = "/tmp/vessa-personas-XXXXXX";
-    root_ = mkdtemp(tmpl);
+    root_ = temp_.path();
     std::filesystem::create_directories(root_ + "/etc/vessad");
     std::filesystem::create_directories(root_ + "/run/vessad/process-personas");
   }
-  void TearDown() override { std::filesystem::remove_all(root_); }
   void write(const VSAValue& v) {
     VSAErrorRef error;
     auto bytes = VSAPlist::serialize(v, VSAPlist::Format::XML, &error);
@@ -33,6 +32,7 @@ class PersonaFiles : public ::testing::Test {
     if (!unique.isNull()) r.set("UniqueString", unique);
     return r;
   }
+  VSATestTempDir temp_{"vessa-personas"};
   std::string root_;
 };
 

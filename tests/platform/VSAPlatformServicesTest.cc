@@ -9,6 +9,7 @@
 #include <fstream>
 #include <thread>
 
+#include "VSATestTempDir.h"
 #include "base/VSAPlist.h"
 #include "platform/VSAClientRegistry.h"
 #include "platform/VSADeviceProperties.h"
@@ -24,13 +25,11 @@ using namespace std::chrono_literals;
 class VSAPlatformRoot : public ::testing::Test {
  protected:
   void SetUp() override {
-    char tmpl[] = "/tmp/vessa-root-XXXXXX";
-    root_ = mkdtemp(tmpl);
+    root_ = temp_.path();
     std::filesystem::create_directories(root_ + "/etc/vessad/clients.d");
     std::filesystem::create_directories(root_ + "/run/vessad");
     std::filesystem::create_directories(root_ + "/usr/bin");
   }
-  void TearDown() override { std::filesystem::remove_all(root_); }
 
   void writePlist(const std::string& path, const VSAValue& v) {
     VSAErrorRef error;
@@ -41,6 +40,7 @@ class VSAPlatformRoot : public ::testing::Test {
     ssize_t n = readlink("/proc/self/exe", buf, sizeof buf - 1);
     return std::string(buf, n);
   }
+  VSATestTempDir temp_{"vessa-root"};
   std::string root_;
 };
 
