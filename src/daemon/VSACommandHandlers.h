@@ -20,3 +20,12 @@ void VSAHandleRetiredCommand(const VSAValue& request, VSAValue& reply,
 // may use ("ReplyPersonaUniqueStringsArray").
 void VSAHandlePersonaUniqueStrings(const VSAValue& request, VSAValue& reply,
                                    VSAClientConnection& connection, VSAResultCode* result);
+
+// Command 18: records "CodeSigningInfo" (dict) for "Identifier" with
+// "OptionsDictionary"; deletions it decides run when the request completes.
+void VSAHandleRecordCodeSigningInfo(const VSAValue& request, VSAValue& reply,
+                                    VSAClientConnection& connection, VSAResultCode* result);
+// Command 19: "ReplyInfoDictionary" with the identifier's code-signing info
+// (absent for unknown, placeholder, advance-copy and invalid entries).
+void VSAHandleReadCodeSigningInfo(const VSAValue& request, VSAValue& reply,
+                                  VSAClientConnection& connection, VSAResultCode* result);

@@ -28,8 +28,8 @@ const std::array<VSACommandTableEntry, kVSACommandCount> kTable = {{
     {15, nullptr, allowed, R, O, L},  // path of a system container
     {16, nullptr, allowed, R, O, L},  // group container paths of an owner
     {17, nullptr, allowed, R, O, L},  // path of a system group container
-    {18, nullptr, allowed, R, _, _},  // record code-signing information
-    {19, nullptr, allowed, R, _, _},  // read code-signing information
+    {18, VSAHandleRecordCodeSigningInfo, allowed, R, _, _},  // record code-signing information
+    {19, VSAHandleReadCodeSigningInfo, allowed, R, _, _},    // read code-signing information
     {20, nullptr, allowed, R, _, _},  // invalidate apps without a bundle container
     {21, nullptr, allowed, _, _, _},  // change data protection (replies from its completion)
     {22, nullptr, allowed, R, _, _},  // recreate a container's default structure

@@ -8,6 +8,7 @@
 #include <memory>
 
 #include "base/VSAWorkQueue.h"
+#include "codesigning/VSACodeSigningMapping.h"
 #include "codesigning/VSAWhitelist.h"
 #include "model/VSAGlobalConfiguration.h"
 #include "model/VSAUserIdentitySharedCache.h"
@@ -42,12 +43,19 @@ struct VSADaemonContext {
                                      globalConfiguration->isInternalImage())) {
     // A device may come without a termination service ("HasTerminationService" NO).
     if (deviceProperties->deviceDictionary().get("HasTerminationService") == nullptr ||
-        deviceProperties->deviceDictionary().get("HasTerminationService")->boolValue().value_or(true))
+        deviceProperties->deviceDictionary()
+            .get("HasTerminationService")
+            ->boolValue()
+            .value_or(true))
       terminationService = std::make_shared<VSAApplicationTerminationService>(root, clientRegistry);
     userIdentityCache = VSAUserIdentitySharedCache::create(
         {personaService, userDatabase, globalConfiguration->currentMobileUserId(),
          globalConfiguration->currentMobileGroupId(),
          VSAUserIdentityCache::personasAreSupported(*deviceProperties), transactions});
+    // Opening the database stops the process when another daemon holds it.
+    codeSigningMapping = std::make_shared<VSACodeSigningMapping>(
+        userIdentityCache, globalConfiguration,
+        std::make_unique<VSASQLiteDB>(globalConfiguration->libraryDirectory()));
   }
 
   VSASystemRoot systemRoot;
@@ -63,6 +71,7 @@ struct VSADaemonContext {
   std::shared_ptr<VSATransactions> transactions;
   std::shared_ptr<VSAUserIdentitySharedCache> userIdentityCache;
   std::shared_ptr<VSAWhitelist> whitelist;
+  std::shared_ptr<VSACodeSigningMapping> codeSigningMapping;
   std::shared_ptr<VSAApplicationTerminationService> terminationService;  // may be null
 
   VSAWorkQueue::Ref listenerQueue;   // "com.tamsk.vessad.listener"

@@ -77,8 +77,14 @@ void VSARelayDispatcher::processRelayEvent(const VSAIPCMessageRef& message) {
     identity = VSAClientIdentity::clientIdentityWithRelayConnection(
         *message->connection(), *context_.clientRegistry, *context_.userIdentityCache);
     VSAGrants grants = VSADeriveGrants(*entry, identity.get());
-    // Caller-registered entitlements are recorded here once the code-signing
-    // mapping exists; nothing else in the request depends on that step.
+    if (identity && grants.admitted) {
+      VSAResultCode registered = context_.codeSigningMapping->processCallerRegisteredEntitlements(
+          identity->entitlements(), identity->bundleIdentifier(), commandQueue.get());
+      if (registered != VSAResult::kSuccess)
+        VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin,
+                 "Error processing entitlements for %@ : %llu", identity->bundleIdentifier(),
+                 registered);
+    }
     if (!grants.admitted) {
       VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin,
                "connection attempt from pid %d (%@) is not entitled",

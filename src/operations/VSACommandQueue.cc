@@ -20,6 +20,11 @@ size_t VSACommandQueue::count() const {
   return commands_.size();
 }
 
+std::vector<std::shared_ptr<VSACommand>> VSACommandQueue::pendingCommands() const {
+  std::lock_guard lock(commandsMutex_);
+  return {commands_.begin(), commands_.end()};
+}
+
 bool VSACommandQueue::executeNextCommandWithError(VSAResultCode* error) {
   std::shared_ptr<VSACommand> command;
   {

@@ -13,6 +13,7 @@
 #include <deque>
 #include <memory>
 #include <mutex>
+#include <vector>
 
 #include "base/VSAError.h"
 #include "base/VSAWorkQueue.h"
@@ -39,6 +40,8 @@ class VSACommandQueue {
   // its code in the cell; later commands are not run).
   bool executeAllUntilExhaustedOrError(VSAResultCode* error);
   size_t count() const;
+  // A snapshot of the pending commands, oldest first.
+  std::vector<std::shared_ptr<VSACommand>> pendingCommands() const;
 
  private:
   VSAWorkQueue::Ref queue_;

@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -270,6 +271,62 @@ TEST(DaemonShutdown, WaitsForOpenTransactionsBeforeExiting) {
   EXPECT_FALSE(std::filesystem::exists(d.socketPath()));
   VSAIPCClient late;
   EXPECT_FALSE(late.connect(d.socketPath(), &error)) << "nothing listens after the stop";
+}
+
+}  // namespace
+
+namespace {
+
+TEST(DaemonCodeSigning, RecordThenReadThroughTheRealDaemon) {
+  VSATestDaemon d;
+  d.registerSelf("com.example.installer", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
+  ASSERT_TRUE(d.start());
+  VSAValue info = VSAValue::Dictionary{
+      {"com.tamsk.Vessa.Entitlements",
+       VSAValue::Dictionary{{"com.tamsk.security.application-groups", VSAValue("group.demo")}}},
+      {"TeamIdentifier", VSAValue("TEAM")}};
+  auto record = [&](const char* id, VSAValue options) {
+    return d.request(VSAValue::Dictionary{{"Command", VSAValue(18u)},
+                                          {"Identifier", VSAValue(id)},
+                                          {"CodeSigningInfo", info},
+                                          {"OptionsDictionary", options}});
+  };
+  EXPECT_EQ(replyError(record("com.example.app", VSAValue::dictionary())), 1u);
+  auto read = d.request(VSAValue::Dictionary{{"Command", VSAValue(19u)},
+                                             {"Identifier", VSAValue("com.example.app")}});
+  ASSERT_TRUE(read && read->get("ReplyInfoDictionary"));
+  EXPECT_EQ(*read->get("ReplyInfoDictionary"), info);
+  // A placeholder is recorded but not shown to clients.
+  EXPECT_EQ(replyError(record(
+                "com.example.placeholder",
+                VSAValue::Dictionary{{"com.tamsk.Vessa.PlaceholderEntitlements", VSAValue(true)}})),
+            1u);
+  auto hidden = d.request(VSAValue::Dictionary{
+      {"Command", VSAValue(19u)}, {"Identifier", VSAValue("com.example.placeholder")}});
+  EXPECT_EQ(replyError(hidden), 1u);
+  EXPECT_FALSE(hidden->get("ReplyInfoDictionary"));
+  EXPECT_EQ(replyError(d.request(VSAValue::Dictionary{{"Command", VSAValue(19u)}})), 18u);
+  EXPECT_TRUE(
+      std::filesystem::exists(d.path("/private/var/root/Library/Vessa/containers.sqlite3")));
+  EXPECT_EQ(d.stop(), 0);
+}
+
+TEST(DaemonCodeSigning, ASecondDaemonOnTheSameRootStopsAtStartUp) {
+  VSATestDaemon first;
+  ASSERT_TRUE(first.start());
+  // A second vessad on the same root must refuse to share the database.
+  pid_t pid = fork();
+  if (pid == 0) {
+    int devnull = open("/dev/null", O_WRONLY);
+    dup2(devnull, 2);
+    execl(VESSAD_PATH, "vessad", "--root", first.root().c_str(), nullptr);
+    _exit(127);
+  }
+  int status = 0;
+  waitpid(pid, &status, 0);
+  EXPECT_TRUE(WIFSIGNALED(status) || (WIFEXITED(status) && WEXITSTATUS(status) != 0));
+  EXPECT_EQ(replyError(first.request(command(27))), 55u) << "the first daemon still serves";
+  EXPECT_EQ(first.stop(), 0);
 }
 
 }  // namespace

@@ -1,0 +1,135 @@
+// What each code-signing identifier's signature and entitlements say, kept
+// in the code-signing database, and the container work that follows from
+// changes: group containers whose last reference goes and system containers
+// no longer entitled are queued for deletion on the caller's command queue
+// (never deleted inline).
+//
+// Every operation runs on the serial queue "com.tamsk.Vessa.EntitlementQueue":
+// public methods enter it synchronously and must not be called from it;
+// `_onQueue_` methods assert that they run on it.
+#pragma once
+
+#include <map>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "base/VSAValue.h"
+#include "base/VSAWorkQueue.h"
+#include "codesigning/VSASQLiteDB.h"
+#include "model/VSAGlobalConfiguration.h"
+#include "model/VSAUserIdentityCache.h"
+#include "operations/VSACommandQueue.h"
+
+inline constexpr const char* kVSAEntitlementsKey = "com.tamsk.Vessa.Entitlements";
+inline constexpr const char* kVSAOptionDataContainerClass = "com.tamsk.Vessa.DataContainerClass";
+inline constexpr const char* kVSAOptionParentBundleID = "com.tamsk.Vessa.ParentBundleID";
+inline constexpr const char* kVSAOptionRegByCaller = "RegByCaller";
+inline constexpr const char* kVSAOptionPlaceholder = "com.tamsk.Vessa.PlaceholderEntitlements";
+inline constexpr const char* kVSAOptionAdvanceCopy = "com.tamsk.Vessa.AdvanceCopy";
+inline constexpr const char* kVSAEntitlementApplicationGroups =
+    "com.tamsk.security.application-groups";
+inline constexpr const char* kVSAEntitlementSystemGroups = "com.tamsk.security.system-groups";
+inline constexpr const char* kVSAEntitlementSystemGroupContainers =
+    "com.tamsk.security.system-group-containers";
+inline constexpr const char* kVSAEntitlementSystemContainer = "com.tamsk.security.system-container";
+
+enum VSAGroupType : int { kVSAGroupTypeApplication = 0, kVSAGroupTypeSystem = 1 };
+
+// A counted multiset of group identifiers.
+using VSAReferenceCounts = std::map<std::string, int>;
+
+class VSACodeSigningMapping {
+ public:
+  // initWithUserIdentityCache:queue:mappingDB:
+  VSACodeSigningMapping(std::shared_ptr<VSAUserIdentityCache> userIdentityCache,
+                        std::shared_ptr<VSAGlobalConfiguration> configuration,
+                        std::unique_ptr<VSASQLiteDB> mappingDB);
+
+  // Registers (or, without `info`, forgets) an identifier's code-signing info.
+  VSAResultCode processCodeSigningInfo(const std::optional<VSAValue>& info,
+                                       const std::string* identifier, const VSAValue& options,
+                                       VSACommandQueue* commandQueue);
+  VSAResultCode processCallerRegisteredEntitlements(const VSAValue& entitlements,
+                                                    const std::string& identifier,
+                                                    VSACommandQueue* commandQueue);
+  // For clients: nothing for placeholder, advance-copy or invalid entries.
+  std::optional<VSAValue> getCodeSigningInfoForIdentifier(const std::string& identifier);
+  std::optional<VSAValue> entitlementsForIdentifier(const std::string& identifier);
+  std::optional<std::vector<std::string>> appGroupIdentifiersForIdentifier(const std::string& id);
+  std::optional<std::vector<std::string>> systemGroupIdentifiersForIdentifier(
+      const std::string& id);
+  VSAContainerClass dataContainerTypeForIdentifier(const std::string& identifier);
+  bool identifierHasSystemContainer(const std::string& identifier);
+  bool identifierHasCallerRegisteredEntitlements(const std::string& identifier);
+  std::optional<VSACodeSigningEntry> codeSigningEntryForIdentifier(const std::string& identifier,
+                                                                   VSAErrorRef* error);
+  std::optional<std::string> parentIdentifierForChildIdentifier(const std::string& child);
+  std::optional<std::vector<std::string>> childBundleIdentifiersForParentIdentifier(
+      const std::string& parent);
+  std::optional<std::vector<std::string>> identifiersWithError(VSAErrorRef* error);
+  bool invalidateCodeSigningInfoForIdentifier(const std::string& identifier, VSAErrorRef* error);
+  bool invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier,
+                                                            VSAErrorRef* error);
+  void removeCodeSigningDictionariesForIdentifierAndItsChildren(const std::string& identifier,
+                                                                VSACommandQueue* commandQueue);
+  bool removeAllAdvanceCopiesWithError(VSAErrorRef* error);
+  std::optional<VSAReferenceCounts> copyReferenceCountSetOfType(int groupType);
+
+  // Group identifiers from an entitlements dictionary (string or array of
+  // strings; duplicates removed); nothing for other shapes (logged).
+  static std::optional<std::vector<std::string>> copyApplicationGroupEntitlementForIdentifier(
+      const std::string& identifier, const VSAValue* entitlements, const char* groupKey);
+
+  VSAWorkQueue& queue() { return *queue_; }
+
+ private:
+  VSAResultCode _onQueue_processCodeSigningInfo(const std::optional<VSAValue>& info,
+                                                const std::string& identifier,
+                                                const VSAValue& options,
+                                                const std::optional<VSAValue>& oldEntitlements,
+                                                VSACommandQueue* commandQueue);
+  VSAResultCode _onQueue_setCodeSigningDictionaryValues(
+      const std::vector<std::optional<VSACodeSigningEntry>>& values,
+      const std::vector<std::string>& identifiers);
+  // Reads an entry; "not found" is no entry and no error.
+  std::optional<VSACodeSigningEntry> _onQueue_entry(const std::string& identifier,
+                                                    VSAErrorRef* error);
+  std::optional<VSAValue> _onQueue_entitlementsForIdentifier(const std::string& identifier);
+  std::optional<VSAReferenceCounts> _onQueue_copyReferenceCountSetOfType(int groupType);
+  void _onQueue_handleChangeFromOldGroupContainerIds(
+      const std::optional<std::vector<std::string>>& oldIds,
+      const std::optional<std::vector<std::string>>& newIds, int groupType,
+      VSACommandQueue* commandQueue);
+  void _onQueue_removeReferenceForGroupIdentifiers(const std::vector<std::string>& ids,
+                                                   int groupType, VSACommandQueue* commandQueue);
+  void _onQueue_removeGroupContainersIfNeededforUserIdentity(const VSAUserIdentityRef& user,
+                                                             VSAContainerClass groupContainerClass,
+                                                             const std::vector<std::string>& ids,
+                                                             VSAReferenceCounts counts,
+                                                             VSACommandQueue* commandQueue);
+  void _onQueue_queueSystemContainerDeletion(const std::string& identifier,
+                                             VSACommandQueue* commandQueue);
+  static std::optional<std::vector<std::string>> systemGroupIds(const std::string& identifier,
+                                                                const VSAValue* entitlements,
+                                                                bool filterPrefix);
+  template <typename F>
+  auto sync(F&& f) -> decltype(f());
+
+  std::shared_ptr<VSAUserIdentityCache> userIdentityCache_;
+  std::shared_ptr<VSAGlobalConfiguration> configuration_;
+  VSAWorkQueue::Ref queue_;
+  std::unique_ptr<VSASQLiteDB> codeSigningMappingDB_;
+};
+
+template <typename F>
+auto VSACodeSigningMapping::sync(F&& f) -> decltype(f()) {
+  if constexpr (std::is_void_v<decltype(f())>) {
+    queue_->sync(f);
+  } else {
+    std::optional<decltype(f())> result;
+    queue_->sync([&] { result.emplace(f()); });
+    return std::move(*result);
+  }
+}

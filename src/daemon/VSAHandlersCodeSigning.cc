@@ -1,0 +1,38 @@
+#include "base/VSALog.h"
+#include "codesigning/VSACodeSigningMapping.h"
+#include "daemon/VSAClientConnection.h"
+#include "daemon/VSACommandHandlers.h"
+
+void VSAHandleRecordCodeSigningInfo(const VSAValue& request, VSAValue&,
+                                    VSAClientConnection& connection, VSAResultCode* result) {
+  const VSAValue* identifier = request.get("Identifier");
+  if (!identifier || !identifier->isString()) {
+    VSASetCode(result, VSAResult::kMissingIdentifier);
+    return;
+  }
+  const VSAValue* info = request.get("CodeSigningInfo");
+  if (info && !info->isDictionary()) {
+    VSALog(kVSALogError, "VSAHandleRecordCodeSigningInfo",
+           "CodeSigningInfo for %@ is not a dictionary", *identifier->stringValue());
+    VSASetCode(result, VSAResult::kInvalidArgument);
+    return;
+  }
+  const VSAValue* options = request.get("OptionsDictionary");
+  VSAValue opts = options && options->isDictionary() ? *options : VSAValue::dictionary();
+  VSAResultCode code = connection.context().codeSigningMapping->processCodeSigningInfo(
+      info ? std::optional<VSAValue>(*info) : std::nullopt, identifier->stringValue(), opts,
+      connection.commandQueue().get());
+  if (code != VSAResult::kSuccess) VSASetCode(result, code);
+}
+
+void VSAHandleReadCodeSigningInfo(const VSAValue& request, VSAValue& reply,
+                                  VSAClientConnection& connection, VSAResultCode* result) {
+  const VSAValue* identifier = request.get("Identifier");
+  if (!identifier || !identifier->isString()) {
+    VSASetCode(result, VSAResult::kMissingIdentifier);
+    return;
+  }
+  if (auto info = connection.context().codeSigningMapping->getCodeSigningInfoForIdentifier(
+          *identifier->stringValue()))
+    reply.set("ReplyInfoDictionary", *info);
+}

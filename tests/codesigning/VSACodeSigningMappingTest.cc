@@ -1,0 +1,177 @@
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <fstream>
+
+#include "VSATestTempDir.h"
+#include "codesigning/VSACodeSigningMapping.h"
+#include "model/FakePersonaService.h"
+#include "operations/VSACommandStageForDelete.h"
+#include "platform/VSALinuxFileSystem.h"
+
+namespace fs = std::filesystem;
+
+namespace {
+
+class Mapping : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    root_ = temp_.path();
+    fs::create_directories(root_ + "/etc");
+    fs::create_directories(root_ + "/private/var/mobile");
+    std::ofstream(root_ + "/etc/passwd") << "mobile:x:501:501::/private/var/mobile:/bin/sh\n";
+    VSASystemRoot root(root_);
+    auto users = std::make_shared<VSAUserDatabase>(root);
+    auto config = std::make_shared<VSAGlobalConfiguration>(
+        root, std::make_shared<VSADeviceProperties>(root), users,
+        std::make_shared<VSAFileManager>(std::make_shared<VSALinuxFileSystem>(), users));
+    auto personas = std::make_shared<FakePersonaService>();
+    personas->personas = std::vector<VSAPersonaAttributes>{
+        FakePersonaService::persona(VSAPersonaAttributes::Kind::Personal, 1000, "P")};
+    auto cache = VSAUserIdentityCache::create({personas, users, 501, 501, true, nullptr});
+    mapping_ = std::make_unique<VSACodeSigningMapping>(
+        cache, config, std::make_unique<VSASQLiteDB>(config->libraryDirectory()));
+  }
+
+  static VSAValue info(VSAValue entitlements) {
+    return VSAValue::Dictionary{{kVSAEntitlementsKey, std::move(entitlements)},
+                                {"CDHash", VSAValue("abc")}};
+  }
+  static VSAValue groups(std::initializer_list<const char*> ids) {
+    VSAValue::Array a;
+    for (const char* id : ids) a.push_back(VSAValue(id));
+    return VSAValue::Dictionary{{kVSAEntitlementApplicationGroups, VSAValue(std::move(a))}};
+  }
+  VSAResultCode reg(const std::string& id, std::optional<VSAValue> i, VSACommandQueue& q,
+                    VSAValue options = VSAValue::dictionary()) {
+    return mapping_->processCodeSigningInfo(i, &id, options, &q);
+  }
+  // The containers queued for deletion, as "identifier/class".
+  static std::vector<std::string> staged(const VSACommandQueue& q) {
+    std::vector<std::string> out;
+    for (const auto& c : q.pendingCommands())
+      if (auto s = std::dynamic_pointer_cast<VSACommandStageForDelete>(c))
+        for (const auto& id : s->containerIdentities())
+          out.push_back(id->identifier() + "/" + std::to_string(id->containerClass()));
+    return out;
+  }
+
+  VSATestTempDir temp_{"vessa-mapping"};
+  std::string root_;
+  std::unique_ptr<VSACodeSigningMapping> mapping_;
+};
+
+TEST_F(Mapping, RoundTripAndExternalReads) {
+  VSACommandQueue q;
+  ASSERT_EQ(reg("com.app", info(VSAValue::dictionary()), q), 1u);
+  auto back = mapping_->getCodeSigningInfoForIdentifier("com.app");
+  ASSERT_TRUE(back);
+  EXPECT_EQ(*back->get("CDHash")->stringValue(), "abc");
+  // A placeholder is not shown to clients but is there for the daemon.
+  ASSERT_EQ(reg("com.placeholder", info(VSAValue::dictionary()), q,
+                VSAValue::Dictionary{{kVSAOptionPlaceholder, VSAValue(true)},
+                                     {kVSAOptionDataContainerClass, VSAValue(2u)}}),
+            1u);
+  EXPECT_FALSE(mapping_->getCodeSigningInfoForIdentifier("com.placeholder"));
+  EXPECT_TRUE(mapping_->entitlementsForIdentifier("com.placeholder"));
+  EXPECT_EQ(mapping_->dataContainerTypeForIdentifier("com.placeholder"), 2u);
+  EXPECT_EQ(mapping_->processCodeSigningInfo(std::nullopt, nullptr, VSAValue::dictionary(), &q),
+            18u);
+  EXPECT_EQ(q.count(), 0u);
+}
+
+TEST_F(Mapping, ChildOfAParentWithoutEntry) {
+  VSACommandQueue q;
+  ASSERT_EQ(reg("com.app.plugin", info(VSAValue::dictionary()), q,
+                VSAValue::Dictionary{{kVSAOptionParentBundleID, VSAValue("com.app")}}),
+            1u);
+  VSAErrorRef error;
+  auto parent = mapping_->codeSigningEntryForIdentifier("com.app", &error);
+  ASSERT_TRUE(parent);
+  EXPECT_EQ(parent->codeSigningInfo(), VSAValue::dictionary()) << "holds only the child list";
+  EXPECT_EQ(*parent->childBundleIdentifiers(), std::vector<std::string>{"com.app.plugin"});
+  EXPECT_EQ(*mapping_->parentIdentifierForChildIdentifier("com.app.plugin"), "com.app");
+}
+
+TEST_F(Mapping, DroppingTheSystemContainerEntitlementQueuesItsDeletion) {
+  VSACommandQueue q;
+  VSAValue withContainer = VSAValue::Dictionary{{kVSAEntitlementSystemContainer, VSAValue(true)}};
+  ASSERT_EQ(reg("com.service", info(withContainer), q), 1u);
+  EXPECT_TRUE(mapping_->identifierHasSystemContainer("com.service"));
+  EXPECT_EQ(q.count(), 0u) << "adding it creates nothing here";
+  ASSERT_EQ(reg("com.service", info(VSAValue::dictionary()), q), 1u);
+  EXPECT_EQ(staged(q), std::vector<std::string>{"com.service/12"});
+  // Registering the same info again changes nothing and queues nothing.
+  ASSERT_EQ(reg("com.service", info(VSAValue::dictionary()), q), 1u);
+  EXPECT_EQ(q.count(), 1u);
+}
+
+TEST_F(Mapping, SharedGroupIsQueuedForDeletionOnlyAtTheLastReference) {
+  VSACommandQueue q;
+  ASSERT_EQ(reg("com.a", info(groups({"group.shared", "group.a"})), q), 1u);
+  ASSERT_EQ(reg("com.b", info(groups({"group.shared"})), q), 1u);
+  auto counts = mapping_->copyReferenceCountSetOfType(kVSAGroupTypeApplication);
+  EXPECT_EQ((*counts)["group.shared"], 2);
+  // com.a drops both groups: group.a had one reference, group.shared two.
+  ASSERT_EQ(reg("com.a", info(VSAValue::dictionary()), q), 1u);
+  EXPECT_EQ(staged(q), std::vector<std::string>{"group.a/7"}) << "only group.a goes";
+  ASSERT_EQ(reg("com.b", info(VSAValue::dictionary()), q), 1u);
+  EXPECT_EQ(staged(q), (std::vector<std::string>{"group.a/7", "group.shared/7"}));
+  // Running the queue: staging needs the container cache, which reports 28.
+  VSAResultCode code = 1;
+  EXPECT_FALSE(q.executeAllUntilExhaustedOrError(&code));
+  EXPECT_EQ(code, 28u);
+}
+
+TEST_F(Mapping, SystemGroupsAreNeverReleasedByARegistration) {
+  VSACommandQueue q;
+  VSAValue e = VSAValue::Dictionary{{kVSAEntitlementSystemGroups, VSAValue("systemgroup.com.x")}};
+  ASSERT_EQ(reg("com.sys", info(e), q), 1u);
+  EXPECT_EQ(*mapping_->systemGroupIdentifiersForIdentifier("com.sys"),
+            std::vector<std::string>{"systemgroup.com.x"});
+  ASSERT_EQ(reg("com.sys", info(VSAValue::dictionary()), q), 1u);
+  EXPECT_EQ(q.count(), 0u);
+}
+
+TEST_F(Mapping, ForgettingAnIdentifierReleasesItsGroups) {
+  VSACommandQueue q;
+  ASSERT_EQ(reg("com.a", info(groups({"group.only"})), q), 1u);
+  ASSERT_EQ(reg("com.a", std::nullopt, q), 1u);
+  EXPECT_EQ(staged(q), std::vector<std::string>{"group.only/7"});
+  VSAErrorRef error;
+  EXPECT_FALSE(mapping_->codeSigningEntryForIdentifier("com.a", &error));
+}
+
+TEST_F(Mapping, CallerRegisteredEntitlementsNeverOverwriteASignature) {
+  VSACommandQueue q;
+  VSAValue e1 = VSAValue::Dictionary{{"x", VSAValue(1)}};
+  VSAValue e2 = VSAValue::Dictionary{{"x", VSAValue(2)}};
+  ASSERT_EQ(mapping_->processCallerRegisteredEntitlements(e1, "com.caller", &q), 1u);
+  EXPECT_TRUE(mapping_->identifierHasCallerRegisteredEntitlements("com.caller"));
+  ASSERT_EQ(mapping_->processCallerRegisteredEntitlements(e2, "com.caller", &q), 1u);
+  EXPECT_EQ(*mapping_->entitlementsForIdentifier("com.caller"), e2) << "re-registered";
+  ASSERT_EQ(reg("com.signed", info(e1), q), 1u);
+  ASSERT_EQ(mapping_->processCallerRegisteredEntitlements(e2, "com.signed", &q), 1u);
+  EXPECT_EQ(*mapping_->entitlementsForIdentifier("com.signed"), e1);
+}
+
+TEST_F(Mapping, GroupEntitlementShapes) {
+  VSAValue e = VSAValue::Dictionary{
+      {kVSAEntitlementApplicationGroups, VSAValue::Array{VSAValue("g"), VSAValue("g")}},
+      {kVSAEntitlementSystemGroups,
+       VSAValue::Array{VSAValue("systemgroup.ok"), VSAValue("noprefix")}}};
+  EXPECT_EQ(*VSACodeSigningMapping::copyApplicationGroupEntitlementForIdentifier(
+                "id", &e, kVSAEntitlementApplicationGroups),
+            std::vector<std::string>{"g"})
+      << "duplicates count once";
+  VSAValue mixed = VSAValue::Dictionary{
+      {kVSAEntitlementApplicationGroups, VSAValue::Array{VSAValue("g"), VSAValue(1)}}};
+  EXPECT_FALSE(VSACodeSigningMapping::copyApplicationGroupEntitlementForIdentifier(
+      "id", &mixed, kVSAEntitlementApplicationGroups));
+  VSACommandQueue q;
+  ASSERT_EQ(reg("com.s", info(e), q), 1u);
+  EXPECT_EQ(*mapping_->systemGroupIdentifiersForIdentifier("com.s"),
+            std::vector<std::string>{"systemgroup.ok"});
+}
+
+}  // namespace
