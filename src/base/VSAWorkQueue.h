@@ -11,7 +11,8 @@
 //  - suspend()/resume() are counted; a suspended queue starts no new block
 //    (a running block finishes). Resuming more often than suspending is a
 //    programming error and aborts.
-//  - sync() runs the block and waits for it; calling sync() on a serial queue
+//  - sync() runs the block and waits for it (on an idle serial queue that
+//    runs on the shared pool, the calling thread runs it itself); calling sync() on a serial queue
 //    from a block already running on it (or on a queue it targets) deadlocks,
 //    exactly like the platform's queues. isCurrent() lets `_onQueue_` methods
 //    assert where they run.

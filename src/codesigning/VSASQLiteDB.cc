@@ -68,7 +68,10 @@ template <typename... A>
 VSAErrorRef dbError(VSAResultCode code, const char* function, const char* format,
                     const A&... args) {
   auto e = VSAError::make(code, nullptr, function, __LINE__, format, args...);
-  VSALogIn(VSALogCategory::Database, kVSALogError, function, "%@", e->message());
+  // "Not found" is an everyday answer (most identifiers have no children):
+  // it is only worth a debug line.
+  int level = code == VSAResult::kNotFoundInDatabase ? kVSALogDebug : kVSALogError;
+  VSALogIn(VSALogCategory::Database, level, function, "%@", e->message());
   return e;
 }
 }  // namespace
