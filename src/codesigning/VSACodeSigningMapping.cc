@@ -4,6 +4,8 @@
 #include <exception>
 
 #include "base/VSALog.h"
+#include "base/VSAPathString.h"
+#include "base/VSAPlist.h"
 #include "model/VSAContainerIdentity.h"
 #include "operations/VSACommandStageForDelete.h"
 
@@ -27,7 +29,42 @@ VSACodeSigningMapping::VSACodeSigningMapping(
     : userIdentityCache_(std::move(userIdentityCache)),
       configuration_(std::move(configuration)),
       queue_(VSAWorkQueue::create("com.tamsk.Vessa.EntitlementQueue")),
-      codeSigningMappingDB_(std::move(mappingDB)) {}
+      codeSigningMappingDB_(std::move(mappingDB)) {
+  queue_->sync([this] { _onQueue_migrateFromMappingFileToDBIfNecessary(); });
+}
+
+void VSACodeSigningMapping::_onQueue_migrateFromMappingFileToDBIfNecessary() {
+  std::string path = VSAPathJoin(configuration_->libraryDirectory(), "vsa_code_signing_info.plist");
+  VSAErrorRef error;
+  auto file = VSA_dictionaryWithContentsOfURL(path, 0, &error);
+  if (!file) {
+    if (error && !(error->domain() == kVSAPOSIXErrorDomain && error->code() == ENOENT))
+      logMapping(kVSALogError, "Failed to read code signing mapping file at %@ : %@", path, error);
+    return;
+  }
+  logMapping(kVSALogNotice, "Migrating code signing info from file to DB");
+  uint16_t migrated = 0, failed = 0;
+  for (const auto& [identifier, serialized] : *file->dictionaryValue()) {
+    VSACodeSigningEntry entry = VSACodeSigningEntry::initWithSerializedDictionary(serialized);
+    VSAErrorRef addError;
+    if (codeSigningMappingDB_->addCodeSigningEntry(&entry, &identifier, &addError)) {
+      ++migrated;
+    } else {
+      ++failed;
+      logMapping(kVSALogError, "Failed to migrate code signing entry for %@ : %@", identifier,
+                 addError);
+    }
+  }
+  logMapping(kVSALogNotice, "Successfully migrated %d entries, failed to migrate %d", migrated,
+             failed);
+  // Entries that failed are given up once anything migrated (the file goes).
+  if (migrated > 0) {
+    VSAErrorRef removeError;
+    if (!configuration_->fileManager().removeItemAtURL(path, &removeError))
+      logMapping(kVSALogError, "Failed to remove legacy code signing mapping file: %@",
+                 removeError);
+  }
+}
 
 std::optional<VSACodeSigningEntry> VSACodeSigningMapping::_onQueue_entry(
     const std::string& identifier, VSAErrorRef* error) {

@@ -42,7 +42,9 @@ using VSAReferenceCounts = std::map<std::string, int>;
 
 class VSACodeSigningMapping {
  public:
-  // initWithUserIdentityCache:queue:mappingDB:
+  // initWithUserIdentityCache:queue:mappingDB: — also moves a legacy mapping
+  // file ("vsa_code_signing_info.plist" in the library directory) into the
+  // database, on the mapping's queue.
   VSACodeSigningMapping(std::shared_ptr<VSAUserIdentityCache> userIdentityCache,
                         std::shared_ptr<VSAGlobalConfiguration> configuration,
                         std::unique_ptr<VSASQLiteDB> mappingDB);
@@ -85,6 +87,7 @@ class VSACodeSigningMapping {
   VSAWorkQueue& queue() { return *queue_; }
 
  private:
+  void _onQueue_migrateFromMappingFileToDBIfNecessary();
   VSAResultCode _onQueue_processCodeSigningInfo(const std::optional<VSAValue>& info,
                                                 const std::string& identifier,
                                                 const VSAValue& options,

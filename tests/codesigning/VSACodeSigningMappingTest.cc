@@ -4,6 +4,7 @@
 #include <fstream>
 
 #include "VSATestTempDir.h"
+#include "base/VSAPlist.h"
 #include "codesigning/VSACodeSigningMapping.h"
 #include "model/FakePersonaService.h"
 #include "operations/VSACommandStageForDelete.h"
@@ -15,7 +16,10 @@ namespace {
 
 class Mapping : public ::testing::Test {
  protected:
-  void SetUp() override {
+  void SetUp() override { build(nullptr); }
+
+  // Builds the mapping; `legacy` is written as the old mapping file first.
+  void build(const VSAValue* legacy) {
     root_ = temp_.path();
     fs::create_directories(root_ + "/etc");
     fs::create_directories(root_ + "/private/var/mobile");
@@ -29,6 +33,9 @@ class Mapping : public ::testing::Test {
     personas->personas = std::vector<VSAPersonaAttributes>{
         FakePersonaService::persona(VSAPersonaAttributes::Kind::Personal, 1000, "P")};
     auto cache = VSAUserIdentityCache::create({personas, users, 501, 501, true, nullptr});
+    legacyPath_ = config->libraryDirectory() + "/vsa_code_signing_info.plist";
+    if (legacy) VSA_writeToURL(*legacy, legacyPath_, 0, nullptr);
+    mapping_.reset();
     mapping_ = std::make_unique<VSACodeSigningMapping>(
         cache, config, std::make_unique<VSASQLiteDB>(config->libraryDirectory()));
   }
@@ -57,7 +64,7 @@ class Mapping : public ::testing::Test {
   }
 
   VSATestTempDir temp_{"vessa-mapping"};
-  std::string root_;
+  std::string root_, legacyPath_;
   std::unique_ptr<VSACodeSigningMapping> mapping_;
 };
 
@@ -153,6 +160,21 @@ TEST_F(Mapping, CallerRegisteredEntitlementsNeverOverwriteASignature) {
   ASSERT_EQ(reg("com.signed", info(e1), q), 1u);
   ASSERT_EQ(mapping_->processCallerRegisteredEntitlements(e2, "com.signed", &q), 1u);
   EXPECT_EQ(*mapping_->entitlementsForIdentifier("com.signed"), e1);
+}
+
+TEST_F(Mapping, LegacyMappingFileMovesIntoTheDatabaseOnce) {
+  VSACodeSigningEntry old(info(groups({"group.legacy"})), 2);
+  VSAValue file = VSAValue::Dictionary{{"com.legacy.app", old.serialize()}};
+  build(&file);
+  VSAErrorRef error;
+  auto migrated = mapping_->codeSigningEntryForIdentifier("com.legacy.app", &error);
+  ASSERT_TRUE(migrated);
+  EXPECT_TRUE(migrated->isEqual(old));
+  EXPECT_FALSE(fs::exists(legacyPath_)) << "the file goes once something migrated";
+  // A file from which nothing migrates stays for the next start.
+  VSAValue empty = VSAValue::dictionary();
+  build(&empty);
+  EXPECT_TRUE(fs::exists(legacyPath_));
 }
 
 TEST_F(Mapping, GroupEntitlementShapes) {
