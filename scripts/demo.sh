@@ -38,6 +38,17 @@ ctl "$installer" --root "$root" Identifier=com.example.demo
 step "Personas the installer may use (it is listed by the universal persona, so all of them)"
 ctl "$installer" --root "$root" --json Command=32
 
+step "Recording code-signing information for an app (command 18) and reading it back (19)"
+cat > "$root/tmp/csinfo.json" <<'JSON'
+{"Command": 18, "Identifier": "com.example.demo",
+ "CodeSigningInfo": {"com.tamsk.Vessa.Entitlements":
+                       {"com.tamsk.security.application-groups": ["group.com.example.shared"]},
+                     "TeamIdentifier": "DEMOTEAM"},
+ "OptionsDictionary": {"com.tamsk.Vessa.DataContainerClass": 2}}
+JSON
+ctl "$installer" --root "$root" --file "$root/tmp/csinfo.json"
+ctl "$installer" --root "$root" --json Command=19 Identifier=com.example.demo
+
 step "Locking and unlocking the device (the daemon follows the lock state)"
 echo 1 > "$root/run/vessad/lockstate"; sleep 0.2
 echo 0 > "$root/run/vessad/lockstate"; sleep 0.2
