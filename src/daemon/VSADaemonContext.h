@@ -20,6 +20,7 @@
 #include "platform/VSALinuxPersonaService.h"
 #include "platform/VSALockStateService.h"
 #include "platform/VSANotificationCenter.h"
+#include "platform/VSASandboxService.h"
 #include "platform/VSASystemRoot.h"
 #include "platform/VSATransactions.h"
 #include "platform/VSAUserDatabase.h"
@@ -39,6 +40,7 @@ struct VSADaemonContext {
         globalConfiguration(std::make_shared<VSAGlobalConfiguration>(root, deviceProperties,
                                                                      userDatabase, fileManager)),
         transactions(std::make_shared<VSATransactions>()),
+        sandboxService(std::make_shared<VSASandboxService>(root)),
         whitelist(VSAWhitelist::load(root.resolve("/etc/vessad/whitelist.plist"),
                                      globalConfiguration->isInternalImage())) {
     // A device may come without a termination service ("HasTerminationService" NO).
@@ -69,6 +71,7 @@ struct VSADaemonContext {
   std::shared_ptr<VSAFileManager> fileManager;
   std::shared_ptr<VSAGlobalConfiguration> globalConfiguration;
   std::shared_ptr<VSATransactions> transactions;
+  std::shared_ptr<VSASandboxService> sandboxService;
   std::shared_ptr<VSAUserIdentitySharedCache> userIdentityCache;
   std::shared_ptr<VSAWhitelist> whitelist;
   std::shared_ptr<VSACodeSigningMapping> codeSigningMapping;

@@ -1,0 +1,183 @@
+#include "platform/VSASandboxService.h"
+
+#include <fcntl.h>
+#include <openssl/crypto.h>
+#include <openssl/hmac.h>
+#include <openssl/rand.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include "base/VSALog.h"
+#include "base/VSAPlist.h"
+
+namespace {
+std::string hex(const uint8_t* p, size_t n) {
+  static const char* digits = "0123456789abcdef";
+  std::string out;
+  out.reserve(2 * n);
+  for (size_t i = 0; i < n; ++i) {
+    out += digits[p[i] >> 4];
+    out += digits[p[i] & 15];
+  }
+  return out;
+}
+// mkdir -p, the last component with `mode`.
+void makeDirectories(const std::string& path, mode_t mode) {
+  for (size_t pos = path.find('/', 1); pos != std::string::npos; pos = path.find('/', pos + 1))
+    mkdir(path.substr(0, pos).c_str(), 0755);
+  mkdir(path.c_str(), mode);
+}
+
+std::string hex(const std::string& s) {
+  return hex(reinterpret_cast<const uint8_t*>(s.data()), s.size());
+}
+}  // namespace
+
+std::optional<uint64_t> VSASandboxItemTypeForClass(uint64_t c) {
+  switch (c) {
+    case 2:
+      return 1;  // app data
+    case 4:
+      return 2;  // plug-in data
+    case 6:
+      return 3;  // VPN plug-in data
+    case 7:
+      return 4;  // app group
+    case 9:
+      return 5;  // relay service data
+    case 10:
+      return 6;  // internal daemon data
+    case 11:
+      return 7;  // temporary directory
+    case 12:
+      return 8;  // system data
+    case 13:
+      return 9;  // system group
+    default:
+      return std::nullopt;
+  }
+}
+
+VSASandboxService::VSASandboxService(VSASystemRoot root) : root_(std::move(root)) {}
+
+std::string VSASandboxService::tablePath(uid_t uid) const {
+  return root_.resolve("/run/vessad/sandbox/" + std::to_string(uid) + ".plist");
+}
+
+std::vector<VSASandboxItem> VSASandboxService::load(uid_t uid) {
+  auto it = tables_.find(uid);
+  if (it != tables_.end()) return it->second;
+  std::vector<VSASandboxItem> items;
+  VSAErrorRef error;
+  if (auto dict = VSA_dictionaryWithContentsOfURL(tablePath(uid), 0, &error)) {
+    const VSAValue* list = dict->get("Items");
+    for (const VSAValue& v : list && list->isArray() ? *list->arrayValue() : VSAValue::Array{}) {
+      const VSAValue *type = v.get("ItemType"), *id = v.get("Identifier"), *cls = v.get("Class"),
+                     *persona = v.get("PersonaID"), *path = v.get("Path");
+      if (!type || !id || !id->isString() || !cls || !path || !path->isString()) continue;
+      items.push_back({type->uint64Value().value_or(0), *id->stringValue(),
+                       cls->uint64Value().value_or(0),
+                       static_cast<int32_t>(persona ? persona->int64Value().value_or(0) : 0),
+                       *path->stringValue()});
+    }
+  }
+  tables_[uid] = items;
+  return items;
+}
+
+int VSASandboxService::store(uid_t uid, const std::vector<VSASandboxItem>& items) {
+  VSAValue::Array list;
+  for (const auto& i : items)
+    list.push_back(VSAValue::Dictionary{{"ItemType", VSAValue(i.itemType)},
+                                        {"Identifier", VSAValue(i.identifier)},
+                                        {"Class", VSAValue(i.containerClass)},
+                                        {"PersonaID", VSAValue(static_cast<int64_t>(i.personaID))},
+                                        {"Path", VSAValue(i.path)}});
+  std::string dir = root_.resolve("/run/vessad/sandbox");
+  makeDirectories(dir, 0700);
+  VSAErrorRef error;
+  if (!VSA_writeToURL(VSAValue::Dictionary{{"Items", VSAValue(std::move(list))}}, tablePath(uid), 0,
+                      &error))
+    return error && error->domain() == kVSAPOSIXErrorDomain ? static_cast<int>(error->code()) : EIO;
+  tables_[uid] = items;
+  return 0;
+}
+
+int VSASandboxService::setUserStateItem(uid_t uid, uint64_t itemType, const std::string& identifier,
+                                        uint64_t containerClass, int32_t personaID,
+                                        const std::optional<std::string>& path) {
+  if (identifier.empty()) return EINVAL;
+  std::lock_guard lock(mutex_);
+  auto items = load(uid);
+  std::erase_if(items, [&](const VSASandboxItem& i) {
+    return i.identifier == identifier && i.containerClass == containerClass;
+  });
+  if (path) items.push_back({itemType, identifier, containerClass, personaID, *path});
+  return store(uid, items);
+}
+
+int VSASandboxService::iterateUserStateItems(
+    uid_t uid, const std::function<bool(const VSASandboxItem&)>& block) {
+  std::vector<VSASandboxItem> items;
+  {
+    std::lock_guard lock(mutex_);
+    items = load(uid);
+  }
+  for (const auto& i : items)
+    if (!block(i)) break;
+  return 0;
+}
+
+bool VSASandboxService::key(std::string* out) {
+  std::lock_guard lock(mutex_);
+  if (!key_.empty()) {
+    *out = key_;
+    return true;
+  }
+  std::string path = root_.resolve("/run/vessad/sandbox-token.key");
+  std::vector<uint8_t> bytes;
+  if (auto existing = VSAReadFile(path, nullptr); existing && existing->size() == 32) {
+    bytes = *existing;
+  } else {
+    bytes.resize(32);
+    if (RAND_bytes(bytes.data(), 32) != 1) return false;
+    makeDirectories(root_.runDirectory(), 0755);
+    if (!VSAWriteFileAtomically(path, bytes, 0600, nullptr)) return false;
+  }
+  key_.assign(bytes.begin(), bytes.end());
+  *out = key_;
+  return true;
+}
+
+std::string VSASandboxService::mac(const std::string& extensionClass, const std::string& path,
+                                   const VSAAuditToken& auditToken, const std::string& k) const {
+  auto token = auditToken.bytes();
+  std::string message = extensionClass + '\0' + path + '\0' +
+                        std::string(reinterpret_cast<const char*>(token.data()), token.size());
+  unsigned char digest[EVP_MAX_MD_SIZE];
+  unsigned int length = 0;
+  HMAC(EVP_sha256(), k.data(), static_cast<int>(k.size()),
+       reinterpret_cast<const unsigned char*>(message.data()), message.size(), digest, &length);
+  return hex(digest, length);
+}
+
+std::optional<std::string> VSASandboxService::issueFileExtension(const std::string& extensionClass,
+                                                                 const std::string& path,
+                                                                 const VSAAuditToken& auditToken) {
+  std::string k;
+  if (extensionClass.find(';') != std::string::npos || !key(&k)) return std::nullopt;
+  auto token = auditToken.bytes();
+  return extensionClass + ";" + hex(path) + ";" + hex(token.data(), token.size()) + ";" +
+         mac(extensionClass, path, auditToken, k);
+}
+
+bool VSASandboxService::verifyFileExtension(const std::string& token,
+                                            const std::string& extensionClass,
+                                            const std::string& path,
+                                            const VSAAuditToken& auditToken) {
+  std::string k;
+  if (!key(&k)) return false;
+  auto expected = issueFileExtension(extensionClass, path, auditToken);
+  return expected && expected->size() == token.size() &&
+         CRYPTO_memcmp(expected->data(), token.data(), token.size()) == 0;
+}
