@@ -10,6 +10,7 @@
 #include "base/VSAWorkQueue.h"
 #include "codesigning/VSACodeSigningMapping.h"
 #include "codesigning/VSAWhitelist.h"
+#include "model/VSAContainerCache.h"
 #include "model/VSAGlobalConfiguration.h"
 #include "model/VSAUserIdentitySharedCache.h"
 #include "platform/VSAApplicationTerminationService.h"
@@ -58,6 +59,14 @@ struct VSADaemonContext {
     codeSigningMapping = std::make_shared<VSACodeSigningMapping>(
         userIdentityCache, globalConfiguration,
         std::make_unique<VSASQLiteDB>(globalConfiguration->libraryDirectory()));
+    containerCache = VSAContainerCache::create(
+        {userIdentityCache, globalConfiguration, sandboxService, notifications,
+         [mapping = codeSigningMapping](const std::string& child) {
+           return mapping->parentIdentifierForChildIdentifier(child);
+         },
+         [list = whitelist](const std::string& id, VSAContainerClass c) {
+           return list->containerIdIsWellknown(id, c);
+         }});
   }
 
   VSASystemRoot systemRoot;
@@ -75,6 +84,7 @@ struct VSADaemonContext {
   std::shared_ptr<VSAUserIdentitySharedCache> userIdentityCache;
   std::shared_ptr<VSAWhitelist> whitelist;
   std::shared_ptr<VSACodeSigningMapping> codeSigningMapping;
+  std::shared_ptr<VSAContainerCache> containerCache;
   std::shared_ptr<VSAApplicationTerminationService> terminationService;  // may be null
 
   VSAWorkQueue::Ref listenerQueue;   // "com.tamsk.vessad.listener"

@@ -1,0 +1,368 @@
+#include "model/VSAContainerCache.h"
+
+#include "base/VSALog.h"
+#include "base/VSAPathString.h"
+#include "platform/VSAFileManager.h"
+
+namespace {
+constexpr const char* kOrigin = "VSAContainerCache";
+
+const char* shortName(VSAContainerClass c) {
+  static const char* names[] = {"undefined", "app",     "appData",    "plugin",     "pluginData",
+                                "vpn",       "vpnData", "appGroup",   "framework",  "relayService",
+                                "daemon",    "tempDir", "systemData", "systemGroup"};
+  return c < 14 ? names[c] : "invalid";
+}
+
+const char* transientTag(bool transient) { return transient ? "(transient)" : ""; }
+
+template <typename... A>
+VSAErrorRef cacheError(VSAResultCode code, const char* format, const A&... args) {
+  auto e = VSAError::make(code, nullptr, kOrigin, __LINE__, format, args...);
+  VSALogIn(VSALogCategory::Cache, kVSALogError, kOrigin, "%@", e->message());
+  return e;
+}
+
+std::string lastComponent(const std::string& path) {
+  size_t slash = path.find_last_of('/');
+  return slash == std::string::npos ? path : path.substr(slash + 1);
+}
+}  // namespace
+
+std::shared_ptr<VSAContainerCache> VSAContainerCache::create(Dependencies deps) {
+  std::shared_ptr<VSAContainerCache> cache(new VSAContainerCache(std::move(deps)));
+  cache->deps_.userIdentityCache->addObserver(cache);
+  return cache;
+}
+
+std::string VSAContainerCache::cacheKeyForUserIdentity(const VSAUserIdentityRef& user,
+                                                       VSAContainerClass c) {
+  if (VSAUserIdentity::isUserIdentityRequiredForContainerClass(c))
+    return VSAFormat("[%@]-%@", user ? user->identifier() : std::string("(null)"), shortName(c));
+  return shortName(c);
+}
+
+bool VSAContainerCache::containerURLIsValidForContainerClass(
+    const std::string& url, VSAContainerClass c,
+    const std::function<bool(const std::string&, VSAContainerClass)>& isWellknown) {
+  std::string name = lastComponent(url);
+  if (VSAUUID::parse(name)) return true;
+  return (c == 12 || c == 13) && isWellknown && isWellknown(name, c);
+}
+
+bool VSAContainerCache::hasClassMap(const VSAUserIdentityRef& user, VSAContainerClass c,
+                                    bool transient) {
+  std::lock_guard lock(cacheLock_);
+  return (transient ? transient_ : live_).count(cacheKeyForUserIdentity(user, c)) > 0;
+}
+
+VSAContainerCache::ClassMap* VSAContainerCache::_lock_getCache(const VSAUserIdentityRef& user,
+                                                               VSAContainerClass c, bool transient,
+                                                               bool populateSandbox, bool build,
+                                                               VSAErrorRef* error) {
+  std::string key = cacheKeyForUserIdentity(user, c);
+  auto& maps = transient ? transient_ : live_;
+  if (auto it = maps.find(key); it != maps.end()) return &it->second;
+  if (!build) return nullptr;
+  VSALogIn(VSALogCategory::Cache, kVSALogNotice, kOrigin, "Rebuilding container class cache: %@%@",
+           key, transientTag(transient));
+  VSASignpostInterval interval(VSALogCategory::Cache, "RebuildingCache");
+  auto& config = *deps_.configuration;
+  auto dir = config.containerDirectoryURLForUserIdentity(user, c, transient);
+  if (!dir) {
+    VSASetError(error, cacheError(43, "Cache: %@%@: no directory for class %llu", key,
+                                  transientTag(transient), c));
+    return nullptr;
+  }
+  auto items = config.fileManager().urlsForItemsInDirectoryAtURL(*dir, error);
+  if (!items) return nullptr;
+  ClassMap map;
+  for (const auto& item : *items) {
+    if (!containerURLIsValidForContainerClass(item.path, c, deps_.isWellknown)) continue;
+    auto m = VSAMetadata::readAndValidateMetadataAtUrl(item.path, user, true, config,
+                                                       *deps_.userIdentityCache, nullptr);
+    if (!m) continue;
+    m->setTransient(transient);
+    if (populateSandbox && !transient &&
+        shouldRegisterSandboxMappingWithUserIdentity(user, m->identifier(), c) &&
+        !setSandboxContainerMappingForUserIdentity(user, m->identifier(), c, m->url()))
+      VSALogIn(VSALogCategory::Cache, kVSALogError, kOrigin,
+               "Failed to set container mapping during create/lookup operation of %@, %llu",
+               m->identifier(), c);
+    map[m->identifier()] = std::move(m);
+  }
+  return &(maps[key] = std::move(map));
+}
+
+VSAMetadataRef VSAContainerCache::_lock_metadataFromSandbox(const VSAContainerIdentity& identity) {
+  VSAMetadataRef found;
+  const auto& user = identity.userIdentity();
+  VSASignpostInterval interval(VSALogCategory::Cache, "ReadFromSandbox");
+  int rc =
+      deps_.sandbox->iterateUserStateItems(identity.posixUID(), [&](const VSASandboxItem& item) {
+        if (item.identifier.empty() || item.path.empty()) {
+          VSALogIn(VSALogCategory::Cache, kVSALogError, kOrigin,
+                   "Sandbox item of type %llu has no identifier or path", item.itemType);
+          return true;
+        }
+        if (item.identifier != identity.identifier() ||
+            item.containerClass != identity.containerClass())
+          return true;
+        VSAErrorRef error;
+        auto m = VSAMetadata::readAndValidateMetadataAtUrl(
+            item.path, user, true, *deps_.configuration, *deps_.userIdentityCache, &error);
+        if (!m) {
+          VSALogIn(VSALogCategory::Cache, kVSALogError, kOrigin,
+                   "Could not validate container from Sandbox-provided path [%@]; error = %@",
+                   item.path, error);
+        } else if (m->containerClass() != identity.containerClass() ||
+                   m->identifier() != identity.identifier()) {
+          VSALogIn(
+              VSALogCategory::Cache, kVSALogError, kOrigin,
+              "Attempted to fetch container from Sandbox-provided path [%@] that was not what was "
+              "expected; expected class: %llu, expected identifier: [%@], actual class: %llu, "
+              "actual identifier: [%@]",
+              item.path, identity.containerClass(), identity.identifier(), m->containerClass(),
+              m->identifier());
+        } else {
+          VSALogIn(VSALogCategory::Cache, kVSALogDebug, kOrigin,
+                   "Took %@ from the sandbox's container table", m->identifier());
+          found = std::move(m);
+        }
+        return false;
+      });
+  if (rc != 0)
+    VSALogIn(VSALogCategory::Cache, kVSALogError, kOrigin,
+             "Failed to read back sandbox cache; result = %d", rc);
+  return found;
+}
+
+bool VSAContainerCache::checkFound(const VSAMetadataRef& m, const std::string& key, bool transient,
+                                   VSAErrorRef* error) {
+  if (m->url().empty()) {
+    VSASetError(error,
+                cacheError(47, "Cache: %@%@: nil URL from %@", key, transientTag(transient), *m));
+    return false;
+  }
+  if (!deps_.configuration->fileManager().itemExistsAtURL(
+          VSAPathJoin(m->url(), kVSAMetadataFileName))) {
+    VSASetError(
+        error,
+        cacheError(44, "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu", key,
+                   transientTag(transient), m->url(), m->identifier(), m->containerClass()));
+    VSAErrorRef removeError;
+    if (!removeContainerForUserIdentity(m->userIdentity(), m->containerClass(), m->identifier(),
+                                        transient, &removeError))
+      VSALogIn(VSALogCategory::Cache, kVSALogError, kOrigin,
+               "Failed to remove from cache user: %@, id: %@, class: %llu, transient: %d : %@",
+               m->userIdentity(), m->identifier(), m->containerClass(), transient, removeError);
+    return false;
+  }
+  return true;
+}
+
+VSAMetadataRef VSAContainerCache::containerForContainerIdentity(
+    const VSAContainerIdentity& identity, bool transient, bool updateSandbox,
+    bool allowKernelLookup, VSAErrorRef* error) {
+  const auto& user = identity.userIdentity();
+  VSAContainerClass c = identity.containerClass();
+  std::string key = cacheKeyForUserIdentity(user, c);
+  VSAMetadataRef found;
+  {
+    std::lock_guard lock(cacheLock_);
+    ClassMap* map = _lock_getCache(user, c, transient, updateSandbox, false, nullptr);
+    if (!map && allowKernelLookup && !transient) found = _lock_metadataFromSandbox(identity);
+    if (!found) {
+      if (!map) map = _lock_getCache(user, c, transient, updateSandbox, true, nullptr);
+      if (!map) {
+        VSASetError(error, cacheError(43, "Cache: [%@]-%@%@: Failed to rebuild",
+                                      user ? user->identifier() : std::string(), shortName(c),
+                                      transientTag(transient)));
+        return nullptr;
+      }
+      auto it = map->find(identity.identifier());
+      if (it == map->end()) {
+        auto e = VSAError::make(VSAResult::kContainerNotFound, nullptr, kOrigin, __LINE__,
+                                "Cache: %@%@: Container Not Found with ID: %@", key,
+                                transientTag(transient), identity.identifier());
+        VSALogIn(VSALogCategory::Cache, kVSALogDebug, kOrigin, "%@", e->message());
+        VSASetError(error, e);
+        return nullptr;
+      }
+      found = it->second;
+    }
+  }
+  auto copy = std::make_shared<VSAMetadata>(*found);
+  if (!checkFound(copy, key, transient, error)) return nullptr;
+  VSALogIn(VSALogCategory::Cache, kVSALogDebug, kOrigin, "Cache: %@%@: Found Identifier: %@", key,
+           transientTag(transient), identity.identifier());
+  return copy;
+}
+
+std::optional<std::vector<VSAMetadataRef>> VSAContainerCache::allContainersForUserIdentity(
+    const VSAUserIdentityRef& user, VSAContainerClass c, bool transient, bool populateSandbox,
+    VSAErrorRef* error) {
+  if (!VSAContainerClassIsValid(c)) {
+    VSASetError(error, cacheError(VSAResult::kInvalidArgument, "Invalid Content Class: %ld",
+                                  static_cast<long>(c)));
+    return std::nullopt;
+  }
+  std::vector<VSAMetadataRef> entries;
+  std::string key = cacheKeyForUserIdentity(user, c);
+  {
+    std::lock_guard lock(cacheLock_);
+    ClassMap* map = _lock_getCache(user, c, transient, populateSandbox, true, error);
+    if (!map) return std::nullopt;
+    for (const auto& [id, m] : *map) entries.push_back(std::make_shared<VSAMetadata>(*m));
+  }
+  std::vector<VSAMetadataRef> out;
+  for (auto& m : entries) {
+    if (!checkFound(m, key, transient, nullptr)) continue;
+    VSALogIn(VSALogCategory::Cache, kVSALogDebug, kOrigin, "Cache: %@%@: ALL Found Identifier: %@",
+             key, transientTag(transient), m->identifier());
+    out.push_back(std::move(m));
+  }
+  return out;
+}
+
+bool VSAContainerCache::addContainerMetadata(const VSAMetadata& metadata, const std::string& url,
+                                             bool transient, bool updateSandbox,
+                                             VSAErrorRef* error) {
+  if (url.empty()) {
+    VSASetError(error, cacheError(VSAResult::kInvalidArgument, "Invalid input: URL: %@", url));
+    return false;
+  }
+  VSAContainerClass c = metadata.containerClass();
+  if (!VSAContainerClassIsValid(c)) {
+    VSASetError(error,
+                cacheError(VSAResult::kInvalidArgument, "Invalid Metadata Content Class: %lld",
+                           static_cast<long long>(c)));
+    return false;
+  }
+  const auto& user = metadata.userIdentity();
+  std::lock_guard lock(cacheLock_);
+  ClassMap* map = _lock_getCache(user, c, transient, false, true, nullptr);
+  if (!map) {
+    VSASetError(error, cacheError(43, "Cache: [%@]-%@%@: Failed to rebuild",
+                                  user ? user->identifier() : std::string(), shortName(c),
+                                  transientTag(transient)));
+    return false;
+  }
+  auto stored = std::make_shared<VSAMetadata>(metadata);
+  stored->setUrl(url);
+  stored->setTransient(transient);
+  (*map)[stored->identifier()] = stored;
+  VSALogIn(VSALogCategory::Cache, kVSALogNotice, kOrigin, "Cache: %@%@: Added Identifier: %@",
+           cacheKeyForUserIdentity(user, c), transientTag(transient), stored->identifier());
+  if (updateSandbox && !transient &&
+      shouldRegisterSandboxMappingWithUserIdentity(user, stored->identifier(), c) &&
+      !setSandboxContainerMappingForUserIdentity(user, stored->identifier(), c, url))
+    VSALogIn(VSALogCategory::Cache, kVSALogError, kOrigin,
+             "Failed to set container mapping of %@, %llu", stored->identifier(), c);
+  return true;
+}
+
+bool VSAContainerCache::removeContainerForUserIdentity(const VSAUserIdentityRef& user,
+                                                       VSAContainerClass c,
+                                                       const std::string& identifier,
+                                                       bool transient, VSAErrorRef* error) {
+  if (!VSAContainerClassIsValid(c)) {
+    VSASetError(error, cacheError(VSAResult::kInvalidArgument, "Invalid Content Class: %ld",
+                                  static_cast<long>(c)));
+    return false;
+  }
+  std::lock_guard lock(cacheLock_);
+  ClassMap* map = _lock_getCache(user, c, transient, false, true, nullptr);
+  if (!map) {
+    VSASetError(error, cacheError(43, "Cache: [%@]-%@%@: Failed to rebuild",
+                                  user ? user->identifier() : std::string(), shortName(c),
+                                  transientTag(transient)));
+    return false;
+  }
+  map->erase(identifier);
+  VSALogIn(VSALogCategory::Cache, kVSALogNotice, kOrigin, "Cache: %@%@: Removed Identifier: %@",
+           cacheKeyForUserIdentity(user, c), transientTag(transient), identifier);
+  if (!transient && VSASandboxItemTypeForClass(c) &&
+      !setSandboxContainerMappingForUserIdentity(user, identifier, c, std::nullopt))
+    VSALogIn(VSALogCategory::Cache, kVSALogError, kOrigin,
+             "Failed to remove container mapping of %@, %llu", identifier, c);
+  return true;
+}
+
+void VSAContainerCache::invalidateUserIdentity(const VSAUserIdentityRef& user) {
+  {
+    std::lock_guard lock(cacheLock_);
+    for (VSAContainerClass c = 1; c <= 13; ++c) {
+      std::string key = cacheKeyForUserIdentity(user, c);
+      if (auto it = live_.find(key); it != live_.end()) {
+        for (const auto& [id, m] : it->second)
+          if (VSASandboxItemTypeForClass(c) &&
+              !setSandboxContainerMappingForUserIdentity(user, id, c, std::nullopt))
+            VSALogIn(VSALogCategory::Cache, kVSALogError, kOrigin,
+                     "Failed to remove container mapping of [%@], class: %llu", id, c);
+      }
+      live_.erase(key);
+      transient_.erase(key);
+    }
+  }
+  if (uint32_t status = deps_.notifications->post(CONTAINER_NOTIFY_USER_INVALIDATED))
+    VSALogIn(VSALogCategory::Cache, kVSALogError, kOrigin,
+             "Could not post user-invalidated notification: %u", status);
+}
+
+void VSAContainerCache::userIdentityCacheDidInvalidateUserIdentity(
+    VSAUserIdentityCache&, const VSAUserIdentityRef& identity) {
+  invalidateUserIdentity(identity);
+}
+
+bool VSAContainerCache::shouldRegisterSandboxMappingWithUserIdentity(const VSAUserIdentityRef& user,
+                                                                     const std::string& identifier,
+                                                                     VSAContainerClass c) {
+  bool decision, multi = false;
+  std::string app = identifier;
+  if (c == 2 || c == 4 || c == 6 || c == 9 || c == 10 || c == 11) {
+    if ((c == 4 || c == 6) && deps_.parentIdentifierForChild)
+      if (auto parent = deps_.parentIdentifierForChild(identifier)) app = *parent;
+    auto set = deps_.userIdentityCache->userIdentitiesForBundleIdentifier(app);
+    auto personal = deps_.userIdentityCache->userIdentityForPersonalPersona();
+    multi = set.size() >= 2 && set.count(personal) > 0;
+    decision = multi ? !(user && user->isEnterprise()) : set.count(user) > 0;
+  } else if (c == 7) {
+    decision = true;
+  } else {
+    decision = !(user && user->isEnterprise());
+  }
+  VSALogIn(VSALogCategory::Sandbox, kVSALogDebug, kOrigin,
+           "Deciding to register userIdentity: %@, identifier: %@ (%@), containerClass: %llu with "
+           "sandbox: %d because isMulti: %d",
+           user, identifier, app, c, decision, multi);
+  return decision;
+}
+
+bool VSAContainerCache::setSandboxContainerMappingForUserIdentity(
+    const VSAUserIdentityRef& user, const std::string& identifier, VSAContainerClass c,
+    const std::optional<std::string>& url) {
+  auto itemType = VSASandboxItemTypeForClass(c);
+  if (!itemType) {
+    VSALogIn(VSALogCategory::Sandbox, kVSALogError, kOrigin,
+             "Unsupported class for setting sandbox container mapping: %llu", c);
+    return false;
+  }
+  uid_t uid = user ? user->posixUIDForContainerClass(c) : 0;
+  int32_t persona = user ? user->kernelPersonaID() : 0;
+  int rc = deps_.sandbox->setUserStateItem(uid, *itemType, identifier, c, persona, url);
+  std::string path = url.value_or("(null)");
+  if (rc != 0) {
+    VSALogIn(VSALogCategory::Sandbox, kVSALogError, kOrigin,
+             url ? "Failed to set mapping for user: %u, itemType: %llu, identifier %s, class: "
+                   "%llu, path: %s : %d"
+                 : "Failed to remove mapping for user: %u, itemType: %llu, identifier: %s, class: "
+                   "%llu, path: %s : %d",
+             uid, *itemType, identifier, c, path, rc);
+    return false;
+  }
+  VSALogIn(VSALogCategory::Sandbox, kVSALogDebug, kOrigin,
+           "Pushed user: %u, itemType: %llu, identifier %s, class: %llu, persona id: %d, path: %s",
+           uid, *itemType, identifier, c, persona, path);
+  return true;
+}

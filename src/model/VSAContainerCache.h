@@ -1,0 +1,95 @@
+// The container cache: per (user identity, class), and separately for live
+// and transient containers, a map from identifier to validated metadata,
+// built once from disk and then changed in place by create, delete and
+// replace. It keeps the sandbox's per-user container table in step, and a
+// single lookup may ask that table before building a whole class map.
+//
+// One mutex covers both dictionaries and is held for whole class-map builds
+// (a class is never built twice; other lookups wait). Found containers are
+// checked on disk after the lock is released; a container whose metadata
+// vanished is reported once (44) and dropped. Lookups hand out copies.
+// The whitelist and the code-signing mapping are reached through the two
+// functions of Dependencies, which keeps this module below them.
+#pragma once
+
+#include <functional>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "model/VSAContainerIdentity.h"
+#include "model/VSAGlobalConfiguration.h"
+#include "model/VSAMetadata.h"
+#include "model/VSAUserIdentityCache.h"
+#include "platform/VSANotificationCenter.h"
+#include "platform/VSASandboxService.h"
+
+class VSAContainerCache : public VSAUserIdentityCacheObserver,
+                          public std::enable_shared_from_this<VSAContainerCache> {
+ public:
+  struct Dependencies {
+    std::shared_ptr<VSAUserIdentityCache> userIdentityCache;
+    std::shared_ptr<VSAGlobalConfiguration> configuration;
+    std::shared_ptr<VSASandboxService> sandbox;
+    std::shared_ptr<VSANotificationCenter> notifications;
+    // The parent app of a plug-in (code-signing mapping).
+    std::function<std::optional<std::string>(const std::string&)> parentIdentifierForChild;
+    // Well-known system (12) and system group (13) container identifiers.
+    std::function<bool(const std::string&, VSAContainerClass)> isWellknown;
+  };
+
+  // Makes the cache and registers it as an observer of the user identity cache.
+  static std::shared_ptr<VSAContainerCache> create(Dependencies deps);
+
+  VSAMetadataRef containerForContainerIdentity(const VSAContainerIdentity& identity, bool transient,
+                                               bool updateSandbox, bool allowKernelLookup,
+                                               VSAErrorRef* error);
+  VSAMetadataRef containerForContainerIdentity(const VSAContainerIdentity& identity) {
+    return containerForContainerIdentity(identity, false, false, false, nullptr);
+  }
+  std::optional<std::vector<VSAMetadataRef>> allContainersForUserIdentity(
+      const VSAUserIdentityRef& user, VSAContainerClass contentClass, bool transient,
+      bool populateSandboxCache, VSAErrorRef* error);
+  bool addContainerMetadata(const VSAMetadata& metadata, const std::string& url, bool transient,
+                            bool updateSandbox, VSAErrorRef* error);
+  bool removeContainerForUserIdentity(const VSAUserIdentityRef& user,
+                                      VSAContainerClass contentClass, const std::string& identifier,
+                                      bool transient, VSAErrorRef* error);
+  void invalidateUserIdentity(const VSAUserIdentityRef& user);
+  void userIdentityCacheDidInvalidateUserIdentity(VSAUserIdentityCache& cache,
+                                                  const VSAUserIdentityRef& identity) override;
+
+  bool shouldRegisterSandboxMappingWithUserIdentity(const VSAUserIdentityRef& user,
+                                                    const std::string& identifier,
+                                                    VSAContainerClass containerClass);
+  bool setSandboxContainerMappingForUserIdentity(const VSAUserIdentityRef& user,
+                                                 const std::string& identifier,
+                                                 VSAContainerClass containerClass,
+                                                 const std::optional<std::string>& url);
+
+  static bool containerURLIsValidForContainerClass(
+      const std::string& url, VSAContainerClass containerClass,
+      const std::function<bool(const std::string&, VSAContainerClass)>& isWellknown);
+  static std::string cacheKeyForUserIdentity(const VSAUserIdentityRef& user,
+                                             VSAContainerClass containerClass);
+  // Whether the class map has been built (tests and diagnostics).
+  bool hasClassMap(const VSAUserIdentityRef& user, VSAContainerClass c, bool transient);
+
+ private:
+  using ClassMap = std::map<std::string, VSAMetadataRef>;
+  explicit VSAContainerCache(Dependencies deps) : deps_(std::move(deps)) {}
+  ClassMap* _lock_getCache(const VSAUserIdentityRef& user, VSAContainerClass c, bool transient,
+                           bool populateSandbox, bool build, VSAErrorRef* error);
+  VSAMetadataRef _lock_metadataFromSandbox(const VSAContainerIdentity& identity);
+  // The on-disk checks done outside the lock; false (and the entry dropped) when stale.
+  bool checkFound(const VSAMetadataRef& m, const std::string& key, bool transient,
+                  VSAErrorRef* error);
+
+  Dependencies deps_;
+  std::mutex cacheLock_;
+  std::map<std::string, ClassMap> live_;
+  std::map<std::string, ClassMap> transient_;
+};

@@ -1,0 +1,159 @@
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <fstream>
+
+#include "VSATestTempDir.h"
+#include "base/VSAPlist.h"
+#include "model/FakePersonaService.h"
+#include "model/VSAContainerCache.h"
+#include "platform/VSALinuxFileSystem.h"
+
+namespace fs = std::filesystem;
+using Kind = VSAPersonaAttributes::Kind;
+
+namespace {
+
+class Cache : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    root_ = temp_.path();
+    fs::create_directories(root_ + "/etc");
+    fs::create_directories(root_ + "/private/var/mobile");
+    fs::create_directories(root_ + "/private/var/enterprise");
+    std::ofstream(root_ + "/etc/passwd") << "mobile:x:501:501::/private/var/mobile:/bin/sh\n";
+    VSASystemRoot root(root_);
+    auto users = std::make_shared<VSAUserDatabase>(root);
+    config_ = std::make_shared<VSAGlobalConfiguration>(
+        root, std::make_shared<VSADeviceProperties>(root), users,
+        std::make_shared<VSAFileManager>(std::make_shared<VSALinuxFileSystem>(), users));
+    personas_ = std::make_shared<FakePersonaService>();
+    personas_->personas = std::vector<VSAPersonaAttributes>{
+        FakePersonaService::persona(Kind::Personal, 1000, "P", {}),
+        FakePersonaService::persona(Kind::Enterprise, 1001, "E", {"com.work"},
+                                    root_ + "/private/var/enterprise")};
+    identities_ = VSAUserIdentityCache::create({personas_, users, 501, 501, true, nullptr});
+    notifications_ = std::make_shared<VSANotificationCenter>(root);
+    sandbox_ = std::make_shared<VSASandboxService>(root);
+    cache_ = VSAContainerCache::create({identities_, config_, sandbox_, notifications_,
+                                        [](const std::string&) { return std::nullopt; },
+                                        [](const std::string& id, VSAContainerClass c) {
+                                          return c == 12 && id == "com.wellknown";
+                                        }});
+    personal_ = identities_->userIdentityForPersonalPersona();
+    enterprise_ = identities_->userIdentityForPersonaUniqueString(std::string("E"), 501, 501);
+  }
+
+  // Writes a container on disk (not through the cache); returns its metadata.
+  VSAMetadataRef onDisk(const VSAUserIdentityRef& owner, const char* id, VSAContainerClass c,
+                        std::string name = "") {
+    VSAUUID uuid = VSAUUID::random();
+    std::string dir = *config_->containerDirectoryURLForUserIdentity(owner, c, false) + "/" +
+                      (name.empty() ? uuid.string() : name);
+    fs::create_directories(dir);
+    auto identity =
+        VSAConcreteContainerIdentity::containerIdentityWithUUID(uuid, owner, id, c, nullptr);
+    auto m = std::make_shared<VSAMetadata>(identity, std::nullopt, dir, std::nullopt);
+    EXPECT_TRUE(m->writeMetadataToDiskWithError(*config_, nullptr));
+    return m;
+  }
+  VSAContainerIdentityRef identity(const VSAUserIdentityRef& owner, const char* id,
+                                   VSAContainerClass c) {
+    return VSAContainerIdentity::containerIdentityWithUserIdentity(owner, id, c, nullptr);
+  }
+  int sandboxItems(uid_t uid) {
+    int n = 0;
+    sandbox_->iterateUserStateItems(uid, [&](const VSASandboxItem&) { return ++n, true; });
+    return n;
+  }
+
+  VSATestTempDir temp_{"vessa-cache"};
+  std::string root_;
+  std::shared_ptr<VSAGlobalConfiguration> config_;
+  std::shared_ptr<FakePersonaService> personas_;
+  std::shared_ptr<VSAUserIdentityCache> identities_;
+  std::shared_ptr<VSANotificationCenter> notifications_;
+  std::shared_ptr<VSASandboxService> sandbox_;
+  std::shared_ptr<VSAContainerCache> cache_;
+  VSAUserIdentityRef personal_, enterprise_;
+};
+
+TEST_F(Cache, BuildsFromDiskSkippingBadNamesAndWrongClasses) {
+  onDisk(personal_, "com.app", 2);
+  onDisk(personal_, "com.named", 2, "Foo");  // not a UUID name
+  auto misplaced = onDisk(personal_, "com.bundle", 2);
+  // A metadata file that names another class is skipped (class-path check).
+  VSAValue v =
+      *VSA_dictionaryWithContentsOfURL(misplaced->url() + "/" + kVSAMetadataFileName, 0, nullptr);
+  v.set("VSAMetadataContentClass", VSAValue(1u));
+  VSA_writeToURL(v, misplaced->url() + "/" + kVSAMetadataFileName, 0, nullptr);
+  auto all = cache_->allContainersForUserIdentity(personal_, 2, false, false, nullptr);
+  ASSERT_TRUE(all);
+  ASSERT_EQ(all->size(), 1u);
+  EXPECT_EQ((*all)[0]->identifier(), "com.app");
+  // Well-known names count in Data/System only.
+  onDisk(personal_, "com.wellknown", 12, "com.wellknown");
+  EXPECT_EQ(cache_->allContainersForUserIdentity(personal_, 12, false, false, nullptr)->size(), 1u);
+  EXPECT_FALSE(VSAContainerCache::containerURLIsValidForContainerClass(
+      "/x/com.wellknown", 13, [](const std::string&, VSAContainerClass c) { return c == 12; }));
+}
+
+TEST_F(Cache, VanishedMetadataIsReportedOnceThenNotFound) {
+  auto m = onDisk(personal_, "com.app", 2);
+  auto id = identity(personal_, "com.app", 2);
+  VSAErrorRef error;
+  ASSERT_TRUE(cache_->containerForContainerIdentity(*id, false, false, false, &error));
+  fs::remove(m->url() + "/" + kVSAMetadataFileName);
+  EXPECT_FALSE(cache_->containerForContainerIdentity(*id, false, false, false, &error));
+  EXPECT_EQ(error->resultCode(0), 44u);
+  EXPECT_FALSE(cache_->containerForContainerIdentity(*id, false, false, false, &error));
+  EXPECT_EQ(error->resultCode(0), 21u);
+}
+
+TEST_F(Cache, KernelLookupAvoidsBuildingTheClassMap) {
+  auto m = onDisk(personal_, "com.app", 2);
+  ASSERT_TRUE(cache_->setSandboxContainerMappingForUserIdentity(personal_, "com.app", 2, m->url()));
+  auto found = cache_->containerForContainerIdentity(*identity(personal_, "com.app", 2), false,
+                                                     false, true, nullptr);
+  ASSERT_TRUE(found);
+  EXPECT_EQ(found->url(), m->url());
+  EXPECT_FALSE(cache_->hasClassMap(personal_, 2, false));
+}
+
+TEST_F(Cache, SandboxMappingRules) {
+  EXPECT_FALSE(cache_->shouldRegisterSandboxMappingWithUserIdentity(enterprise_, "com.x", 1))
+      << "enterprise bundle mappings are never pushed";
+  EXPECT_TRUE(cache_->shouldRegisterSandboxMappingWithUserIdentity(enterprise_, "group.g", 7));
+  EXPECT_TRUE(cache_->shouldRegisterSandboxMappingWithUserIdentity(enterprise_, "com.work", 2));
+  EXPECT_FALSE(cache_->shouldRegisterSandboxMappingWithUserIdentity(personal_, "com.work", 2));
+  EXPECT_TRUE(cache_->shouldRegisterSandboxMappingWithUserIdentity(personal_, "com.unlisted", 2));
+  EXPECT_FALSE(cache_->setSandboxContainerMappingForUserIdentity(personal_, "com.bundle", 1, "/x"))
+      << "bundle classes have no sandbox item type";
+}
+
+TEST_F(Cache, AddRemoveAndInvalidateAnEnterpriseIdentity) {
+  auto m = onDisk(enterprise_, "com.work", 2);
+  ASSERT_TRUE(cache_->addContainerMetadata(*m, m->url(), false, true, nullptr));
+  EXPECT_EQ(sandboxItems(501), 1);
+  ASSERT_TRUE(cache_->allContainersForUserIdentity(enterprise_, 7, true, false, nullptr));
+  EXPECT_TRUE(cache_->hasClassMap(enterprise_, 2, false));
+  EXPECT_TRUE(cache_->hasClassMap(enterprise_, 7, true));
+  // The enterprise persona goes away: its maps and mappings go, one notification.
+  personas_->personas->pop_back();
+  identities_->flush();
+  EXPECT_FALSE(cache_->hasClassMap(enterprise_, 2, false));
+  EXPECT_FALSE(cache_->hasClassMap(enterprise_, 7, true));
+  EXPECT_EQ(sandboxItems(501), 0);
+  EXPECT_EQ(notifications_->postedNames(),
+            std::vector<std::string>{CONTAINER_NOTIFY_USER_INVALIDATED});
+  // Removing from a rebuilt map drops the entry.
+  auto p = onDisk(personal_, "com.app", 2);
+  ASSERT_TRUE(cache_->containerForContainerIdentity(*identity(personal_, "com.app", 2)));
+  ASSERT_TRUE(cache_->removeContainerForUserIdentity(personal_, 2, "com.app", false, nullptr));
+  VSAErrorRef error;
+  EXPECT_FALSE(cache_->containerForContainerIdentity(*identity(personal_, "com.app", 2), false,
+                                                     false, false, &error));
+  EXPECT_EQ(error->resultCode(0), 21u) << "the map is not rebuilt from disk once built";
+}
+
+}  // namespace
