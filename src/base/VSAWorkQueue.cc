@@ -88,12 +88,15 @@ class MainLoop final : public VSAWorkQueueExecutor {
     jobs_.push_back(std::move(job));
     cv_.notify_one();
   }
+  // A stop asked for before run() starts ends the next run at once.
   void run() {
     std::unique_lock lock(mutex_);
-    stop_ = false;
     for (;;) {
       cv_.wait(lock, [this] { return stop_ || !jobs_.empty(); });
-      if (stop_) return;
+      if (stop_) {
+        stop_ = false;
+        return;
+      }
       auto job = std::move(jobs_.front());
       jobs_.pop_front();
       lock.unlock();

@@ -42,19 +42,28 @@ int VSADaemon::run() {
     initTransaction.reset();  // step 15: start-up is over
   });
   dispatcher_ = std::make_unique<VSARelayDispatcher>(*context_);
-  listener_ = std::make_unique<VSAIPCListener>(context_->systemRoot.socketPath(),
-                                               context_->listenerQueue, context_->transactions);
-  VSAErrorRef error;
-  if (listener_->listen(&error)) {
-    listener_->setHandler([this](const VSAIPCMessageRef& m) { dispatcher_->processRelayEvent(m); });
-    listener_->resume();
-  } else {
-    VSALogIn(VSALogCategory::Daemon, kVSALogError, "main", "unable to start relay service!");
-    VSALogIn(VSALogCategory::Daemon, kVSALogError, "main", "%@", error);
-    listener_.reset();
+  {
+    std::lock_guard lock(listenerMutex_);
+    listener_ = std::make_unique<VSAIPCListener>(context_->systemRoot.socketPath(),
+                                                 context_->listenerQueue, context_->transactions);
+    VSAErrorRef error;
+    if (!stopping_ && listener_->listen(&error)) {
+      listener_->setHandler(
+          [this](const VSAIPCMessageRef& m) { dispatcher_->processRelayEvent(m); });
+      listener_->resume();
+    } else {
+      if (!stopping_) {
+        VSALogIn(VSALogCategory::Daemon, kVSALogError, "main", "unable to start relay service!");
+        VSALogIn(VSALogCategory::Daemon, kVSALogError, "main", "%@", error);
+      }
+      listener_.reset();
+    }
   }
   VSAWorkQueue::runMain();
-  if (listener_) listener_->stop();
+  {
+    std::lock_guard lock(listenerMutex_);
+    if (listener_) listener_->stop();
+  }
   VSALogIn(VSALogCategory::Daemon, kVSALogNotice, "main", "vessad stopped");
   VSALogger::shared().closeRotatingLog();
   return 0;
@@ -72,7 +81,10 @@ void VSADaemon::drainForShutdown() {
   VSALogIn(VSALogCategory::Daemon, kVSALogNotice, "main",
            "Stopping: no new requests; waiting for %d open transactions",
            context_->transactions->openCount());
-  if (listener_) listener_->stopAccepting();
+  {
+    std::lock_guard lock(listenerMutex_);
+    if (listener_) listener_->stopAccepting();
+  }
   if (!context_->transactions->waitUntilIdle(std::chrono::seconds(30)))
     VSALogIn(VSALogCategory::Daemon, kVSALogError, "main",
              "Giving up on %d open transactions after 30 seconds",

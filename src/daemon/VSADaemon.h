@@ -13,6 +13,7 @@
 
 #include <atomic>
 #include <memory>
+#include <mutex>
 #include <string>
 #include <thread>
 
@@ -55,4 +56,6 @@ class VSADaemon {
   std::unique_ptr<VSALockStateMonitor> lockStateMonitor_;
   std::string firstBootSemaphore_;
   std::atomic<bool> stopping_{false};
+  // Guards listener_: a signal may ask for a stop while run() sets it up.
+  std::mutex listenerMutex_;
 };
