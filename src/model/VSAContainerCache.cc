@@ -23,6 +23,12 @@ VSAErrorRef cacheError(VSAResultCode code, const char* format, const A&... args)
   return e;
 }
 
+VSAErrorRef rebuildError(const VSAUserIdentityRef& user, VSAContainerClass c, bool transient) {
+  return cacheError(43, "Cache: [%@]-%@%@: Failed to rebuild",
+                    user ? user->identifier() : std::string(), shortName(c),
+                    transientTag(transient));
+}
+
 std::string lastComponent(const std::string& path) {
   size_t slash = path.find_last_of('/');
   return slash == std::string::npos ? path : path.substr(slash + 1);
@@ -175,9 +181,7 @@ VSAMetadataRef VSAContainerCache::containerForContainerIdentity(
     if (!found) {
       if (!map) map = _lock_getCache(user, c, transient, updateSandbox, true, nullptr);
       if (!map) {
-        VSASetError(error, cacheError(43, "Cache: [%@]-%@%@: Failed to rebuild",
-                                      user ? user->identifier() : std::string(), shortName(c),
-                                      transientTag(transient)));
+        VSASetError(error, rebuildError(user, c, transient));
         return nullptr;
       }
       auto it = map->find(identity.identifier());
@@ -243,9 +247,7 @@ bool VSAContainerCache::addContainerMetadata(const VSAMetadata& metadata, const 
   std::lock_guard lock(cacheLock_);
   ClassMap* map = _lock_getCache(user, c, transient, false, true, nullptr);
   if (!map) {
-    VSASetError(error, cacheError(43, "Cache: [%@]-%@%@: Failed to rebuild",
-                                  user ? user->identifier() : std::string(), shortName(c),
-                                  transientTag(transient)));
+    VSASetError(error, rebuildError(user, c, transient));
     return false;
   }
   auto stored = std::make_shared<VSAMetadata>(metadata);
@@ -274,9 +276,7 @@ bool VSAContainerCache::removeContainerForUserIdentity(const VSAUserIdentityRef&
   std::lock_guard lock(cacheLock_);
   ClassMap* map = _lock_getCache(user, c, transient, false, true, nullptr);
   if (!map) {
-    VSASetError(error, cacheError(43, "Cache: [%@]-%@%@: Failed to rebuild",
-                                  user ? user->identifier() : std::string(), shortName(c),
-                                  transientTag(transient)));
+    VSASetError(error, rebuildError(user, c, transient));
     return false;
   }
   map->erase(identifier);
