@@ -2,7 +2,7 @@
 #include <shared_mutex>
 
 #include "VSABenchRatio.h"
-#include "daemon/VSALocks.h"
+#include "base/VSALocks.h"
 
 static void BM_SharedMutexReadLockUnlock(benchmark::State& state) {
   std::shared_mutex m;

@@ -122,7 +122,7 @@ void VSACodeSigningMapping::_onQueue_queueSystemContainerDeletion(const std::str
   if (commandQueue)
     commandQueue->insertCommand(
         VSACommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
-            {identity}, true, [identifier](VSAResultCode c) {
+            stageEnvironment_, {identity}, true, [identifier](VSAResultCode c) {
               logMapping(kVSALogError,
                          "Failed to destroy system container with identifier %@: %llu", identifier,
                          c);

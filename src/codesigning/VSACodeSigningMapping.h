@@ -21,6 +21,7 @@
 #include "model/VSAGlobalConfiguration.h"
 #include "model/VSAUserIdentityCache.h"
 #include "operations/VSACommandQueue.h"
+#include "operations/VSAStageForDeleteEnvironment.h"
 
 inline constexpr const char* kVSAEntitlementsKey = "com.tamsk.Vessa.Entitlements";
 inline constexpr const char* kVSAOptionDataContainerClass = "com.tamsk.Vessa.DataContainerClass";
@@ -85,6 +86,11 @@ class VSACodeSigningMapping {
       const std::string& identifier, const VSAValue* entitlements, const char* groupKey);
 
   VSAWorkQueue& queue() { return *queue_; }
+  // What the deletions this mapping queues run with (set once the container
+  // cache exists).
+  void setStageForDeleteEnvironment(std::shared_ptr<const VSAStageForDeleteEnvironment> environment) {
+    stageEnvironment_ = std::move(environment);
+  }
 
  private:
   void _onQueue_migrateFromMappingFileToDBIfNecessary();
@@ -124,6 +130,7 @@ class VSACodeSigningMapping {
   std::shared_ptr<VSAGlobalConfiguration> configuration_;
   VSAWorkQueue::Ref queue_;
   std::unique_ptr<VSASQLiteDB> codeSigningMappingDB_;
+  std::shared_ptr<const VSAStageForDeleteEnvironment> stageEnvironment_;
 };
 
 template <typename F>

@@ -155,7 +155,7 @@ void VSACodeSigningMapping::_onQueue_removeGroupContainersIfNeededforUserIdentit
         std::string who = user->identifier();
         commandQueue->insertCommand(
             VSACommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
-                {identity}, true, [id, who](VSAResultCode c) {
+                stageEnvironment_, {identity}, true, [id, who](VSAResultCode c) {
                   logMapping(kVSALogError,
                              "Failed to destroy group container with identifier %@ for %@: %llu",
                              id, who, c);

@@ -67,6 +67,15 @@ struct VSADaemonContext {
          [list = whitelist](const std::string& id, VSAContainerClass c) {
            return list->containerIdIsWellknown(id, c);
          }});
+    auto stageEnvironment = std::make_shared<VSAStageForDeleteEnvironment>();
+    stageEnvironment->cache = containerCache;
+    stageEnvironment->configuration = globalConfiguration;
+    std::weak_ptr<VSACodeSigningMapping> mapping = codeSigningMapping;
+    stageEnvironment->removeCodeSigning = [mapping](const std::string& id, VSACommandQueue& queue) {
+      if (auto m = mapping.lock())
+        m->removeCodeSigningDictionariesForIdentifierAndItsChildren(id, &queue);
+    };
+    codeSigningMapping->setStageForDeleteEnvironment(stageEnvironment);
   }
 
   VSASystemRoot systemRoot;

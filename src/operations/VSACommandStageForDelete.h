@@ -1,11 +1,10 @@
-// The deferred deletion of containers (command type 3): the containers are
-// renamed into death row and dropped from the container cache when the
-// request's command queue is drained, under the all-identifiers write lock
-// unless the caller already holds it.
-//
-// Staging needs the container cache, which is not built yet: until it is,
-// running the command fails with code 28 and says so, so a request that
-// decided on a deletion reports that it could not be carried out.
+// The deferred deletion of containers (command type 3). When the request's
+// command queue is drained, each listed container is found in the cache,
+// renamed into death row (or, when that fails, removed in place) and dropped
+// from the cache; a deleted bundle's code-signing records go too. It runs
+// under the all-identifiers write lock unless the caller already holds it.
+// The background task that empties death row comes with the deletion
+// operations.
 #pragma once
 
 #include <functional>
@@ -14,6 +13,7 @@
 
 #include "model/VSAContainerIdentity.h"
 #include "operations/VSACommandQueue.h"
+#include "operations/VSAStageForDeleteEnvironment.h"
 
 class VSACommandStageForDelete : public VSACommand {
  public:
@@ -21,10 +21,12 @@ class VSACommandStageForDelete : public VSACommand {
 
   // commandForStageForDeleteWithContainerIdentities:useLocking:onError:
   static std::shared_ptr<VSACommandStageForDelete> commandForStageForDeleteWithContainerIdentities(
+      std::shared_ptr<const VSAStageForDeleteEnvironment> environment,
       std::vector<VSAContainerIdentityRef> containerIdentities, bool useLocking,
       ErrorHandler onError);
 
-  VSACommandStageForDelete(std::vector<VSAContainerIdentityRef> containerIdentities,
+  VSACommandStageForDelete(std::shared_ptr<const VSAStageForDeleteEnvironment> environment,
+                           std::vector<VSAContainerIdentityRef> containerIdentities,
                            bool useLocking, ErrorHandler onError);
 
   uint64_t command() const override { return 3; }
@@ -34,6 +36,10 @@ class VSACommandStageForDelete : public VSACommand {
   bool useLocking() const { return useLocking_; }
 
  private:
+  // Stages one container; false with `code` set when the loop must stop.
+  bool stage(const VSAContainerIdentity& identity, VSACommandQueue& queue, VSAResultCode* code);
+
+  std::shared_ptr<const VSAStageForDeleteEnvironment> environment_;
   std::vector<VSAContainerIdentityRef> identities_;
   bool useLocking_;
   ErrorHandler onError_;

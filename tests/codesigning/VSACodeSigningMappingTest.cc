@@ -7,6 +7,7 @@
 #include "base/VSAPlist.h"
 #include "codesigning/VSACodeSigningMapping.h"
 #include "model/FakePersonaService.h"
+#include "model/VSAContainerCache.h"
 #include "operations/VSACommandStageForDelete.h"
 #include "platform/VSALinuxFileSystem.h"
 
@@ -38,6 +39,17 @@ class Mapping : public ::testing::Test {
     mapping_.reset();
     mapping_ = std::make_unique<VSACodeSigningMapping>(
         cache, config, std::make_unique<VSASQLiteDB>(config->libraryDirectory()));
+    config_ = config;
+    personal_ = cache->userIdentityForPersonalPersona();
+    containers_ =
+        VSAContainerCache::create({cache, config, std::make_shared<VSASandboxService>(root),
+                                   std::make_shared<VSANotificationCenter>(root),
+                                   [](const std::string&) { return std::nullopt; },
+                                   [](const std::string&, VSAContainerClass) { return false; }});
+    auto environment = std::make_shared<VSAStageForDeleteEnvironment>();
+    environment->cache = containers_;
+    environment->configuration = config;
+    mapping_->setStageForDeleteEnvironment(environment);
   }
 
   static VSAValue info(VSAValue entitlements) {
@@ -63,8 +75,25 @@ class Mapping : public ::testing::Test {
     return out;
   }
 
+  // A container of the mobile user on disk and in the cache; returns its directory.
+  std::string container(const char* id, VSAContainerClass c) {
+    VSAUUID uuid = VSAUUID::random();
+    std::string dir =
+        *config_->containerDirectoryURLForUserIdentity(personal_, c, false) + "/" + uuid.string();
+    fs::create_directories(dir);
+    auto identity =
+        VSAConcreteContainerIdentity::containerIdentityWithUUID(uuid, personal_, id, c, nullptr);
+    VSAMetadata m(identity, std::nullopt, dir, std::nullopt);
+    EXPECT_TRUE(m.writeMetadataToDiskWithError(*config_, nullptr));
+    EXPECT_TRUE(containers_->addContainerMetadata(m, dir, false, false, nullptr));
+    return dir;
+  }
+
   VSATestTempDir temp_{"vessa-mapping"};
   std::string root_, legacyPath_;
+  std::shared_ptr<VSAGlobalConfiguration> config_;
+  std::shared_ptr<VSAContainerCache> containers_;
+  VSAUserIdentityRef personal_;
   std::unique_ptr<VSACodeSigningMapping> mapping_;
 };
 
@@ -124,10 +153,50 @@ TEST_F(Mapping, SharedGroupIsQueuedForDeletionOnlyAtTheLastReference) {
   EXPECT_EQ(staged(q), std::vector<std::string>{"group.a/7"}) << "only group.a goes";
   ASSERT_EQ(reg("com.b", info(VSAValue::dictionary()), q), 1u);
   EXPECT_EQ(staged(q), (std::vector<std::string>{"group.a/7", "group.shared/7"}));
-  // Running the queue: staging needs the container cache, which reports 28.
+  EXPECT_EQ(q.count(), 2u);
+}
+
+TEST_F(Mapping, QueuedDeletionsStageTheContainersOnDeathRow) {
+  std::string shared = container("group.shared", 7);
+  VSACommandQueue q;
+  ASSERT_EQ(reg("com.a", info(groups({"group.shared"})), q), 1u);
+  ASSERT_EQ(reg("com.a", info(VSAValue::dictionary()), q), 1u);
+  ASSERT_EQ(q.count(), 1u);
   VSAResultCode code = 1;
-  EXPECT_FALSE(q.executeAllUntilExhaustedOrError(&code));
-  EXPECT_EQ(code, 28u);
+  EXPECT_TRUE(q.executeAllUntilExhaustedOrError(&code)) << code;
+  EXPECT_FALSE(fs::exists(shared));
+  EXPECT_TRUE(
+      fs::exists(config_->deathrowDirectory() + "/" + fs::path(shared).filename().string()));
+  VSAErrorRef error;
+  auto gone = VSAContainerIdentity::containerIdentityWithUserIdentity(personal_, "group.shared", 7,
+                                                                      nullptr);
+  EXPECT_FALSE(containers_->containerForContainerIdentity(*gone, false, false, false, &error));
+  EXPECT_EQ(error->resultCode(0), 21u);
+}
+
+TEST_F(Mapping, AStagedBundleTakesItsCodeSigningRecordsAlong) {
+  std::string bundle = container("com.bundled", 1);
+  VSACommandQueue q;
+  ASSERT_EQ(reg("com.bundled", info(VSAValue::dictionary()), q), 1u);
+  auto identity =
+      VSAContainerIdentity::containerIdentityWithUserIdentity(personal_, "com.bundled", 1, nullptr);
+  auto environment = std::make_shared<VSAStageForDeleteEnvironment>();
+  environment->cache = containers_;
+  environment->configuration = config_;
+  environment->removeCodeSigning = [this](const std::string& id, VSACommandQueue& queue) {
+    mapping_->removeCodeSigningDictionariesForIdentifierAndItsChildren(id, &queue);
+  };
+  q.insertCommand(VSACommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
+      environment, {identity}, true, nullptr));
+  VSAResultCode code = 1;
+  EXPECT_TRUE(q.executeAllUntilExhaustedOrError(&code)) << code;
+  EXPECT_FALSE(fs::exists(bundle));
+  VSAErrorRef error;
+  EXPECT_FALSE(mapping_->codeSigningEntryForIdentifier("com.bundled", &error));
+  // A missing container is skipped without error.
+  q.insertCommand(VSACommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
+      environment, {identity}, true, nullptr));
+  EXPECT_TRUE(q.executeAllUntilExhaustedOrError(&code));
 }
 
 TEST_F(Mapping, SystemGroupsAreNeverReleasedByARegistration) {

@@ -10,7 +10,7 @@
 
 #include "base/VSALog.h"
 #include "base/VSAUUID.h"
-#include "daemon/VSALocks.h"
+#include "base/VSALocks.h"
 
 namespace {
 

@@ -1,4 +1,4 @@
-#include "daemon/VSALocks.h"
+#include "base/VSALocks.h"
 
 #include <pthread.h>
 
