@@ -78,6 +78,12 @@ class VSACodeSigningMapping {
   void removeCodeSigningDictionariesForIdentifierAndItsChildren(const std::string& identifier,
                                                                 VSACommandQueue* commandQueue);
   bool removeAllAdvanceCopiesWithError(VSAErrorRef* error);
+  // Invalidates the records of apps (and their plug-ins) that no longer have
+  // a bundle container; caller-registered entries and plug-ins with a parent
+  // are left alone. 1 when every step succeeded.
+  VSAResultCode invalidateCodeSigningInfoForAppsWithoutBundleContainer();
+  // Queues deletion of system containers that no entry's entitlements claim.
+  void reconcileSystemContainersWithCommandQueue(VSACommandQueue* commandQueue);
   std::optional<VSAReferenceCounts> copyReferenceCountSetOfType(int groupType);
 
   // Group identifiers from an entitlements dictionary (string or array of

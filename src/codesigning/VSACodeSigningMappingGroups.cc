@@ -4,6 +4,7 @@
 #include <cassert>
 #include <set>
 
+#include "base/VSALocks.h"
 #include "base/VSALog.h"
 #include "codesigning/VSACodeSigningMapping.h"
 #include "model/VSAPerUserConfiguration.h"
@@ -224,4 +225,89 @@ bool VSACodeSigningMapping::removeAllAdvanceCopiesWithError(VSAErrorRef* error) 
   return sync([&] {
     return codeSigningMappingDB_->deleteAllAdvanceCopiesOfCodeSigningEntriesWithError(error);
   });
+}
+
+VSAResultCode VSACodeSigningMapping::invalidateCodeSigningInfoForAppsWithoutBundleContainer() {
+  VSAAllIdentifiersLockGuard lock(true);
+  VSAResultCode result = VSAResult::kSuccess;
+  VSAErrorRef error;
+  auto identifiers = identifiersWithError(&error);
+  if (!identifiers) {
+    logMapping(kVSALogError,
+               "Failed to enumerate containers when invalidating code signing info: %@", error);
+    return error ? error->resultCode(VSAResult::kDatabaseFailed) : VSAResult::kDatabaseFailed;
+  }
+  auto owner = userIdentityCache_->defaultUserIdentity();
+  for (const std::string& identifier : *identifiers) {
+    VSAErrorRef entryError;
+    auto entry = codeSigningEntryForIdentifier(identifier, &entryError);
+    if (!entry) {
+      logMapping(kVSALogError, "Error fetching code sign info for %@ to check for invalidation: %@",
+                 identifier, entryError);
+      continue;
+    }
+    VSAContainerClass c = entry->dataContainerClass();
+    bool plugIn = c >= 3 && c <= 6;
+    bool hasParent = plugIn && parentIdentifierForChildIdentifier(identifier).has_value();
+    logMapping(kVSALogInfo,
+               "Checking for invalidation: identifier = %@, codeSigningEntry = <%p>, "
+               "isRegisteredByCaller = %d, isPlugIn = %d, hasParent = %d",
+               identifier, static_cast<const void*>(&*entry), entry->isRegisteredByCaller(), plugIn,
+               hasParent);
+    if (entry->isRegisteredByCaller() || hasParent) continue;
+    bool found = false;
+    for (VSAContainerClass bundle : {1ull, 3ull, 5ull}) {
+      auto identity = VSAContainerIdentity::containerIdentityWithUserIdentity(owner, identifier,
+                                                                              bundle, nullptr);
+      if (identity && stageEnvironment_ &&
+          stageEnvironment_->cache->containerForContainerIdentity(*identity, false, false, false,
+                                                                  nullptr)) {
+        found = true;
+        break;
+      }
+    }
+    if (found) continue;
+    logMapping(kVSALogNotice, "Invalidating: identifier = %@, isPlugin = %d", identifier, plugIn);
+    VSAErrorRef invalidateError;
+    if (!invalidateCodeSigningInfoForIdentifierAndItsChildren(identifier, &invalidateError)) {
+      logMapping(kVSALogError, "Failed to invalidate code signing info for %@ : %@", identifier,
+                 invalidateError);
+      result = invalidateError ? invalidateError->resultCode(VSAResult::kDatabaseFailed)
+                               : VSAResult::kDatabaseFailed;
+    }
+  }
+  return result;
+}
+
+void VSACodeSigningMapping::reconcileSystemContainersWithCommandQueue(
+    VSACommandQueue* commandQueue) {
+  std::set<std::string> claimed;
+  VSAErrorRef error = sync([&] {
+    return codeSigningMappingDB_->enumerateIdentifiersAndCodeSigningInfoUsingBlock(
+        [&](const std::string& identifier, const VSACodeSigningEntry& entry) {
+          const VSAValue* e = entry.codeSigningInfo().get(kVSAEntitlementsKey);
+          const VSAValue* v = e ? e->get(kVSAEntitlementSystemContainer) : nullptr;
+          if (v && v->boolValue().value_or(false)) claimed.insert(identifier);
+        });
+  });
+  if (error) {
+    logMapping(kVSALogError, "Failed to enumerate system container references: %@", error);
+    return;
+  }
+  if (!stageEnvironment_) return;
+  VSAErrorRef listError;
+  auto containers = stageEnvironment_->cache->allContainersForUserIdentity(
+      userIdentityCache_->defaultUserIdentity(), 12, false, false, &listError);
+  if (!containers) {
+    logMapping(kVSALogError, "Failed to fetch system container list: %@", listError);
+    return;
+  }
+  for (const auto& m : *containers) {
+    if (claimed.count(m->identifier())) continue;
+    logMapping(kVSALogNotice, "Removing system container with identifier %@", m->identifier());
+    if (commandQueue)
+      commandQueue->insertCommand(
+          VSACommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
+              stageEnvironment_, {m->containerIdentity()}, false, nullptr));
+  }
 }

@@ -29,3 +29,7 @@ void VSAHandleRecordCodeSigningInfo(const VSAValue& request, VSAValue& reply,
 // (absent for unknown, placeholder, advance-copy and invalid entries).
 void VSAHandleReadCodeSigningInfo(const VSAValue& request, VSAValue& reply,
                                   VSAClientConnection& connection, VSAResultCode* result);
+
+// Command 20: invalidates the code-signing records of apps without a bundle container.
+void VSAHandleInvalidateAppsWithoutBundle(const VSAValue& request, VSAValue& reply,
+                                          VSAClientConnection& connection, VSAResultCode* result);

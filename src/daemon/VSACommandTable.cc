@@ -30,7 +30,7 @@ const std::array<VSACommandTableEntry, kVSACommandCount> kTable = {{
     {17, nullptr, allowed, R, O, L},  // path of a system group container
     {18, VSAHandleRecordCodeSigningInfo, allowed, R, _, _},  // record code-signing information
     {19, VSAHandleReadCodeSigningInfo, allowed, R, _, _},    // read code-signing information
-    {20, nullptr, allowed, R, _, _},  // invalidate apps without a bundle container
+    {20, VSAHandleInvalidateAppsWithoutBundle, allowed, R, _, _},  // invalidate apps without bundle
     {21, nullptr, allowed, _, _, _},  // change data protection (replies from its completion)
     {22, nullptr, allowed, R, _, _},  // recreate a container's default structure
     {23, nullptr, allowed, R, _, L},  // disk usage of a container

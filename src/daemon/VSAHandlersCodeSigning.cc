@@ -36,3 +36,11 @@ void VSAHandleReadCodeSigningInfo(const VSAValue& request, VSAValue& reply,
           *identifier->stringValue()))
     reply.set("ReplyInfoDictionary", *info);
 }
+
+void VSAHandleInvalidateAppsWithoutBundle(const VSAValue&, VSAValue&,
+                                          VSAClientConnection& connection, VSAResultCode* result) {
+  VSAResultCode code =
+      connection.context()
+          .codeSigningMapping->invalidateCodeSigningInfoForAppsWithoutBundleContainer();
+  if (code != VSAResult::kSuccess) VSASetCode(result, code);
+}

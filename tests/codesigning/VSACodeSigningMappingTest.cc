@@ -246,6 +246,42 @@ TEST_F(Mapping, LegacyMappingFileMovesIntoTheDatabaseOnce) {
   EXPECT_TRUE(fs::exists(legacyPath_));
 }
 
+TEST_F(Mapping, AppsWithoutABundleContainerAreInvalidated) {
+  container("com.installed", 1);
+  VSACommandQueue q;
+  ASSERT_EQ(reg("com.installed", info(VSAValue::dictionary()), q), 1u);
+  ASSERT_EQ(reg("com.gone", info(VSAValue::dictionary()), q,
+                VSAValue::Dictionary{{kVSAOptionDataContainerClass, VSAValue(2u)}}),
+            1u);
+  ASSERT_EQ(reg("com.gone.plugin", info(VSAValue::dictionary()), q,
+                VSAValue::Dictionary{{kVSAOptionParentBundleID, VSAValue("com.gone")},
+                                     {kVSAOptionDataContainerClass, VSAValue(4u)}}),
+            1u);
+  ASSERT_EQ(mapping_->processCallerRegisteredEntitlements(VSAValue::dictionary(), "com.caller", &q),
+            1u);
+  EXPECT_EQ(mapping_->invalidateCodeSigningInfoForAppsWithoutBundleContainer(), 1u);
+  VSAErrorRef error;
+  EXPECT_FALSE(mapping_->codeSigningEntryForIdentifier("com.installed", &error)->isInvalid());
+  EXPECT_TRUE(mapping_->codeSigningEntryForIdentifier("com.gone", &error)->isInvalid());
+  EXPECT_TRUE(mapping_->codeSigningEntryForIdentifier("com.gone.plugin", &error)->isInvalid())
+      << "a plug-in goes with its parent";
+  EXPECT_FALSE(mapping_->codeSigningEntryForIdentifier("com.caller", &error)->isInvalid());
+}
+
+TEST_F(Mapping, UnclaimedSystemContainersAreReconciledAway) {
+  container("com.claimed", 12);
+  std::string orphan = container("com.orphan", 12);
+  VSACommandQueue q;
+  ASSERT_EQ(reg("com.claimed",
+                info(VSAValue::Dictionary{{kVSAEntitlementSystemContainer, VSAValue(true)}}), q),
+            1u);
+  mapping_->reconcileSystemContainersWithCommandQueue(&q);
+  EXPECT_EQ(staged(q), std::vector<std::string>{"com.orphan/12"});
+  VSAResultCode code = 1;
+  EXPECT_TRUE(q.executeAllUntilExhaustedOrError(&code)) << code;
+  EXPECT_FALSE(fs::exists(orphan));
+}
+
 TEST_F(Mapping, GroupEntitlementShapes) {
   VSAValue e = VSAValue::Dictionary{
       {kVSAEntitlementApplicationGroups, VSAValue::Array{VSAValue("g"), VSAValue("g")}},
