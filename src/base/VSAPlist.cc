@@ -226,6 +226,16 @@ bool VSAWriteFileAtomically(const std::string& path, const std::vector<uint8_t>&
   return true;
 }
 
+int VSAMakeDirectories(const std::string& path, mode_t mode) {
+  for (size_t pos = path.find('/', 1); pos != std::string::npos; pos = path.find('/', pos + 1)) {
+    if (::mkdir(path.substr(0, pos).c_str(), 0755) != 0 && errno != EEXIST) return errno;
+  }
+  if (::mkdir(path.c_str(), mode) != 0 && errno != EEXIST) return errno;
+  struct stat st;
+  if (::stat(path.c_str(), &st) != 0) return errno;
+  return S_ISDIR(st.st_mode) ? 0 : ENOTDIR;
+}
+
 std::optional<std::vector<uint8_t>> VSAReadFile(const std::string& path, VSAErrorRef* error,
                                                 size_t limit) {
   int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW);

@@ -50,6 +50,9 @@ std::optional<VSAValue> VSA_dictionaryWithContentsOfURL(const std::string& path,
 // Writes `bytes` to `path` atomically (temporary file + fsync + rename).
 bool VSAWriteFileAtomically(const std::string& path, const std::vector<uint8_t>& bytes, mode_t mode,
                             VSAErrorRef* error);
+// mkdir -p: creates `path` and its missing parents (parents 0755, `path`
+// itself `mode`); 0 or the errno of the step that failed.
+int VSAMakeDirectories(const std::string& path, mode_t mode = 0755);
 // Reads a whole file; refuses files larger than `limit` bytes.
 std::optional<std::vector<uint8_t>> VSAReadFile(const std::string& path, VSAErrorRef* error,
                                                 size_t limit = 64u << 20);

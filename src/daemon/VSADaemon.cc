@@ -7,21 +7,13 @@
 #include "base/VSACrash.h"
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
+#include "base/VSAPlist.h"
 #include "platform/VSANamedSemaphore.h"
 
 #ifndef VESSA_BUILD_DATE
 #define VESSA_BUILD_DATE __DATE__
 #define VESSA_BUILD_TIME __TIME__
 #endif
-
-namespace {
-// mkdir -p for the daemon's run directory.
-void makeRunDirectory(const std::string& path) {
-  for (size_t pos = path.find('/', 1); pos != std::string::npos; pos = path.find('/', pos + 1))
-    mkdir(path.substr(0, pos).c_str(), 0755);
-  mkdir(path.c_str(), 0755);
-}
-}  // namespace
 
 VSADaemon::VSADaemon(Options options)
     : options_(std::move(options)),
@@ -34,7 +26,7 @@ VSADaemon::VSADaemon(Options options)
 VSADaemon::~VSADaemon() = default;
 
 int VSADaemon::run() {
-  makeRunDirectory(context_->systemRoot.runDirectory());
+  VSAMakeDirectories(context_->systemRoot.runDirectory());
   context_->listenerQueue = VSAWorkQueue::create("com.tamsk.vessad.listener");
   auto initTransaction = context_->transactions->open();
   context_->listenerQueue->async([this, initTransaction = std::move(initTransaction)]() mutable {

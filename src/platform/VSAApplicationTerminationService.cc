@@ -59,7 +59,7 @@ VSAApplicationTerminationService::createAssertion(const std::string& bundleIdent
     handles_[handle] = bundleIdentifier;
     ++holds_[bundleIdentifier];
     std::string dir = root_.resolve("/run/vessad/termination-assertions");
-    mkdir(dir.c_str(), 0755);
+    VSAMakeDirectories(dir);
     std::string text = std::to_string(static_cast<int>(reason)) + "\n";
     VSAWriteFileAtomically(recordPath(bundleIdentifier),
                            std::vector<uint8_t>(text.begin(), text.end()), 0644, nullptr);

@@ -34,7 +34,7 @@ bool VSALockStateService::setLockState(int state) {
 int VSALockStateService::registerForLockStatus(VSAWorkQueue::Ref queue,
                                                std::function<void()> handler) {
   std::string dir = root_.runDirectory();
-  mkdir(dir.c_str(), 0755);
+  VSAMakeDirectories(dir);
   auto watcher = std::make_unique<VSAInotifyWatcher>(
       dir, std::set<std::string>{"lockstate"}, std::move(queue),
       [handler = std::move(handler)](const std::string&) { handler(); });

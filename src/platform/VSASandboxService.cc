@@ -21,13 +21,6 @@ std::string hex(const uint8_t* p, size_t n) {
   }
   return out;
 }
-// mkdir -p, the last component with `mode`.
-void makeDirectories(const std::string& path, mode_t mode) {
-  for (size_t pos = path.find('/', 1); pos != std::string::npos; pos = path.find('/', pos + 1))
-    mkdir(path.substr(0, pos).c_str(), 0755);
-  mkdir(path.c_str(), mode);
-}
-
 std::string hex(const std::string& s) {
   return hex(reinterpret_cast<const uint8_t*>(s.data()), s.size());
 }
@@ -94,7 +87,7 @@ int VSASandboxService::store(uid_t uid, const std::vector<VSASandboxItem>& items
                                         {"PersonaID", VSAValue(static_cast<int64_t>(i.personaID))},
                                         {"Path", VSAValue(i.path)}});
   std::string dir = root_.resolve("/run/vessad/sandbox");
-  makeDirectories(dir, 0700);
+  VSAMakeDirectories(dir, 0700);
   VSAErrorRef error;
   if (!VSA_writeToURL(VSAValue::Dictionary{{"Items", VSAValue(std::move(list))}}, tablePath(uid), 0,
                       &error))
@@ -141,7 +134,7 @@ bool VSASandboxService::key(std::string* out) {
   } else {
     bytes.resize(32);
     if (RAND_bytes(bytes.data(), 32) != 1) return false;
-    makeDirectories(root_.runDirectory(), 0755);
+    VSAMakeDirectories(root_.runDirectory());
     if (!VSAWriteFileAtomically(path, bytes, 0600, nullptr)) return false;
   }
   key_.assign(bytes.begin(), bytes.end());
