@@ -5,7 +5,16 @@
 #include <unistd.h>
 
 #include <filesystem>
+#include <fstream>
 #include <string>
+
+// Gives the system root `root` a "mobile" user (501) and its home, which
+// user identities need.
+inline void VSAWriteMobileUser(const std::string& root) {
+  std::filesystem::create_directories(root + "/etc");
+  std::filesystem::create_directories(root + "/private/var/mobile");
+  std::ofstream(root + "/etc/passwd") << "mobile:x:501:501::/private/var/mobile:/bin/sh\n";
+}
 
 class VSATestTempDir {
  public:

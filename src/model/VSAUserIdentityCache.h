@@ -127,6 +127,9 @@ class VSAUserIdentityCache : public std::enable_shared_from_this<VSAUserIdentity
   bool _lock_resync_fromUserPersonaAttributes(const std::vector<VSAPersonaAttributes>& list);
   void _lock_flush();
   void applyUIDFloor(uid_t& uid, gid_t& gid) const;
+  // The identity of a unique string as stored (personal when personas are
+  // unsupported, unspecific for no string, nothing for an unknown one).
+  VSAUserIdentityRef lookUpPersonaUniqueString(const std::optional<std::string>& unique);
   VSAUserIdentityRef rebasedIfNeeded(const VSAUserIdentityRef& identity, uid_t uid, gid_t gid);
 
   Dependencies deps_;

@@ -25,25 +25,26 @@ VSAUserIdentityRef VSAUserIdentityCache::userIdentityForPersonalPersonaWithUID(u
 
 VSAUserIdentityRef VSAUserIdentityCache::unspecificUserIdentity() { return snapshot()->unspecific; }
 
-VSAUserIdentityRef VSAUserIdentityCache::userIdentityForPersonaUniqueString(
-    const std::optional<std::string>& unique, uid_t uid, gid_t gid) {
-  applyUIDFloor(uid, gid);
-  auto s = snapshot();
-  if (!personasAreSupported()) return rebasedIfNeeded(s->personal, uid, gid);
-  if (!unique) return rebasedIfNeeded(s->unspecific, uid, gid);
-  auto it = s->personaUniqueStringToUserIdentity.find(*unique);
-  if (it == s->personaUniqueStringToUserIdentity.end()) return nullptr;
-  VSALog(kVSALogDebug, kOrigin, "Found %@ for %@", it->second, *unique);
-  return rebasedIfNeeded(it->second, uid, gid);
-}
-
-VSAUserIdentityRef VSAUserIdentityCache::userIdentityForCurrentUserWithPersonaUniqueString(
+VSAUserIdentityRef VSAUserIdentityCache::lookUpPersonaUniqueString(
     const std::optional<std::string>& unique) {
   auto s = snapshot();
   if (!personasAreSupported()) return s->personal;
   if (!unique) return s->unspecific;
   auto it = s->personaUniqueStringToUserIdentity.find(*unique);
-  return it == s->personaUniqueStringToUserIdentity.end() ? nullptr : it->second;
+  if (it == s->personaUniqueStringToUserIdentity.end()) return nullptr;
+  VSALog(kVSALogDebug, kOrigin, "Found %@ for %@", it->second, *unique);
+  return it->second;
+}
+
+VSAUserIdentityRef VSAUserIdentityCache::userIdentityForPersonaUniqueString(
+    const std::optional<std::string>& unique, uid_t uid, gid_t gid) {
+  applyUIDFloor(uid, gid);
+  return rebasedIfNeeded(lookUpPersonaUniqueString(unique), uid, gid);
+}
+
+VSAUserIdentityRef VSAUserIdentityCache::userIdentityForCurrentUserWithPersonaUniqueString(
+    const std::optional<std::string>& unique) {
+  return lookUpPersonaUniqueString(unique);
 }
 
 VSAUserIdentityRef VSAUserIdentityCache::userIdentityForCurrentContext() {

@@ -22,9 +22,7 @@ class Mapping : public ::testing::Test {
   // Builds the mapping; `legacy` is written as the old mapping file first.
   void build(const VSAValue* legacy) {
     root_ = temp_.path();
-    fs::create_directories(root_ + "/etc");
-    fs::create_directories(root_ + "/private/var/mobile");
-    std::ofstream(root_ + "/etc/passwd") << "mobile:x:501:501::/private/var/mobile:/bin/sh\n";
+    VSAWriteMobileUser(root_);
     VSASystemRoot root(root_);
     auto users = std::make_shared<VSAUserDatabase>(root);
     auto config = std::make_shared<VSAGlobalConfiguration>(

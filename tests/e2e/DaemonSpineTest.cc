@@ -33,6 +33,15 @@ uint64_t replyError(const std::optional<VSAValue>& reply) {
   return reply->get("ReplyError")->uint64Value().value_or(0);
 }
 
+// Starts `d` (with this process registered as a full client) and sends
+// command 27 on `client`; the caller holds initialisation beforehand.
+std::optional<uint64_t> sendWhileInitialisationIsHeld(VSATestDaemon& d, VSAIPCClient& client) {
+  d.registerSelf("com.example.full", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
+  VSAErrorRef error;
+  if (!d.start() || !client.connect(d.socketPath(), &error)) return std::nullopt;
+  return client.send(command(27), &error);
+}
+
 TEST(DaemonSpine, InvalidCommandsGetOnlyReplyError49) {
   VSATestDaemon d;
   d.registerSelf("com.example.full", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
@@ -80,14 +89,11 @@ TEST(DaemonSpine, EntitlementGatesThroughRealClients) {
 
 TEST(DaemonSpine, RequestSentDuringInitialisationIsAnsweredAfterIt) {
   VSATestDaemon d;
-  d.registerSelf("com.example.full", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
   // Initialisation is held at its first step (opening the log).
   VSAInitialisationHold hold(d.root());
-  ASSERT_TRUE(d.start());
   VSAIPCClient client;
   VSAErrorRef error;
-  ASSERT_TRUE(client.connect(d.socketPath(), &error));
-  auto id = client.send(command(27), &error);
+  auto id = sendWhileInitialisationIsHeld(d, client);
   ASSERT_TRUE(id);
   EXPECT_FALSE(client.waitForReply(*id, 500ms, &error)) << "answered before initialisation";
   hold.release();
@@ -252,13 +258,10 @@ namespace {
 // accepting, answers what it already received, and only then exits.
 TEST(DaemonShutdown, WaitsForOpenTransactionsBeforeExiting) {
   VSATestDaemon d;
-  d.registerSelf("com.example.full", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
   VSAInitialisationHold hold(d.root());
-  ASSERT_TRUE(d.start());
   VSAIPCClient client;
   VSAErrorRef error;
-  ASSERT_TRUE(client.connect(d.socketPath(), &error));
-  auto id = client.send(command(27), &error);
+  auto id = sendWhileInitialisationIsHeld(d, client);
   ASSERT_TRUE(id);
   std::this_thread::sleep_for(200ms);
   std::thread stopper([&] { EXPECT_EQ(d.stop(), 0); });

@@ -18,10 +18,8 @@ class Cache : public ::testing::Test {
  protected:
   void SetUp() override {
     root_ = temp_.path();
-    fs::create_directories(root_ + "/etc");
-    fs::create_directories(root_ + "/private/var/mobile");
+    VSAWriteMobileUser(root_);
     fs::create_directories(root_ + "/private/var/enterprise");
-    std::ofstream(root_ + "/etc/passwd") << "mobile:x:501:501::/private/var/mobile:/bin/sh\n";
     VSASystemRoot root(root_);
     auto users = std::make_shared<VSAUserDatabase>(root);
     config_ = std::make_shared<VSAGlobalConfiguration>(
