@@ -19,3 +19,6 @@ void VSAAppendUTF8(std::string& out, uint32_t cp);
 
 // Joins two path pieces with exactly one '/' between them.
 std::string VSAPathJoin(std::string_view base, std::string_view component);
+
+// The path without its last component ("/a/b/" and "/a/b" give "/a"; "b" gives "").
+std::string VSADirectoryName(std::string_view path);

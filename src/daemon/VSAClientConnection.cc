@@ -39,7 +39,11 @@ void VSAClientConnection::rebootKeeperSetup() {
 
 void VSAClientConnection::keeperSetup() {
   VSALogIn(VSALogCategory::Startup, kVSALogNotice, __func__,
-           "Boot setup: no container setup steps are available in this build");
+           "Boot setup: replace-operation recovery is not available in this build");
+  VSAErrorRef error;
+  if (!context_.dataProtectionManager->restartPendingDataProtectionOperationsWithError(&error))
+    VSALogIn(VSALogCategory::Startup, kVSALogError, __func__,
+             "Failed restarting pending data protection operations: %@", error);
 }
 
 void VSAClientConnection::rebootKeeperCleanupWithCompletion(std::function<void()> completion) {

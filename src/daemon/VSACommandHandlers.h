@@ -33,3 +33,8 @@ void VSAHandleReadCodeSigningInfo(const VSAValue& request, VSAValue& reply,
 // Command 20: invalidates the code-signing records of apps without a bundle container.
 void VSAHandleInvalidateAppsWithoutBundle(const VSAValue& request, VSAValue& reply,
                                           VSAClientConnection& connection, VSAResultCode* result);
+
+// Command 21: sets the protection class of a data container ("DataProtectionClass",
+// "IsThirdParty", "RetryIfLocked"); the reply comes from the change's completion.
+void VSAHandleSetDataProtection(const VSAValue& request, VSAValue& reply,
+                                VSAClientConnection& connection, VSAResultCode* result);

@@ -31,7 +31,8 @@ const std::array<VSACommandTableEntry, kVSACommandCount> kTable = {{
     {18, VSAHandleRecordCodeSigningInfo, allowed, R, _, _},  // record code-signing information
     {19, VSAHandleReadCodeSigningInfo, allowed, R, _, _},    // read code-signing information
     {20, VSAHandleInvalidateAppsWithoutBundle, allowed, R, _, _},  // invalidate apps without bundle
-    {21, nullptr, allowed, _, _, _},  // change data protection (replies from its completion)
+    {21, VSAHandleSetDataProtection, allowed, _, _,
+     _},                              // change data protection (replies from its completion)
     {22, nullptr, allowed, R, _, _},  // recreate a container's default structure
     {23, nullptr, allowed, R, _, L},  // disk usage of a container
     {24, nullptr, kVSAEntitlementDataMigration, R, _, _},       // data migration

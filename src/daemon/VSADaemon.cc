@@ -111,9 +111,16 @@ void VSADaemon::initialize() {
   context_->deathrowQueue =
       VSAWorkQueue::create("com.tamsk.vessad.deathrow", VSAWorkQueue::Kind::Serial,
                            VSAWorkQueue::global(VSAWorkQueue::Priority::Background));
-  context_->lockStateQueue = VSAWorkQueue::create("com.tamsk.vessad.lockstate");
   if (!context_->deathrowQueue || !context_->lockStateQueue)
     VSACrash("Can't create dispatch queues.");
+  // The queue matches the lock state before boot setup: a pending
+  // protection change restarted there while the device is locked must wait
+  // for the unlock rather than retry at once.
+  lockStateMonitor_ = std::make_unique<VSALockStateMonitor>(
+      context_->lockStateQueue,
+      [lockState = context_->lockState] { return lockState->currentLockState(); });
+  VSAWorkQueue::main()->sync(
+      [monitor = lockStateMonitor_.get()] { monitor->lockStateDidChange(); });
   sharedConnection_ = VSAClientConnection::sharedClientConnection(*context_);
 
   bool firstBoot = isFirstBoot();
@@ -127,9 +134,6 @@ void VSADaemon::initialize() {
   }
   // The kernel upcall interface is started here once its server exists.
 
-  lockStateMonitor_ = std::make_unique<VSALockStateMonitor>(
-      context_->lockStateQueue,
-      [lockState = context_->lockState] { return lockState->currentLockState(); });
   int status = context_->lockState->registerForLockStatus(
       VSAWorkQueue::main(), [monitor = lockStateMonitor_.get()] { monitor->lockStateDidChange(); });
   if (status != 0)

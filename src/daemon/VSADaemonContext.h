@@ -10,6 +10,7 @@
 #include "base/VSAWorkQueue.h"
 #include "codesigning/VSACodeSigningMapping.h"
 #include "codesigning/VSAWhitelist.h"
+#include "dataprotection/VSADataProtectionManager.h"
 #include "model/VSAContainerCache.h"
 #include "model/VSAGlobalConfiguration.h"
 #include "model/VSAUserIdentitySharedCache.h"
@@ -76,6 +77,19 @@ struct VSADaemonContext {
         m->removeCodeSigningDictionariesForIdentifierAndItsChildren(id, &queue);
     };
     codeSigningMapping->setStageForDeleteEnvironment(stageEnvironment);
+    lockStateQueue = VSAWorkQueue::create("com.tamsk.vessad.lockstate");
+    auto protection = std::make_shared<VSADataProtectionEnvironment>();
+    protection->configuration = globalConfiguration;
+    protection->userIdentityCache = userIdentityCache;
+    protection->containerCache = containerCache;
+    protection->transactions = transactions;
+    protection->lockStateQueue = lockStateQueue;
+    protection->terminationService = terminationService;
+    protection->entitlementsForIdentifier = [mapping](const std::string& id) {
+      auto m = mapping.lock();
+      return m ? m->entitlementsForIdentifier(id) : std::nullopt;
+    };
+    dataProtectionManager = std::make_shared<VSADataProtectionManager>(protection);
   }
 
   VSASystemRoot systemRoot;
@@ -95,10 +109,11 @@ struct VSADaemonContext {
   std::shared_ptr<VSACodeSigningMapping> codeSigningMapping;
   std::shared_ptr<VSAContainerCache> containerCache;
   std::shared_ptr<VSAApplicationTerminationService> terminationService;  // may be null
+  std::shared_ptr<VSADataProtectionManager> dataProtectionManager;
 
   VSAWorkQueue::Ref listenerQueue;   // "com.tamsk.vessad.listener"
   VSAWorkQueue::Ref deathrowQueue;   // "com.tamsk.vessad.deathrow"
-  VSAWorkQueue::Ref lockStateQueue;  // "com.tamsk.vessad.lockstate"
+  VSAWorkQueue::Ref lockStateQueue;  // "com.tamsk.vessad.lockstate", suspended while locked
 
   // Runs `work` on `queue` while holding the daemon busy (a transaction),
   // for work that a reply does not wait for.

@@ -18,6 +18,17 @@ struct VSADirectoryEntry {
   enum class Type { Directory, File, Symlink, Other } type = Type::Other;
 };
 
+// The platform's names of the data-protection classes, as entitlements spell them.
+inline constexpr const char* kVSAFileProtectionComplete = "VSAFileProtectionComplete";  // 1
+inline constexpr const char* kVSAFileProtectionCompleteUnlessOpen =
+    "VSAFileProtectionCompleteUnlessOpen";                                                // 2
+inline constexpr const char* kVSAFileProtectionWriteOnly = "VSAFileProtectionWriteOnly";  // 2
+inline constexpr const char* kVSAFileProtectionCompleteUntilFirstUserAuthentication =
+    "VSAFileProtectionCompleteUntilFirstUserAuthentication";  // 3
+inline constexpr const char* kVSAFileProtectionCompleteUntilUserAuthentication =
+    "VSAFileProtectionCompleteUntilUserAuthentication";                         // 3
+inline constexpr const char* kVSAFileProtectionNone = "VSAFileProtectionNone";  // 4
+
 // The three ACLs of system containers (all granting the "systemusers" group).
 enum class VSASystemContainerACL { TopLevel, Directory, File };
 

@@ -7,7 +7,7 @@
 
 #include "VSATestTempDir.h"
 #include "base/VSAPlist.h"
-#include "daemon/VSAApplicationTerminationAssertion.h"
+#include "platform/VSAApplicationTerminationAssertion.h"
 
 namespace fs = std::filesystem;
 

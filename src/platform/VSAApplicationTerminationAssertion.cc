@@ -1,4 +1,4 @@
-#include "daemon/VSAApplicationTerminationAssertion.h"
+#include "platform/VSAApplicationTerminationAssertion.h"
 
 #include <future>
 
