@@ -63,6 +63,11 @@ class VSACodeSigningMapping {
   std::optional<std::vector<std::string>> appGroupIdentifiersForIdentifier(const std::string& id);
   std::optional<std::vector<std::string>> systemGroupIdentifiersForIdentifier(
       const std::string& id);
+  // The system group identifiers an entitlements dictionary grants (prefix-checked).
+  static std::optional<std::vector<std::string>> systemGroupIdentifiersFromEntitlements(
+      const std::string& id, const VSAValue& entitlements) {
+    return systemGroupIds(id, &entitlements, true);
+  }
   VSAContainerClass dataContainerTypeForIdentifier(const std::string& identifier);
   bool identifierHasSystemContainer(const std::string& identifier);
   bool identifierHasCallerRegisteredEntitlements(const std::string& identifier);
@@ -94,7 +99,8 @@ class VSACodeSigningMapping {
   VSAWorkQueue& queue() { return *queue_; }
   // What the deletions this mapping queues run with (set once the container
   // cache exists).
-  void setStageForDeleteEnvironment(std::shared_ptr<const VSAStageForDeleteEnvironment> environment) {
+  void setStageForDeleteEnvironment(
+      std::shared_ptr<const VSAStageForDeleteEnvironment> environment) {
     stageEnvironment_ = std::move(environment);
   }
 

@@ -28,13 +28,14 @@ bool VSAClientConnection::completeWithError(VSAResultCode* error) {
   return commandQueue_->executeAllUntilExhaustedOrError(error);
 }
 
-// The container steps of boot-time setup and cleanup (staging and transient
-// leftovers, replace recovery, pending protection changes, death row) are
-// built with the container operations; until then these say so in the log,
-// and the cleanups still complete so that start-up posts its notifications.
+// Boot-time setup and cleanup. Steps not built yet (build-upgrade migration,
+// system container restore, group reconciliation, replace recovery, orphan
+// scans) say so in the log; the cleanups always complete so that start-up
+// posts its notifications.
 void VSAClientConnection::rebootKeeperSetup() {
   VSALogIn(VSALogCategory::Startup, kVSALogNotice, __func__,
-           "First-boot setup: no container setup steps are available in this build");
+           "First-boot setup: migration and system container restore are not available in this "
+           "build");
 }
 
 void VSAClientConnection::keeperSetup() {
@@ -47,15 +48,65 @@ void VSAClientConnection::keeperSetup() {
 }
 
 void VSAClientConnection::rebootKeeperCleanupWithCompletion(std::function<void()> completion) {
+  auto& config = *context_.globalConfiguration;
+  auto& deathRow = *context_.deathRow;
+  auto token = context_.transactions->open();
+  // Transient containers do not survive a reboot.
+  VSAErrorRef error;
+  std::string transient = config.transientDirectory();
+  if (!deathRow._moveItemAtURLToDeathRow(transient, true, false, &error))
+    VSALogIn(VSALogCategory::Startup, kVSALogError, __func__,
+             "Failed to delete shared transient URL %@ : %@", transient, error);
+  if (auto legacy = config.legacyTransientBundleDirectory()) {
+    VSALogIn(VSALogCategory::Startup, kVSALogNotice, __func__,
+             "Sentencing legacy transient bundle directory [%@] to final deletion", *legacy);
+    if (!deathRow._moveItemAtURLToDeathRow(*legacy, true, false, &error))
+      VSALogIn(VSALogCategory::Startup, kVSALogError, __func__,
+               "Failed to delete legacy shared transient bundle URL %@ : %@", *legacy, error);
+  }
+  std::string bundles = config.transientBundleDirectory();
+  if (!deathRow._moveItemAtURLToDeathRow(bundles, true, false, &error))
+    VSALogIn(VSALogCategory::Startup, kVSALogError, __func__,
+             "Failed to delete shared transient bundle URL %@ : %@", bundles, error);
   VSALogIn(VSALogCategory::Startup, kVSALogNotice, __func__,
-           "First-boot cleanup: no container cleanup steps are available in this build");
-  context_.asyncWithTransaction(VSAWorkQueue::global(VSAWorkQueue::Priority::Background),
-                                std::move(completion));
+           "First-boot cleanup: orphaned-data scans are not available in this build");
+  VSADeathRow::_sharedBackgroundQueue()->async(
+      [token, completion = std::move(completion)] { completion(); });
 }
 
 void VSAClientConnection::keeperCleanupWithCompletion(std::function<void()> completion) {
-  VSALogIn(VSALogCategory::Startup, kVSALogNotice, __func__,
-           "Boot cleanup: no container cleanup steps are available in this build");
-  context_.asyncWithTransaction(VSAWorkQueue::global(VSAWorkQueue::Priority::Background),
-                                std::move(completion));
+  auto token = context_.transactions->open();
+  auto& config = *context_.globalConfiguration;
+  auto& fm = *context_.fileManager;
+  std::set<std::string> staged;  // per-class staging may share a directory
+  auto collect = [&](const std::string& directory, const char* failureFormat) {
+    VSAErrorRef error;
+    auto items = fm.urlsForItemsInDirectoryAtURL(directory, &error);
+    if (!items) {
+      if (!(error && error->domain() == kVSAPOSIXErrorDomain && error->code() == ENOENT))
+        VSALogIn(VSALogCategory::Startup, kVSALogError, "keeperCleanupWithCompletion",
+                 failureFormat, directory, error);
+      return;
+    }
+    for (const auto& item : *items) staged.insert(item.path);
+  };
+  collect(config.stagingDirectory(), "Failed to get items at global staging URL: %@ : %@");
+  context_.userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
+      [&](const VSAUserIdentityRef& user) {
+        for (VSAContainerClass c : {2, 4, 6, 7, 9, 10, 11})
+          collect(config.stagingDirectoryURLForUserIdentity(user, c),
+                  "Failed to get items at per-user staging URL: %@ : %@");
+      });
+  // Staging directories are never resumed: whatever a crash left there goes.
+  auto deathRow = context_.deathRow;
+  VSADeathRow::_sharedBackgroundQueue()->async(
+      [deathRow, staged = std::move(staged), token, completion = std::move(completion)] {
+        for (const auto& item : staged) {
+          VSAErrorRef error;
+          if (!deathRow->_moveItemAtURLToDeathRow(item, true, false, &error))
+            VSALog(kVSALogError, "keeperCleanupWithCompletion", "%@", error);
+        }
+        deathRow->deleteContainersOnDeathRowWithCompletion(
+            [token, completion](VSAResultCode) { completion(); });
+      });
 }

@@ -12,12 +12,18 @@
 
 #include <functional>
 #include <memory>
+#include <mutex>
 #include <optional>
+#include <set>
+#include <string>
+#include <vector>
 
 #include "base/VSAError.h"
 #include "base/VSAValue.h"
 #include "daemon/VSAClientIdentity.h"
 #include "daemon/VSADaemonContext.h"
+#include "model/VSAContainerIdentity.h"
+#include "model/VSAMetadata.h"
 #include "operations/VSACommandQueue.h"
 #include "platform/VSAIPCMessage.h"
 
@@ -52,6 +58,35 @@ class VSAClientConnection {
   void setRelayMessage(VSAIPCMessageRef message) { relayMessage_ = std::move(message); }
   const VSAIPCMessageRef& relayMessage() const { return relayMessage_; }
 
+  // The container named by `identity`, created first when it is missing and
+  // `createIfNecessary` (in staging under a fresh UUID name, then renamed
+  // into place). Takes the all-identifiers lock unless `useLocking` is false.
+  VSAMetadataRef createOrLookupContainerWithContainerIdentity(
+      const VSAContainerIdentityRef& identity, bool createIfNecessary, bool transient,
+      bool useLocking, VSAResultCode* withError);
+  bool isEntitledForLookupWithClass(VSAContainerClass containerClass,
+                                    const std::string& identifier);
+  // The identifiers the lookup entitlement lists for a class (nothing when
+  // the client has none, or for a class outside 1-13).
+  std::optional<std::set<std::string>> _lookupForContainerClass(VSAContainerClass containerClass);
+  bool _createTopLevelContainerDirectory(const std::string& url, VSAContainerClass containerClass,
+                                         uid_t owner, VSAErrorRef* error);
+  bool _createSubDirectories(const std::string& url, const VSAMetadata& containerMetadata,
+                             VSAErrorRef* error);
+  int32_t _dataProtectionClassForContainerMetadata(const VSAMetadata& metadata);
+
+  // Looks the container up (with the caller's access test) and queues its
+  // staging for when the request completes.
+  void deleteContainerWithContainerIdentity(const VSAContainerIdentityRef& identity, bool transient,
+                                            VSAResultCode* withError);
+  // The client's containers of one class (its own user identity).
+  std::optional<std::vector<VSAMetadataRef>> containersWithClass(VSAContainerClass containerClass,
+                                                                 bool transient,
+                                                                 VSAResultCode* withError);
+  // A live container's metadata, under its identifier read lock.
+  VSAMetadataRef metadataWithContainerIdentity(const VSAContainerIdentityRef& identity,
+                                               VSAResultCode* withError);
+
   // Runs the request's deferred commands; a failing command's code lands in `error`.
   bool completeWithError(VSAResultCode* error);
 
@@ -73,4 +108,6 @@ class VSAClientConnection {
   std::optional<VSAValue> entitledWipeIdentifiers_;
   std::shared_ptr<VSACommandQueue> commandQueue_;
   VSAIPCMessageRef relayMessage_;
+  std::mutex lookupCacheMutex_;
+  std::optional<std::map<std::string, std::set<std::string>>> lookupCache_;
 };

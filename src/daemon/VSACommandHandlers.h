@@ -38,3 +38,21 @@ void VSAHandleInvalidateAppsWithoutBundle(const VSAValue& request, VSAValue& rep
 // "IsThirdParty", "RetryIfLocked"); the reply comes from the change's completion.
 void VSAHandleSetDataProtection(const VSAValue& request, VSAValue& reply,
                                 VSAClientConnection& connection, VSAResultCode* result);
+
+// Container commands; see VSAHandlersContainers.cc for the keys.
+void VSAHandleCreateOrLookup(const VSAValue& request, VSAValue& reply,
+                             VSAClientConnection& connection, VSAResultCode* result);
+void VSAHandleListContainers(const VSAValue& request, VSAValue& reply,
+                             VSAClientConnection& connection, VSAResultCode* result);
+void VSAHandleStageForDelete(const VSAValue& request, VSAValue& reply,
+                             VSAClientConnection& connection, VSAResultCode* result);
+void VSAHandleDeleteDeathRow(const VSAValue& request, VSAValue& reply,
+                             VSAClientConnection& connection, VSAResultCode* result);
+void VSAHandleContainerMetadata(const VSAValue& request, VSAValue& reply,
+                                VSAClientConnection& connection, VSAResultCode* result);
+void VSAHandleDeleteContainer(const VSAValue& request, VSAValue& reply,
+                              VSAClientConnection& connection, VSAResultCode* result);
+void VSAHandleSystemContainerPath(const VSAValue& request, VSAValue& reply,
+                                  VSAClientConnection& connection, VSAResultCode* result);
+void VSAHandleSystemGroupContainerPath(const VSAValue& request, VSAValue& reply,
+                                       VSAClientConnection& connection, VSAResultCode* result);

@@ -14,8 +14,10 @@
 #include "model/VSAContainerCache.h"
 #include "model/VSAGlobalConfiguration.h"
 #include "model/VSAUserIdentitySharedCache.h"
+#include "operations/VSADeathRow.h"
 #include "platform/VSAApplicationTerminationService.h"
 #include "platform/VSAClientRegistry.h"
+#include "platform/VSAContainerSubdirectories.h"
 #include "platform/VSADeviceProperties.h"
 #include "platform/VSAFileManager.h"
 #include "platform/VSALinuxFileSystem.h"
@@ -28,7 +30,10 @@
 #include "platform/VSAUserDatabase.h"
 
 struct VSADaemonContext {
-  explicit VSADaemonContext(const VSASystemRoot& root)
+  // `wrapFileSystem` lets a test put a fault-injecting layer over the real file system.
+  using FileSystemWrapper =
+      std::function<std::shared_ptr<VSAFileSystem>(std::shared_ptr<VSAFileSystem>)>;
+  explicit VSADaemonContext(const VSASystemRoot& root, const FileSystemWrapper& wrapFileSystem = {})
       : systemRoot(root),
         deviceProperties(std::make_shared<VSADeviceProperties>(root)),
         clientRegistry(std::make_shared<VSAClientRegistry>(root)),
@@ -36,13 +41,17 @@ struct VSADaemonContext {
         lockState(std::make_shared<VSALockStateService>(root)),
         userDatabase(std::make_shared<VSAUserDatabase>(root)),
         personaService(std::make_shared<VSALinuxPersonaService>(root)),
-        fileSystem(std::make_shared<VSALinuxFileSystem>(
-            [lockState = lockState] { return lockState->currentLockState() == 1; })),
+        fileSystem(
+            wrap(wrapFileSystem, std::make_shared<VSALinuxFileSystem>([lockState = lockState] {
+                   return lockState->currentLockState() == 1;
+                 }))),
         fileManager(std::make_shared<VSAFileManager>(fileSystem, userDatabase)),
         globalConfiguration(std::make_shared<VSAGlobalConfiguration>(root, deviceProperties,
                                                                      userDatabase, fileManager)),
         transactions(std::make_shared<VSATransactions>()),
         sandboxService(std::make_shared<VSASandboxService>(root)),
+        subdirectories(std::make_shared<VSAContainerSubdirectories>(root)),
+        deathRow(std::make_shared<VSADeathRow>(globalConfiguration, transactions)),
         whitelist(VSAWhitelist::load(root.resolve("/etc/vessad/whitelist.plist"),
                                      globalConfiguration->isInternalImage())) {
     // A device may come without a termination service ("HasTerminationService" NO).
@@ -68,7 +77,7 @@ struct VSADaemonContext {
          [list = whitelist](const std::string& id, VSAContainerClass c) {
            return list->containerIdIsWellknown(id, c);
          }});
-    auto stageEnvironment = std::make_shared<VSAStageForDeleteEnvironment>();
+    stageEnvironment = std::make_shared<VSAStageForDeleteEnvironment>();
     stageEnvironment->cache = containerCache;
     stageEnvironment->configuration = globalConfiguration;
     std::weak_ptr<VSACodeSigningMapping> mapping = codeSigningMapping;
@@ -104,16 +113,24 @@ struct VSADaemonContext {
   std::shared_ptr<VSAGlobalConfiguration> globalConfiguration;
   std::shared_ptr<VSATransactions> transactions;
   std::shared_ptr<VSASandboxService> sandboxService;
+  std::shared_ptr<VSAContainerSubdirectories> subdirectories;
+  std::shared_ptr<VSADeathRow> deathRow;
   std::shared_ptr<VSAUserIdentitySharedCache> userIdentityCache;
   std::shared_ptr<VSAWhitelist> whitelist;
   std::shared_ptr<VSACodeSigningMapping> codeSigningMapping;
   std::shared_ptr<VSAContainerCache> containerCache;
   std::shared_ptr<VSAApplicationTerminationService> terminationService;  // may be null
   std::shared_ptr<VSADataProtectionManager> dataProtectionManager;
+  std::shared_ptr<VSAStageForDeleteEnvironment> stageEnvironment;
 
   VSAWorkQueue::Ref listenerQueue;   // "com.tamsk.vessad.listener"
   VSAWorkQueue::Ref deathrowQueue;   // "com.tamsk.vessad.deathrow"
   VSAWorkQueue::Ref lockStateQueue;  // "com.tamsk.vessad.lockstate", suspended while locked
+
+  static std::shared_ptr<VSAFileSystem> wrap(const FileSystemWrapper& wrapper,
+                                             std::shared_ptr<VSAFileSystem> fs) {
+    return wrapper ? wrapper(std::move(fs)) : fs;
+  }
 
   // Runs `work` on `queue` while holding the daemon busy (a transaction),
   // for work that a reply does not wait for.

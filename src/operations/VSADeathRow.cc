@@ -1,0 +1,105 @@
+#include "operations/VSADeathRow.h"
+
+#include <cerrno>
+
+#include "base/VSALog.h"
+#include "base/VSAPathString.h"
+
+namespace {
+constexpr VSAResultCode kDeleteFailed = 28;
+
+std::string lastPathComponent(std::string path) {
+  while (path.size() > 1 && path.back() == '/') path.pop_back();
+  size_t slash = path.rfind('/');
+  return slash == std::string::npos ? path : path.substr(slash + 1);
+}
+
+bool isMissing(const VSAErrorRef& e) {
+  return e && e->domain() == kVSAPOSIXErrorDomain && e->code() == ENOENT;
+}
+}  // namespace
+
+VSADeathRow::VSADeathRow(std::shared_ptr<VSAGlobalConfiguration> configuration,
+                         std::shared_ptr<VSATransactions> transactions)
+    : configuration_(std::move(configuration)), transactions_(std::move(transactions)) {}
+
+VSAWorkQueue::Ref VSADeathRow::_sharedBackgroundQueue() {
+  static VSAWorkQueue::Ref queue =
+      VSAWorkQueue::create("com.tamsk.vessad.background", VSAWorkQueue::Kind::Serial,
+                           VSAWorkQueue::global(VSAWorkQueue::Priority::Background));
+  return queue;
+}
+
+bool VSADeathRow::_moveItemAtURLToDeathRow(const std::string& url, bool isDir,
+                                           bool startDeletionThread, VSAErrorRef* error) {
+  const char* fn = "_moveItemAtURLToDeathRow";
+  VSAFileManager& fm = configuration_->fileManager();
+  std::string deathrow = configuration_->deathrowDirectory();
+  VSAErrorRef underlying;
+  auto unique = fm.createTemporaryDirectoryInDirectoryURL(deathrow, &underlying);
+  if (!unique) {
+    auto e = VSA_ERROR_UNDERLYING(VSAResult::kDeathRowMoveFailed, underlying,
+                                  "Failed to create unique directory at: %@", deathrow);
+    VSALog(kVSALogError, fn, "%@", e->message());
+    VSASetError(error, e);
+    return false;
+  }
+  std::string destination = VSAPathJoin(*unique, lastPathComponent(url));
+  (void)isDir;  // a directory and a file move alike here
+  if (!fm.moveItemAtURL(url, destination, &underlying)) {
+    fm.fileSystem().rmdir(*unique);
+    if (isMissing(underlying)) return true;
+    auto e = VSA_ERROR_UNDERLYING(VSAResult::kDeathRowMoveFailed, underlying,
+                                  "Failed to move item at: %@ to: %@", url, destination);
+    VSALog(kVSALogError, fn, "%@", e->message());
+    VSASetError(error, e);
+    return false;
+  }
+  if (startDeletionThread) deleteContainersOnDeathRowWithCompletion(nullptr);
+  return true;
+}
+
+void VSADeathRow::deleteContainersOnDeathRowWithCompletion(Completion completion) {
+  auto token = transactions_ ? transactions_->open() : nullptr;
+  // The object belongs to the daemon context, which outlives its transactions.
+  _sharedBackgroundQueue()->async([this, token, completion = std::move(completion)] {
+    VSAResultCode code = emptyDeathRow();
+    if (completion) completion(code);
+  });
+}
+
+VSAResultCode VSADeathRow::emptyDeathRow() {
+  const char* fn = "deleteContainersOnDeathRowWithCompletion";
+  VSAFileManager& fm = configuration_->fileManager();
+  std::string deathrow = configuration_->deathrowDirectory();
+  VSAErrorRef error;
+  auto items = fm.urlsForItemsInDirectoryAtURL(deathrow, &error);
+  if (!items) {
+    if (isMissing(error)) return VSAResult::kSuccess;
+    VSALog(kVSALogError, fn, "Failed to get items for deletion: %@ : %@", deathrow, error);
+    return kDeleteFailed;
+  }
+  VSAResultCode code = VSAResult::kSuccess;
+  for (const auto& item : *items) {
+    if (!_removeItemOrMoveToTempAtURL(item.path, &error)) {
+      VSALog(kVSALogError, fn, "Failed to destroy item at: %@", item.path);
+      code = kDeleteFailed;
+    }
+  }
+  return code;
+}
+
+bool VSADeathRow::_removeItemOrMoveToTempAtURL(const std::string& url, VSAErrorRef* error) {
+  const char* fn = "_removeItemOrMoveToTempAtURL";
+  VSAFileManager& fm = configuration_->fileManager();
+  VSAErrorRef removeError;
+  if (fm.removeItemAtURL(url, &removeError)) return true;
+  VSALog(kVSALogDebug, fn, "Couldn't remove, so moving item to /tmp: %@ : %@", url, removeError);
+  std::string tmp = configuration_->systemRoot().resolve("/tmp");
+  if (fm.itemDoesNotExistAtURL(tmp))
+    fm.createDirectoryAtURL(tmp, true, 01777, 0, kVSANoProtectionClass, nullptr);
+  std::string destination = VSAPathJoin(tmp, lastPathComponent(url));
+  if (fm.moveItemAtURL(url, destination, error)) return true;
+  VSALog(kVSALogError, fn, "Failed to move dir: %@ to: %@", url, destination);
+  return false;
+}

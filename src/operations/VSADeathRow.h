@@ -1,0 +1,44 @@
+// Death row: where containers and other trees go to be deleted.
+//
+// Moving an item there is one rename (into a fresh "temp.XXXXXX" directory,
+// so items of the same name stay apart) and cannot half-happen. Emptying
+// runs on the process-wide serial background queue
+// "com.tamsk.vessad.background", so two emptyings never overlap, inside a
+// transaction that keeps the daemon alive until it has run. An entry that
+// cannot be removed is moved to the root's /tmp so that it never blocks the
+// others. Thread-safe; holds no identifier lock (nothing on death row is
+// reachable through the cache).
+#pragma once
+
+#include <functional>
+#include <memory>
+#include <string>
+
+#include "base/VSAError.h"
+#include "base/VSAWorkQueue.h"
+#include "model/VSAGlobalConfiguration.h"
+#include "platform/VSATransactions.h"
+
+class VSADeathRow {
+ public:
+  using Completion = std::function<void(VSAResultCode)>;
+
+  VSADeathRow(std::shared_ptr<VSAGlobalConfiguration> configuration,
+              std::shared_ptr<VSATransactions> transactions);
+
+  static VSAWorkQueue::Ref _sharedBackgroundQueue();
+
+  // A missing item is success and starts nothing; other failures are 41.
+  bool _moveItemAtURLToDeathRow(const std::string& url, bool isDir, bool startDeletionThread,
+                                VSAErrorRef* error);
+  // Returns at once; the completion gets the code of the last failure (1 when none).
+  void deleteContainersOnDeathRowWithCompletion(Completion completion);
+  // Removes a tree or, failing that, moves it to /tmp.
+  bool _removeItemOrMoveToTempAtURL(const std::string& url, VSAErrorRef* error);
+
+ private:
+  VSAResultCode emptyDeathRow();
+
+  std::shared_ptr<VSAGlobalConfiguration> configuration_;
+  std::shared_ptr<VSATransactions> transactions_;
+};

@@ -1,0 +1,268 @@
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include <filesystem>
+#include <fstream>
+#include <future>
+#include <thread>
+
+#include "VSATestTempDir.h"
+#include "daemon/VSAClientConnection.h"
+#include "platform/VSAFaultInjectingFileSystem.h"
+
+namespace fs = std::filesystem;
+using Op = VSAFileSystem::Op;
+
+namespace {
+
+class Lifecycle : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    root_ = temp_.path();
+    VSAWriteMobileUser(root_);
+    std::ofstream(root_ + "/etc/group") << "mobile:x:501:\nsystemusers:x:600:\n";
+    context_ = std::make_unique<VSADaemonContext>(
+        VSASystemRoot(root_), [this](std::shared_ptr<VSAFileSystem> real) {
+          faults_ = std::make_shared<VSAFaultInjectingFileSystem>(std::move(real));
+          return faults_;
+        });
+    user_ = context_->userIdentityCache->userIdentityForPersonalPersona();
+  }
+
+  std::unique_ptr<VSAClientConnection> connection(const std::string& bundle, bool allowOther,
+                                                  bool unrestricted,
+                                                  std::optional<VSAValue> lookup = std::nullopt) {
+    auto client =
+        std::make_shared<VSAClientIdentity>(bundle, 501, 501, 1234, user_, VSAValue::dictionary(),
+                                            false, std::array<uint8_t, 32>{}, false);
+    return std::make_unique<VSAClientConnection>(*context_, client, true, allowOther, unrestricted,
+                                                 std::move(lookup), std::nullopt,
+                                                 std::make_shared<VSACommandQueue>());
+  }
+  std::unique_ptr<VSAClientConnection> installer() {
+    return connection("com.example.installer", true, true);
+  }
+  VSAContainerIdentityRef identity(const std::string& id, VSAContainerClass c = 2) {
+    return VSAContainerIdentity::containerIdentityWithUserIdentity(user_, id, c, nullptr);
+  }
+  VSAMetadataRef create(VSAClientConnection& c, const std::string& id, VSAResultCode* code,
+                        bool transient = false, VSAContainerClass cls = 2) {
+    *code = VSAResult::kSuccess;
+    return c.createOrLookupContainerWithContainerIdentity(identity(id, cls), true, transient, true,
+                                                          code);
+  }
+  static size_t entries(const std::string& dir) {
+    if (!fs::exists(dir)) return 0;
+    return static_cast<size_t>(std::distance(fs::directory_iterator(dir), {}));
+  }
+  std::string classDirectory(VSAContainerClass c = 2, bool transient = false) {
+    return *context_->globalConfiguration->containerDirectoryURLForUserIdentity(user_, c,
+                                                                                transient);
+  }
+  std::string staging() {
+    return context_->globalConfiguration->stagingDirectoryURLForUserIdentity(user_, 2);
+  }
+  VSAResultCode emptyDeathRow() {
+    std::promise<VSAResultCode> done;
+    context_->deathRow->deleteContainersOnDeathRowWithCompletion(
+        [&](VSAResultCode code) { done.set_value(code); });
+    return done.get_future().get();
+  }
+
+  VSATestTempDir temp_{"vessa-lifecycle"};
+  std::string root_;
+  std::shared_ptr<VSAFaultInjectingFileSystem> faults_;
+  std::unique_ptr<VSADaemonContext> context_;
+  VSAUserIdentityRef user_;
+};
+
+TEST_F(Lifecycle, CreatesInPlaceWithMetadataAndSubdirectoriesThenFindsIt) {
+  auto c = installer();
+  VSAResultCode code;
+  auto created = create(*c, "com.example.app", &code);
+  ASSERT_TRUE(created) << code;
+  EXPECT_FALSE(created->existed());
+  EXPECT_EQ(fs::path(created->url()).parent_path(), fs::path(classDirectory()));
+  EXPECT_EQ(fs::path(created->url()).filename().string().size(), 36u);  // a UUID name
+  EXPECT_TRUE(fs::exists(created->url() + "/" + kVSAMetadataFileName));
+  struct stat st;
+  ASSERT_EQ(::stat((created->url() + "/Library/Caches").c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 07777, 0755u);
+  EXPECT_EQ(st.st_uid, 501u);
+  EXPECT_EQ(entries(staging()), 0u);
+  auto found = create(*c, "com.example.app", &code);
+  ASSERT_TRUE(found);
+  EXPECT_TRUE(found->existed());
+  EXPECT_EQ(found->url(), created->url());
+  EXPECT_EQ(found->uuid(), created->uuid());
+  // Looking up without creation finds it too; a missing one is 21 and leaves nothing.
+  EXPECT_TRUE(c->createOrLookupContainerWithContainerIdentity(identity("com.example.app"), false,
+                                                              false, true, &code));
+  EXPECT_FALSE(c->createOrLookupContainerWithContainerIdentity(identity("com.example.none"), false,
+                                                               false, true, &code));
+  EXPECT_EQ(code, VSAResult::kContainerNotFound);
+  EXPECT_EQ(entries(classDirectory()), 1u);
+}
+
+TEST_F(Lifecycle, SimultaneousCreatesOfOneIdentityMakeOneDirectory) {
+  constexpr int kThreads = 8;
+  std::vector<std::thread> threads;
+  std::atomic<int> created{0}, existed{0}, failed{0};
+  std::promise<void> go;
+  auto start = go.get_future().share();
+  for (int i = 0; i < kThreads; ++i)
+    threads.emplace_back([&] {
+      auto c = installer();
+      start.wait();
+      VSAResultCode code;
+      auto m = create(*c, "com.example.race", &code);
+      if (!m)
+        ++failed;
+      else
+        ++(m->existed() ? existed : created);
+    });
+  go.set_value();
+  for (auto& t : threads) t.join();
+  EXPECT_EQ(failed, 0);
+  EXPECT_EQ(created, 1);
+  EXPECT_EQ(existed, kThreads - 1);
+  EXPECT_EQ(entries(classDirectory()), 1u);
+}
+
+TEST_F(Lifecycle, TransientContainersAreAlwaysMadeFresh) {
+  auto c = installer();
+  VSAResultCode code;
+  auto first = create(*c, "com.example.temp", &code, true);
+  ASSERT_TRUE(first) << code;
+  EXPECT_TRUE(first->transient());
+  EXPECT_EQ(fs::path(first->url()).parent_path(), fs::path(classDirectory(2, true)));
+  auto second = create(*c, "com.example.temp", &code, true);
+  ASSERT_TRUE(second) << code;
+  EXPECT_FALSE(second->existed());
+  EXPECT_NE(second->url(), first->url());
+  EXPECT_FALSE(fs::exists(first->url()));
+  EXPECT_EQ(entries(classDirectory(2, true)), 1u);
+}
+
+TEST_F(Lifecycle, WellKnownSystemGroupsLiveUnderTheirNameWithSystemOwners) {
+  auto c = installer();
+  VSAResultCode code;
+  auto m = create(*c, "systemgroup.com.tamsk.launcher", &code, false, 13);
+  ASSERT_TRUE(m) << code;
+  EXPECT_EQ(fs::path(m->url()).filename(), "systemgroup.com.tamsk.launcher");
+  struct stat st;
+  ASSERT_EQ(::stat((m->url() + "/Library").c_str(), &st), 0);
+  EXPECT_EQ(st.st_uid, kVSANobodyID);
+  auto other = create(*c, "systemgroup.com.example.unknown", &code, false, 13);
+  ASSERT_TRUE(other) << code;
+  EXPECT_EQ(fs::path(other->url()).filename().string().size(), 36u);
+}
+
+TEST_F(Lifecycle, AccessTestsComeBeforeAnyLookup) {
+  VSAResultCode code;
+  // Its own identifier: no grant needed.
+  auto self = connection("com.example.self", false, false);
+  ASSERT_TRUE(create(*self, "com.example.self", &code)) << code;
+  // Another identifier without a grant: 55, and nothing created.
+  EXPECT_FALSE(create(*self, "com.example.other", &code));
+  EXPECT_EQ(code, VSAResult::kNotEntitled);
+  auto existing = create(*installer(), "com.example.other", &code);
+  ASSERT_TRUE(existing);
+  EXPECT_FALSE(self->createOrLookupContainerWithContainerIdentity(identity("com.example.other"),
+                                                                  false, false, true, &code));
+  EXPECT_EQ(code, VSAResult::kNotEntitled);  // the same answer whether it exists or not
+  // The lookup entitlement lists identifiers per class.
+  VSAValue lookup = VSAValue::dictionary();
+  lookup.set("appData", VSAValue(VSAValue::Array{VSAValue("com.example.other")}));
+  lookup.set("plugin", VSAValue("not an array"));
+  auto looker = connection("com.example.looker", false, false, lookup);
+  EXPECT_TRUE(looker->createOrLookupContainerWithContainerIdentity(identity("com.example.other"),
+                                                                   false, false, true, &code));
+  EXPECT_TRUE(looker->isEntitledForLookupWithClass(2, "com.example.other"));
+  EXPECT_FALSE(looker->isEntitledForLookupWithClass(3, "com.example.other"));
+  EXPECT_EQ(looker->_lookupForContainerClass(3)->size(), 0u);
+  EXPECT_FALSE(looker->_lookupForContainerClass(14));
+  // The built-in whitelist lets this client see one app's data.
+  auto whitelisted = connection("com.tamsk.mail.composer", false, false);
+  ASSERT_TRUE(create(*installer(), "com.tamsk.mail", &code));
+  EXPECT_TRUE(whitelisted->createOrLookupContainerWithContainerIdentity(identity("com.tamsk.mail"),
+                                                                        false, false, true, &code));
+  EXPECT_EQ(entries(classDirectory()), 3u);
+}
+
+TEST_F(Lifecycle, AFailureAtAnyStepOfCreationLeavesNothingBehind) {
+  auto c = installer();
+  VSAResultCode code;
+  // Count the calls of one successful creation, then fail each in turn.
+  const Op ops[] = {Op::Mkdir,     Op::Chown,    Op::Chmod,   Op::Rename,
+                    Op::WriteFile, Op::SetClass, Op::Mkdtemp, Op::Lstat};
+  std::map<Op, int> before;
+  for (Op op : ops) before[op] = faults_->callCount(op);
+  ASSERT_TRUE(create(*c, "com.example.counted", &code));
+  int cases = 0;
+  for (Op op : ops) {
+    int calls = faults_->callCount(op) - before[op];
+    for (int n = 1; n <= calls; ++n) {
+      std::string id =
+          "com.example.fail." + std::string(VSAFileSystem::opName(op)) + "." + std::to_string(n);
+      size_t live = entries(classDirectory());
+      faults_->failNth(op, n, EIO);
+      auto m = create(*c, id, &code);
+      faults_->reset();
+      if (m) continue;  // a step whose failure is only logged
+      ++cases;
+      SCOPED_TRACE(id);
+      EXPECT_NE(code, VSAResult::kSuccess);
+      EXPECT_EQ(entries(staging()), 0u);
+      EXPECT_FALSE(context_->containerCache->containerForContainerIdentity(*identity(id)));
+      EXPECT_EQ(entries(classDirectory()), live);  // nothing reached the live directory
+      EXPECT_EQ(emptyDeathRow(), VSAResult::kSuccess);
+    }
+  }
+  EXPECT_GT(cases, 5);
+  ASSERT_TRUE(create(*c, "com.example.fail.Mkdir.1", &code)) << code;
+}
+
+TEST_F(Lifecycle, DeletionStagesOnRequestCompletionAndDeathRowEmpties) {
+  auto c = installer();
+  VSAResultCode code;
+  auto m = create(*c, "com.example.doomed", &code);
+  ASSERT_TRUE(m);
+  code = VSAResult::kSuccess;
+  c->deleteContainerWithContainerIdentity(identity("com.example.doomed"), false, &code);
+  EXPECT_EQ(code, VSAResult::kSuccess);
+  EXPECT_TRUE(fs::exists(m->url()));  // nothing happens before the request completes
+  ASSERT_TRUE(c->completeWithError(&code));
+  EXPECT_FALSE(fs::exists(m->url()));
+  std::string deathrow = context_->globalConfiguration->deathrowDirectory();
+  EXPECT_EQ(entries(deathrow), 1u);
+  EXPECT_FALSE(c->createOrLookupContainerWithContainerIdentity(identity("com.example.doomed"),
+                                                               false, false, true, &code));
+  EXPECT_EQ(code, VSAResult::kContainerNotFound);
+  EXPECT_EQ(emptyDeathRow(), VSAResult::kSuccess);
+  EXPECT_EQ(entries(deathrow), 0u);
+  // Deleting a missing container fails in the lookup and queues nothing.
+  auto other = installer();
+  code = VSAResult::kSuccess;
+  other->deleteContainerWithContainerIdentity(identity("com.example.doomed"), false, &code);
+  EXPECT_EQ(code, VSAResult::kContainerNotFound);
+  EXPECT_EQ(other->commandQueue()->count(), 0u);
+}
+
+TEST_F(Lifecycle, DeathRowEntriesThatResistRemovalEndInTmp) {
+  std::string deathrow = context_->globalConfiguration->deathrowDirectory();
+  for (const char* name : {"a", "b", "c"}) {
+    fs::create_directories(deathrow + "/" + name);
+    std::ofstream(deathrow + "/" + name + "/file") << name;
+  }
+  faults_->failNth(Op::Rmdir, 1, EBUSY);
+  EXPECT_EQ(emptyDeathRow(), VSAResult::kSuccess);
+  EXPECT_EQ(entries(deathrow), 0u);
+  EXPECT_EQ(entries(root_ + "/tmp"), 1u);
+  // Moving something that is not there succeeds and starts nothing.
+  VSAErrorRef error;
+  EXPECT_TRUE(context_->deathRow->_moveItemAtURLToDeathRow(root_ + "/nothing", true, true, &error));
+  EXPECT_EQ(entries(deathrow), 0u);
+}
+
+}  // namespace
