@@ -1,0 +1,211 @@
+// End to end: containers created, found, protected and deleted through the
+// real daemon and its socket.
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <fstream>
+#include <future>
+#include <thread>
+
+#include "base/VSAPlist.h"
+#include "e2e/VSATestDaemon.h"
+#include "platform/VSAAuditToken.h"
+#include "platform/VSALinuxFileSystem.h"
+#include "platform/VSALockStateService.h"
+
+namespace fs = std::filesystem;
+using namespace std::chrono_literals;
+
+namespace {
+
+const char* kAllowed = "com.tamsk.private.Vessa.allowed";
+
+uint64_t replyError(const std::optional<VSAValue>& reply) {
+  if (!reply || !reply->get("ReplyError")) return 0;
+  return reply->get("ReplyError")->uint64Value().value_or(0);
+}
+
+VSAValue createRequest(const char* id, bool create = true, uint64_t containerClass = 2) {
+  return VSAValue::Dictionary{{"Command", VSAValue(0u)},
+                              {"Identifier", VSAValue(id)},
+                              {"ContainerClass", VSAValue(containerClass)},
+                              {"CreateIfNecessary", VSAValue(create)}};
+}
+
+std::string stringOf(const std::optional<VSAValue>& reply, const char* key) {
+  const VSAValue* v = reply ? reply->get(key) : nullptr;
+  return v && v->isString() ? *v->stringValue() : std::string();
+}
+
+// Runs this test process in persona `personaID` of the daemon's root.
+void enterPersona(const VSATestDaemon& d, uint32_t personaID) {
+  fs::create_directories(d.path("/run/vessad/process-personas"));
+  std::ofstream(d.path("/run/vessad/process-personas/" + std::to_string(getpid())))
+      << VSAAuditToken::processStartTime(getpid()) << " " << personaID << "\n";
+}
+
+void writePersonas(const VSATestDaemon& d, const std::string& enterpriseApp) {
+  VSAValue personas = VSAValue::Array{
+      VSAValue::Dictionary{{"PersonaID", VSAValue(1000u)},
+                           {"Kind", VSAValue("personal")},
+                           {"UniqueString", VSAValue("PERSONAL-1000")}},
+      VSAValue::Dictionary{
+          {"PersonaID", VSAValue(1001u)},
+          {"Kind", VSAValue("enterprise")},
+          {"UniqueString", VSAValue("WORK-1001")},
+          {"LayoutPath", VSAValue("/private/var/enterprise/1001")},
+          {"BundleIdentifiers", VSAValue(VSAValue::Array{VSAValue(enterpriseApp)})}}};
+  fs::create_directories(d.path("/private/var/enterprise/1001"));
+  auto bytes = VSAPlist::serialize(personas, VSAPlist::Format::XML, nullptr);
+  std::ofstream(d.path("/etc/vessad/personas.plist"), std::ios::binary)
+      .write(reinterpret_cast<const char*>(bytes->data()), bytes->size());
+}
+
+TEST(DaemonContainers, CreateLookUpDeleteAndEmptyDeathRow) {
+  VSATestDaemon d;
+  d.registerSelf(
+      "com.example.installer",
+      VSAValue::Dictionary{{kAllowed, VSAValue(true)},
+                           {"com.tamsk.private.Vessa.userManagedAssets", VSAValue(true)}});
+  ASSERT_TRUE(d.start());
+  auto created = d.request(createRequest("com.example.app"));
+  ASSERT_EQ(replyError(created), 1u);
+  EXPECT_FALSE(*created->get("ReplyExisted")->boolValue());
+  std::string path = stringOf(created, "ReplyPath");
+  EXPECT_TRUE(fs::exists(path + "/.com.tamsk.vessa_keeper.metadata.plist"));
+  EXPECT_TRUE(created->get("ReplyUUID")->uuidValue());
+  auto found = d.request(createRequest("com.example.app", false));
+  EXPECT_TRUE(*found->get("ReplyExisted")->boolValue());
+  EXPECT_EQ(stringOf(found, "ReplyPath"), path);
+  // Metadata with and without the info dictionary.
+  VSAValue meta = VSAValue::Dictionary{{"Command", VSAValue(7u)},
+                                       {"Identifier", VSAValue("com.example.app")},
+                                       {"ContainerClass", VSAValue(2u)}};
+  auto plain = d.request(meta);
+  EXPECT_EQ(stringOf(plain, "ReplyPath"), path);
+  EXPECT_FALSE(plain->get("ReplyInfoDictionary"));
+  meta.set("InfoDictRequested", VSAValue(true));
+  EXPECT_TRUE(d.request(meta)->get("ReplyInfoDictionary"));
+  // Listing shows it.
+  auto list =
+      d.request(VSAValue::Dictionary{{"Command", VSAValue(1u)}, {"ContainerClass", VSAValue(2u)}});
+  ASSERT_EQ(replyError(list), 1u);
+  EXPECT_EQ(list->get("ReplyIdsArray")->arrayValue()->size(), 1u);
+  // Argument errors.
+  EXPECT_EQ(replyError(d.request(createRequest("com.example.app", false, 14))), 20u);
+  EXPECT_EQ(replyError(d.request(
+                VSAValue::Dictionary{{"Command", VSAValue(0u)}, {"ContainerClass", VSAValue(2u)}})),
+            18u);
+  VSAValue badPersona = createRequest("com.example.app", false);
+  badPersona.set("PersonaUniqueString", VSAValue("NO-SUCH-PERSONA"));
+  EXPECT_EQ(replyError(d.request(badPersona)), 76u);
+  // Delete, then empty death row (command 4 replies from its completion).
+  VSAValue del = VSAValue::Dictionary{{"Command", VSAValue(10u)},
+                                      {"Identifier", VSAValue("com.example.app")},
+                                      {"ContainerClass", VSAValue(2u)}};
+  EXPECT_EQ(replyError(d.request(del)), 1u);
+  EXPECT_FALSE(fs::exists(path));
+  EXPECT_EQ(replyError(d.request(del)), 21u);
+  EXPECT_EQ(replyError(d.request(VSAValue::Dictionary{{"Command", VSAValue(4u)}})), 1u);
+  EXPECT_TRUE(fs::is_empty(d.path("/private/var/root/Library/Caches/com.tamsk.vessad/Dead")) ||
+              !fs::exists(d.path("/private/var/root/Library/Caches/com.tamsk.vessad/Dead")));
+  EXPECT_EQ(d.stop(), 0);
+}
+
+TEST(DaemonContainers, LookupEntitlementMatrixForCommandZero) {
+  VSATestDaemon d;
+  d.registerVessactl("installer", "com.example.installer",
+                     VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
+  d.registerVessactl("owner", "com.example.owner", VSAValue::dictionary());
+  d.registerVessactl(
+      "looker", "com.example.looker",
+      VSAValue::Dictionary{{"com.tamsk.private.Vessa.lookup",
+                            VSAValue::Dictionary{{"appData", VSAValue(VSAValue::Array{VSAValue(
+                                                                 "com.example.owner")})}}}});
+  d.registerVessactl("composer", "com.tamsk.mail.composer", VSAValue::dictionary());
+  d.registerVessactl("stranger", "com.example.stranger", VSAValue::dictionary());
+  ASSERT_TRUE(d.start());
+  auto lookup = [&](const std::string& client, const std::string& id, bool create) {
+    std::vector<std::string> args = {"Command=0", "Identifier=" + id, "ContainerClass=2"};
+    if (create) args.push_back("CreateIfNecessary=true");
+    return d.vessactl(client, args);
+  };
+  EXPECT_EQ(lookup("installer", "com.example.owner", true).status, 0);
+  EXPECT_EQ(lookup("installer", "com.tamsk.mail", true).status, 0);
+  EXPECT_EQ(lookup("owner", "com.example.owner", false).status, 0);   // its own
+  EXPECT_EQ(lookup("looker", "com.example.owner", false).status, 0);  // lookup dictionary
+  EXPECT_EQ(lookup("composer", "com.tamsk.mail", false).status, 0);   // whitelist
+  auto denied = lookup("stranger", "com.example.owner", false);       // none
+  EXPECT_NE(denied.status, 0);
+  EXPECT_NE(denied.output.find("55"), std::string::npos) << denied.output;
+  // The same answer for a container that does not exist.
+  auto missing = lookup("stranger", "com.example.nothing", false);
+  EXPECT_NE(missing.output.find("55"), std::string::npos) << missing.output;
+  EXPECT_EQ(d.stop(), 0);
+}
+
+TEST(DaemonContainers, SandboxTokensOnlyForEnterpriseContainers) {
+  VSATestDaemon d;
+  writePersonas(d, "com.example.work");
+  d.registerSelf("com.example.work", VSAValue::Dictionary{{kAllowed, VSAValue(true)}}, true);
+  ASSERT_TRUE(d.start());
+  auto personal = d.request(createRequest("com.example.work"));
+  ASSERT_EQ(replyError(personal), 1u);
+  EXPECT_FALSE(personal->get("ReplySandboxToken"));
+  enterPersona(d, 1001);
+  auto enterprise = d.request(createRequest("com.example.work"));
+  ASSERT_EQ(replyError(enterprise), 1u);
+  EXPECT_EQ(stringOf(enterprise, "ReplyPersonaUniqueString"), "WORK-1001");
+  EXPECT_NE(stringOf(enterprise, "ReplyPath"), stringOf(personal, "ReplyPath"));
+  EXPECT_FALSE(stringOf(enterprise, "ReplySandboxToken").empty());
+  // Class 1 (a bundle) gets no token even there.
+  auto bundle = d.request(createRequest("com.example.work", true, 1));
+  ASSERT_EQ(replyError(bundle), 1u);
+  EXPECT_FALSE(bundle->get("ReplySandboxToken"));
+  fs::remove(d.path("/run/vessad/process-personas/" + std::to_string(getpid())));
+  EXPECT_EQ(d.stop(), 0);
+}
+
+TEST(DaemonContainers, ProtectionChangeWaitsForTheUnlock) {
+  VSATestDaemon d;
+  d.registerSelf("com.example.installer", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
+  ASSERT_TRUE(d.start());
+  auto created = d.request(createRequest("com.example.app"));
+  ASSERT_EQ(replyError(created), 1u);
+  std::string path = stringOf(created, "ReplyPath");
+  std::ofstream(path + "/Library/notes") << "secret";
+  VSAValue protect = VSAValue::Dictionary{{"Command", VSAValue(21u)},
+                                          {"Identifier", VSAValue("com.example.app")},
+                                          {"ContainerClass", VSAValue(2u)},
+                                          {"DataProtectionClass", VSAValue(3)},
+                                          {"RetryIfLocked", VSAValue(true)}};
+  ASSERT_EQ(replyError(d.request(protect)), 1u);
+  VSALinuxFileSystem files;
+  int c = 0;
+  ASSERT_EQ(files.getProtectionClass(path + "/Library/notes", &c), 0);
+  EXPECT_EQ(c, 3);
+  // Locked: files of class 3 cannot change, so the next change waits.
+  VSALockStateService device{VSASystemRoot(d.root())};
+  ASSERT_TRUE(device.setLockState(1));
+  std::this_thread::sleep_for(300ms);  // let the daemon see the lock
+  protect.set("DataProtectionClass", VSAValue(1));
+  auto pending = std::async(std::launch::async, [&] { return d.request(protect, 20s); });
+  EXPECT_EQ(pending.wait_for(1s), std::future_status::timeout);
+  EXPECT_EQ(
+      std::distance(
+          fs::directory_iterator(d.path("/private/var/root/Library/Vessa/PendingUpdates")), {}),
+      1);
+  ASSERT_TRUE(device.setLockState(0));
+  auto reply = pending.get();
+  EXPECT_EQ(replyError(reply), 1u);
+  ASSERT_EQ(files.getProtectionClass(path + "/Library/notes", &c), 0);
+  EXPECT_EQ(c, 1);
+  EXPECT_TRUE(fs::is_empty(d.path("/private/var/root/Library/Vessa/PendingUpdates")));
+  // Class 2 is always refused.
+  protect.set("DataProtectionClass", VSAValue(2));
+  EXPECT_EQ(replyError(d.request(protect)), 11u);
+  EXPECT_EQ(d.stop(), 0);
+}
+
+}  // namespace
