@@ -49,10 +49,43 @@ JSON
 ctl "$installer" --root "$root" --file "$root/tmp/csinfo.json"
 ctl "$installer" --root "$root" --json Command=19 Identifier=com.example.demo
 
-step "Locking and unlocking the device (the daemon follows the lock state)"
-echo 1 > "$root/run/vessad/lockstate"; sleep 0.2
-echo 0 > "$root/run/vessad/lockstate"; sleep 0.2
+step "Creating the app's data container (command 0, class 2)"
+ctl "$installer" --root "$root" --json Command=0 Identifier=com.example.demo ContainerClass=2 \
+  CreateIfNecessary=true
+path=$("$installer" --root "$root" --json Command=0 Identifier=com.example.demo ContainerClass=2 |
+  sed -n 's/.*"ReplyPath": *"\([^"]*\)".*/\1/p')
+echo "(asked again, the same container answers with ReplyExisted true)"
+step "Its directory tree (mode, owner, path)"
+find "$path" -printf '%M %u %p\n' | sed -e "s|$root|\$ROOT|g" | sort -k3
+step "Its metadata (command 7)"
+ctl "$installer" --root "$root" --json Command=7 Identifier=com.example.demo ContainerClass=2 \
+  InfoDictRequested=true
+
+step "Locking the device, then asking for protection class 1 with retry (command 21)"
+ctl "$installer" --root "$root" --json Command=21 Identifier=com.example.demo ContainerClass=2 \
+  DataProtectionClass:i64=3
+echo 1 > "$root/run/vessad/lockstate"; sleep 0.3
+"$installer" --root "$root" --json Command=21 Identifier=com.example.demo ContainerClass=2 \
+  DataProtectionClass:i64=1 RetryIfLocked=true > "$root/tmp/protect.out" &
+pending=$!
+sleep 0.5
+echo "pending update files while locked:"
+ls "$root/private/var/root/Library/Vessa/PendingUpdates" | sed 's/^/  /'
+echo "unlocking"
+echo 0 > "$root/run/vessad/lockstate"
+wait $pending || true
+echo "the reply, sent when the change finished after the unlock:"
+cat "$root/tmp/protect.out"
 grep -o 'lock_state_changed: LockState=[0-9]*' "$root/vessad.out"
+
+step "Deleting the container (command 10): it is staged on death row"
+ctl "$installer" --root "$root" Command=10 Identifier=com.example.demo ContainerClass=2
+deathrow="$root/private/var/root/Library/Caches/com.tamsk.vessad/Dead"
+ls -A "$deathrow" | sed 's/^/  death row: /'
+step "Emptying death row (command 4)"
+ctl "$installer" --root "$root" Command=4
+echo "death row now holds $(ls -A "$deathrow" | wc -l) entries"
+ctl "$installer" --root "$root" Command=0 Identifier=com.example.demo ContainerClass=2
 
 step "Notifications posted by the daemon"
 "$build/vessactl" --root "$root" notifications

@@ -48,6 +48,7 @@ cat > "$root/etc/vessad/clients.d/demo-installer.plist" <<'PL'
   <key>SigningIdentifier</key><string>com.tamsk.demo.installer</string>
   <key>Entitlements</key><dict>
     <key>com.tamsk.private.Vessa.allowed</key><true/>
+    <key>com.tamsk.private.Vessa.userManagedAssets</key><true/>
   </dict>
   <key>Sandboxed</key><false/>
 </dict></plist>
