@@ -196,7 +196,7 @@ std::optional<VSAValue> VSAPlist::parse(const uint8_t* bytes, size_t length, VSA
 }
 
 bool VSAWriteFileAtomically(const std::string& path, const std::vector<uint8_t>& bytes, mode_t mode,
-                            VSAErrorRef* error) {
+                            VSAErrorRef* error, bool sync) {
   std::string tmp = path + ".tmp-XXXXXX";
   int fd = mkstemp(tmp.data());
   if (fd < 0) {
@@ -215,7 +215,7 @@ bool VSAWriteFileAtomically(const std::string& path, const std::vector<uint8_t>&
     done += static_cast<size_t>(w);
   }
   if (!err && fchmod(fd, mode) != 0) err = errno;
-  if (!err && fsync(fd) != 0) err = errno;
+  if (!err && sync && fsync(fd) != 0) err = errno;
   if (::close(fd) != 0 && !err) err = errno;
   if (!err && ::rename(tmp.c_str(), path.c_str()) != 0) err = errno;
   if (err) {
@@ -276,10 +276,10 @@ std::optional<std::vector<uint8_t>> VSAReadFile(const std::string& path, VSAErro
 
 bool VSA_writeToURL(const VSAValue& dictionary, const std::string& path, uint64_t options,
                     VSAErrorRef* error) {
-  (void)options;  // protection is applied by the file manager where the caller asks for it
+  // Protection is applied by the file manager where the caller asks for it.
   auto bytes = VSAPlist::serialize(dictionary, VSAPlist::Format::Binary, error);
   if (!bytes) return false;
-  return VSAWriteFileAtomically(path, *bytes, 0644, error);
+  return VSAWriteFileAtomically(path, *bytes, 0644, error, !(options & kVSAWriteFileWithoutSync));
 }
 
 std::optional<VSAValue> VSA_dictionaryWithContentsOfURL(const std::string& path, uint64_t options,

@@ -18,6 +18,9 @@
 
 // Write option asking that the written file get no data protection.
 inline constexpr uint64_t kVSAWriteFileProtectionNone = 0x10000000;
+// Write option for files that need not survive a power loss (run-time state
+// below run/): still atomic, but not flushed to the disk.
+inline constexpr uint64_t kVSAWriteFileWithoutSync = 0x20000000;
 // The general domain's "not a property list of the expected kind" code.
 inline constexpr int64_t kVSAPropertyListReadCorruptError = 3840;
 inline constexpr int64_t kVSAFileReadCorruptFileError = 2048;
@@ -49,7 +52,7 @@ std::optional<VSAValue> VSA_dictionaryWithContentsOfURL(const std::string& path,
 
 // Writes `bytes` to `path` atomically (temporary file + fsync + rename).
 bool VSAWriteFileAtomically(const std::string& path, const std::vector<uint8_t>& bytes, mode_t mode,
-                            VSAErrorRef* error);
+                            VSAErrorRef* error, bool sync = true);
 // mkdir -p: creates `path` and its missing parents (parents 0755, `path`
 // itself `mode`); 0 or the errno of the step that failed.
 int VSAMakeDirectories(const std::string& path, mode_t mode = 0755);

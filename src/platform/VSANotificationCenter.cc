@@ -8,6 +8,9 @@
 #include <fstream>
 #include <sstream>
 
+#include "base/VSAPathString.h"
+#include "base/VSAPlist.h"
+
 VSANotificationCenter::VSANotificationCenter(VSASystemRoot root) : root_(std::move(root)) {}
 
 std::string VSANotificationCenter::logPath() const {
@@ -16,6 +19,11 @@ std::string VSANotificationCenter::logPath() const {
 
 uint32_t VSANotificationCenter::post(const std::string& name) {
   int fd = ::open(logPath().c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
+  if (fd < 0 && errno == ENOENT) {
+    // The run directory is made on demand (a root may not have one yet).
+    VSAMakeDirectories(VSADirectoryName(logPath()));
+    fd = ::open(logPath().c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
+  }
   if (fd < 0) return static_cast<uint32_t>(errno);
   std::string line = std::to_string(static_cast<long long>(time(nullptr))) + " " + name + "\n";
   ssize_t n = ::write(fd, line.data(), line.size());

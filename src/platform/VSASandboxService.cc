@@ -57,7 +57,7 @@ std::string VSASandboxService::tablePath(uid_t uid) const {
   return root_.resolve("/run/vessad/sandbox/" + std::to_string(uid) + ".plist");
 }
 
-std::vector<VSASandboxItem> VSASandboxService::load(uid_t uid) {
+const std::vector<VSASandboxItem>& VSASandboxService::load(uid_t uid) {
   auto it = tables_.find(uid);
   if (it != tables_.end()) return it->second;
   std::vector<VSASandboxItem> items;
@@ -74,11 +74,10 @@ std::vector<VSASandboxItem> VSASandboxService::load(uid_t uid) {
                        *path->stringValue()});
     }
   }
-  tables_[uid] = items;
-  return items;
+  return tables_[uid] = std::move(items);
 }
 
-int VSASandboxService::store(uid_t uid, const std::vector<VSASandboxItem>& items) {
+int VSASandboxService::write(uid_t uid, const std::vector<VSASandboxItem>& items) {
   VSAValue::Array list;
   for (const auto& i : items)
     list.push_back(VSAValue::Dictionary{{"ItemType", VSAValue(i.itemType)},
@@ -89,24 +88,53 @@ int VSASandboxService::store(uid_t uid, const std::vector<VSASandboxItem>& items
   std::string dir = root_.resolve("/run/vessad/sandbox");
   VSAMakeDirectories(dir, 0700);
   VSAErrorRef error;
-  if (!VSA_writeToURL(VSAValue::Dictionary{{"Items", VSAValue(std::move(list))}}, tablePath(uid), 0,
-                      &error))
-    return error && error->domain() == kVSAPOSIXErrorDomain ? static_cast<int>(error->code()) : EIO;
-  tables_[uid] = items;
+  // The table lives as long as the boot, like the kernel's: no flush to disk.
+  if (!VSA_writeToURL(VSAValue::Dictionary{{"Items", VSAValue(std::move(list))}}, tablePath(uid),
+                      kVSAWriteFileWithoutSync, &error)) {
+    VSALog(kVSALogError, "VSASandboxService", "Failed to write container table %@: %@",
+           tablePath(uid), error);
+    return EIO;
+  }
   return 0;
 }
+
+void VSASandboxService::_lock_scheduleWrite(uid_t uid) {
+  dirty_.insert(uid);
+  if (writeScheduled_) return;
+  writeScheduled_ = true;
+  writeQueue_->async([this] { writePending(); });
+}
+
+void VSASandboxService::writePending() {
+  std::map<uid_t, std::vector<VSASandboxItem>> pending;
+  {
+    std::lock_guard lock(mutex_);
+    for (uid_t uid : dirty_) pending[uid] = tables_[uid];
+    dirty_.clear();
+    writeScheduled_ = false;
+  }
+  for (const auto& [uid, items] : pending) write(uid, items);
+}
+
+void VSASandboxService::flush() {
+  writeQueue_->sync([this] { writePending(); });
+}
+
+VSASandboxService::~VSASandboxService() { flush(); }
 
 int VSASandboxService::setUserStateItem(uid_t uid, uint64_t itemType, const std::string& identifier,
                                         uint64_t containerClass, int32_t personaID,
                                         const std::optional<std::string>& path) {
   if (identifier.empty()) return EINVAL;
   std::lock_guard lock(mutex_);
-  auto items = load(uid);
+  load(uid);
+  auto& items = tables_[uid];
   std::erase_if(items, [&](const VSASandboxItem& i) {
     return i.identifier == identifier && i.containerClass == containerClass;
   });
   if (path) items.push_back({itemType, identifier, containerClass, personaID, *path});
-  return store(uid, items);
+  _lock_scheduleWrite(uid);
+  return 0;
 }
 
 int VSASandboxService::iterateUserStateItems(

@@ -1,0 +1,41 @@
+#!/usr/bin/env bash
+# Runs vessa-bench against a fresh demo device: provisions a system root,
+# registers vessa-bench as a full client, starts vessad, runs the three
+# scenarios and stops the daemon.
+#   scripts/vessa-bench.sh [DIR]
+set -euo pipefail
+cd "$(dirname "$0")/.."
+repo=$(pwd)
+scripts/setup.sh
+scripts/build.sh >/dev/null
+build=${BUILD_DIR:-build}
+root=${1:-$(mktemp -d /tmp/vessa-bench-XXXXXX)}
+mkdir -p "$root"
+root=$(cd "$root" && pwd)
+scripts/provision-root.sh "$root" "$repo/$build/vessactl" >/dev/null
+cp "$build/vessa-bench" "$root/usr/bin/vessa-bench"
+cat > "$root/etc/vessad/clients.d/vessa-bench.plist" <<'PL'
+<?xml version="1.0" encoding="UTF-8"?>
+<plist version="1.0"><dict>
+  <key>Executable</key><string>/usr/bin/vessa-bench</string>
+  <key>SigningIdentifier</key><string>com.tamsk.vessa-bench</string>
+  <key>Entitlements</key><dict><key>com.tamsk.private.Vessa.allowed</key><true/></dict>
+</dict></plist>
+PL
+chmod 0644 "$root/etc/vessad/clients.d/vessa-bench.plist"
+"$build/vessad" --root "$root" --stderr --log-level 3 >"$root/vessad.out" 2>&1 &
+daemon=$!
+trap 'kill $daemon 2>/dev/null || true' EXIT
+for _ in $(seq 100); do [[ -S "$root/run/vessad/com.tamsk.vessad" ]] && break; sleep 0.05; done
+bench="$root/usr/bin/vessa-bench"
+echo "== Look-up of an existing container, one client"
+"$bench" --root "$root" --mode lookup --clients 1 --requests "${LOOKUPS:-20000}"
+echo
+echo "== Creation, one client"
+"$bench" --root "$root" --mode create --clients 1 --requests "${CREATES:-2000}"
+echo
+echo "== Mixed requests, 16 clients"
+"$bench" --root "$root" --mode mixed --clients 16 --requests "${MIXED:-10000}"
+kill -TERM $daemon
+wait $daemon
+trap - EXIT

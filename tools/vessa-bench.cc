@@ -1,0 +1,268 @@
+// vessa-bench: a load generator for a running vessad.
+//
+// Every figure is printed beside a baseline measured in the same run:
+//  - request modes (lookup, mixed) first run the same clients against an echo
+//    server built from the daemon's own listener, socket and framing, then
+//    against the daemon, and print requests/s and p50/p99 latency as ratios;
+//  - the create mode compares container creation through the daemon with a
+//    raw loop doing the same directory work (staging directory,
+//    sub-directories, metadata file, rename) in the same root.
+// The client must be registered in the root's client registry with the
+// "com.tamsk.private.Vessa.allowed" entitlement (scripts/vessa-bench.sh does it).
+#include <unistd.h>
+
+#include <algorithm>
+#include <atomic>
+#include <chrono>
+#include <cstdio>
+#include <cstring>
+#include <filesystem>
+#include <functional>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "base/VSAPlist.h"
+#include "base/VSAUUID.h"
+#include "base/VSAWorkQueue.h"
+#include "platform/VSAIPCClient.h"
+#include "platform/VSAIPCListener.h"
+#include "platform/VSALinuxFileSystem.h"
+#include "platform/VSATransactions.h"
+
+namespace {
+using Clock = std::chrono::steady_clock;
+
+struct Options {
+  std::string root = "/";
+  std::string mode = "lookup";
+  int clients = 1;
+  int requests = 10000;
+};
+
+struct Result {
+  double seconds = 0;
+  std::vector<double> latenciesUs;
+  long errors = 0;  // replies whose ReplyError is not 1
+  long lost = 0;    // requests without a reply
+  double perSecond() const { return latenciesUs.size() / seconds; }
+  double percentile(double p) const {
+    if (latenciesUs.empty()) return 0;
+    std::vector<double> v = latenciesUs;
+    size_t k = std::min(v.size() - 1, static_cast<size_t>(p * v.size()));
+    std::nth_element(v.begin(), v.begin() + k, v.end());
+    return v[k];
+  }
+};
+
+// Request `i` of client `c`.
+using RequestMaker = std::function<VSAValue(int c, int i)>;
+
+Result runClients(const std::string& socket, const Options& o, const RequestMaker& make,
+                  bool checkReplies) {
+  std::vector<std::thread> threads;
+  std::vector<Result> parts(o.clients);
+  std::atomic<int> ready{0};
+  std::atomic<bool> go{false};
+  for (int c = 0; c < o.clients; ++c)
+    threads.emplace_back([&, c] {
+      VSAIPCClient client;
+      VSAErrorRef error;
+      bool connected = client.connect(socket, &error);
+      ++ready;
+      while (!go) std::this_thread::yield();
+      Result& r = parts[c];
+      for (int i = 0; i < o.requests; ++i) {
+        if (!connected) {
+          ++r.lost;
+          continue;
+        }
+        auto start = Clock::now();
+        auto reply = client.sendRequest(make(c, i), std::chrono::seconds(60), &error);
+        r.latenciesUs.push_back(
+            std::chrono::duration<double, std::micro>(Clock::now() - start).count());
+        if (!reply) {
+          ++r.lost;
+        } else if (checkReplies) {
+          const VSAValue* e = reply->get("ReplyError");
+          if (!e || e->uint64Value().value_or(0) != 1) ++r.errors;
+        }
+      }
+    });
+  while (ready < o.clients) std::this_thread::yield();
+  auto start = Clock::now();
+  go = true;
+  for (auto& t : threads) t.join();
+  Result all;
+  all.seconds = std::chrono::duration<double>(Clock::now() - start).count();
+  for (auto& p : parts) {
+    all.latenciesUs.insert(all.latenciesUs.end(), p.latenciesUs.begin(), p.latenciesUs.end());
+    all.errors += p.errors;
+    all.lost += p.lost;
+  }
+  return all;
+}
+
+// The daemon's listener, socket and framing, answering every request at once.
+Result runEcho(const Options& o, const RequestMaker& make) {
+  std::string dir = "/tmp/vessa-bench-echo-XXXXXX";
+  if (!mkdtemp(dir.data())) return {};
+  auto transactions = std::make_shared<VSATransactions>();
+  VSAIPCListener listener(dir + "/echo", VSAWorkQueue::create("vessa-bench.echo"), transactions);
+  VSAErrorRef error;
+  if (!listener.listen(&error)) return {};
+  listener.setHandler([](const VSAIPCMessageRef& m) {
+    auto reply = m->createReply();
+    if (!reply) return;
+    reply->set("ReplyError", VSAValue(1u));
+    m->sendReply(*reply);
+  });
+  listener.resume();
+  Result r = runClients(dir + "/echo", o, make, true);
+  listener.stop();
+  std::filesystem::remove_all(dir);
+  return r;
+}
+
+void printPair(const char* what, const Result& base, const Result& daemon) {
+  std::printf("%-10s %12s %12s %12s\n", what, "requests/s", "p50 (us)", "p99 (us)");
+  std::printf("%-10s %12.0f %12.1f %12.1f\n", "baseline", base.perSecond(), base.percentile(0.5),
+              base.percentile(0.99));
+  std::printf("%-10s %12.0f %12.1f %12.1f\n", "vessad", daemon.perSecond(), daemon.percentile(0.5),
+              daemon.percentile(0.99));
+  std::printf("ratio: throughput %.2fx, p50 latency %.2fx, p99 latency %.2fx (baseline / vessad)\n",
+              daemon.perSecond() / base.perSecond(),
+              base.percentile(0.5) / std::max(daemon.percentile(0.5), 1e-9),
+              base.percentile(0.99) / std::max(daemon.percentile(0.99), 1e-9));
+  std::printf("errors: %ld, lost replies: %ld (of %zu)\n", daemon.errors, daemon.lost,
+              daemon.latenciesUs.size() + static_cast<size_t>(daemon.lost));
+}
+
+VSAValue request(uint64_t command, const std::string& id, bool create = false) {
+  return VSAValue::Dictionary{{"Command", VSAValue(command)},
+                              {"Identifier", VSAValue(id)},
+                              {"ContainerClass", VSAValue(2u)},
+                              {"CreateIfNecessary", VSAValue(create)}};
+}
+
+// One container's directory work done by hand, as creation does it.
+double rawCreateLoop(const std::string& root, int count) {
+  VSALinuxFileSystem fs;
+  std::string base = root + "/private/var/mobile/bench-raw";
+  std::string staging = base + "/Staging", live = base + "/Live";
+  std::filesystem::create_directories(staging);
+  std::filesystem::create_directories(live);
+  const char* subdirs[] = {"Documents",           "Library",    "Library/Caches",
+                           "Library/Preferences", "SystemData", "tmp"};
+  auto start = Clock::now();
+  for (int i = 0; i < count; ++i) {
+    std::string name = VSAUUID::random().string();
+    std::string dir = staging + "/" + name;
+    fs.mkdir(dir, 0755);
+    fs.lchown(dir, 501, 501);
+    VSAValue metadata = VSAValue::Dictionary{{"VSAMetadataIdentifier", VSAValue("com.raw")},
+                                             {"VSAMetadataUUID", VSAValue(name)}};
+    auto bytes = VSAPlist::serialize(metadata, VSAPlist::Format::Binary, nullptr);
+    fs.writeFile(dir + "/.tmp-metadata", *bytes, 0644);
+    fs.rename(dir + "/.tmp-metadata", dir + "/.metadata.plist");
+    for (const char* s : subdirs) {
+      std::string sub = dir + "/" + s;
+      fs.mkdir(sub, 0755);
+      fs.lchown(sub, 501, 501);
+      fs.chmod(sub, 0755);
+      fs.setProtectionClass(sub, 0);
+    }
+    fs.rename(dir, live + "/" + name);
+  }
+  double seconds = std::chrono::duration<double>(Clock::now() - start).count();
+  std::filesystem::remove_all(base);
+  return count / seconds;
+}
+
+int usage() {
+  std::fprintf(stderr,
+               "usage: vessa-bench --root DIR [--mode lookup|create|mixed] [--clients N] "
+               "[--requests N]\n"
+               "  lookup: command 0 on one existing container (baseline: echo server)\n"
+               "  create: command 0 creating a new container per request (baseline: raw\n"
+               "          directory work in the same root)\n"
+               "  mixed:  look up, create, read metadata, list, delete (baseline: echo)\n"
+               "  --requests counts requests per client (default 10000)\n");
+  return 2;
+}
+}  // namespace
+
+int main(int argc, char** argv) {
+  Options o;
+  for (int i = 1; i < argc; ++i) {
+    std::string a = argv[i];
+    auto value = [&]() -> std::string { return i + 1 < argc ? argv[++i] : ""; };
+    if (a == "--root")
+      o.root = value();
+    else if (a == "--mode")
+      o.mode = value();
+    else if (a == "--clients")
+      o.clients = std::atoi(value().c_str());
+    else if (a == "--requests")
+      o.requests = std::atoi(value().c_str());
+    else
+      return usage();
+  }
+  if (o.clients < 1 || o.requests < 1) return usage();
+  std::string socket = o.root + "/run/vessad/com.tamsk.vessad";
+  std::string pid = std::to_string(getpid());
+  std::printf("vessa-bench: mode %s, %d client(s) x %d request(s)\n", o.mode.c_str(), o.clients,
+              o.requests);
+  if (o.mode == "lookup") {
+    Options one = o;
+    one.clients = 1;
+    one.requests = 1;
+    runClients(
+        socket, one, [&](int, int) { return request(0, "com.bench.lookup", true); }, true);
+    RequestMaker make = [](int, int) { return request(0, "com.bench.lookup"); };
+    Result base = runEcho(o, make);
+    printPair("lookup", base, runClients(socket, o, make, true));
+    return 0;
+  }
+  if (o.mode == "create") {
+    double raw = rawCreateLoop(o.root, o.requests * o.clients);
+    Result daemon = runClients(
+        socket, o,
+        [&](int c, int i) {
+          return request(
+              0, "com.bench.create." + pid + "." + std::to_string(c) + "." + std::to_string(i),
+              true);
+        },
+        true);
+    std::printf(
+        "create     raw loop %.0f containers/s, vessad %.0f containers/s (p50 %.1f us, p99 "
+        "%.1f us)\nratio: %.2fx\nerrors: %ld, lost replies: %ld\n",
+        raw, daemon.perSecond(), daemon.percentile(0.5), daemon.percentile(0.99),
+        daemon.perSecond() / raw, daemon.errors, daemon.lost);
+    return 0;
+  }
+  if (o.mode == "mixed") {
+    // Each client cycles over its own containers: create, look up, metadata, list, delete.
+    RequestMaker make = [&](int c, int i) {
+      std::string id =
+          "com.bench.mixed." + pid + "." + std::to_string(c) + "." + std::to_string(i / 5);
+      switch (i % 5) {
+        case 0:
+          return request(0, id, true);
+        case 1:
+          return request(0, id);
+        case 2:
+          return request(7, id);
+        case 3:
+          return VSAValue(
+              VSAValue::Dictionary{{"Command", VSAValue(1u)}, {"ContainerClass", VSAValue(2u)}});
+        default:
+          return request(10, id);
+      }
+    };
+    Result base = runEcho(o, make);
+    printPair("mixed", base, runClients(socket, o, make, true));
+    return 0;
+  }
+  return usage();
+}
