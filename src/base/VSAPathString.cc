@@ -55,3 +55,9 @@ std::string VSADirectoryName(std::string_view path) {
   if (slash == 0) return "/";
   return std::string(path.substr(0, slash));
 }
+
+std::string VSALastPathComponent(std::string_view path) {
+  while (path.size() > 1 && path.back() == '/') path.remove_suffix(1);
+  size_t slash = path.rfind('/');
+  return std::string(slash == std::string_view::npos ? path : path.substr(slash + 1));
+}

@@ -20,5 +20,8 @@ void VSAAppendUTF8(std::string& out, uint32_t cp);
 // Joins two path pieces with exactly one '/' between them.
 std::string VSAPathJoin(std::string_view base, std::string_view component);
 
+// The last component of a path, ignoring trailing slashes ("/a/b/" gives "b").
+std::string VSALastPathComponent(std::string_view path);
+
 // The path without its last component ("/a/b/" and "/a/b" give "/a"; "b" gives "").
 std::string VSADirectoryName(std::string_view path);

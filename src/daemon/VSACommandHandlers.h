@@ -6,8 +6,14 @@
 
 #include "base/VSAError.h"
 #include "base/VSAValue.h"
+#include "platform/VSAIPCMessage.h"
 
 class VSAClientConnection;
+
+// Sends the reply of a command that replies from its completion (4, 21):
+// `reply` with "ReplyError" set to `code`, exactly once; failures are logged.
+void VSASendLateReply(const VSAIPCMessageRef& message, VSAValue reply, VSAResultCode code,
+                      uint64_t command);
 
 using VSACommandHandler = void (*)(const VSAValue& request, VSAValue& reply,
                                    VSAClientConnection& connection, VSAResultCode* result);

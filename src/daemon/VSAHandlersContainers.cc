@@ -137,14 +137,7 @@ void VSAHandleDeleteDeathRow(const VSAValue&, VSAValue& reply, VSAClientConnecti
                              VSAResultCode*) {
   VSAIPCMessageRef message = connection.relayMessage();
   connection.context().deathRow->deleteContainersOnDeathRowWithCompletion(
-      [message, reply](VSAResultCode code) mutable {
-        if (!message) return;
-        reply.set("ReplyError", VSAValue(code));
-        VSAErrorRef error;
-        if (!message->sendReply(reply, &error))
-          VSALogIn(VSALogCategory::Relay, kVSALogError, "VSAHandleDeleteDeathRow",
-                   "Failed to send reply for command 4: %@", error);
-      });
+      [message, reply](VSAResultCode code) { VSASendLateReply(message, reply, code, 4); });
 }
 
 void VSAHandleContainerMetadata(const VSAValue& request, VSAValue& reply,

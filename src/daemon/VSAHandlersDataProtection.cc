@@ -22,12 +22,17 @@ void VSAHandleSetDataProtection(const VSAValue& request, VSAValue& reply,
   VSAIPCMessageRef message = connection.relayMessage();
   connection.context().dataProtectionManager->setDataProtectionOnDataContainerForContainerIdentity(
       *identity, static_cast<int32_t>(*protectionClass), args.boolValue("IsThirdParty"),
-      args.boolValue("RetryIfLocked"), [message, reply](VSAResultCode code) mutable {
-        if (!message) return;
-        reply.set("ReplyError", VSAValue(code));
-        VSAErrorRef error;
-        if (!message->sendReply(reply, &error))
-          VSALogIn(VSALogCategory::Relay, kVSALogError, "VSAHandleSetDataProtection",
-                   "Failed to send reply for command 21: %@", error);
-      });
+      args.boolValue("RetryIfLocked"),
+      [message, reply](VSAResultCode code) { VSASendLateReply(message, reply, code, 21); });
+}
+
+void VSASendLateReply(const VSAIPCMessageRef& message, VSAValue reply, VSAResultCode code,
+                      uint64_t command) {
+  if (!message) return;
+  reply.set("ReplyError", VSAValue(code));
+  VSAErrorRef error;
+  if (!message->sendReply(reply, &error))
+    VSALogIn(VSALogCategory::Relay, kVSALogError, "VSASendLateReply",
+             "Failed to send reply for command %llu: %@", static_cast<unsigned long long>(command),
+             error);
 }

@@ -29,10 +29,6 @@ VSAErrorRef rebuildError(const VSAUserIdentityRef& user, VSAContainerClass c, bo
                     transientTag(transient));
 }
 
-std::string lastComponent(const std::string& path) {
-  size_t slash = path.find_last_of('/');
-  return slash == std::string::npos ? path : path.substr(slash + 1);
-}
 }  // namespace
 
 std::shared_ptr<VSAContainerCache> VSAContainerCache::create(Dependencies deps) {
@@ -51,7 +47,7 @@ std::string VSAContainerCache::cacheKeyForUserIdentity(const VSAUserIdentityRef&
 bool VSAContainerCache::containerURLIsValidForContainerClass(
     const std::string& url, VSAContainerClass c,
     const std::function<bool(const std::string&, VSAContainerClass)>& isWellknown) {
-  std::string name = lastComponent(url);
+  std::string name = VSALastPathComponent(url);
   if (VSAUUID::parse(name)) return true;
   return (c == 12 || c == 13) && isWellknown && isWellknown(name, c);
 }

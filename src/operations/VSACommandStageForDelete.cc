@@ -11,10 +11,6 @@ namespace {
 constexpr VSAResultCode kDeleteFailed = 28;
 constexpr VSAResultCode kCacheRemovalFailed = 46;
 
-std::string lastComponent(const std::string& path) {
-  size_t slash = path.find_last_of('/');
-  return slash == std::string::npos ? path : path.substr(slash + 1);
-}
 }  // namespace
 
 std::shared_ptr<VSACommandStageForDelete>
@@ -44,7 +40,7 @@ bool VSACommandStageForDelete::stage(const VSAContainerIdentity& identity, VSACo
                                                          identity, false, true, false, nullptr);
   if (!container) return true;  // nothing to stage
   std::string destination =
-      VSAPathJoin(config.deathrowDirectory(), lastComponent(container->url()));
+      VSAPathJoin(config.deathrowDirectory(), VSALastPathComponent(container->url()));
   if (VSAContainerClassIsBundle(identity.containerClass()) && environment_->removeCodeSigning)
     environment_->removeCodeSigning(identity.identifier(), queue);
   VSAErrorRef error;

@@ -8,12 +8,6 @@
 namespace {
 constexpr VSAResultCode kDeleteFailed = 28;
 
-std::string lastPathComponent(std::string path) {
-  while (path.size() > 1 && path.back() == '/') path.pop_back();
-  size_t slash = path.rfind('/');
-  return slash == std::string::npos ? path : path.substr(slash + 1);
-}
-
 bool isMissing(const VSAErrorRef& e) {
   return e && e->domain() == kVSAPOSIXErrorDomain && e->code() == ENOENT;
 }
@@ -44,7 +38,7 @@ bool VSADeathRow::_moveItemAtURLToDeathRow(const std::string& url, bool isDir,
     VSASetError(error, e);
     return false;
   }
-  std::string destination = VSAPathJoin(*unique, lastPathComponent(url));
+  std::string destination = VSAPathJoin(*unique, VSALastPathComponent(url));
   (void)isDir;  // a directory and a file move alike here
   if (!fm.moveItemAtURL(url, destination, &underlying)) {
     fm.fileSystem().rmdir(*unique);
@@ -98,7 +92,7 @@ bool VSADeathRow::_removeItemOrMoveToTempAtURL(const std::string& url, VSAErrorR
   std::string tmp = configuration_->systemRoot().resolve("/tmp");
   if (fm.itemDoesNotExistAtURL(tmp))
     fm.createDirectoryAtURL(tmp, true, 01777, 0, kVSANoProtectionClass, nullptr);
-  std::string destination = VSAPathJoin(tmp, lastPathComponent(url));
+  std::string destination = VSAPathJoin(tmp, VSALastPathComponent(url));
   if (fm.moveItemAtURL(url, destination, error)) return true;
   VSALog(kVSALogError, fn, "Failed to move dir: %@ to: %@", url, destination);
   return false;
