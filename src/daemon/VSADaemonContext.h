@@ -69,10 +69,15 @@ struct VSADaemonContext {
     codeSigningMapping = std::make_shared<VSACodeSigningMapping>(
         userIdentityCache, globalConfiguration,
         std::make_unique<VSASQLiteDB>(globalConfiguration->libraryDirectory()));
+    // The cache and the code-signing mapping point at each other (the mapping
+    // stages deletions through the cache); the cache's side is weak so that
+    // both go away with the context.
+    std::weak_ptr<VSACodeSigningMapping> mapping = codeSigningMapping;
     containerCache = VSAContainerCache::create(
         {userIdentityCache, globalConfiguration, sandboxService, notifications,
-         [mapping = codeSigningMapping](const std::string& child) {
-           return mapping->parentIdentifierForChildIdentifier(child);
+         [mapping](const std::string& child) -> std::optional<std::string> {
+           auto m = mapping.lock();
+           return m ? m->parentIdentifierForChildIdentifier(child) : std::nullopt;
          },
          [list = whitelist](const std::string& id, VSAContainerClass c) {
            return list->containerIdIsWellknown(id, c);
@@ -80,7 +85,6 @@ struct VSADaemonContext {
     stageEnvironment = std::make_shared<VSAStageForDeleteEnvironment>();
     stageEnvironment->cache = containerCache;
     stageEnvironment->configuration = globalConfiguration;
-    std::weak_ptr<VSACodeSigningMapping> mapping = codeSigningMapping;
     stageEnvironment->removeCodeSigning = [mapping](const std::string& id, VSACommandQueue& queue) {
       if (auto m = mapping.lock())
         m->removeCodeSigningDictionariesForIdentifierAndItsChildren(id, &queue);

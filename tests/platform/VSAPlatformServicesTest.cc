@@ -112,7 +112,7 @@ TEST_F(VSAPlatformRoot, LockStateFileAndNotification) {
   auto queue = VSAWorkQueue::create("test.lockstate.notify");
   ASSERT_EQ(service.registerForLockStatus(queue, [&] { ++notified; }), 0);
   ASSERT_TRUE(service.setLockState(1));
-  for (int i = 0; i < 200 && notified == 0; ++i) std::this_thread::sleep_for(5ms);
+  for (int i = 0; i < 1000 && notified == 0; ++i) std::this_thread::sleep_for(5ms);
   EXPECT_GE(notified.load(), 1);
   EXPECT_EQ(service.currentLockState(), 1);
   std::ofstream(service.stateFilePath()) << "garbage";
