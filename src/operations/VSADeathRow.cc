@@ -55,11 +55,13 @@ bool VSADeathRow::_moveItemAtURLToDeathRow(const std::string& url, bool isDir,
 
 void VSADeathRow::deleteContainersOnDeathRowWithCompletion(Completion completion) {
   auto token = transactions_ ? transactions_->open() : nullptr;
-  // The object belongs to the daemon context, which outlives its transactions.
-  _sharedBackgroundQueue()->async([this, token, completion = std::move(completion)] {
-    VSAResultCode code = emptyDeathRow();
-    if (completion) completion(code);
-  });
+  // The background queue is process-wide and may run this after the daemon
+  // context that made it is gone (tests build many), so the work owns its object.
+  _sharedBackgroundQueue()->async(
+      [self = shared_from_this(), token, completion = std::move(completion)] {
+        VSAResultCode code = self->emptyDeathRow();
+        if (completion) completion(code);
+      });
 }
 
 VSAResultCode VSADeathRow::emptyDeathRow() {

@@ -19,7 +19,7 @@
 #include "model/VSAGlobalConfiguration.h"
 #include "platform/VSATransactions.h"
 
-class VSADeathRow {
+class VSADeathRow : public std::enable_shared_from_this<VSADeathRow> {
  public:
   using Completion = std::function<void(VSAResultCode)>;
 
@@ -32,6 +32,7 @@ class VSADeathRow {
   bool _moveItemAtURLToDeathRow(const std::string& url, bool isDir, bool startDeletionThread,
                                 VSAErrorRef* error);
   // Returns at once; the completion gets the code of the last failure (1 when none).
+  // The queued work keeps this object alive until it has run.
   void deleteContainersOnDeathRowWithCompletion(Completion completion);
   // Removes a tree or, failing that, moves it to /tmp.
   bool _removeItemOrMoveToTempAtURL(const std::string& url, VSAErrorRef* error);

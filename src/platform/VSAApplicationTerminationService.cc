@@ -65,8 +65,10 @@ VSAApplicationTerminationService::createAssertion(const std::string& bundleIdent
                            std::vector<uint8_t>(text.begin(), text.end()), 0644, nullptr);
   }
   // The record is in place first, so nothing relaunches between kill and hold.
-  VSAWorkQueue::global()->async([this, bundleIdentifier, acquired = std::move(acquired)] {
-    int rc = terminateProcessesOf(bundleIdentifier);
+  // The global queue may run this after its owner let go of the service.
+  VSAWorkQueue::global()->async([self = shared_from_this(), bundleIdentifier,
+                                 acquired = std::move(acquired)] {
+    int rc = self->terminateProcessesOf(bundleIdentifier);
     acquired(rc ? VSA_POSIX_ERROR(rc, "could not terminate every process of " + bundleIdentifier)
                 : nullptr);
   });

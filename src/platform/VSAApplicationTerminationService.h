@@ -21,7 +21,8 @@
 #include "platform/VSAClientRegistry.h"
 #include "platform/VSASystemRoot.h"
 
-class VSAApplicationTerminationService {
+class VSAApplicationTerminationService
+    : public std::enable_shared_from_this<VSAApplicationTerminationService> {
  public:
   using Handle = uint64_t;
   // The three termination reasons of the platform.

@@ -2,23 +2,21 @@
 
 VSATransactions::Token VSATransactions::open() {
   {
-    std::lock_guard lock(mutex_);
-    ++open_;
+    std::lock_guard lock(state_->mutex);
+    ++state_->open;
   }
-  return Token(static_cast<void*>(this), [this](void*) { close(); });
-}
-
-void VSATransactions::close() {
-  std::lock_guard lock(mutex_);
-  if (--open_ == 0) cv_.notify_all();
+  return Token(static_cast<void*>(state_.get()), [state = state_](void*) {
+    std::lock_guard lock(state->mutex);
+    if (--state->open == 0) state->cv.notify_all();
+  });
 }
 
 int VSATransactions::openCount() const {
-  std::lock_guard lock(mutex_);
-  return open_;
+  std::lock_guard lock(state_->mutex);
+  return state_->open;
 }
 
 bool VSATransactions::waitUntilIdle(std::chrono::milliseconds timeout) {
-  std::unique_lock lock(mutex_);
-  return cv_.wait_for(lock, timeout, [this] { return open_ == 0; });
+  std::unique_lock lock(state_->mutex);
+  return state_->cv.wait_for(lock, timeout, [this] { return state_->open == 0; });
 }

@@ -3,7 +3,8 @@
 //
 // open() hands out a token; the transaction ends when the last copy of the
 // token is released. An orderly shutdown calls waitUntilIdle(), which returns
-// once no transaction is open. Thread-safe.
+// once no transaction is open. Thread-safe; a token may outlive the object
+// that issued it (its count lives in state the token shares).
 #pragma once
 
 #include <chrono>
@@ -21,8 +22,10 @@ class VSATransactions {
   bool waitUntilIdle(std::chrono::milliseconds timeout);
 
  private:
-  void close();
-  mutable std::mutex mutex_;
-  std::condition_variable cv_;
-  int open_ = 0;
+  struct State {
+    std::mutex mutex;
+    std::condition_variable cv;
+    int open = 0;
+  };
+  std::shared_ptr<State> state_ = std::make_shared<State>();
 };

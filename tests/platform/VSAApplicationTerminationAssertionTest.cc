@@ -25,12 +25,12 @@ class Termination : public ::testing::Test {
                                         {"SigningIdentifier", VSAValue("com.example.app")}},
                    root_ + "/etc/vessad/clients.d/app.plist", 0, nullptr);
     VSASystemRoot root(root_);
-    service_ = std::make_unique<VSAApplicationTerminationService>(
+    service_ = std::make_shared<VSAApplicationTerminationService>(
         root, std::make_shared<VSAClientRegistry>(root));
   }
   VSATestTempDir temp_{"vessa-term"};
   std::string root_;
-  std::unique_ptr<VSAApplicationTerminationService> service_;
+  std::shared_ptr<VSAApplicationTerminationService> service_;
 };
 
 TEST_F(Termination, AssertionTerminatesTheAppAndHoldsItUntilInvalidated) {

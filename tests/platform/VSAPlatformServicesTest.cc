@@ -108,12 +108,13 @@ TEST_F(VSAPlatformRoot, UntrustedOrMalformedRegistryEntriesGiveNoIdentity) {
 TEST_F(VSAPlatformRoot, LockStateFileAndNotification) {
   VSALockStateService service{VSASystemRoot(root_)};
   EXPECT_EQ(service.currentLockState(), 0) << "no file means unlocked";
-  std::atomic<int> notified{0};
+  // Notifications queued by the writes below may run after this body returns.
+  auto notified = std::make_shared<std::atomic<int>>(0);
   auto queue = VSAWorkQueue::create("test.lockstate.notify");
-  ASSERT_EQ(service.registerForLockStatus(queue, [&] { ++notified; }), 0);
+  ASSERT_EQ(service.registerForLockStatus(queue, [notified] { ++*notified; }), 0);
   ASSERT_TRUE(service.setLockState(1));
-  for (int i = 0; i < 1000 && notified == 0; ++i) std::this_thread::sleep_for(5ms);
-  EXPECT_GE(notified.load(), 1);
+  for (int i = 0; i < 1000 && *notified == 0; ++i) std::this_thread::sleep_for(5ms);
+  EXPECT_GE(notified->load(), 1);
   EXPECT_EQ(service.currentLockState(), 1);
   std::ofstream(service.stateFilePath()) << "garbage";
   EXPECT_EQ(service.currentLockState(), -1);
