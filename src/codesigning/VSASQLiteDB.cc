@@ -76,22 +76,31 @@ VSAErrorRef dbError(VSAResultCode code, const char* function, const char* format
 }
 }  // namespace
 
-// A prepared statement, finalised on every path.
+// A prepared statement borrowed from the database's cache (or prepared when
+// the cache has none for this SQL) and handed back reset on every path.
 class VSASQLiteDB::Statement {
  public:
-  Statement(VSASQLiteDB& db, const char* sql, const char* kind, VSAErrorRef* error) : db_(db) {
-    if (sqlite3_prepare_v2(db.db_, sql, -1, &stmt_, nullptr) != SQLITE_OK) {
+  Statement(VSASQLiteDB& db, const char* sql, const char* kind, VSAErrorRef* error)
+      : db_(db), sql_(sql) {
+    stmt_ = db.takeCachedStatement(sql);
+    if (stmt_) return;
+    if (sqlite3_prepare_v3(db.db_, sql, -1, SQLITE_PREPARE_PERSISTENT, &stmt_, nullptr) !=
+        SQLITE_OK) {
       VSASetError(error, dbError(VSAResult::kDatabaseFailed, "sqlite3_prepare",
                                  "sqlite3_prepare(%s) for %@ failed: %s", kind, db.url_,
                                  sqlite3_errmsg(db.db_)));
+      sqlite3_finalize(stmt_);
       stmt_ = nullptr;
     }
   }
   ~Statement() {
-    if (stmt_ && sqlite3_finalize(stmt_) != SQLITE_OK)
-      VSALogIn(VSALogCategory::Database, kVSALogError, kOrigin,
-               "sqlite3_finalize for %@ failed: %s", db_.url_, sqlite3_errmsg(db_.db_));
+    if (!stmt_) return;
+    sqlite3_reset(stmt_);
+    sqlite3_clear_bindings(stmt_);
+    db_.returnCachedStatement(sql_, stmt_);
   }
+  Statement(const Statement&) = delete;
+  Statement& operator=(const Statement&) = delete;
   explicit operator bool() const { return stmt_ != nullptr; }
   sqlite3_stmt* get() const { return stmt_; }
   bool bindText(int index, const std::string& text, const char* what, VSAErrorRef* error) {
@@ -120,8 +129,30 @@ class VSASQLiteDB::Statement {
 
  private:
   VSASQLiteDB& db_;
+  const char* sql_;
   sqlite3_stmt* stmt_ = nullptr;
 };
+
+sqlite3_stmt* VSASQLiteDB::takeCachedStatement(const char* sql) {
+  auto it = statements_.find(std::string_view(sql));
+  if (it == statements_.end()) return nullptr;
+  sqlite3_stmt* stmt = it->second;
+  statements_.erase(it);
+  return stmt;
+}
+
+void VSASQLiteDB::returnCachedStatement(const char* sql, sqlite3_stmt* stmt) {
+  // A nested use of the same SQL prepared a second copy; only one is kept.
+  if (!db_ || !statements_.emplace(sql, stmt).second) sqlite3_finalize(stmt);
+}
+
+void VSASQLiteDB::finalizeCachedStatements() {
+  for (auto& [sql, stmt] : statements_)
+    if (sqlite3_finalize(stmt) != SQLITE_OK)
+      VSALogIn(VSALogCategory::Database, kVSALogError, kOrigin,
+               "sqlite3_finalize for %@ failed: %s", url_, sqlite3_errmsg(db_));
+  statements_.clear();
+}
 
 VSASQLiteDB::VSASQLiteDB(const std::string& parentDirectory)
     : url_(VSAPathJoin(parentDirectory, "containers.sqlite3")), db_(openDBWithURL(url_)) {}
@@ -153,6 +184,7 @@ sqlite3* VSASQLiteDB::openDBWithURL(const std::string& path) {
 void VSASQLiteDB::closeDB() {
   if (!db_) return;
   VSALogIn(VSALogCategory::Database, kVSALogDebug, kOrigin, "closing %@", url_);
+  finalizeCachedStatements();
   if (int rc = sqlite3_close(db_))
     VSALogIn(VSALogCategory::Database, kVSALogError, kOrigin, "sqlite3_close for %@ failed: %d",
              url_, rc);

@@ -2,8 +2,9 @@
 //
 // One row per code-signing identifier (flags and data container class), its
 // code-signing info dictionary as a binary property-list blob, and the child
-// (plug-in) identifiers linked to a parent. Every statement is prepared per
-// call and finalised on every path; multi-statement changes run inside
+// (plug-in) identifiers linked to a parent. Each statement is prepared once,
+// kept by its SQL text and reset after every use (the daemon asks for the
+// same few queries on every request); multi-statement changes run inside
 // BEGIN/COMMIT and roll back on failure. The file is opened in exclusive
 // locking mode: a second daemon on the same root cannot use it and stops at
 // start-up instead of corrupting it. Not thread-safe: all calls come from the
@@ -11,6 +12,7 @@
 #pragma once
 
 #include <functional>
+#include <map>
 #include <optional>
 #include <string>
 #include <vector>
@@ -19,6 +21,7 @@
 #include "codesigning/VSACodeSigningEntry.h"
 
 struct sqlite3;
+struct sqlite3_stmt;
 
 class VSASQLiteDB {
  public:
@@ -72,6 +75,11 @@ class VSASQLiteDB {
   bool fillChildren(VSACodeSigningEntry& entry, const std::string& identifier, VSAErrorRef* error);
   bool transaction(const std::function<bool(VSAErrorRef*)>& body, VSAErrorRef* error);
 
+  sqlite3_stmt* takeCachedStatement(const char* sql);
+  void returnCachedStatement(const char* sql, sqlite3_stmt* stmt);
+  void finalizeCachedStatements();
+
   std::string url_;
   sqlite3* db_ = nullptr;
+  std::map<std::string, sqlite3_stmt*, std::less<>> statements_;  // by SQL text
 };

@@ -1,11 +1,12 @@
 #include "platform/VSAAuditToken.h"
 
+#include <fcntl.h>
 #include <sys/socket.h>
+#include <unistd.h>
 
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
-#include <fstream>
-#include <sstream>
 
 #include "base/VSAFormat.h"
 
@@ -25,17 +26,23 @@ uint64_t VSAAuditToken::processStartTime(pid_t pid) {
   if (pid <= 0) return 0;
   char path[64];
   std::snprintf(path, sizeof path, "/proc/%d/stat", pid);
-  std::ifstream in(path);
-  std::string line;
-  if (!std::getline(in, line)) return 0;
+  int fd = ::open(path, O_RDONLY | O_CLOEXEC);
+  if (fd < 0) return 0;
+  char buf[1024];
+  ssize_t n = ::read(fd, buf, sizeof buf - 1);
+  ::close(fd);
+  if (n <= 0) return 0;
+  buf[n] = '\0';
   // The command name may hold spaces and parentheses: fields start after the last ')'.
-  size_t close = line.rfind(')');
-  if (close == std::string::npos) return 0;
-  std::istringstream rest(line.substr(close + 1));
-  std::string field;
+  const char* p = std::strrchr(buf, ')');
+  if (!p) return 0;
+  ++p;
   // Field 3 (state) is the first after ')'; start time is field 22.
-  for (int i = 3; i <= 22 && (rest >> field); ++i) {
-    if (i == 22) return std::strtoull(field.c_str(), nullptr, 10);
+  for (int field = 3; field <= 22; ++field) {
+    while (*p == ' ') ++p;
+    if (!*p) return 0;
+    if (field == 22) return std::strtoull(p, nullptr, 10);
+    while (*p && *p != ' ') ++p;
   }
   return 0;
 }

@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <climits>
+#include <cstdio>
 #include <cstdlib>
 
 #include "base/VSALog.h"
@@ -93,7 +94,14 @@ std::optional<VSAClientRegistryEntry> VSAClientRegistry::entryForExecutable(
 
 std::optional<VSAClientRegistryEntry> VSAClientRegistry::entryForAuditToken(
     const VSAAuditToken& token) {
-  std::string exe = canonical("/proc/" + std::to_string(token.pid) + "/exe");
+  // The kernel answers this link with the executable's resolved absolute path
+  // (one system call, where realpath would walk every component again). A
+  // deleted executable reads as "<path> (deleted)" and matches no entry.
+  char path[64];
+  std::snprintf(path, sizeof path, "/proc/%d/exe", token.pid);
+  char buf[PATH_MAX];
+  ssize_t n = readlink(path, buf, sizeof buf);
+  std::string exe = n > 0 && n < static_cast<ssize_t>(sizeof buf) ? std::string(buf, n) : "";
   // Check after resolving the path, so the path surely belongs to this process.
   if (exe.empty() || !token.isCurrent()) return std::nullopt;
   return entryForExecutable(exe);

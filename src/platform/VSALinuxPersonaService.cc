@@ -1,8 +1,8 @@
 #include "platform/VSALinuxPersonaService.h"
 
+#include <fcntl.h>
 #include <sys/stat.h>
-
-#include <fstream>
+#include <unistd.h>
 
 #include "base/VSALog.h"
 #include "base/VSAPlist.h"
@@ -77,6 +77,24 @@ std::optional<std::pair<pid_t, uint64_t>> VSACurrentPersonaScope::current() {
 VSALinuxPersonaService::VSALinuxPersonaService(VSASystemRoot root) : root_(std::move(root)) {}
 
 std::optional<std::vector<VSAPersonaAttributes>> VSALinuxPersonaService::listPersonas() {
+  struct stat st;
+  if (stat(personasPath().c_str(), &st) != 0) return readPersonas();  // missing or unreadable
+  FileStamp stamp{static_cast<uint64_t>(st.st_dev), static_cast<uint64_t>(st.st_ino),
+                  static_cast<uint64_t>(st.st_size), st.st_mtim.tv_sec, st.st_mtim.tv_nsec};
+  {
+    std::lock_guard lock(cacheMutex_);
+    if (cachedStamp_ == stamp) return cachedPersonas_;
+  }
+  auto personas = readPersonas();
+  if (personas) {
+    std::lock_guard lock(cacheMutex_);
+    cachedStamp_ = stamp;
+    cachedPersonas_ = *personas;
+  }
+  return personas;
+}
+
+std::optional<std::vector<VSAPersonaAttributes>> VSALinuxPersonaService::readPersonas() {
   VSAErrorRef error;
   auto bytes = VSAReadFile(personasPath(), &error);
   if (!bytes) {
@@ -108,12 +126,20 @@ std::string VSALinuxPersonaService::processRecordPath(pid_t pid) const {
 std::optional<uint32_t> VSALinuxPersonaService::recordedPersonaID(pid_t pid,
                                                                   uint64_t startTime) const {
   std::string path = processRecordPath(pid);
+  // Checked on the open file, so the record read is the one that was checked.
+  int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
+  if (fd < 0) return std::nullopt;
   struct stat st;
-  if (lstat(path.c_str(), &st) != 0 || !S_ISREG(st.st_mode) || st.st_uid != 0) return std::nullopt;
-  std::ifstream in(path);
-  uint64_t recordedStart = 0;
-  uint64_t persona = 0;
-  if (!(in >> recordedStart >> persona) || recordedStart != startTime || persona > UINT32_MAX)
+  char buf[64];
+  ssize_t n = fstat(fd, &st) == 0 && S_ISREG(st.st_mode) && st.st_uid == 0
+                  ? ::read(fd, buf, sizeof buf - 1)
+                  : -1;
+  ::close(fd);
+  if (n <= 0) return std::nullopt;
+  buf[n] = '\0';
+  unsigned long long recordedStart = 0, persona = 0;
+  if (std::sscanf(buf, "%llu %llu", &recordedStart, &persona) != 2 || recordedStart != startTime ||
+      persona > UINT32_MAX)
     return std::nullopt;
   return static_cast<uint32_t>(persona);
 }

@@ -12,7 +12,9 @@
 // The launcher records each process it starts in a persona as
 // `<root>/run/vessad/process-personas/<pid>`: "<start time> <persona id>".
 // A process without a (current, root-owned) record runs in the personal
-// persona. Changes of personas.plist are watched with inotify. Thread-safe.
+// persona. Changes of personas.plist are watched with inotify. The parsed
+// list is kept while the file's identity (device, inode, size, modification
+// time) stays the same, so a request costs one stat, not a parse. Thread-safe.
 #pragma once
 
 #include <memory>
@@ -41,7 +43,17 @@ class VSALinuxPersonaService : public VSAPersonaService {
   std::optional<uint32_t> recordedPersonaID(pid_t pid, uint64_t startTime) const;
 
  private:
+  struct FileStamp {
+    uint64_t device = 0, inode = 0, size = 0;
+    int64_t seconds = 0, nanoseconds = 0;
+    bool operator==(const FileStamp&) const = default;
+  };
+  std::optional<std::vector<VSAPersonaAttributes>> readPersonas();
+
   VSASystemRoot root_;
+  std::mutex cacheMutex_;
+  std::optional<FileStamp> cachedStamp_;
+  std::vector<VSAPersonaAttributes> cachedPersonas_;
   std::mutex watcherMutex_;
   std::unique_ptr<VSAInotifyWatcher> watcher_;
 };
