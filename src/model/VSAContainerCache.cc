@@ -97,46 +97,38 @@ VSAContainerCache::ClassMap* VSAContainerCache::_lock_getCache(const VSAUserIden
 }
 
 VSAMetadataRef VSAContainerCache::_lock_metadataFromSandbox(const VSAContainerIdentity& identity) {
-  VSAMetadataRef found;
   const auto& user = identity.userIdentity();
   VSASignpostInterval interval(VSALogCategory::Cache, "ReadFromSandbox");
-  int rc =
-      deps_.sandbox->iterateUserStateItems(identity.posixUID(), [&](const VSASandboxItem& item) {
-        if (item.identifier.empty() || item.path.empty()) {
-          VSALogIn(VSALogCategory::Cache, kVSALogError, kOrigin,
-                   "Sandbox item of type %llu has no identifier or path", item.itemType);
-          return true;
-        }
-        if (item.identifier != identity.identifier() ||
-            item.containerClass != identity.containerClass())
-          return true;
-        VSAErrorRef error;
-        auto m = VSAMetadata::readAndValidateMetadataAtUrl(
-            item.path, user, true, *deps_.configuration, *deps_.userIdentityCache, &error);
-        if (!m) {
-          VSALogIn(VSALogCategory::Cache, kVSALogError, kOrigin,
-                   "Could not validate container from Sandbox-provided path [%@]; error = %@",
-                   item.path, error);
-        } else if (m->containerClass() != identity.containerClass() ||
-                   m->identifier() != identity.identifier()) {
-          VSALogIn(
-              VSALogCategory::Cache, kVSALogError, kOrigin,
-              "Attempted to fetch container from Sandbox-provided path [%@] that was not what was "
-              "expected; expected class: %llu, expected identifier: [%@], actual class: %llu, "
-              "actual identifier: [%@]",
-              item.path, identity.containerClass(), identity.identifier(), m->containerClass(),
-              m->identifier());
-        } else {
-          VSALogIn(VSALogCategory::Cache, kVSALogDebug, kOrigin,
-                   "Took %@ from the sandbox's container table", m->identifier());
-          found = std::move(m);
-        }
-        return false;
-      });
-  if (rc != 0)
+  auto item = deps_.sandbox->userStateItem(identity.posixUID(), identity.identifier(),
+                                           identity.containerClass());
+  if (!item) return nullptr;
+  if (item->path.empty()) {
     VSALogIn(VSALogCategory::Cache, kVSALogError, kOrigin,
-             "Failed to read back sandbox cache; result = %d", rc);
-  return found;
+             "Sandbox item of type %llu has no identifier or path", item->itemType);
+    return nullptr;
+  }
+  VSAErrorRef error;
+  auto m = VSAMetadata::readAndValidateMetadataAtUrl(item->path, user, true, *deps_.configuration,
+                                                     *deps_.userIdentityCache, &error);
+  if (!m) {
+    VSALogIn(VSALogCategory::Cache, kVSALogError, kOrigin,
+             "Could not validate container from Sandbox-provided path [%@]; error = %@", item->path,
+             error);
+    return nullptr;
+  }
+  if (m->containerClass() != identity.containerClass() ||
+      m->identifier() != identity.identifier()) {
+    VSALogIn(VSALogCategory::Cache, kVSALogError, kOrigin,
+             "Attempted to fetch container from Sandbox-provided path [%@] that was not what was "
+             "expected; expected class: %llu, expected identifier: [%@], actual class: %llu, "
+             "actual identifier: [%@]",
+             item->path, identity.containerClass(), identity.identifier(), m->containerClass(),
+             m->identifier());
+    return nullptr;
+  }
+  VSALogIn(VSALogCategory::Cache, kVSALogDebug, kOrigin,
+           "Took %@ from the sandbox's container table", m->identifier());
+  return m;
 }
 
 bool VSAContainerCache::checkFound(const VSAMetadataRef& m, const std::string& key, bool transient,

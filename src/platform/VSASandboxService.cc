@@ -4,8 +4,11 @@
 #include <openssl/crypto.h>
 #include <openssl/hmac.h>
 #include <openssl/rand.h>
+#include <pthread.h>
 #include <sys/stat.h>
 #include <unistd.h>
+
+#include <algorithm>
 
 #include "base/VSALog.h"
 #include "base/VSAPlist.h"
@@ -51,16 +54,27 @@ std::optional<uint64_t> VSASandboxItemTypeForClass(uint64_t c) {
   }
 }
 
-VSASandboxService::VSASandboxService(VSASystemRoot root) : root_(std::move(root)) {}
+VSASandboxService::VSASandboxService(VSASystemRoot root)
+    : root_(std::move(root)), writer_([this] { writerLoop(); }) {}
+
+VSASandboxService::~VSASandboxService() {
+  {
+    std::lock_guard lock(mutex_);
+    stopping_ = true;
+  }
+  changed_.notify_all();
+  writer_.join();
+  writePending();
+}
 
 std::string VSASandboxService::tablePath(uid_t uid) const {
   return root_.resolve("/run/vessad/sandbox/" + std::to_string(uid) + ".plist");
 }
 
-const std::vector<VSASandboxItem>& VSASandboxService::load(uid_t uid) {
+const VSASandboxService::Table& VSASandboxService::load(uid_t uid) {
   auto it = tables_.find(uid);
   if (it != tables_.end()) return it->second;
-  std::vector<VSASandboxItem> items;
+  Table items;
   VSAErrorRef error;
   if (auto dict = VSA_dictionaryWithContentsOfURL(tablePath(uid), 0, &error)) {
     const VSAValue* list = dict->get("Items");
@@ -68,18 +82,20 @@ const std::vector<VSASandboxItem>& VSASandboxService::load(uid_t uid) {
       const VSAValue *type = v.get("ItemType"), *id = v.get("Identifier"), *cls = v.get("Class"),
                      *persona = v.get("PersonaID"), *path = v.get("Path");
       if (!type || !id || !id->isString() || !cls || !path || !path->isString()) continue;
-      items.push_back({type->uint64Value().value_or(0), *id->stringValue(),
-                       cls->uint64Value().value_or(0),
-                       static_cast<int32_t>(persona ? persona->int64Value().value_or(0) : 0),
-                       *path->stringValue()});
+      VSASandboxItem item{type->uint64Value().value_or(0), *id->stringValue(),
+                          cls->uint64Value().value_or(0),
+                          static_cast<int32_t>(persona ? persona->int64Value().value_or(0) : 0),
+                          *path->stringValue()};
+      items[{item.identifier, item.containerClass}] = std::move(item);
     }
   }
   return tables_[uid] = std::move(items);
 }
 
-int VSASandboxService::write(uid_t uid, const std::vector<VSASandboxItem>& items) {
+int VSASandboxService::write(uid_t uid, const Table& items) {
   VSAValue::Array list;
-  for (const auto& i : items)
+  list.reserve(items.size());
+  for (const auto& [key, i] : items)
     list.push_back(VSAValue::Dictionary{{"ItemType", VSAValue(i.itemType)},
                                         {"Identifier", VSAValue(i.identifier)},
                                         {"Class", VSAValue(i.containerClass)},
@@ -98,42 +114,53 @@ int VSASandboxService::write(uid_t uid, const std::vector<VSASandboxItem>& items
   return 0;
 }
 
-void VSASandboxService::_lock_scheduleWrite(uid_t uid) {
-  dirty_.insert(uid);
-  if (writeScheduled_) return;
-  writeScheduled_ = true;
-  writeQueue_->async([this] { writePending(); });
+void VSASandboxService::writerLoop() {
+  pthread_setname_np(pthread_self(), "vessa-sandbox");
+  std::unique_lock lock(mutex_);
+  for (;;) {
+    changed_.wait(lock, [this] { return stopping_ || !dirty_.empty(); });
+    if (stopping_) return;  // the destructor writes what is left
+    changed_.wait_for(lock, gatherInterval_, [this] { return stopping_; });
+    if (stopping_) return;
+    lock.unlock();
+    auto took = writePending();
+    lock.lock();
+    gatherInterval_ = std::clamp<std::chrono::steady_clock::duration>(
+        took * 10, std::chrono::milliseconds(100), std::chrono::seconds(2));
+  }
 }
 
-void VSASandboxService::writePending() {
-  std::map<uid_t, std::vector<VSASandboxItem>> pending;
+std::chrono::steady_clock::duration VSASandboxService::writePending() {
+  std::lock_guard writing(writeMutex_);
+  auto start = std::chrono::steady_clock::now();
+  std::map<uid_t, Table> pending;
   {
     std::lock_guard lock(mutex_);
     for (uid_t uid : dirty_) pending[uid] = tables_[uid];
     dirty_.clear();
-    writeScheduled_ = false;
   }
   for (const auto& [uid, items] : pending) write(uid, items);
+  return std::chrono::steady_clock::now() - start;
 }
 
-void VSASandboxService::flush() {
-  writeQueue_->sync([this] { writePending(); });
-}
-
-VSASandboxService::~VSASandboxService() { flush(); }
+void VSASandboxService::flush() { writePending(); }
 
 int VSASandboxService::setUserStateItem(uid_t uid, uint64_t itemType, const std::string& identifier,
                                         uint64_t containerClass, int32_t personaID,
                                         const std::optional<std::string>& path) {
   if (identifier.empty()) return EINVAL;
-  std::lock_guard lock(mutex_);
-  load(uid);
-  auto& items = tables_[uid];
-  std::erase_if(items, [&](const VSASandboxItem& i) {
-    return i.identifier == identifier && i.containerClass == containerClass;
-  });
-  if (path) items.push_back({itemType, identifier, containerClass, personaID, *path});
-  _lock_scheduleWrite(uid);
+  {
+    std::lock_guard lock(mutex_);
+    load(uid);
+    auto& items = tables_[uid];
+    if (path)
+      items[{identifier, containerClass}] = {itemType, identifier, containerClass, personaID,
+                                             *path};
+    else
+      items.erase({identifier, containerClass});
+    dirty_.insert(uid);
+  }
+  changed_.notify_one();
   return 0;
 }
 
@@ -142,11 +169,21 @@ int VSASandboxService::iterateUserStateItems(
   std::vector<VSASandboxItem> items;
   {
     std::lock_guard lock(mutex_);
-    items = load(uid);
+    for (const auto& [key, item] : load(uid)) items.push_back(item);
   }
   for (const auto& i : items)
     if (!block(i)) break;
   return 0;
+}
+
+std::optional<VSASandboxItem> VSASandboxService::userStateItem(uid_t uid,
+                                                               const std::string& identifier,
+                                                               uint64_t containerClass) {
+  std::lock_guard lock(mutex_);
+  const Table& items = load(uid);
+  auto it = items.find({identifier, containerClass});
+  if (it == items.end()) return std::nullopt;
+  return it->second;
 }
 
 bool VSASandboxService::key(std::string* out) {

@@ -6,10 +6,12 @@
 // `<root>/run/vessad/sandbox/<uid>.plist` so that it outlives a daemon
 // restart as the kernel's table would. Only classes with an item type
 // (VSASandboxItemTypeForClass) may be stored. Changes apply to the table in
-// memory at once; the files are rewritten on the service's own serial queue,
-// several changes coalescing into one write (so a burst of creations costs
-// one rewrite, not one per container). Destroying the service, or flush(),
-// writes what is pending.
+// memory at once (indexed by identifier and class); the files are rewritten
+// by the service's writer thread, which gathers changes for a while before
+// each rewrite: at least 100 ms, and ten times as long as the last rewrite
+// took (at most 2 s), so that rewriting a large table never costs more than
+// a tenth of the daemon's time however fast containers come and go.
+// Destroying the service, or flush(), writes what is pending.
 //
 // Extension tokens: HMAC-SHA256 over (extension class, path, audit token)
 // with a per-boot key kept in `<root>/run/vessad/sandbox-token.key` (0600).
@@ -18,15 +20,18 @@
 // Thread-safe.
 #pragma once
 
+#include <chrono>
+#include <condition_variable>
 #include <functional>
 #include <map>
 #include <mutex>
 #include <optional>
 #include <set>
 #include <string>
+#include <thread>
+#include <utility>
 #include <vector>
 
-#include "base/VSAWorkQueue.h"
 #include "platform/VSAAuditToken.h"
 #include "platform/VSASystemRoot.h"
 
@@ -56,6 +61,9 @@ class VSASandboxService {
                        const std::optional<std::string>& path);
   // Calls `block` for each item of `uid` until it answers false; 0 or an errno.
   int iterateUserStateItems(uid_t uid, const std::function<bool(const VSASandboxItem&)>& block);
+  // The item of `uid` for `identifier` and `containerClass`, if there is one.
+  std::optional<VSASandboxItem> userStateItem(uid_t uid, const std::string& identifier,
+                                              uint64_t containerClass);
 
   // Issues a token granting `auditToken`'s process access to `path`.
   std::optional<std::string> issueFileExtension(const std::string& extensionClass,
@@ -65,21 +73,27 @@ class VSASandboxService {
                            const std::string& path, const VSAAuditToken& auditToken);
 
  private:
+  using Table = std::map<std::pair<std::string, uint64_t>, VSASandboxItem>;
+
   std::string tablePath(uid_t uid) const;
-  const std::vector<VSASandboxItem>& load(uid_t uid);  // caller holds mutex_
-  // Marks `uid`'s table changed and schedules a write (caller holds mutex_).
-  void _lock_scheduleWrite(uid_t uid);
-  void writePending();
-  int write(uid_t uid, const std::vector<VSASandboxItem>& items);
+  const Table& load(uid_t uid);  // caller holds mutex_
+  void writerLoop();
+  // Writes the changed tables; answers how long that took.
+  std::chrono::steady_clock::duration writePending();
+  int write(uid_t uid, const Table& items);
   bool key(std::string* out);
   std::string mac(const std::string& extensionClass, const std::string& path,
                   const VSAAuditToken& auditToken, const std::string& key) const;
 
   VSASystemRoot root_;
   std::mutex mutex_;
-  std::map<uid_t, std::vector<VSASandboxItem>> tables_;
+  std::map<uid_t, Table> tables_;
   std::set<uid_t> dirty_;
-  bool writeScheduled_ = false;
-  VSAWorkQueue::Ref writeQueue_ = VSAWorkQueue::create("com.tamsk.vessad.sandbox-table");
+  std::condition_variable changed_;
+  bool stopping_ = false;
+  std::chrono::steady_clock::duration gatherInterval_ = std::chrono::milliseconds(100);
+  // Held while a snapshot is taken and written, so files never go back in time.
+  std::mutex writeMutex_;
+  std::thread writer_;
   std::string key_;
 };

@@ -1,7 +1,9 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
+#include <chrono>
 #include <filesystem>
+#include <thread>
 
 #include "VSATestTempDir.h"
 #include "platform/VSASandboxService.h"
@@ -28,7 +30,10 @@ TEST(VSASandboxService, ContainerTableOutlivesTheService) {
     return true;
   });
   ASSERT_EQ(items.size(), 2u);
-  EXPECT_EQ(items[1].path, "/c/B");
+  ASSERT_TRUE(reopened.userStateItem(501, "com.app", 2));
+  EXPECT_EQ(reopened.userStateItem(501, "com.app", 2)->path, "/c/B");
+  EXPECT_EQ(reopened.userStateItem(501, "group.g", 7)->path, "/c/G");
+  EXPECT_FALSE(reopened.userStateItem(501, "com.app", 7)) << "the class is part of the key";
   ASSERT_EQ(reopened.setUserStateItem(501, 1, "com.app", 2, 1000, std::nullopt), 0) << "removal";
   int count = 0;
   reopened.iterateUserStateItems(501, [&](const VSASandboxItem&) { return ++count, true; });
@@ -36,6 +41,31 @@ TEST(VSASandboxService, ContainerTableOutlivesTheService) {
   reopened.iterateUserStateItems(502, [&](const VSASandboxItem&) { return ADD_FAILURE(), true; });
   EXPECT_FALSE(VSASandboxItemTypeForClass(1)) << "bundle containers are not sandbox items";
   EXPECT_EQ(*VSASandboxItemTypeForClass(13), 9u);
+}
+
+// The writer thread persists changes on its own, without a flush or the
+// service going away, and a burst of changes ends in one consistent file.
+TEST(VSASandboxService, WriterThreadPersistsBurstsWithoutAFlush) {
+  VSATestTempDir temp("vessa-sandbox");
+  VSASandboxService sandbox{VSASystemRoot(temp.path())};
+  for (int i = 0; i < 500; ++i)
+    ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app" + std::to_string(i), 2, 1000,
+                                       "/c/" + std::to_string(i)),
+              0);
+  for (int i = 0; i < 250; ++i)
+    ASSERT_EQ(
+        sandbox.setUserStateItem(501, 1, "com.app" + std::to_string(i), 2, 1000, std::nullopt), 0);
+  auto countOnDisk = [&] {
+    // A second service reads the file afresh (and writes nothing).
+    VSASandboxService reader{VSASystemRoot(temp.path())};
+    int n = 0;
+    reader.iterateUserStateItems(501, [&](const VSASandboxItem&) { return ++n, true; });
+    return n;
+  };
+  int onDisk = 0;
+  for (int i = 0; i < 300 && (onDisk = countOnDisk()) != 250; ++i)
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  EXPECT_EQ(onDisk, 250);
 }
 
 TEST(VSASandboxService, TokensVerifyOnlyForTheirClassPathAndProcess) {
