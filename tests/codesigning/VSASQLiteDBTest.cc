@@ -170,3 +170,33 @@ TEST_F(CodeSigningDB, CorruptFileStopsAtOpen) {
 }
 
 }  // namespace
+
+// Statements are kept between calls: one used again while it is still
+// stepping (a block that re-enters the database) gets its own copy, and a
+// read abandoned mid-way or a failed write leaves nothing bound or pending.
+TEST_F(CodeSigningDB, KeptStatementsSurviveReentryAndFailures) {
+  ASSERT_TRUE(add(entry("A", {"com.p.c"}), "com.p"));
+  ASSERT_TRUE(add(entry("B"), "com.q"));
+  int outer = 0, inner = 0;
+  EXPECT_FALSE(db_->enumerateIdentifiersAndCodeSigningInfoUsingBlock(
+      [&](const std::string&, const VSACodeSigningEntry&) {
+        ++outer;
+        EXPECT_FALSE(db_->enumerateIdentifiersAndCodeSigningInfoUsingBlock(
+            [&](const std::string&, const VSACodeSigningEntry&) { ++inner; }));
+      }));
+  EXPECT_EQ(outer, 2);
+  EXPECT_EQ(inner, 4);
+  VSAErrorRef error;
+  std::string unknown = "com.unknown";
+  EXPECT_FALSE(db_->deleteCodeSigningEntryWithIdentifier(&unknown, &error));
+  std::string known = "com.q";
+  EXPECT_TRUE(db_->deleteCodeSigningEntryWithIdentifier(&known, &error))
+      << "the same statement, bound afresh after a failure";
+  EXPECT_FALSE(db_->codeSigningEntryWithIdentifier("com.q", &error));
+  for (int i = 0; i < 100; ++i)
+    ASSERT_EQ(*db_->parentIdentifierForChildIdentifier("com.p.c", &error), "com.p");
+  ASSERT_TRUE(add(entry("C"), "com.r")) << "writes after many abandoned single-row reads";
+  db_.reset();
+  db_ = std::make_unique<VSASQLiteDB>(dir_);
+  EXPECT_TRUE(db_->codeSigningEntryWithIdentifier("com.r", &error)) << "closed cleanly, reopened";
+}

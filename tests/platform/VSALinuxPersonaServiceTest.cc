@@ -86,6 +86,45 @@ TEST_F(PersonaFiles, CurrentPersonaComesFromTheServedProcessRecord) {
   EXPECT_FALSE(VSACurrentPersonaScope::current());
 }
 
+// The parsed list is kept between calls; every way of changing the file
+// (atomic replacement with a same-sized text, removal) is seen at once.
+TEST_F(PersonaFiles, KeptListFollowsEveryChangeOfTheFile) {
+  VSALinuxPersonaService service{VSASystemRoot(root_)};
+  write(VSAValue::Array{record(1, "personal", VSAValue("P")),
+                        record(2, "enterprise", VSAValue("E"))});
+  ASSERT_EQ(service.listPersonas()->at(1).personaID, 2u);
+  ASSERT_EQ(service.listPersonas()->at(1).personaID, 2u) << "answered from the kept list";
+  write(VSAValue::Array{record(1, "personal", VSAValue("P")),
+                        record(3, "enterprise", VSAValue("E"))});
+  EXPECT_EQ(service.listPersonas()->at(1).personaID, 3u);
+  std::filesystem::remove(root_ + "/etc/vessad/personas.plist");
+  ASSERT_EQ(service.listPersonas()->size(), 1u) << "back to the default personal persona";
+  EXPECT_EQ(*service.listPersonas()->front().uniqueString, kVSADefaultPersonalPersonaString);
+}
+
+// A process record counts only as a regular file owned by root: a link or
+// another user's file could be planted to move a process into a persona.
+TEST_F(PersonaFiles, ProcessRecordMustBeARootOwnedRegularFile) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to own the record";
+  write(VSAValue::Array{record(1, "personal", VSAValue("P")),
+                        record(2, "enterprise", VSAValue("E"))});
+  VSALinuxPersonaService service{VSASystemRoot(root_)};
+  uint64_t start = VSAAuditToken::processStartTime(getpid());
+  std::string record = service.processRecordPath(getpid());
+  std::string planted = root_ + "/planted";
+  std::ofstream(planted) << start << " 2\n";
+  std::filesystem::create_symlink(planted, record);
+  EXPECT_FALSE(service.recordedPersonaID(getpid(), start)) << "a symbolic link";
+  std::filesystem::remove(record);
+  std::ofstream(record) << start << " 2\n";
+  ASSERT_EQ(chown(record.c_str(), 501, 501), 0);
+  EXPECT_FALSE(service.recordedPersonaID(getpid(), start)) << "not owned by root";
+  ASSERT_EQ(chown(record.c_str(), 0, 0), 0);
+  EXPECT_EQ(service.recordedPersonaID(getpid(), start), 2u);
+  std::ofstream(record) << "garbage";
+  EXPECT_FALSE(service.recordedPersonaID(getpid(), start));
+}
+
 TEST_F(PersonaFiles, ObserverHearsFileChanges) {
   VSALinuxPersonaService service{VSASystemRoot(root_)};
   std::atomic<int> changes{0};
