@@ -146,19 +146,10 @@ bool VSAFileManager::createDirectoryAtURL(const std::string& path, bool intermed
                                           VSAErrorRef* error) {
   const char* fn = "createDirectoryAtURL";
   if (intermediates) {
-    auto parts = components(path);
-    std::string partial;
-    for (size_t i = 0; i < parts.size(); ++i) {
-      partial = i == 0 ? parts[0] : VSAPathJoin(partial, parts[i]);
-      if (partial == "/") continue;
-      int rc = fs_->mkdir(partial, mode);
-      struct stat st;
-      if (rc == EEXIST && fs_->lstat(partial, &st) == 0 && !S_ISDIR(st.st_mode)) rc = ENOTDIR;
-      if (rc != 0 && rc != EEXIST) {
-        VSASetError(error, VSAFileManagerFail(rc, fn, "mkpath_np of %s failed: %s", path,
-                                              std::strerror(rc)));
-        return false;
-      }
+    if (int rc = makePath(path, mode)) {
+      VSASetError(
+          error, VSAFileManagerFail(rc, fn, "mkpath_np of %s failed: %s", path, std::strerror(rc)));
+      return false;
     }
   } else if (int rc = fs_->mkdir(path, mode); rc != 0 && rc != EEXIST) {
     VSASetError(error,
@@ -181,6 +172,27 @@ bool VSAFileManager::createDirectoryAtURL(const std::string& path, bool intermed
     }
   }
   return true;
+}
+
+// Tries the directory itself first and climbs only while parents are
+// missing: a directory whose parent exists (the usual case) costs one mkdir,
+// an existing one a mkdir and an lstat, however deep the path. A non-directory
+// (a symbolic link included) in the way is ENOTDIR.
+int VSAFileManager::makePath(const std::string& path, mode_t mode, int depth) {
+  if (path.empty() || path == "/" || depth > 256) return path.empty() ? ENOENT : 0;
+  int rc = fs_->mkdir(path, mode);
+  if (rc == ENOENT) {
+    std::string parent = VSADirectoryName(path);
+    if (parent == path) return rc;
+    if (int prc = makePath(parent, mode, depth + 1)) return prc;
+    rc = fs_->mkdir(path, mode);
+  }
+  if (rc == EEXIST) {
+    struct stat st;
+    if (int src = fs_->lstat(path, &st)) return src;
+    return S_ISDIR(st.st_mode) ? 0 : ENOTDIR;
+  }
+  return rc;
 }
 
 bool VSAFileManager::moveItemAtURL(const std::string& from, const std::string& to, VSAErrorRef* e) {

@@ -101,6 +101,8 @@ class VSAFileManager {
             std::string* failure, int* failureErrno);
   std::optional<std::string> realPathAllowingMissing(const std::string& path);
   std::optional<gid_t> systemUsersGroup(VSAErrorRef* error);
+  // mkdir -p from the bottom up: 0 or an errno.
+  int makePath(const std::string& path, mode_t mode, int depth = 0);
 
   std::shared_ptr<VSAFileSystem> fs_;
   std::shared_ptr<const VSAUserDatabase> userDatabase_;

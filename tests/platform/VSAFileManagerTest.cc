@@ -103,6 +103,37 @@ TEST_F(FileManager, CreatingAnExistingDirectoryStillAppliesOwnerAndClass) {
   file(base_ + "/plainfile");
   EXPECT_FALSE(fm_->createDirectoryAtURL(base_ + "/plainfile/d", true, 0755, 0,
                                          kVSANoProtectionClass, &error));
+  EXPECT_FALSE(fm_->createDirectoryAtURL(base_ + "/plainfile", true, 0755, 0, kVSANoProtectionClass,
+                                         &error));
+  EXPECT_EQ(error->underlyingError() ? error->underlyingError()->code() : error->code(), ENOTDIR);
+  ASSERT_EQ(symlink((base_ + "/x").c_str(), (base_ + "/link").c_str()), 0);
+  EXPECT_FALSE(
+      fm_->createDirectoryAtURL(base_ + "/link", true, 0755, 0, kVSANoProtectionClass, &error))
+      << "a link to a directory is not a directory";
+}
+
+// A directory is made from the bottom up: the cost does not grow with the
+// depth of the path when the parents exist.
+TEST_F(FileManager, IntermediateDirectoriesAreMadeOnlyWhereMissing) {
+  VSAErrorRef error;
+  std::string deep = base_ + "/a/b/c/d/e/f/g";
+  faults_->reset();
+  ASSERT_TRUE(fm_->createDirectoryAtURL(deep, true, 0755, 0, kVSANoProtectionClass, &error));
+  EXPECT_TRUE(std::filesystem::is_directory(deep));
+  EXPECT_LE(faults_->callCount(VSAFileSystem::Op::Mkdir), 15) << "climbs only as far as needed";
+  faults_->reset();
+  ASSERT_TRUE(fm_->createDirectoryAtURL(deep + "/h", true, 0755, 0, kVSANoProtectionClass, &error));
+  EXPECT_EQ(faults_->callCount(VSAFileSystem::Op::Mkdir), 1);
+  faults_->reset();
+  ASSERT_TRUE(fm_->createDirectoryAtURL(deep, true, 0755, 0, kVSANoProtectionClass, &error));
+  EXPECT_EQ(faults_->callCount(VSAFileSystem::Op::Mkdir), 1);
+  EXPECT_EQ(faults_->callCount(VSAFileSystem::Op::Lstat), 1);
+  faults_->reset();
+  faults_->failNth(VSAFileSystem::Op::Mkdir, 2, EACCES);
+  EXPECT_FALSE(
+      fm_->createDirectoryAtURL(base_ + "/p/q", true, 0755, 0, kVSANoProtectionClass, &error))
+      << "a parent that cannot be made fails the whole path";
+  EXPECT_FALSE(std::filesystem::exists(base_ + "/p"));
 }
 
 TEST_F(FileManager, ProtectionClassRefusesChangesWhileLocked) {
