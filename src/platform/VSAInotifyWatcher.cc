@@ -22,6 +22,8 @@ VSAInotifyWatcher::~VSAInotifyWatcher() {
   }
   if (inotifyFd_ >= 0) ::close(inotifyFd_);
   if (stopFd_ >= 0) ::close(stopFd_);
+  std::lock_guard lock(gate_->mutex);
+  gate_->open = false;
 }
 
 bool VSAInotifyWatcher::start(VSAErrorRef* error) {
@@ -58,8 +60,10 @@ void VSAInotifyWatcher::run() {
       p += sizeof(struct inotify_event) + ev->len;
     }
     for (const std::string& name : changed) {
-      Handler h = handler_;
-      queue_->async([h, name] { h(name); });
+      queue_->async([gate = gate_, h = handler_, name] {
+        std::lock_guard lock(gate->mutex);
+        if (gate->open) h(name);
+      });
     }
   }
 }

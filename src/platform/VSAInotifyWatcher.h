@@ -3,11 +3,14 @@
 // A background thread waits on the inotify descriptor; for each change of an
 // entry whose name is in the watched set (created, written and closed,
 // renamed in, deleted) the handler is called on the given work queue. The
-// destructor stops and joins the thread; no handler is submitted after it
-// returns.
+// destructor stops and joins the thread, waits for a handler that is running
+// on another thread, and turns away the ones still queued: no handler runs
+// after it returns. A handler may destroy its own watcher.
 #pragma once
 
 #include <functional>
+#include <memory>
+#include <mutex>
 #include <set>
 #include <string>
 #include <thread>
@@ -31,6 +34,14 @@ class VSAInotifyWatcher {
  private:
   void run();
 
+  // Shared with the queued calls: closed by the destructor. Recursive, so
+  // that a handler can destroy the watcher that called it.
+  struct Gate {
+    std::recursive_mutex mutex;
+    bool open = true;
+  };
+
+  std::shared_ptr<Gate> gate_ = std::make_shared<Gate>();
   std::string directory_;
   std::set<std::string> names_;
   VSAWorkQueue::Ref queue_;
