@@ -15,6 +15,7 @@ VSAInotifyWatcher::VSAInotifyWatcher(std::string directory, std::set<std::string
       handler_(std::move(handler)) {}
 
 VSAInotifyWatcher::~VSAInotifyWatcher() {
+  gate_->open = false;
   if (thread_.joinable()) {
     uint64_t one = 1;
     (void)!::write(stopFd_, &one, sizeof one);
@@ -22,8 +23,7 @@ VSAInotifyWatcher::~VSAInotifyWatcher() {
   }
   if (inotifyFd_ >= 0) ::close(inotifyFd_);
   if (stopFd_ >= 0) ::close(stopFd_);
-  std::lock_guard lock(gate_->mutex);
-  gate_->open = false;
+  std::lock_guard wait(gate_->mutex);  // a handler running elsewhere finishes first
 }
 
 bool VSAInotifyWatcher::start(VSAErrorRef* error) {
@@ -38,6 +38,9 @@ bool VSAInotifyWatcher::start(VSAErrorRef* error) {
     VSASetError(error, VSA_POSIX_ERROR(errno));
     return false;
   }
+  // Under the gate: a handler (which may destroy this watcher) runs only
+  // after the thread is stored, even when a change arrives at once.
+  std::lock_guard lock(gate_->mutex);
   thread_ = std::thread([this] { run(); });
   return true;
 }

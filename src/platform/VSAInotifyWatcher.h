@@ -8,6 +8,7 @@
 // after it returns. A handler may destroy its own watcher.
 #pragma once
 
+#include <atomic>
 #include <functional>
 #include <memory>
 #include <mutex>
@@ -36,9 +37,11 @@ class VSAInotifyWatcher {
 
   // Shared with the queued calls: closed by the destructor. Recursive, so
   // that a handler can destroy the watcher that called it.
+  // `open` is cleared before the mutex is taken, so a queued call that wins
+  // the mutex from the destructor still sees the gate closed.
   struct Gate {
     std::recursive_mutex mutex;
-    bool open = true;
+    std::atomic<bool> open{true};
   };
 
   std::shared_ptr<Gate> gate_ = std::make_shared<Gate>();
