@@ -5,25 +5,15 @@
 #   scripts/demo.sh [DIR]
 set -euo pipefail
 cd "$(dirname "$0")/.."
-repo=$(pwd)
-scripts/setup.sh
-scripts/build.sh >/dev/null
-build=${BUILD_DIR:-build}
-
-root=${1:-$(mktemp -d /tmp/vessa-demo-XXXXXX)}
-mkdir -p "$root"
-root=$(cd "$root" && pwd)
-echo "== Provisioning a demo device in $root"
-scripts/provision-root.sh "$root" "$repo/$build/vessactl"
+source scripts/device.sh
+echo "== Provisioning a demo device"
+device_prepare vessa-demo "${1:-}"
 
 step() { echo; echo "== $*"; }
 ctl() { echo "\$ $*" | sed -e "s|$root|\$ROOT|g" -e "s|$build/||"; "$@" || true; }
 
 step "Starting vessad --root \$ROOT"
-"$build/vessad" --root "$root" --stderr --log-level 7 >"$root/vessad.out" 2>&1 &
-daemon=$!
-trap 'kill $daemon 2>/dev/null || true' EXIT
-for _ in $(seq 100); do [[ -S "$root/run/vessad/com.tamsk.vessad" ]] && break; sleep 0.05; done
+device_start_daemon 7
 installer="$root/usr/bin/demo-installer"
 
 step "An entitled client sends the retired command 27: the table answers 49"
@@ -91,9 +81,7 @@ step "Notifications posted by the daemon"
 "$build/vessactl" --root "$root" notifications
 
 step "Stopping vessad (SIGTERM)"
-kill -TERM $daemon
-wait $daemon && echo "vessad exited with status 0"
-trap - EXIT
+device_stop_daemon && echo "vessad exited with status 0"
 
 step "The daemon's rotating log: $root/private/var/root/Library/Logs/Vessa/vessad.log"
 grep -v '<Debug>' "$root/private/var/root/Library/Logs/Vessa/vessad.log" | tail -n 12

@@ -5,14 +5,8 @@
 #   scripts/vessa-bench.sh [DIR]
 set -euo pipefail
 cd "$(dirname "$0")/.."
-repo=$(pwd)
-scripts/setup.sh
-scripts/build.sh >/dev/null
-build=${BUILD_DIR:-build}
-root=${1:-$(mktemp -d /tmp/vessa-bench-XXXXXX)}
-mkdir -p "$root"
-root=$(cd "$root" && pwd)
-scripts/provision-root.sh "$root" "$repo/$build/vessactl" >/dev/null
+source scripts/device.sh
+device_prepare vessa-bench "${1:-}" >/dev/null
 cp "$build/vessa-bench" "$root/usr/bin/vessa-bench"
 cat > "$root/etc/vessad/clients.d/vessa-bench.plist" <<'PL'
 <?xml version="1.0" encoding="UTF-8"?>
@@ -23,10 +17,7 @@ cat > "$root/etc/vessad/clients.d/vessa-bench.plist" <<'PL'
 </dict></plist>
 PL
 chmod 0644 "$root/etc/vessad/clients.d/vessa-bench.plist"
-"$build/vessad" --root "$root" --stderr --log-level 3 >"$root/vessad.out" 2>&1 &
-daemon=$!
-trap 'kill $daemon 2>/dev/null || true' EXIT
-for _ in $(seq 100); do [[ -S "$root/run/vessad/com.tamsk.vessad" ]] && break; sleep 0.05; done
+device_start_daemon 3
 bench="$root/usr/bin/vessa-bench"
 echo "== Look-up of an existing container, one client"
 "$bench" --root "$root" --mode lookup --clients 1 --requests "${LOOKUPS:-20000}"
@@ -36,6 +27,4 @@ echo "== Creation, one client"
 echo
 echo "== Mixed requests, 16 clients"
 "$bench" --root "$root" --mode mixed --clients 16 --requests "${MIXED:-10000}"
-kill -TERM $daemon
-wait $daemon
-trap - EXIT
+device_stop_daemon
