@@ -61,3 +61,26 @@ std::string VSALastPathComponent(std::string_view path) {
   size_t slash = path.rfind('/');
   return std::string(slash == std::string_view::npos ? path : path.substr(slash + 1));
 }
+
+bool VSAIsSafeFileName(std::string_view name) {
+  if (name.empty() || name.size() > kVSAMaxClientNameLength || name == "." || name == "..")
+    return false;
+  return name.find('/') == std::string_view::npos && name.find('\0') == std::string_view::npos;
+}
+
+std::string VSAClientStringForLog(std::string_view text, size_t limit) {
+  static const char* hex = "0123456789abcdef";
+  std::string out;
+  for (size_t i = 0; i < text.size() && i < limit; ++i) {
+    auto c = static_cast<unsigned char>(text[i]);
+    if (c < 0x20 || c == 0x7f || c == '\\') {
+      out += "\\x";
+      out += hex[c >> 4];
+      out += hex[c & 15];
+    } else {
+      out += static_cast<char>(c);
+    }
+  }
+  if (text.size() > limit) out += "...(" + std::to_string(text.size()) + " bytes)";
+  return out;
+}

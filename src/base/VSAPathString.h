@@ -25,3 +25,15 @@ std::string VSALastPathComponent(std::string_view path);
 
 // The path without its last component ("/a/b/" and "/a/b" give "/a"; "b" gives "").
 std::string VSADirectoryName(std::string_view path);
+
+// The longest name a client may give for anything the daemon turns into a
+// file name (identifiers, group identifiers, persona strings, keys).
+inline constexpr size_t kVSAMaxClientNameLength = 255;
+
+// True when `name` can stand as one file-name component without leaving its
+// directory: not empty, not "." or "..", no '/', no NUL, at most 255 bytes.
+bool VSAIsSafeFileName(std::string_view name);
+
+// A client-supplied string made fit for a log line: control bytes escaped as
+// \xNN and anything past `limit` bytes cut off (with the original length).
+std::string VSAClientStringForLog(std::string_view text, size_t limit = 96);

@@ -1,10 +1,27 @@
 #include "daemon/VSARequestArguments.h"
 
 #include "base/VSALog.h"
+#include "base/VSALogRateLimiter.h"
+#include "base/VSAPathString.h"
 #include "daemon/VSAClientConnection.h"
 
 namespace {
 const char* const kOrigin = "VSARequestArguments";
+}
+
+bool VSARequestArguments::acceptClientName(const std::string& value, const char* key) {
+  if (VSAIsSafeFileName(value)) return true;
+  const auto& client = connection_.clientIdentity();
+  uint64_t suppressed = 0;
+  if (VSALogRateLimiter::refusals().admit(client ? client->posixUID() : 0, &suppressed)) {
+    VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin,
+             "Refusing %s [%@] (%zu bytes) from %@: not a valid name%s", key,
+             VSAClientStringForLog(value), value.size(),
+             client ? client->description() : std::string("(none)"),
+             suppressed ? VSAFormat(" (%llu refusals not logged)", suppressed) : std::string());
+  }
+  fail(VSAResult::kInvalidArgument);
+  return false;
 }
 
 std::optional<VSAContainerClass> VSARequestArguments::containerClass(const char* key) {
@@ -26,6 +43,7 @@ const std::string* VSARequestArguments::identifier(const char* key) {
     fail(VSAResult::kMissingIdentifier);
     return nullptr;
   }
+  if (!acceptClientName(*value->stringValue(), key)) return nullptr;
   return value->stringValue();
 }
 
@@ -44,8 +62,10 @@ VSAUserIdentityRef VSARequestArguments::userIdentity(VSAContainerClass container
   if (!VSAUserIdentity::isUserIdentityRequiredForContainerClass(containerClass) || !persona ||
       context.deviceProperties->isMultiUser())
     return own;
+  if (persona->isString() && !acceptClientName(*persona->stringValue(), personaKey)) return nullptr;
   std::string clientText = client ? client->description() : std::string("(none)");
-  std::string personaText = persona->isString() ? *persona->stringValue() : persona->description();
+  std::string personaText =
+      VSAClientStringForLog(persona->isString() ? *persona->stringValue() : persona->description());
   VSAUserIdentityRef named = persona->isString()
                                  ? context.userIdentityCache->userIdentityForPersonaUniqueString(
                                        *persona->stringValue(), own->posixUID(), own->posixGID())

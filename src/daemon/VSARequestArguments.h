@@ -40,6 +40,9 @@ class VSARequestArguments {
   VSAConcreteContainerIdentityRef concreteContainerIdentity(const VSAIdentityKeys& keys = {});
 
   void fail(VSAResultCode code) { VSASetCode(result_, code); }
+  // Refuses (code 11, one rate-limited log line per client) a client string
+  // that the daemon could turn into a file name but that is not a safe one.
+  bool acceptClientName(const std::string& value, const char* key);
 
  private:
   const VSAValue& request_;

@@ -1,6 +1,7 @@
 #include "model/VSAContainerIdentity.h"
 
 #include "base/VSALog.h"
+#include "base/VSAPathString.h"
 #include "model/VSAUserIdentityCache.h"
 
 VSAContainerIdentity::VSAContainerIdentity(VSAUserIdentityRef userIdentity, std::string identifier,
@@ -22,8 +23,12 @@ bool VSAContainerIdentity::validate(const VSAUserIdentityRef& userIdentity,
     VSASetCode(error, VSAResult::kMissingIdentifier);
     return false;
   }
-  if (!identifier->isString()) {
-    VSALog(kVSALogError, method, "Invalid object: identifier = [%@]", *identifier);
+  // Identifiers name directories and files: one that could leave its
+  // directory is refused here as well as at the request boundary.
+  if (!identifier->isString() || !VSAIsSafeFileName(*identifier->stringValue())) {
+    VSALog(kVSALogError, method, "Invalid object: identifier = [%@]",
+           VSAClientStringForLog(identifier->isString() ? *identifier->stringValue()
+                                                        : identifier->description()));
     VSASetCode(error, VSAResult::kInvalidArgument);
     return false;
   }
