@@ -60,7 +60,7 @@ void VSACodeSigningMapping::_onQueue_migrateFromMappingFileToDBIfNecessary() {
   // Entries that failed are given up once anything migrated (the file goes).
   if (migrated > 0) {
     VSAErrorRef removeError;
-    if (!configuration_->fileManager().removeItemAtURL(path, &removeError))
+    if (!configuration_->fileManager().removeFileAtURL(path, &removeError))
       logMapping(kVSALogError, "Failed to remove legacy code signing mapping file: %@",
                  removeError);
   }

@@ -81,7 +81,7 @@ bool VSADataProtectionChangeOperation::_onQueue_writeToDiskWithError(VSAErrorRef
   std::string url = updateFileURL();
   VSAFileManager& fm = env_->configuration->fileManager();
   VSAErrorRef underlying;
-  if (!fm.removeItemAtURL(url, &underlying)) {
+  if (!fm.removeFileAtURL(url, &underlying)) {
     auto e = VSA_ERROR_UNDERLYING(VSAResult::kRemoveFailed, underlying,
                                   "Failed to remove pending data protection file at %@", url);
     VSALog(kVSALogError, __func__, "%@", e->message());
@@ -105,8 +105,9 @@ bool VSADataProtectionChangeOperation::_runChangeOperationNeedToRetry(bool* need
   *needRetry = false;
   VSAFileManager& fm = env_->configuration->fileManager();
   VSAErrorRef lockedFailure;
-  auto visit = [&](const std::string& path, const struct stat& st,
-                   VSAFileManager::WalkPhase phase) {
+  auto visit = [&](const VSAWalkItem& item, VSAFileManager::WalkPhase phase) {
+    const std::string& path = item.path;
+    const struct stat& st = item.st;
     if (phase == VSAFileManager::WalkPhase::DirectoryEnd || S_ISLNK(st.st_mode)) return true;
     if (path.empty()) {
       VSALog(kVSALogError, "_runChangeOperationNeedToRetry", "itemURL is nil for item: %@",
@@ -116,7 +117,7 @@ bool VSADataProtectionChangeOperation::_runChangeOperationNeedToRetry(bool* need
     VSALog(kVSALogDebug, "_runChangeOperationNeedToRetry", "Setting protection class of %s to %d",
            path, newClass_);
     VSAErrorRef failure;
-    if (fm.setDataProtectionClassOfItemAtURL(path, newClass_, nullptr, &failure)) return true;
+    if (fm.setDataProtectionClassOfItem(item, newClass_, &failure)) return true;
     if (lockedError(failure)) {
       lockedFailure = failure;
       return false;  // every further item would fail the same way
@@ -210,7 +211,7 @@ bool VSADataProtectionChangeOperation::_onQueue_deleteUpdateFileWithError(VSAErr
            static_cast<unsigned long long>(metadata_->containerClass()));
     return true;
   }
-  return env_->configuration->fileManager().removeItemAtURL(updateFileURL(), error);
+  return env_->configuration->fileManager().removeFileAtURL(updateFileURL(), error);
 }
 
 bool VSADataProtectionChangeOperation::_stillMostCurrentUpdate() {
@@ -237,7 +238,7 @@ bool VSADataProtectionChangeOperation::_onQueue_stillMostCurrentUpdate() {
 bool VSADataProtectionChangeOperation::deleteUpdateFileWithContainerIdentity(
     const VSAContainerIdentity& identity, VSAGlobalConfiguration& configuration,
     VSAErrorRef* error) {
-  return configuration.fileManager().removeItemAtURL(
+  return configuration.fileManager().removeFileAtURL(
       urlForProtectionOperationWithContainerIdentity(identity, configuration), error);
 }
 

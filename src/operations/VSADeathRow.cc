@@ -49,6 +49,11 @@ bool VSADeathRow::_moveItemAtURLToDeathRow(const std::string& url, bool isDir,
     VSASetError(error, e);
     return false;
   }
+  // Its former owner must not race the removal: the item becomes root's
+  // (the directory above it already is, with mode 0700).
+  VSAErrorRef restrictError;
+  if (!fm.restrictItemToRootAtURL(destination, &restrictError))
+    VSALog(kVSALogError, fn, "%@", restrictError ? restrictError->message() : std::string());
   if (startDeletionThread) deleteContainersOnDeathRowWithCompletion(nullptr);
   return true;
 }

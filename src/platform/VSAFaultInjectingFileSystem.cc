@@ -177,3 +177,76 @@ int VSAFaultInjectingFileSystem::maintainDirectoryStatistics(const std::string& 
   if (int e = injected(Op::MaintainStatistics)) return e;
   return inner_->maintainDirectoryStatistics(path);
 }
+
+int VSAFaultInjectingFileSystem::openDirectory(const std::string& path, int* fd) {
+  if (int e = injected(Op::OpenDirectory)) return e;
+  return inner_->openDirectory(path, fd);
+}
+
+int VSAFaultInjectingFileSystem::openDirectoryAt(int dir, const std::string& name, int* fd) {
+  if (int e = injected(Op::OpenDirectory)) return e;
+  return inner_->openDirectoryAt(dir, name, fd);
+}
+
+int VSAFaultInjectingFileSystem::statAt(int dir, const std::string& name, struct stat* st) {
+  if (int e = injected(Op::Lstat)) return e;
+  return inner_->statAt(dir, name, st);
+}
+
+int VSAFaultInjectingFileSystem::readDirectoryAt(int dir, std::vector<VSADirectoryEntry>* entries) {
+  if (int e = injected(Op::ReadDirectory)) return e;
+  return inner_->readDirectoryAt(dir, entries);
+}
+
+int VSAFaultInjectingFileSystem::mkdirAt(int dir, const std::string& name, mode_t mode) {
+  if (int e = injected(Op::Mkdir)) return e;
+  return inner_->mkdirAt(dir, name, mode);
+}
+
+int VSAFaultInjectingFileSystem::unlinkAt(int dir, const std::string& name, bool directory) {
+  if (int e = injected(directory ? Op::Rmdir : Op::Unlink)) return e;
+  return inner_->unlinkAt(dir, name, directory);
+}
+
+int VSAFaultInjectingFileSystem::chownAt(int dir, const std::string& name, uid_t uid, gid_t gid) {
+  if (int e = injected(Op::Chown)) return e;
+  return inner_->chownAt(dir, name, uid, gid);
+}
+
+int VSAFaultInjectingFileSystem::chmodAt(int dir, const std::string& name, mode_t mode) {
+  if (int e = injected(Op::Chmod)) return e;
+  return inner_->chmodAt(dir, name, mode);
+}
+
+int VSAFaultInjectingFileSystem::getFlagsAt(int dir, const std::string& name, int* flags) {
+  if (int e = injected(Op::GetFlags)) return e;
+  return inner_->getFlagsAt(dir, name, flags);
+}
+
+int VSAFaultInjectingFileSystem::setFlagsAt(int dir, const std::string& name, int flags) {
+  if (int e = injected(Op::SetFlags)) return e;
+  return inner_->setFlagsAt(dir, name, flags);
+}
+
+int VSAFaultInjectingFileSystem::setSystemContainerACLAt(int dir, const std::string& name,
+                                                         VSASystemContainerACL kind, gid_t gid) {
+  if (int e = injected(Op::SetACL)) return e;
+  return inner_->setSystemContainerACLAt(dir, name, kind, gid);
+}
+
+int VSAFaultInjectingFileSystem::getProtectionClassAt(int dir, const std::string& name,
+                                                      int* protectionClass) {
+  if (int e = injected(Op::GetClass)) return e;
+  return inner_->getProtectionClassAt(dir, name, protectionClass);
+}
+
+int VSAFaultInjectingFileSystem::setProtectionClassAt(int dir, const std::string& name,
+                                                      int protectionClass) {
+  if (int e = injected(Op::SetClass)) return e;
+  return inner_->setProtectionClassAt(dir, name, protectionClass);
+}
+
+int VSAFaultInjectingFileSystem::syncDirectory(int dir) {
+  if (int e = injected(Op::SyncDirectory)) return e;
+  return inner_->syncDirectory(dir);
+}

@@ -3,7 +3,9 @@
 // failNth(op, n, errno) makes the n-th call (counting from 1, from now on)
 // of `op` fail with `errno` without reaching the real file system; failAll
 // fails every call of `op`. Call counts per operation let a test enumerate
-// the steps of an operation and fail each in turn. Thread-safe.
+// the steps of an operation and fail each in turn. A descriptor-relative call
+// counts as the operation of its path form (statAt as Lstat, unlinkAt as
+// Unlink or Rmdir, ...). Thread-safe.
 #pragma once
 
 #include <array>
@@ -49,6 +51,21 @@ class VSAFaultInjectingFileSystem : public VSAFileSystem {
   int setProtectionClass(const std::string& path, int protectionClass) override;
   int directoryStatistics(const std::string& path, uint64_t* bytes) override;
   int maintainDirectoryStatistics(const std::string& path) override;
+  int openDirectory(const std::string& path, int* fd) override;
+  int openDirectoryAt(int dir, const std::string& name, int* fd) override;
+  int statAt(int dir, const std::string& name, struct stat* st) override;
+  int readDirectoryAt(int dir, std::vector<VSADirectoryEntry>* entries) override;
+  int mkdirAt(int dir, const std::string& name, mode_t mode) override;
+  int unlinkAt(int dir, const std::string& name, bool directory) override;
+  int chownAt(int dir, const std::string& name, uid_t uid, gid_t gid) override;
+  int chmodAt(int dir, const std::string& name, mode_t mode) override;
+  int getFlagsAt(int dir, const std::string& name, int* flags) override;
+  int setFlagsAt(int dir, const std::string& name, int flags) override;
+  int setSystemContainerACLAt(int dir, const std::string& name, VSASystemContainerACL kind,
+                              gid_t gid) override;
+  int getProtectionClassAt(int dir, const std::string& name, int* protectionClass) override;
+  int setProtectionClassAt(int dir, const std::string& name, int protectionClass) override;
+  int syncDirectory(int dir) override;
 
  private:
   // Counts the call; answers the errno to fail it with, or 0 to forward it.

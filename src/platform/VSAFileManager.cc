@@ -286,6 +286,17 @@ bool VSAFileManager::setDataProtectionClassOfItemAtURL(const std::string& path, 
   return true;
 }
 
+bool VSAFileManager::setDataProtectionClassOfItem(const VSAWalkItem& item, int protectionClass,
+                                                  VSAErrorRef* error) {
+  if (int rc = fs_->setProtectionClassAt(item.directory, item.name, protectionClass)) {
+    VSASetError(error, VSAFileManagerFail(rc, "setDataProtectionClassOfItemAtURL",
+                                          "Failed to setclass(%d) on file %s: %s", protectionClass,
+                                          item.path, std::strerror(rc)));
+    return false;
+  }
+  return true;
+}
+
 bool VSAFileManager::itemExistsAtURL(const std::string& path) {
   struct stat st;
   int rc = fs_->lstat(path, &st);

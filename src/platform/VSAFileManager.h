@@ -32,10 +32,23 @@ struct VSADirectoryItem {
   bool isDirectory = false;
 };
 
+// One item met by a walk: its path (for logs), its status, and the directory
+// descriptor and name through which it is acted on without a path lookup.
+struct VSAWalkItem {
+  const std::string& path;
+  const struct stat& st;
+  int directory;
+  const std::string& name;
+};
+
+// How deep a walk or removal descends; deeper directories are reported as
+// failures (ELOOP) and left alone.
+inline constexpr int kVSAMaxWalkDepth = 256;
+
 class VSAFileManager {
  public:
   enum class WalkPhase { Directory, DirectoryEnd, Item };
-  using WalkBlock = std::function<bool(const std::string& path, const struct stat& st, WalkPhase)>;
+  using WalkBlock = std::function<bool(const VSAWalkItem& item, WalkPhase)>;
 
   VSAFileManager(std::shared_ptr<VSAFileSystem> fileSystem,
                  std::shared_ptr<const VSAUserDatabase> userDatabase);
@@ -51,8 +64,14 @@ class VSAFileManager {
   bool moveItemIfExistsAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
   bool copyItemAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
   bool copyItemIfExistsAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
-  // Recursive; a missing item is success; immutable items are unlocked and removed.
+  // Recursive, through directory descriptors and on one device; a missing
+  // item is success; immutable items are unlocked and removed.
   bool removeItemAtURL(const std::string& path, VSAErrorRef* error);
+  // One file or link, never a tree (a directory is EISDIR); missing is success.
+  bool removeFileAtURL(const std::string& path, VSAErrorRef* error);
+  // Gives an item (a container sent to death row) to root with mode 0700, so
+  // that its former owner cannot reach into it while it is removed.
+  bool restrictItemToRootAtURL(const std::string& path, VSAErrorRef* error);
   bool standardizeOwnershipAtURL(const std::string& path, uid_t uid, gid_t gid, VSAErrorRef* error);
 
   bool setTopLevelSystemContainerACLAtURL(const std::string& path, VSAErrorRef* error);
@@ -68,14 +87,19 @@ class VSAFileManager {
   bool setDataProtectionClassOfItemAtURL(const std::string& path, int protectionClass,
                                          const std::function<bool(int)>& ifPredicate,
                                          VSAErrorRef* error);
+  // The same for an item met by a walk.
+  bool setDataProtectionClassOfItem(const VSAWalkItem& item, int protectionClass,
+                                    VSAErrorRef* error);
 
   bool itemExistsAtURL(const std::string& path);
   bool itemDoesNotExistAtURL(const std::string& path);
   // Visible entries (names not starting with ".") of one directory.
   std::optional<std::vector<VSADirectoryItem>> urlsForItemsInDirectoryAtURL(const std::string& path,
                                                                             VSAErrorRef* error);
-  // Walks a tree on one device; directories are reported before and after
-  // their contents. The block stops the walk by returning false.
+  // Walks a tree on one device through directory descriptors; directories
+  // are reported before and after their contents. The block stops the walk
+  // by returning false. No link is followed, and a directory swapped for
+  // something else between its status and its opening is a failure.
   bool traverseDirectory(const std::string& path, VSAErrorRef* error, const WalkBlock& block);
   std::optional<std::string> createTemporaryDirectoryInDirectoryURL(
       const std::string& directory, VSAErrorRef* error,
@@ -95,10 +119,17 @@ class VSAFileManager {
   bool copyItem(const std::string& from, const std::string& to, bool failIfSrcMissing,
                 VSAErrorRef* error);
   int copyTree(const std::string& from, const std::string& to, std::string* failedPath);
-  void removeTree(const std::string& path, const struct stat* st, int* slot);
-  int removeImmutable(const std::string& path, bool directory);
-  bool walk(const std::string& path, const struct stat& st, dev_t device, const WalkBlock& block,
-            std::string* failure, int* failureErrno);
+  struct Walk;
+  struct Removal;
+  bool walk(Walk& w, int directory, const std::string& name, const std::string& path,
+            const struct stat& st, int depth);
+  void removeEntry(Removal& r, int directory, const std::string& name, const std::string& path,
+                   bool isDirectory, int depth);
+  void removeDirectoryContents(Removal& r, int directory, const std::string& path, int depth);
+  int unlinkUnlocking(int directory, const std::string& name, const std::string& path,
+                      bool isDirectory);
+  // Opens the directory holding `path`; false with `error` set (as `fn`) on failure.
+  int openParent(const std::string& path, int* fd, std::string* name);
   std::optional<std::string> realPathAllowingMissing(const std::string& path);
   std::optional<gid_t> systemUsersGroup(VSAErrorRef* error);
   // mkdir -p from the bottom up: 0 or an errno.

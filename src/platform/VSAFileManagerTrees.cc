@@ -6,6 +6,7 @@
 #include "base/VSAPathString.h"
 #include "platform/VSAFileManager.h"
 #include "platform/VSAFileManagerErrors.h"
+#include "platform/VSAUniqueFd.h"
 
 namespace {
 constexpr const char* kOrigin = "VSAFileManager";
@@ -22,124 +23,153 @@ bool holdsMetadata(const std::string& path) {
 }
 }  // namespace
 
-bool VSAFileManager::walk(const std::string& path, const struct stat& st, dev_t device,
-                          const WalkBlock& block, std::string* failure, int* failureErrno) {
-  if (!S_ISDIR(st.st_mode)) return block(path, st, WalkPhase::Item);
-  if (!block(path, st, WalkPhase::Directory)) return false;
-  if (st.st_dev == device) {  // stay on one device: do not descend into mounts
+int VSAFileManager::openParent(const std::string& path, int* fd, std::string* name) {
+  *name = VSALastPathComponent(path);
+  if (name->empty() || *name == "." || *name == "..") return EINVAL;
+  std::string parent = VSADirectoryName(path);
+  return fs_->openDirectory(parent.empty() ? "/" : parent, fd);
+}
+
+struct VSAFileManager::Walk {
+  const WalkBlock& block;
+  dev_t device;
+  std::string failure;
+  int failureErrno = 0;
+  size_t entries = 0;
+  bool fail(const std::string& path, int rc) {
+    failure = path;
+    failureErrno = rc;
+    return false;
+  }
+};
+
+bool VSAFileManager::walk(Walk& w, int directory, const std::string& name, const std::string& path,
+                          const struct stat& st, int depth) {
+  VSAWalkItem item{path, st, directory, name};
+  ++w.entries;
+  if (!S_ISDIR(st.st_mode)) return w.block(item, WalkPhase::Item);
+  if (!w.block(item, WalkPhase::Directory)) return false;
+  if (st.st_dev == w.device) {  // stay on one device: do not descend into mounts
+    if (depth >= kVSAMaxWalkDepth) return w.fail(path, ELOOP);
+    int raw = -1;
+    if (int rc = fs_->openDirectoryAt(directory, name, &raw)) return w.fail(path, rc);
+    VSAUniqueFd fd(raw);
+    struct stat opened;
+    if (int rc = fs_->statAt(fd.get(), "", &opened)) return w.fail(path, rc);
+    if (opened.st_dev != st.st_dev || opened.st_ino != st.st_ino) return w.fail(path, ESTALE);
     std::vector<VSADirectoryEntry> entries;
-    if (int rc = fs_->readDirectory(path, &entries)) {
-      *failure = path;
-      *failureErrno = rc;
-      return false;
-    }
+    if (int rc = fs_->readDirectoryAt(fd.get(), &entries)) return w.fail(path, rc);
     for (const auto& e : entries) {
       std::string child = VSAPathJoin(path, e.name);
       struct stat cst;
-      if (int rc = fs_->lstat(child, &cst)) {
-        *failure = child;
-        *failureErrno = rc;
-        return false;
-      }
-      if (!walk(child, cst, device, block, failure, failureErrno)) return false;
+      if (int rc = fs_->statAt(fd.get(), e.name, &cst)) return w.fail(child, rc);
+      if (!walk(w, fd.get(), e.name, child, cst, depth + 1)) return false;
     }
   }
-  return block(path, st, WalkPhase::DirectoryEnd);
+  ++w.entries;
+  return w.block(item, WalkPhase::DirectoryEnd);
 }
 
 bool VSAFileManager::traverseDirectory(const std::string& path, VSAErrorRef* error,
                                        const WalkBlock& block) {
+  int raw = -1;
+  std::string name;
   struct stat st;
-  if (int rc = fs_->lstat(path, &st)) {
+  int rc = openParent(path, &raw, &name);
+  VSAUniqueFd parent(raw);
+  if (rc == 0) rc = fs_->statAt(parent.get(), name, &st);
+  if (rc) {
     VSASetError(error,
                 VSAFileManagerFail(rc, "traverseDirectory", "fts_open failed for %s with error %s",
                                    path, std::strerror(rc)));
     return false;
   }
-  std::string failedPath;
-  int failedErrno = 0;
-  size_t entries = 0;
-  bool completed = walk(
-      path, st, st.st_dev,
-      [&](const std::string& p, const struct stat& s, WalkPhase w) {
-        ++entries;
-        return block(p, s, w);
-      },
-      &failedPath, &failedErrno);
-  VSALogIn(VSALogCategory::FS, kVSALogDebug, "TraversingDirectory", "%zu entries under %s", entries,
-           path);
-  if (failedErrno) {
-    VSASetError(error, VSAFileManagerFail(failedErrno, "traverseDirectory", "Error for path %s: %s",
-                                          path, std::strerror(failedErrno)));
+  Walk w{block, st.st_dev, {}, 0, 0};
+  walk(w, parent.get(), name, path, st, 0);  // a walk stopped by the block is not an error
+  VSALogIn(VSALogCategory::FS, kVSALogDebug, "TraversingDirectory", "%zu entries under %s",
+           w.entries, path);
+  if (w.failureErrno) {
+    VSASetError(error,
+                VSAFileManagerFail(w.failureErrno, "traverseDirectory", "Error for path %s: %s",
+                                   w.failure, std::strerror(w.failureErrno)));
     return false;
   }
-  (void)completed;  // a walk stopped by the block is not an error
   return true;
 }
 
-int VSAFileManager::removeImmutable(const std::string& path, bool directory) {
-  int flags = 0;
-  if (int rc = fs_->getFlags(path, &flags)) {
-    VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin,
-             "Failed to stat %s before unsetting UF_IMMUTABLE: %s", path, std::strerror(rc));
-    return EPERM;
+struct VSAFileManager::Removal {
+  dev_t device;
+  int firstError = 0;
+  void record(const std::string& path, int rc) {
+    if (rc == 0 || rc == ENOENT) return;
+    VSALogIn(VSALogCategory::FS, kVSALogError, "_removefile_error_callback",
+             "removefile hit error for %s : %s", path, std::strerror(rc));
+    if (firstError == 0) firstError = rc;
   }
-  if (!(flags & VSAFileSystem::kImmutableFlag)) return EPERM;
-  if (int rc = fs_->setFlags(path, flags & ~VSAFileSystem::kImmutableFlag)) {
-    VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "Failed to lchflags %s: %s", path,
-             std::strerror(rc));
-    return rc;
+};
+
+// Removes one entry of `directory`. An entry that refuses with EPERM because
+// of the immutable flag (its own, or its directory's) is unlocked and removed.
+int VSAFileManager::unlinkUnlocking(int directory, const std::string& name, const std::string& path,
+                                    bool isDirectory) {
+  int rc = fs_->unlinkAt(directory, name, isDirectory);
+  if (rc != EPERM) return rc;
+  for (const std::string& which : {std::string(), name}) {  // the directory, then the entry
+    const std::string& shown = which.empty() ? VSADirectoryName(path) : path;
+    int flags = 0;
+    if (int frc = fs_->getFlagsAt(directory, which, &flags)) {
+      VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin,
+               "Failed to stat %s before unsetting UF_IMMUTABLE: %s", shown, std::strerror(frc));
+      continue;
+    }
+    if (!(flags & VSAFileSystem::kImmutableFlag)) continue;
+    if (int src = fs_->setFlagsAt(directory, which, flags & ~VSAFileSystem::kImmutableFlag)) {
+      VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "Failed to lchflags %s: %s", shown,
+               std::strerror(src));
+      return src;
+    }
+    VSALogIn(VSALogCategory::FS, kVSALogNotice, kOrigin, "Unset UF_IMMUTABLE on %s", shown);
+    rc = fs_->unlinkAt(directory, name, isDirectory);
+    if (rc != EPERM) break;
   }
-  VSALogIn(VSALogCategory::FS, kVSALogNotice, kOrigin, "Unset UF_IMMUTABLE on %s", path);
-  int rc = directory ? fs_->rmdir(path) : fs_->unlink(path);
   if (rc)
     VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "unlink of %s failed: %s", path,
              std::strerror(rc));
   return rc;
 }
 
-// Removes a tree depth first, going on past errors; the first error is kept
-// in `slot`. An item that refuses with EPERM because of the immutable flag
-// (its own, or its directory's for the children) is unlocked and removed.
-void VSAFileManager::removeTree(const std::string& path, const struct stat* st, int* slot) {
-  auto record = [&](const std::string& p, int rc) {
-    if (rc == 0 || rc == ENOENT) return;
-    VSALogIn(VSALogCategory::FS, kVSALogError, "_removefile_error_callback",
-             "removefile hit error for %s : %s", p, std::strerror(rc));
-    if (*slot == 0) *slot = rc;
-  };
-  bool directory = st ? S_ISDIR(st->st_mode) : false;
-  if (directory) {
-    std::vector<VSADirectoryEntry> entries;
-    int rc = fs_->readDirectory(path, &entries);
-    if (rc) {
-      record(path, rc);
-    }
-    for (const auto& e : entries) {
-      std::string child = VSAPathJoin(path, e.name);
-      if (e.type == VSADirectoryEntry::Type::Directory) {
-        struct stat cst;
-        cst.st_mode = S_IFDIR;
-        removeTree(child, &cst, slot);
-      } else {
-        int urc = fs_->unlink(child);
-        if (urc == EPERM) {
-          // The directory may be the immutable one.
-          int dflags = 0;
-          if (fs_->getFlags(path, &dflags) == 0 && (dflags & VSAFileSystem::kImmutableFlag)) {
-            fs_->setFlags(path, dflags & ~VSAFileSystem::kImmutableFlag);
-            VSALogIn(VSALogCategory::FS, kVSALogNotice, kOrigin, "Unset UF_IMMUTABLE on %s", path);
-            urc = fs_->unlink(child);
-          }
-          if (urc == EPERM) urc = removeImmutable(child, false);
-        }
-        record(child, urc);
-      }
-    }
+void VSAFileManager::removeDirectoryContents(Removal& r, int directory, const std::string& path,
+                                             int depth) {
+  std::vector<VSADirectoryEntry> entries;
+  if (int rc = fs_->readDirectoryAt(directory, &entries)) r.record(path, rc);
+  for (const auto& e : entries)
+    removeEntry(r, directory, e.name, VSAPathJoin(path, e.name),
+                e.type == VSADirectoryEntry::Type::Directory, depth + 1);
+}
+
+// Depth first, going on past errors (the first is kept). Each directory is
+// opened without following links and checked to be on the device the
+// removal started on before anything in it is touched.
+void VSAFileManager::removeEntry(Removal& r, int directory, const std::string& name,
+                                 const std::string& path, bool isDirectory, int depth) {
+  if (!isDirectory) {
+    int rc = unlinkUnlocking(directory, name, path, false);
+    if (rc != EISDIR) return r.record(path, rc);
   }
-  int rc = directory ? fs_->rmdir(path) : fs_->unlink(path);
-  if (rc == EPERM) rc = removeImmutable(path, directory);
-  record(path, rc);
+  if (depth >= kVSAMaxWalkDepth) return r.record(path, ELOOP);
+  int raw = -1;
+  int rc = fs_->openDirectoryAt(directory, name, &raw);
+  VSAUniqueFd fd(raw);
+  if (rc == ENOTDIR || rc == ELOOP) {  // no longer a directory: remove it as it now is
+    return r.record(path, unlinkUnlocking(directory, name, path, false));
+  }
+  if (rc) return r.record(path, rc);
+  struct stat st;
+  if ((rc = fs_->statAt(fd.get(), "", &st))) return r.record(path, rc);
+  if (st.st_dev != r.device) return r.record(path, EXDEV);
+  removeDirectoryContents(r, fd.get(), path, depth);
+  fd.reset();
+  r.record(path, unlinkUnlocking(directory, name, path, true));
 }
 
 bool VSAFileManager::removeItemAtURL(const std::string& path, VSAErrorRef* error) {
@@ -148,22 +178,48 @@ bool VSAFileManager::removeItemAtURL(const std::string& path, VSAErrorRef* error
                                           "nil url passed to -removeItemAtURL:error:"));
     return false;
   }
+  int raw = -1;
+  std::string name;
   struct stat st;
-  int rc = fs_->lstat(path, &st);
+  int rc = openParent(path, &raw, &name);
+  VSAUniqueFd parent(raw);
+  if (rc == 0) rc = fs_->statAt(parent.get(), name, &st);
   if (rc == ENOENT) return true;
   if (rc != 0) {
     VSASetError(error, VSAFileManagerFail(rc, "removeItemAtURL", "removefile of %@ failed: %s",
                                           path, std::strerror(rc)));
     return false;
   }
-  int slot = 0;
-  removeTree(path, &st, &slot);
-  if (slot != 0) {
-    VSASetError(error, VSAFileManagerFail(slot, "removeItemAtURL", "removefile of %@ failed: %s",
-                                          path, std::strerror(slot)));
+  Removal r{st.st_dev, 0};
+  removeEntry(r, parent.get(), name, path, S_ISDIR(st.st_mode), 0);
+  if (r.firstError != 0) {
+    VSASetError(error,
+                VSAFileManagerFail(r.firstError, "removeItemAtURL", "removefile of %@ failed: %s",
+                                   path, std::strerror(r.firstError)));
     return false;
   }
   return true;
+}
+
+bool VSAFileManager::removeFileAtURL(const std::string& path, VSAErrorRef* error) {
+  int rc = fs_->unlink(path);
+  if (rc == 0 || rc == ENOENT) return true;
+  VSASetError(error, VSAFileManagerFail(rc, "removeFileAtURL", "unlink of %@ failed: %s", path,
+                                        std::strerror(rc)));
+  return false;
+}
+
+bool VSAFileManager::restrictItemToRootAtURL(const std::string& path, VSAErrorRef* error) {
+  int raw = -1;
+  std::string name;
+  int rc = openParent(path, &raw, &name);
+  VSAUniqueFd parent(raw);
+  if (rc == 0) rc = fs_->chownAt(parent.get(), name, 0, 0);
+  if (rc == 0) rc = fs_->chmodAt(parent.get(), name, 0700);
+  if (rc == 0) return true;
+  VSASetError(error, VSAFileManagerFail(rc, "restrictItemToRootAtURL",
+                                        "Could not give %@ to root: %s", path, std::strerror(rc)));
+  return false;
 }
 
 // Copies data, extended attributes (ACLs included), owner and mode, never
@@ -204,32 +260,22 @@ int VSAFileManager::copyTree(const std::string& from, const std::string& to, std
 
 bool VSAFileManager::standardizeOwnershipAtURL(const std::string& path, uid_t uid, gid_t gid,
                                                VSAErrorRef* error) {
-  auto normalise = [&](const std::string& p, const struct stat& s, bool compareGID) {
-    if (s.st_uid != uid || (compareGID && s.st_gid != gid)) {
-      if (int rc = fs_->lchown(p, uid, gid))
-        VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "Could not chown %s: %s", p,
+  return traverseDirectory(path, error, [&](const VSAWalkItem& item, WalkPhase w) {
+    if (w == WalkPhase::DirectoryEnd || holdsMetadata(item.path)) return true;
+    // The top is re-owned only when its owner differs; its group alone may.
+    bool compareGID = item.path != path;
+    if (item.st.st_uid != uid || (compareGID && item.st.st_gid != gid)) {
+      if (int rc = fs_->chownAt(item.directory, item.name, uid, gid))
+        VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "Could not chown %s: %s", item.path,
                  std::strerror(rc));
     }
-    if (S_ISLNK(s.st_mode)) return;
-    mode_t mode = S_ISDIR(s.st_mode) || (s.st_mode & 0111) ? 0755 : 0644;
-    if (int rc = fs_->chmod(p, mode))
-      VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "Could not chmod %s: %s", p,
+    if (S_ISLNK(item.st.st_mode)) return true;
+    mode_t mode = S_ISDIR(item.st.st_mode) || (item.st.st_mode & 0111) ? 0755 : 0644;
+    if (int rc = fs_->chmodAt(item.directory, item.name, mode))
+      VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "Could not chmod %s: %s", item.path,
                std::strerror(rc));
-  };
-  bool ok =
-      traverseDirectory(path, error, [&](const std::string& p, const struct stat& s, WalkPhase w) {
-        if (p != path && w != WalkPhase::DirectoryEnd && !holdsMetadata(p)) normalise(p, s, true);
-        return true;
-      });
-  if (!ok) return false;
-  struct stat root;
-  if (int rc = fs_->lstat(path, &root)) {
-    VSASetError(error, VSAFileManagerFail(rc, "standardizeOwnershipAtURL", "Could not stat %s: %s",
-                                          path, std::strerror(rc)));
-    return false;
-  }
-  normalise(path, root, false);
-  return true;
+    return true;
+  });
 }
 
 std::optional<gid_t> VSAFileManager::systemUsersGroup(VSAErrorRef* error) {
@@ -256,30 +302,32 @@ bool VSAFileManager::standardizeACLsAtURL(const std::string& path, bool isSystem
                                           VSAErrorRef* error) {
   auto gid = systemUsersGroup(error);
   if (!gid) return false;
-  return traverseDirectory(
-      path, error, [&](const std::string& p, const struct stat& s, WalkPhase w) {
-        if (w == WalkPhase::DirectoryEnd || holdsMetadata(p)) return true;
-        if (p == path && isSystemContainer && S_ISDIR(s.st_mode)) {
-          if (int rc = fs_->setSystemContainerACL(p, VSASystemContainerACL::TopLevel, *gid))
-            VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin,
-                     "Failed to set top level ACL on dir %s: %s", p, std::strerror(rc));
-          return true;
-        }
-        if (!S_ISLNK(s.st_mode)) {
-          bool dir = S_ISDIR(s.st_mode);
-          // The ACL also sets the owner, group and other permissions to none:
-          // access to system containers comes from the "systemusers" entry alone.
-          if (int rc = fs_->setSystemContainerACL(
-                  p, dir ? VSASystemContainerACL::Directory : VSASystemContainerACL::File, *gid))
-            VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin,
-                     dir ? "Failed to set ACL on dir %s: %s" : "Failed to set ACL on file %s: %s",
-                     p, std::strerror(rc));
-        }
-        if (int rc = fs_->lchown(p, kVSANobodyID, kVSANobodyID))
-          VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "Could not chown %s: %s", p,
-                   std::strerror(rc));
-        return true;
-      });
+  return traverseDirectory(path, error, [&](const VSAWalkItem& item, WalkPhase w) {
+    if (w == WalkPhase::DirectoryEnd || holdsMetadata(item.path)) return true;
+    const struct stat& s = item.st;
+    if (item.path == path && isSystemContainer && S_ISDIR(s.st_mode)) {
+      if (int rc = fs_->setSystemContainerACLAt(item.directory, item.name,
+                                                VSASystemContainerACL::TopLevel, *gid))
+        VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin,
+                 "Failed to set top level ACL on dir %s: %s", item.path, std::strerror(rc));
+      return true;
+    }
+    if (!S_ISLNK(s.st_mode)) {
+      bool dir = S_ISDIR(s.st_mode);
+      // The ACL also sets the owner, group and other permissions to none:
+      // access to system containers comes from the "systemusers" entry alone.
+      if (int rc = fs_->setSystemContainerACLAt(
+              item.directory, item.name,
+              dir ? VSASystemContainerACL::Directory : VSASystemContainerACL::File, *gid))
+        VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin,
+                 dir ? "Failed to set ACL on dir %s: %s" : "Failed to set ACL on file %s: %s",
+                 item.path, std::strerror(rc));
+    }
+    if (int rc = fs_->chownAt(item.directory, item.name, kVSANobodyID, kVSANobodyID))
+      VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "Could not chown %s: %s", item.path,
+               std::strerror(rc));
+    return true;
+  });
 }
 
 bool VSAFileManager::standardizeAllSystemContainerACLsAtURL(const std::string& path,
@@ -314,9 +362,9 @@ bool VSAFileManager::standardizeAllSystemContainerACLsAtURL(const std::string& p
 uint64_t VSAFileManager::diskUsageForURL(const std::string& path) {
   uint64_t total = 0, nodes = 0;
   VSAErrorRef error;
-  traverseDirectory(path, &error, [&](const std::string&, const struct stat& s, WalkPhase w) {
+  traverseDirectory(path, &error, [&](const VSAWalkItem& item, WalkPhase w) {
     if (w != WalkPhase::DirectoryEnd) {
-      total += static_cast<uint64_t>(s.st_size);
+      total += static_cast<uint64_t>(item.st.st_size);
       ++nodes;
     }
     return true;

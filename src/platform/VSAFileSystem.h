@@ -1,8 +1,14 @@
 // The file-system interface: every file-system call of the daemon goes
 // through one of these, so that tests can inject failures (see
 // VSAFaultInjectingFileSystem) and prove that a failure at any step loses
-// nothing. Calls never follow a final symbolic link unless they say so, take
-// host paths and return 0 or an errno. Implementations are thread-safe.
+// nothing. Calls take host paths or a directory descriptor and one name, and
+// return 0 or an errno. No call follows a symbolic link anywhere in a path
+// (ELOOP), unless it says so: the daemon acts as root below directories that
+// apps and users own, and a link swapped in for one of them must not send it
+// elsewhere. Descriptor-relative calls ("...At") act on the directory they are
+// given, wherever it has been moved since it was opened; a walk opens each
+// directory once and acts on its entries by name. Implementations are
+// thread-safe.
 #pragma once
 
 #include <sys/stat.h>
@@ -61,6 +67,8 @@ class VSAFileSystem {
     SetClass,
     DirectoryStatistics,
     MaintainStatistics,
+    OpenDirectory,
+    SyncDirectory,
     Count
   };
 
@@ -71,6 +79,8 @@ class VSAFileSystem {
   virtual int lchown(const std::string& path, uid_t uid, gid_t gid) = 0;
   // Changes the mode of a non-link item (links have no mode of their own).
   virtual int chmod(const std::string& path, mode_t mode) = 0;
+  // A commit: renames, then syncs the destination's directory (the journal
+  // carries the source directory's change in the same commit).
   virtual int rename(const std::string& from, const std::string& to) = 0;
   virtual int readlink(const std::string& path, std::string* target) = 0;
   virtual int realpath(const std::string& path, std::string* resolved) = 0;
@@ -95,7 +105,8 @@ class VSAFileSystem {
   virtual int readFile(const std::string& path, std::vector<uint8_t>* bytes) = 0;
   // `templ` ends in "XXXXXX"; the created directory's path comes back in `path`.
   virtual int mkdtemp(const std::string& templ, std::string* path) = 0;
-  // Writes one of the system-container ACLs granting group `gid`.
+  // Writes one of the system-container ACLs granting group `gid`; a link is
+  // refused (ELOOP).
   virtual int setSystemContainerACL(const std::string& path, VSASystemContainerACL kind,
                                     gid_t gid) = 0;
 
@@ -111,6 +122,32 @@ class VSAFileSystem {
   virtual int directoryStatistics(const std::string& path, uint64_t* bytes) = 0;
   // Asks the file system to keep statistics for the tree below `path` from now on.
   virtual int maintainDirectoryStatistics(const std::string& path) = 0;
+
+  // --- Descriptor-relative calls. `dir` is a descriptor from openDirectory or
+  // openDirectoryAt (the caller closes it); `name` is one component. Where a
+  // call says so, an empty name stands for `dir` itself.
+
+  // Opens a directory for reading and walking (O_DIRECTORY, no link anywhere
+  // in `path`).
+  virtual int openDirectory(const std::string& path, int* fd) = 0;
+  virtual int openDirectoryAt(int dir, const std::string& name, int* fd) = 0;
+  // Empty name: `dir` itself.
+  virtual int statAt(int dir, const std::string& name, struct stat* st) = 0;
+  virtual int readDirectoryAt(int dir, std::vector<VSADirectoryEntry>* entries) = 0;
+  virtual int mkdirAt(int dir, const std::string& name, mode_t mode) = 0;
+  virtual int unlinkAt(int dir, const std::string& name, bool directory) = 0;
+  // Empty name: `dir` itself. A link is changed itself (owner) or left alone (mode).
+  virtual int chownAt(int dir, const std::string& name, uid_t uid, gid_t gid) = 0;
+  virtual int chmodAt(int dir, const std::string& name, mode_t mode) = 0;
+  // Inode flags of a regular file or directory (others: ENOTTY).
+  virtual int getFlagsAt(int dir, const std::string& name, int* flags) = 0;
+  virtual int setFlagsAt(int dir, const std::string& name, int flags) = 0;
+  virtual int setSystemContainerACLAt(int dir, const std::string& name, VSASystemContainerACL kind,
+                                      gid_t gid) = 0;
+  virtual int getProtectionClassAt(int dir, const std::string& name, int* protectionClass) = 0;
+  virtual int setProtectionClassAt(int dir, const std::string& name, int protectionClass) = 0;
+  // Flushes a directory's entries to disk (the second half of a commit).
+  virtual int syncDirectory(int dir) = 0;
 
   static constexpr int kDeviceLockedError = EAGAIN;
   // The inode flag that forbids changing or removing an item.

@@ -17,59 +17,86 @@
 #include <fstream>
 #include <sstream>
 
+#include "base/VSAPathString.h"
+
 namespace {
 int err(int rc) { return rc == 0 ? 0 : errno; }
 
-// Opens an item for an ioctl without following a final link.
+// Opens an item for an ioctl without following a link.
 int openNoFollow(const std::string& path) {
-  return ::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY);
+  VSAUniqueFd fd;
+  if (int rc = VSALinuxFileSystem::openNoSymlinks(
+          path, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY, &fd)) {
+    errno = rc;
+    return -1;
+  }
+  return fd.release();
 }
 }  // namespace
 
 const char* VSAFileSystem::opName(Op op) {
-  static const char* names[] = {
-      "lstat",    "mkdir",    "chown",    "chmod",           "rename",   "readlink",  "realpath",
-      "unlink",   "rmdir",    "readdir",  "getxattr",        "setxattr", "listxattr", "getflags",
-      "setflags", "copydata", "symlink",  "writefile",       "readfile", "mkdtemp",   "setacl",
-      "getclass", "setclass", "dirstats", "maintaindirstats"};
+  static const char* names[] = {"lstat",    "mkdir",    "chown",     "chmod",    "rename",
+                                "readlink", "realpath", "unlink",    "rmdir",    "readdir",
+                                "getxattr", "setxattr", "listxattr", "getflags", "setflags",
+                                "copydata", "symlink",  "writefile", "readfile", "mkdtemp",
+                                "setacl",   "getclass", "setclass",  "dirstats", "maintaindirstats",
+                                "opendir",  "syncdir"};
   return names[static_cast<int>(op)];
 }
 
 VSALinuxFileSystem::VSALinuxFileSystem(std::function<bool()> isLocked)
     : isLocked_(std::move(isLocked)) {}
 
+// Runs `call(directory, name)` on the directory holding `path`.
+template <typename F>
+int VSALinuxFileSystem::atParent(const std::string& path, F&& call) {
+  VSAUniqueFd dir;
+  std::string name;
+  if (int rc = openParent(path, &dir, &name)) return rc;
+  return call(dir.get(), name);
+}
+
 int VSALinuxFileSystem::lstat(const std::string& path, struct stat* st) {
-  return err(::lstat(path.c_str(), st));
+  return atParent(path, [&](int dir, const std::string& name) { return statAt(dir, name, st); });
 }
 
 int VSALinuxFileSystem::mkdir(const std::string& path, mode_t mode) {
-  return err(::mkdir(path.c_str(), mode));
+  return atParent(path, [&](int dir, const std::string& name) { return mkdirAt(dir, name, mode); });
 }
 
 int VSALinuxFileSystem::lchown(const std::string& path, uid_t uid, gid_t gid) {
-  return err(::lchown(path.c_str(), uid, gid));
+  return atParent(path,
+                  [&](int dir, const std::string& name) { return chownAt(dir, name, uid, gid); });
 }
 
 int VSALinuxFileSystem::chmod(const std::string& path, mode_t mode) {
-  struct stat st;
-  if (::lstat(path.c_str(), &st) != 0) return errno;
-  if (S_ISLNK(st.st_mode)) return 0;  // a link has no mode of its own on Linux
-  return err(::chmod(path.c_str(), mode));
+  return atParent(path, [&](int dir, const std::string& name) { return chmodAt(dir, name, mode); });
 }
 
 int VSALinuxFileSystem::rename(const std::string& from, const std::string& to) {
-  return err(::rename(from.c_str(), to.c_str()));
-}
-
-int VSALinuxFileSystem::readlink(const std::string& path, std::string* target) {
-  char buf[1024];
-  ssize_t n = ::readlink(path.c_str(), buf, sizeof buf);
-  if (n < 0) return errno;
-  if (static_cast<size_t>(n) >= sizeof buf) return ENAMETOOLONG;
-  target->assign(buf, n);
+  VSAUniqueFd fromDir, toDir;
+  std::string fromName, toName;
+  if (int rc = openParent(from, &fromDir, &fromName)) return rc;
+  if (int rc = openParent(to, &toDir, &toName)) return rc;
+  if (::renameat(fromDir.get(), fromName.c_str(), toDir.get(), toName.c_str()) != 0) return errno;
+  // The rename has taken effect; a failing sync means a failing disk, which
+  // the next call reports.
+  syncDirectory(toDir.get());
   return 0;
 }
 
+int VSALinuxFileSystem::readlink(const std::string& path, std::string* target) {
+  return atParent(path, [&](int dir, const std::string& name) {
+    char buf[1024];
+    ssize_t n = ::readlinkat(dir, name.c_str(), buf, sizeof buf);
+    if (n < 0) return errno;
+    if (static_cast<size_t>(n) >= sizeof buf) return ENAMETOOLONG;
+    target->assign(buf, n);
+    return 0;
+  });
+}
+
+// The one call that follows links: it answers where a path really leads.
 int VSALinuxFileSystem::realpath(const std::string& path, std::string* resolved) {
   char buf[PATH_MAX];
   if (!::realpath(path.c_str(), buf)) return errno;
@@ -77,90 +104,78 @@ int VSALinuxFileSystem::realpath(const std::string& path, std::string* resolved)
   return 0;
 }
 
-int VSALinuxFileSystem::unlink(const std::string& path) { return err(::unlink(path.c_str())); }
-int VSALinuxFileSystem::rmdir(const std::string& path) { return err(::rmdir(path.c_str())); }
+int VSALinuxFileSystem::unlink(const std::string& path) {
+  return atParent(path,
+                  [&](int dir, const std::string& name) { return unlinkAt(dir, name, false); });
+}
+
+int VSALinuxFileSystem::rmdir(const std::string& path) {
+  return atParent(path,
+                  [&](int dir, const std::string& name) { return unlinkAt(dir, name, true); });
+}
 
 int VSALinuxFileSystem::readDirectory(const std::string& path,
                                       std::vector<VSADirectoryEntry>* entries) {
-  int fd = ::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
-  if (fd < 0) return errno;
-  DIR* d = fdopendir(fd);
-  if (!d) {
-    int e = errno;
-    ::close(fd);
-    return e;
-  }
-  errno = 0;
-  while (struct dirent* e = ::readdir(d)) {
-    if (std::strcmp(e->d_name, ".") == 0 || std::strcmp(e->d_name, "..") == 0) continue;
-    VSADirectoryEntry entry;
-    entry.name = e->d_name;
-    unsigned char type = e->d_type;
-    if (type == DT_UNKNOWN) {
-      struct stat st;
-      if (fstatat(fd, e->d_name, &st, AT_SYMLINK_NOFOLLOW) == 0)
-        type = S_ISDIR(st.st_mode)   ? DT_DIR
-               : S_ISLNK(st.st_mode) ? DT_LNK
-               : S_ISREG(st.st_mode) ? DT_REG
-                                     : DT_UNKNOWN;
-    }
-    entry.type = type == DT_DIR   ? VSADirectoryEntry::Type::Directory
-                 : type == DT_REG ? VSADirectoryEntry::Type::File
-                 : type == DT_LNK ? VSADirectoryEntry::Type::Symlink
-                                  : VSADirectoryEntry::Type::Other;
-    entries->push_back(std::move(entry));
-  }
-  int e = errno;
-  closedir(d);
-  return e;
+  VSAUniqueFd dir;
+  if (int rc = openNoSymlinks(path, O_RDONLY | O_DIRECTORY | O_NOFOLLOW, &dir)) return rc;
+  return readDirectoryAt(dir.get(), entries);
 }
 
 int VSALinuxFileSystem::getxattr(const std::string& path, const std::string& name,
                                  std::string* value) {
-  char buf[65536];
-  ssize_t n = ::lgetxattr(path.c_str(), name.c_str(), buf, sizeof buf);
-  if (n < 0) return errno;
-  value->assign(buf, n);
-  return 0;
+  return atParent(path, [&](int dir, const std::string& item) {
+    char buf[65536];
+    ssize_t n = ::lgetxattr(procPath(dir, item).c_str(), name.c_str(), buf, sizeof buf);
+    if (n < 0) return errno;
+    value->assign(buf, n);
+    return 0;
+  });
 }
 
 int VSALinuxFileSystem::setxattr(const std::string& path, const std::string& name,
                                  const std::string& value) {
-  return err(::lsetxattr(path.c_str(), name.c_str(), value.data(), value.size(), 0));
+  return atParent(path, [&](int dir, const std::string& item) {
+    return err(
+        ::lsetxattr(procPath(dir, item).c_str(), name.c_str(), value.data(), value.size(), 0));
+  });
 }
 
 int VSALinuxFileSystem::listxattr(const std::string& path, std::vector<std::string>* names) {
-  char buf[65536];
-  ssize_t n = ::llistxattr(path.c_str(), buf, sizeof buf);
-  if (n < 0) return errno;
-  for (ssize_t i = 0; i < n;) {
-    std::string name(buf + i);
-    i += name.size() + 1;
-    if (!name.empty()) names->push_back(std::move(name));
-  }
-  return 0;
+  return atParent(path, [&](int dir, const std::string& item) {
+    char buf[65536];
+    ssize_t n = ::llistxattr(procPath(dir, item).c_str(), buf, sizeof buf);
+    if (n < 0) return errno;
+    for (ssize_t i = 0; i < n;) {
+      std::string name(buf + i);
+      i += name.size() + 1;
+      if (!name.empty()) names->push_back(std::move(name));
+    }
+    return 0;
+  });
 }
 
 int VSALinuxFileSystem::getFlags(const std::string& path, int* flags) {
-  int fd = openNoFollow(path);
-  if (fd < 0) return errno;
-  int rc = ioctl(fd, FS_IOC_GETFLAGS, flags) == 0 ? 0 : errno;
-  ::close(fd);
-  return rc;
+  return atParent(path,
+                  [&](int dir, const std::string& name) { return getFlagsAt(dir, name, flags); });
 }
 
 int VSALinuxFileSystem::setFlags(const std::string& path, int flags) {
-  int fd = openNoFollow(path);
-  if (fd < 0) return errno;
-  int rc = ioctl(fd, FS_IOC_SETFLAGS, &flags) == 0 ? 0 : errno;
-  ::close(fd);
-  return rc;
+  return atParent(path,
+                  [&](int dir, const std::string& name) { return setFlagsAt(dir, name, flags); });
 }
 
 int VSALinuxFileSystem::copyData(const std::string& from, const std::string& to, mode_t mode) {
-  int in = ::open(from.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC);
-  if (in < 0) return errno;
-  int out = ::open(to.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, mode);
+  VSAUniqueFd source;
+  if (int rc = openNoSymlinks(from, O_RDONLY | O_NOFOLLOW | O_NONBLOCK, &source)) return rc;
+  struct stat sourceStat;
+  if (::fstat(source.get(), &sourceStat) != 0) return errno;
+  if (!S_ISREG(sourceStat.st_mode)) return EINVAL;
+  VSAUniqueFd toDir;
+  std::string toName;
+  if (int rc = openParent(to, &toDir, &toName)) return rc;
+  int in = source.release();
+  int out = ::openat(toDir.get(), toName.c_str(),
+                     O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, mode);
   if (out < 0) {
     int e = errno;
     ::close(in);
@@ -192,18 +207,29 @@ int VSALinuxFileSystem::copyData(const std::string& from, const std::string& to,
   }
   ::close(in);
   if (::close(out) != 0 && rc == 0) rc = errno;
-  if (rc != 0) ::unlink(to.c_str());
+  if (rc != 0) ::unlinkat(toDir.get(), toName.c_str(), 0);
   return rc;
 }
 
 int VSALinuxFileSystem::symlink(const std::string& target, const std::string& path) {
-  return err(::symlink(target.c_str(), path.c_str()));
+  return atParent(path, [&](int dir, const std::string& name) {
+    return err(::symlinkat(target.c_str(), dir, name.c_str()));
+  });
 }
 
 int VSALinuxFileSystem::writeFile(const std::string& path, const std::vector<uint8_t>& bytes,
                                   mode_t mode) {
-  int fd = ::open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, mode);
+  VSAUniqueFd dir;
+  std::string name;
+  if (int rc = openParent(path, &dir, &name)) return rc;
+  int fd = ::openat(dir.get(), name.c_str(),
+                    O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC, mode);
   if (fd < 0) return errno;
+  struct stat st;
+  if (::fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) {
+    ::close(fd);
+    return EINVAL;
+  }
   size_t done = 0;
   int rc = 0;
   while (done < bytes.size()) {
@@ -238,50 +264,41 @@ int VSALinuxFileSystem::readFile(const std::string& path, std::vector<uint8_t>* 
 }
 
 int VSALinuxFileSystem::mkdtemp(const std::string& templ, std::string* path) {
-  std::string buf = templ;
-  if (!::mkdtemp(buf.data())) return errno;
-  *path = buf;
-  return 0;
+  VSAUniqueFd dir;
+  std::string name;
+  if (int rc = openParent(templ, &dir, &name)) return rc;
+  if (name.size() < 6 || name.compare(name.size() - 6, 6, "XXXXXX") != 0) return EINVAL;
+  static const char alphabet[] = "abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ0123456789";
+  for (int attempt = 0; attempt < 100; ++attempt) {
+    unsigned char random[6];
+    if (getentropy(random, sizeof random) != 0) return errno;
+    for (int i = 0; i < 6; ++i) name[name.size() - 6 + i] = alphabet[random[i] % 62];
+    if (::mkdirat(dir.get(), name.c_str(), 0700) == 0) {
+      *path = VSAPathJoin(VSADirectoryName(templ), name);
+      return 0;
+    }
+    if (errno != EEXIST) return errno;
+  }
+  return EEXIST;
 }
 
 int VSALinuxFileSystem::setSystemContainerACL(const std::string& path, VSASystemContainerACL kind,
                                               gid_t gid) {
-  // The owner, owning group and others get nothing: access is granted by the
-  // "systemusers" entry alone (the mask keeps that entry effective).
-  std::string g = std::to_string(gid);
-  std::string all = "u::---,g::---,o::---,m::rwx,g:" + g + ":rwx";
-  std::string access =
-      kind == VSASystemContainerACL::TopLevel ? "u::---,g::---,o::---,m::rwx,g:" + g + ":-w-" : all;
-  acl_t a = acl_from_text(access.c_str());
-  if (!a) return errno;
-  int rc = acl_set_file(path.c_str(), ACL_TYPE_ACCESS, a) == 0 ? 0 : errno;
-  acl_free(a);
-  if (rc != 0 || kind == VSASystemContainerACL::File) return rc;
-  acl_t d = acl_from_text(all.c_str());  // inherited by new children
-  if (!d) return errno;
-  rc = acl_set_file(path.c_str(), ACL_TYPE_DEFAULT, d) == 0 ? 0 : errno;
-  acl_free(d);
-  return rc;
+  return atParent(path, [&](int dir, const std::string& name) {
+    return setSystemContainerACLAt(dir, name, kind, gid);
+  });
 }
 
 int VSALinuxFileSystem::getProtectionClass(const std::string& path, int* protectionClass) {
-  std::string value;
-  int rc = getxattr(path, kVSAProtectionClassXattr, &value);
-  if (rc == ENODATA) {
-    *protectionClass = 0;
-    return 0;
-  }
-  if (rc != 0) return rc;
-  *protectionClass = std::atoi(value.c_str());
-  return 0;
+  return atParent(path, [&](int dir, const std::string& name) {
+    return getProtectionClassAt(dir, name, protectionClass);
+  });
 }
 
 int VSALinuxFileSystem::setProtectionClass(const std::string& path, int protectionClass) {
-  int current = 0;
-  int rc = getProtectionClass(path, &current);
-  if (rc != 0) return rc;
-  if (current >= 1 && current <= 3 && isLocked_ && isLocked_()) return kDeviceLockedError;
-  return setxattr(path, kVSAProtectionClassXattr, std::to_string(protectionClass));
+  return atParent(path, [&](int dir, const std::string& name) {
+    return setProtectionClassAt(dir, name, protectionClass);
+  });
 }
 
 namespace {

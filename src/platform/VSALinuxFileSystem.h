@@ -1,6 +1,13 @@
 // The Linux file system: POSIX calls, extended attributes, inode flags,
 // libacl and copy_file_range/FICLONE.
 //
+// A path is resolved by the kernel with openat2(RESOLVE_NO_SYMLINKS) up to its
+// directory, and the call then acts on the last name relative to that
+// directory: a link anywhere in the path is ELOOP. The system root is made
+// canonical at start, so the only links met are ones planted below it.
+// Calls with no descriptor form (extended attributes, ACLs) reach the item
+// through /proc/self/fd of its directory, which does not re-resolve the path.
+//
 // The data-protection class of an item is the extended attribute
 // "trusted.vessa.protection-class" (decimal text); the device's lock state,
 // asked through `isLocked`, guards class changes of items of class 1-3.
@@ -9,6 +16,7 @@
 #include <functional>
 
 #include "platform/VSAFileSystem.h"
+#include "platform/VSAUniqueFd.h"
 
 inline constexpr const char* kVSAProtectionClassXattr = "trusted.vessa.protection-class";
 
@@ -44,6 +52,35 @@ class VSALinuxFileSystem : public VSAFileSystem {
   int directoryStatistics(const std::string& path, uint64_t* bytes) override;
   int maintainDirectoryStatistics(const std::string& path) override;
 
+  int openDirectory(const std::string& path, int* fd) override;
+  int openDirectoryAt(int dir, const std::string& name, int* fd) override;
+  int statAt(int dir, const std::string& name, struct stat* st) override;
+  int readDirectoryAt(int dir, std::vector<VSADirectoryEntry>* entries) override;
+  int mkdirAt(int dir, const std::string& name, mode_t mode) override;
+  int unlinkAt(int dir, const std::string& name, bool directory) override;
+  int chownAt(int dir, const std::string& name, uid_t uid, gid_t gid) override;
+  int chmodAt(int dir, const std::string& name, mode_t mode) override;
+  int getFlagsAt(int dir, const std::string& name, int* flags) override;
+  int setFlagsAt(int dir, const std::string& name, int flags) override;
+  int setSystemContainerACLAt(int dir, const std::string& name, VSASystemContainerACL kind,
+                              gid_t gid) override;
+  int getProtectionClassAt(int dir, const std::string& name, int* protectionClass) override;
+  int setProtectionClassAt(int dir, const std::string& name, int protectionClass) override;
+  int syncDirectory(int dir) override;
+
+  // Opens `path` with `flags` (O_CLOEXEC added) without following a link
+  // anywhere in it.
+  static int openNoSymlinks(const std::string& path, int flags, VSAUniqueFd* fd);
+  // Opens the directory holding `path` and names its last component.
+  static int openParent(const std::string& path, VSAUniqueFd* dir, std::string* name);
+
  private:
+  template <typename F>
+  int atParent(const std::string& path, F&& call);
+  // "/proc/self/fd/<dir>/<name>": the item by its directory's descriptor.
+  static std::string procPath(int dir, const std::string& name);
+  // Opens a regular file or directory for an ioctl; others are ENOTTY.
+  static int openForIoctl(int dir, const std::string& name, VSAUniqueFd* fd);
+
   std::function<bool()> isLocked_;
 };

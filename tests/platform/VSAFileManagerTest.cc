@@ -269,8 +269,8 @@ TEST_F(FileManager, ListingHidesDotNamesAndWalkReportsEverything) {
   EXPECT_EQ(names, (std::set<std::string>{"Documents", "visible"}));
   EXPECT_FALSE(fm_->urlsForItemsInDirectoryAtURL(base_ + "/none", &error));
   int dirs = 0, ends = 0, others = 0;
-  ASSERT_TRUE(fm_->traverseDirectory(
-      base_, &error, [&](const std::string&, const struct stat&, VSAFileManager::WalkPhase w) {
+  ASSERT_TRUE(
+      fm_->traverseDirectory(base_, &error, [&](const VSAWalkItem&, VSAFileManager::WalkPhase w) {
         (w == VSAFileManager::WalkPhase::Directory      ? dirs
          : w == VSAFileManager::WalkPhase::DirectoryEnd ? ends
                                                         : others)++;
