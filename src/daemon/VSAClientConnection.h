@@ -70,7 +70,7 @@ class VSAClientConnection {
   // the client has none, or for a class outside 1-13).
   std::optional<std::set<std::string>> _lookupForContainerClass(VSAContainerClass containerClass);
   bool _createTopLevelContainerDirectory(const std::string& url, VSAContainerClass containerClass,
-                                         uid_t owner, VSAErrorRef* error);
+                                         uid_t owner, gid_t group, VSAErrorRef* error);
   bool _createSubDirectories(const std::string& url, const VSAMetadata& containerMetadata,
                              VSAErrorRef* error);
   int32_t _dataProtectionClassForContainerMetadata(const VSAMetadata& metadata);

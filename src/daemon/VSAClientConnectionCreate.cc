@@ -88,12 +88,12 @@ int32_t VSAClientConnection::_dataProtectionClassForContainerMetadata(const VSAM
 
 bool VSAClientConnection::_createTopLevelContainerDirectory(const std::string& url,
                                                             VSAContainerClass c, uid_t owner,
-                                                            VSAErrorRef* error) {
+                                                            gid_t group, VSAErrorRef* error) {
   if (VSAContainerClassIsBundle(c))
     owner = CONTAINER_INSTALLATION_UID;
   else if (VSAContainerClassIsSystem(c))
     owner = 0;
-  return context_.fileManager->createDirectoryAtURL(url, true, 0755, owner, 0, error);
+  return context_.fileManager->createDirectoryAtURL(url, true, 0755, owner, 0, error, group);
 }
 
 bool VSAClientConnection::_createSubDirectories(const std::string& url, const VSAMetadata& metadata,
@@ -104,6 +104,7 @@ bool VSAClientConnection::_createSubDirectories(const std::string& url, const VS
   uid_t owner = VSAContainerClassIsBundle(c) ? CONTAINER_INSTALLATION_UID
                 : system                     ? kVSANobodyID
                          : metadata.userIdentity()->posixUIDForContainerClass(c);
+  gid_t group = system ? kVSANobodyID : metadata.userIdentity()->posixGIDForContainerClass(c);
   VSAResultCode libraryError = VSAResult::kSuccess;
   auto names = context_.subdirectories->subdirectoriesForClass(c, &libraryError);
   if (!names) {
@@ -125,7 +126,7 @@ bool VSAClientConnection::_createSubDirectories(const std::string& url, const VS
     std::string path = VSAPathJoin(url, name);
     VSAErrorRef underlying;
     if (!context_.fileManager->createDirectoryAtURL(
-            path, true, mode, owner, static_cast<uint32_t>(itemClass), &underlying)) {
+            path, true, mode, owner, static_cast<uint32_t>(itemClass), &underlying, group)) {
       auto e = VSA_ERROR_UNDERLYING(underlying->resultCode(kStagingCreateFailed), underlying,
                                     "Failed to create sub-dir for %@ at %@ (protClass: %d)", name,
                                     url, itemClass);
@@ -190,7 +191,8 @@ struct CreateSteps {
     std::string staging = VSAPathJoin(config.stagingDirectoryURLForUserIdentity(user, c), name);
     VSAErrorRef underlying;
     if (!connection._createTopLevelContainerDirectory(
-            staging, c, user->posixUIDForContainerClass(c), &underlying)) {
+            staging, c, user->posixUIDForContainerClass(c), user->posixGIDForContainerClass(c),
+            &underlying)) {
       *error = failure(kStagingCreateFailed, underlying,
                        VSAFormat("Failed to create staging dir at %@ : %@", staging, underlying));
       return nullptr;

@@ -24,9 +24,10 @@ VSAGlobalConfiguration::~VSAGlobalConfiguration() = default;
 
 std::string VSAGlobalConfiguration::ensureDirectory(const std::string& path, uid_t owner,
                                                     uint32_t protectionClass,
-                                                    const char* failureFormat) {
+                                                    const char* failureFormat,
+                                                    std::optional<gid_t> group) {
   VSAErrorRef error;
-  if (!fileManager_->createDirectoryAtURL(path, true, 0755, owner, protectionClass, &error))
+  if (!fileManager_->createDirectoryAtURL(path, true, 0755, owner, protectionClass, &error, group))
     VSALog(kVSALogError, "VSAGlobalConfiguration", failureFormat, path, error);
   return path;
 }

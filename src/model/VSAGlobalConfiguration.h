@@ -71,8 +71,11 @@ class VSAGlobalConfiguration {
       const VSAUserIdentityRef& userIdentity);
 
   // Creates `path` (mode 0755, parents too); logs `failureFormat` on failure.
+  // A directory it makes goes to `owner` and `group` (default: the owner's
+  // primary group). The path comes back either way: whatever acts on it next
+  // goes through the file system, which refuses a link in its way.
   std::string ensureDirectory(const std::string& path, uid_t owner, uint32_t protectionClass,
-                              const char* failureFormat);
+                              const char* failureFormat, std::optional<gid_t> group = {});
 
  private:
   VSASystemRoot root_;

@@ -14,7 +14,8 @@ VSAPerUserConfiguration::VSAPerUserConfiguration(VSAUserIdentityRef userIdentity
 
 std::string VSAPerUserConfiguration::ensure(const std::string& path, const char* failureFormat) {
   return global_.ensureDirectory(path, userIdentity_ ? userIdentity_->posixUID() : 0,
-                                 kVSANoProtectionClass, failureFormat);
+                                 kVSANoProtectionClass, failureFormat,
+                                 userIdentity_ ? userIdentity_->posixGID() : 0);
 }
 
 std::string VSAPerUserConfiguration::userBaseDirectory() {

@@ -142,11 +142,12 @@ std::optional<std::string> VSAFileManager::realPathForURL(const std::string& pat
 }
 
 bool VSAFileManager::createDirectoryAtURL(const std::string& path, bool intermediates, mode_t mode,
-                                          uid_t owner, uint32_t protectionClass,
-                                          VSAErrorRef* error) {
+                                          uid_t owner, uint32_t protectionClass, VSAErrorRef* error,
+                                          std::optional<gid_t> group) {
   const char* fn = "createDirectoryAtURL";
+  bool created = false;
   if (intermediates) {
-    if (int rc = makePath(path, mode)) {
+    if (int rc = makePath(path, mode, &created)) {
       VSASetError(
           error, VSAFileManagerFail(rc, fn, "mkpath_np of %s failed: %s", path, std::strerror(rc)));
       return false;
@@ -155,6 +156,8 @@ bool VSAFileManager::createDirectoryAtURL(const std::string& path, bool intermed
     VSASetError(error,
                 VSAFileManagerFail(rc, fn, "mkdir of %s failed: %s", path, std::strerror(rc)));
     return false;
+  } else {
+    created = rc == 0;
   }
   if (protectionClass != kVSANoProtectionClass) {
     if (int rc = fs_->setProtectionClass(path, static_cast<int>(protectionClass))) {
@@ -164,9 +167,15 @@ bool VSAFileManager::createDirectoryAtURL(const std::string& path, bool intermed
       return false;
     }
   }
-  if (owner != 0) {
-    if (int rc = fs_->lchown(path, owner, owner)) {
-      VSASetError(error, VSAFileManagerFail(rc, fn, "Failed to chown(%d,%d) %s: %s", owner, owner,
+  // Only what this call made changes hands: an existing directory may be one
+  // that its owner swapped in, and root must not give away what it finds.
+  if (owner != 0 && created) {
+    if (!group) {
+      auto account = userDatabase_ ? userDatabase_->userWithUID(owner) : std::nullopt;
+      group = account ? account->gid : static_cast<gid_t>(owner);
+    }
+    if (int rc = fs_->lchown(path, owner, *group)) {
+      VSASetError(error, VSAFileManagerFail(rc, fn, "Failed to chown(%d,%d) %s: %s", owner, *group,
                                             path, std::strerror(rc)));
       return false;
     }
@@ -178,15 +187,18 @@ bool VSAFileManager::createDirectoryAtURL(const std::string& path, bool intermed
 // missing: a directory whose parent exists (the usual case) costs one mkdir,
 // an existing one a mkdir and an lstat, however deep the path. A non-directory
 // (a symbolic link included) in the way is ENOTDIR.
-int VSAFileManager::makePath(const std::string& path, mode_t mode, int depth) {
+int VSAFileManager::makePath(const std::string& path, mode_t mode, bool* created, int depth) {
+  *created = false;
   if (path.empty() || path == "/" || depth > 256) return path.empty() ? ENOENT : 0;
   int rc = fs_->mkdir(path, mode);
   if (rc == ENOENT) {
     std::string parent = VSADirectoryName(path);
     if (parent == path) return rc;
-    if (int prc = makePath(parent, mode, depth + 1)) return prc;
+    bool parentCreated = false;
+    if (int prc = makePath(parent, mode, &parentCreated, depth + 1)) return prc;
     rc = fs_->mkdir(path, mode);
   }
+  if (rc == 0) *created = true;
   if (rc == EEXIST) {
     struct stat st;
     if (int src = fs_->lstat(path, &st)) return src;

@@ -58,8 +58,12 @@ class VSAFileManager {
   // The resolved path of `path` if it stays strictly inside `base`, else nothing.
   std::optional<std::string> realPathForURL(const std::string& path, const std::string& base);
 
+  // A directory the call makes itself is given to `owner` (when not root) and
+  // `group` (by default the owner's primary group); one that was there already
+  // keeps its owner. A link or non-directory in the way is ENOTDIR or ELOOP.
   bool createDirectoryAtURL(const std::string& path, bool withIntermediateDirectories, mode_t mode,
-                            uid_t owner, uint32_t protectionClass, VSAErrorRef* error);
+                            uid_t owner, uint32_t protectionClass, VSAErrorRef* error,
+                            std::optional<gid_t> group = std::nullopt);
   bool moveItemAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
   bool moveItemIfExistsAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
   bool copyItemAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
@@ -133,7 +137,8 @@ class VSAFileManager {
   std::optional<std::string> realPathAllowingMissing(const std::string& path);
   std::optional<gid_t> systemUsersGroup(VSAErrorRef* error);
   // mkdir -p from the bottom up: 0 or an errno.
-  int makePath(const std::string& path, mode_t mode, int depth = 0);
+  // `created` tells whether `path` itself was made by this call.
+  int makePath(const std::string& path, mode_t mode, bool* created, int depth = 0);
 
   std::shared_ptr<VSAFileSystem> fs_;
   std::shared_ptr<const VSAUserDatabase> userDatabase_;

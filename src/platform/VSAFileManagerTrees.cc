@@ -169,7 +169,9 @@ void VSAFileManager::removeEntry(Removal& r, int directory, const std::string& n
   if (st.st_dev != r.device) return r.record(path, EXDEV);
   removeDirectoryContents(r, fd.get(), path, depth);
   fd.reset();
-  r.record(path, unlinkUnlocking(directory, name, path, true));
+  rc = unlinkUnlocking(directory, name, path, true);
+  if (rc == ENOTDIR) rc = unlinkUnlocking(directory, name, path, false);  // swapped meanwhile
+  r.record(path, rc);
 }
 
 bool VSAFileManager::removeItemAtURL(const std::string& path, VSAErrorRef* error) {

@@ -85,14 +85,21 @@ TEST_F(FileManager, MissingTailResolvesThroughTheDeepestExistingPrefix) {
   EXPECT_EQ(*r, real(base_ + "/Documents/sub") + "/new/deeper/file");
 }
 
-TEST_F(FileManager, CreatingAnExistingDirectoryStillAppliesOwnerAndClass) {
-  std::string dir = base_ + "/Documents";
+TEST_F(FileManager, OnlyADirectoryTheCallMakesChangesHands) {
+  std::ofstream(root_ + "/etc/passwd") << "mobile:x:501:777::/private/var/mobile:/bin/false\n";
+  std::string dir = base_ + "/Documents";  // there already, root's
   VSAErrorRef error;
   ASSERT_TRUE(fm_->createDirectoryAtURL(dir, false, 0755, 501, 3, &error));
   struct stat st;
   ASSERT_EQ(lstat(dir.c_str(), &st), 0);
+  EXPECT_EQ(st.st_uid, 0u) << "an existing directory keeps its owner";
+  ASSERT_TRUE(fm_->createDirectoryAtURL(base_ + "/New/Inner", true, 0755, 501, 3, &error));
+  ASSERT_EQ(lstat((base_ + "/New/Inner").c_str(), &st), 0);
   EXPECT_EQ(st.st_uid, 501u);
-  EXPECT_EQ(st.st_gid, 501u) << "the owner number is used as group too";
+  EXPECT_EQ(st.st_gid, 777u) << "the owner's primary group, not its uid";
+  ASSERT_TRUE(fm_->createDirectoryAtURL(base_ + "/Grouped", true, 0755, 501, 3, &error, 12));
+  ASSERT_EQ(lstat((base_ + "/Grouped").c_str(), &st), 0);
+  EXPECT_EQ(st.st_gid, 12u);
   int cls = 0;
   ASSERT_TRUE(fm_->dataProtectionClassOfItemAtURL(dir, &cls, &error));
   EXPECT_EQ(cls, 3);
