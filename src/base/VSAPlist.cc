@@ -224,6 +224,12 @@ std::optional<VSAValue> parseXML(const uint8_t* bytes, size_t length, std::strin
     *why = "XML property list too large";
     return std::nullopt;
   }
+  // NUL is no XML character, and libplist asserts (ending the process) on a
+  // string or key that holds one.
+  if (std::memchr(bytes, 0, length)) {
+    *why = "NUL byte in XML text";
+    return std::nullopt;
+  }
   // libplist builds and frees its tree recursively: a deep list must be
   // refused before it gets there. The root sits at depth 0, so kMaxDepth + 1
   // collections may nest; the conversion below checks every value's depth.

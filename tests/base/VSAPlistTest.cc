@@ -95,6 +95,25 @@ TEST(VSAPlist, XMLNestingScanFollowsLibplistTags) {
   EXPECT_EQ(depth("<array a=\"1\"><arrayish><dict\t>"), 3u);
 }
 
+TEST(VSAPlist, NULInXMLTextIsRefusedNotFatal) {
+  // libplist asserts that a string or key has no NUL in it; such text must
+  // never reach it (found by fuzzing).
+  VSAErrorRef error;
+  for (const char* tag : {"string", "key"}) {
+    std::string xml = std::string("<plist version=\"1.0\"><dict><key>k</key><") + tag + ">ab" +
+                      std::string(3, '\0') + "cd</" + tag + "></dict></plist>";
+    EXPECT_FALSE(VSAPlist::parse(bytesOf(xml), &error)) << tag;
+  }
+  std::string cdata =
+      std::string("<plist version=\"1.0\"><string><![CDATA[x") + '\0' + "y]]></string></plist>";
+  EXPECT_FALSE(VSAPlist::parse(bytesOf(cdata), &error));
+  // A character reference to NUL is refused by libplist itself.
+  std::string entity =
+      "<plist version=\"1.0\"><dict><key>a&#0;b</key><string>a&#0;b</string>"
+      "</dict></plist>";
+  EXPECT_FALSE(VSAPlist::parse(bytesOf(entity), &error));
+}
+
 TEST(VSAPlist, OversizedXMLIsRefusedUnread) {
   std::string xml = "<plist version=\"1.0\"><string>" +
                     std::string(kVSAMaxXMLPropertyListSize, 'a') + "</string></plist>";
