@@ -3,6 +3,8 @@
 #include <bit>
 #include <cstring>
 #include <limits>
+#include <new>
+#include <stdexcept>
 
 #include "base/VSAPathString.h"
 
@@ -235,7 +237,8 @@ class Encoder {
 
 class Decoder {
  public:
-  Decoder(const uint8_t* d, size_t n) : d_(d), n_(n) {}
+  Decoder(const uint8_t* d, size_t n)
+      : d_(d), n_(n), budget_(VSABinaryPlist::decodedSizeBudget(n)) {}
 
   std::optional<VSAValue> run(std::string* error) {
     if (!readTrailer()) return fail(error);
@@ -253,6 +256,13 @@ class Decoder {
   bool bad(const char* why) {
     if (why_.empty()) why_ = why;
     return false;
+  }
+
+  // Charges `bytes` against the byte budget before they are allocated.
+  bool charge(uint64_t bytes) {
+    if (bytes > budget_ - spent_) return bad("decoded size exceeds the budget");
+    spent_ += bytes;
+    return true;
   }
 
   uint64_t readBE(size_t pos, int size) const {
@@ -311,6 +321,7 @@ class Decoder {
   bool readObject(uint64_t index, int depth, VSAValue& out) {
     if (depth > VSABinaryPlist::kMaxDepth) return bad("nesting too deep");
     if (++decoded_ > VSABinaryPlist::kMaxDecodedValues) return bad("too many values");
+    if (!charge(VSABinaryPlist::kValueCost)) return false;
     size_t pos;
     if (!offsetOf(index, pos)) return false;
     uint8_t marker = d_[pos++];
@@ -342,18 +353,21 @@ class Decoder {
       }
       case 0x40: {
         uint64_t count;
-        if (!readCount(pos, low, count) || !fits(pos, count, 1)) return false;
+        if (!readCount(pos, low, count) || !fits(pos, count, 1) || !charge(count)) return false;
         out = VSAValue(VSAValue::Data(d_ + pos, d_ + pos + count));
         return true;
       }
       case 0x50: {
         uint64_t count;
-        if (!readCount(pos, low, count) || !fits(pos, count, 1)) return false;
+        // Each byte becomes at least one UTF-8 byte: that much is charged
+        // before the string is built, the rest once its length is known.
+        if (!readCount(pos, low, count) || !fits(pos, count, 1) || !charge(count)) return false;
         // One-byte strings are ASCII; stray high bytes are taken as Latin-1 so
         // that every decoded string is valid UTF-8.
         std::string s;
         s.reserve(count);
         for (uint64_t i = 0; i < count; ++i) VSAAppendUTF8(s, d_[pos + i]);
+        if (!charge(s.size() - count)) return false;
         out = VSAValue(std::move(s));
         return true;
       }
@@ -390,7 +404,9 @@ class Decoder {
 
   bool readUTF16(size_t pos, uint8_t low, VSAValue& out) {
     uint64_t count;
-    if (!readCount(pos, low, count) || !fits(pos, count, 2)) return false;
+    // Each UTF-16 unit becomes at least one UTF-8 byte (charged now), a pair
+    // at most four; the rest is charged once the string is built.
+    if (!readCount(pos, low, count) || !fits(pos, count, 2) || !charge(count)) return false;
     std::string s;
     s.reserve(count);
     for (uint64_t i = 0; i < count; ++i) {
@@ -406,6 +422,7 @@ class Decoder {
       }
       VSAAppendUTF8(s, u);
     }
+    if (!charge(s.size() - count)) return false;
     out = VSAValue(std::move(s));
     return true;
   }
@@ -422,7 +439,9 @@ class Decoder {
     bool ok = true;
     if (high == 0xA0) {
       VSAValue::Array a;
-      a.reserve(count);
+      // Every element costs at least kValueCost, so no more than the rest of
+      // the budget allows is reserved up front.
+      a.reserve(std::min<uint64_t>(count, (budget_ - spent_) / VSABinaryPlist::kValueCost));
       for (uint64_t i = 0; ok && i < count; ++i) {
         VSAValue child;
         ok = readObject(readBE(pos + i * refSize_, refSize_), depth + 1, child);
@@ -450,6 +469,7 @@ class Decoder {
   uint64_t numObjects_ = 0, top_ = 0, tableOffset_ = 0;
   std::vector<uint8_t> visiting_;
   size_t decoded_ = 0;
+  uint64_t budget_ = 0, spent_ = 0;
   std::string why_;
 };
 
@@ -464,7 +484,35 @@ std::optional<std::vector<uint8_t>> VSABinaryPlist::encode(const VSAValue& value
   return Encoder(form).run(value, error);
 }
 
+size_t VSABinaryPlist::decodedSizeBudget(size_t inputLength) {
+  constexpr size_t kMax = std::numeric_limits<size_t>::max();
+  if (inputLength > (kMax - kDecodedBytesAllowance) / kDecodedBytesPerInputByte) return kMax;
+  return inputLength * kDecodedBytesPerInputByte + kDecodedBytesAllowance;
+}
+
+size_t VSABinaryPlist::decodedSize(const VSAValue& value) {
+  size_t size = kValueCost;
+  if (auto s = value.stringValue()) {
+    size += s->size();
+  } else if (auto d = value.dataValue()) {
+    size += d->size();
+  } else if (auto a = value.arrayValue()) {
+    for (const VSAValue& child : *a) size += decodedSize(child);
+  } else if (auto dict = value.dictionaryValue()) {
+    for (const auto& [key, child] : *dict) size += kValueCost + key.size() + decodedSize(child);
+  }
+  return size;
+}
+
 std::optional<VSAValue> VSABinaryPlist::decode(const uint8_t* bytes, size_t length,
                                                std::string* error) {
-  return Decoder(bytes, length).run(error);
+  // The budget keeps a hostile list small, but a daemon short of memory
+  // must still answer "cannot decode" rather than end.
+  try {
+    return Decoder(bytes, length).run(error);
+  } catch (const std::bad_alloc&) {
+  } catch (const std::length_error&) {
+  }
+  if (error) *error = "out of memory while decoding";
+  return std::nullopt;
 }

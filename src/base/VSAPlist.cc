@@ -1,13 +1,19 @@
 #include "base/VSAPlist.h"
 
 #include <fcntl.h>
+#include <linux/openat2.h>
 #include <plist/plist.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 #include <limits>
+#include <new>
+#include <stdexcept>
+#include <string_view>
 
 namespace {
 
@@ -54,8 +60,24 @@ plist_t toPlistNode(const VSAValue& v) {
   return plist_new_string("");
 }
 
-bool fromPlistNode(plist_t node, int depth, VSAValue& out) {
+// Converts libplist's tree, charging each value as the binary decoder does
+// (VSABinaryPlist::decodedSize) against `budget`.
+struct Budget {
+  size_t left;
+  bool exceeded = false;
+  bool charge(size_t bytes) {
+    if (bytes > left) {
+      exceeded = true;
+      return false;
+    }
+    left -= bytes;
+    return true;
+  }
+};
+
+bool fromPlistNode(plist_t node, int depth, Budget& budget, VSAValue& out) {
   if (!node || depth > VSABinaryPlist::kMaxDepth) return false;
+  if (!budget.charge(VSABinaryPlist::kValueCost)) return false;
   switch (plist_get_node_type(node)) {
     case PLIST_BOOLEAN: {
       uint8_t b = 0;
@@ -81,18 +103,21 @@ bool fromPlistNode(plist_t node, int depth, VSAValue& out) {
     case PLIST_KEY: {
       char* s = nullptr;
       plist_get_string_val(node, &s);
-      out = VSAValue(std::string(s ? s : ""));
+      bool ok = budget.charge(s ? std::strlen(s) : 0);
+      if (ok) out = VSAValue(std::string(s ? s : ""));
       free(s);
-      return true;
+      return ok;
     }
     case PLIST_DATA: {
       char* p = nullptr;
       uint64_t n = 0;
       plist_get_data_val(node, &p, &n);
-      out = VSAValue(
-          VSAValue::Data(reinterpret_cast<uint8_t*>(p), reinterpret_cast<uint8_t*>(p) + n));
+      bool ok = budget.charge(n);
+      if (ok)
+        out = VSAValue(
+            VSAValue::Data(reinterpret_cast<uint8_t*>(p), reinterpret_cast<uint8_t*>(p) + n));
       free(p);
-      return true;
+      return ok;
     }
     case PLIST_DATE: {
       int32_t sec = 0, usec = 0;
@@ -105,7 +130,7 @@ bool fromPlistNode(plist_t node, int depth, VSAValue& out) {
       uint32_t n = plist_array_get_size(node);
       for (uint32_t i = 0; i < n; ++i) {
         VSAValue c;
-        if (!fromPlistNode(plist_array_get_item(node, i), depth + 1, c)) return false;
+        if (!fromPlistNode(plist_array_get_item(node, i), depth + 1, budget, c)) return false;
         a.push_back(std::move(c));
       }
       out = VSAValue(std::move(a));
@@ -125,10 +150,12 @@ bool fromPlistNode(plist_t node, int depth, VSAValue& out) {
           break;
         }
         VSAValue c;
-        ok = key && fromPlistNode(val, depth + 1, c);
+        ok = key && budget.charge(VSABinaryPlist::kValueCost + std::strlen(key)) &&
+             fromPlistNode(val, depth + 1, budget, c);
         if (ok) d[key] = std::move(c);
         free(key);
       }
+      // The iterator is freed even when a key was refused.
       free(it);
       if (!ok) return false;
       out = VSAValue(std::move(d));
@@ -172,27 +199,121 @@ std::optional<std::vector<uint8_t>> VSAPlist::serialize(const VSAValue& value, F
   return out;
 }
 
-std::optional<VSAValue> VSAPlist::parse(const uint8_t* bytes, size_t length, VSAErrorRef* error) {
-  if (VSABinaryPlist::isBinaryPlist(bytes, length)) {
-    std::string why;
-    auto v = VSABinaryPlist::decode(bytes, length, &why);
-    if (!v) VSASetError(error, parseError(why));
-    return v;
+namespace {
+
+bool startsWith(const uint8_t* p, const uint8_t* end, const char* text) {
+  size_t n = std::strlen(text);
+  return static_cast<size_t>(end - p) >= n && std::memcmp(p, text, n) == 0;
+}
+
+// The position just past the first `text` at or after `p`, or `end`.
+const uint8_t* skipPast(const uint8_t* p, const uint8_t* end, const char* text) {
+  size_t n = std::strlen(text);
+  const uint8_t* hit = std::search(p, end, text, text + n);
+  return hit == end ? end : hit + n;
+}
+
+bool isTagEnd(uint8_t c) {
+  return c == ' ' || c == '\t' || c == '\r' || c == '\n' || c == '<' || c == '>';
+}
+
+std::optional<VSAValue> parseXML(const uint8_t* bytes, size_t length, std::string* why) {
+  if (length == 0) {
+    *why = "empty";
+    return std::nullopt;
   }
-  if (length == 0 || length > std::numeric_limits<uint32_t>::max()) {
-    VSASetError(error, parseError("empty or oversized"));
+  if (length > kVSAMaxXMLPropertyListSize) {
+    *why = "XML property list too large";
+    return std::nullopt;
+  }
+  // NUL is no XML character, and libplist asserts (ending the process) on a
+  // string or key that holds one.
+  if (std::memchr(bytes, 0, length)) {
+    *why = "NUL byte in XML text";
+    return std::nullopt;
+  }
+  // libplist builds and frees its tree recursively: a deep list must be
+  // refused before it gets there. The root sits at depth 0, so kMaxDepth + 1
+  // collections may nest; the conversion below checks every value's depth.
+  if (VSAPlist::xmlNestingDepth(bytes, length) >
+      static_cast<size_t>(VSABinaryPlist::kMaxDepth) + 1) {
+    *why = "nesting too deep";
     return std::nullopt;
   }
   plist_t node = nullptr;
   plist_from_xml(reinterpret_cast<const char*>(bytes), static_cast<uint32_t>(length), &node);
-  VSAValue out;
-  bool ok = node && fromPlistNode(node, 0, out);
-  if (node) plist_free(node);
-  if (!ok) {
-    VSASetError(error, parseError("not a property list"));
+  if (!node) {
+    *why = "not a property list";
     return std::nullopt;
   }
+  VSAValue out;
+  Budget budget{VSABinaryPlist::decodedSizeBudget(length)};
+  bool ok = false;
+  try {
+    ok = fromPlistNode(node, 0, budget, out);
+    if (!ok) *why = budget.exceeded ? "decoded size exceeds the budget" : "not a property list";
+  } catch (const std::bad_alloc&) {
+    *why = "out of memory while decoding";
+  } catch (const std::length_error&) {
+    *why = "out of memory while decoding";
+  }
+  plist_free(node);
+  if (!ok) return std::nullopt;
   return out;
+}
+
+}  // namespace
+
+size_t VSAPlist::xmlNestingDepth(const uint8_t* bytes, size_t length) {
+  const uint8_t* p = bytes;
+  const uint8_t* end = bytes + length;
+  size_t depth = 0, deepest = 0;
+  while ((p = std::find(p, end, '<')) != end) {
+    if (startsWith(p, end, "<!--")) {
+      p = skipPast(p + 4, end, "-->");
+    } else if (startsWith(p, end, "<![CDATA[")) {
+      p = skipPast(p + 9, end, "]]>");
+    } else if (startsWith(p, end, "<?")) {
+      p = skipPast(p + 2, end, "?>");
+    } else if (startsWith(p, end, "<!DOCTYPE")) {
+      // An internal subset runs to "]>", otherwise the declaration ends at '>'.
+      const uint8_t* q = p + 9;
+      while (q != end && *q != '[' && *q != '>') ++q;
+      p = q != end && *q == '[' ? skipPast(q, end, "]>") : (q == end ? end : q + 1);
+    } else {
+      const uint8_t* name = p + 1;
+      const uint8_t* q = name;
+      while (q != end && !isTagEnd(*q)) ++q;
+      std::string_view tag(reinterpret_cast<const char*>(name), q - name);
+      // The tag ends at the next '>' (a '<' first is an error to libplist).
+      // Looking no further than the next '<' keeps the scan linear.
+      const uint8_t* close = q;
+      while (close != end && *close != '>' && *close != '<') ++close;
+      bool empty = close != end && *close == '>' && close > name && close[-1] == '/';
+      if (tag == "/array" || tag == "/dict") {
+        if (depth > 0) --depth;
+      } else if (!empty && (tag.starts_with("array") || tag.starts_with("dict"))) {
+        deepest = std::max(deepest, ++depth);
+      }
+      p = q;
+    }
+  }
+  return deepest;
+}
+
+std::optional<VSAValue> VSAPlist::parse(const uint8_t* bytes, size_t length, VSAErrorRef* error,
+                                        Accept accept) {
+  std::string why;
+  std::optional<VSAValue> value;
+  if (VSABinaryPlist::isBinaryPlist(bytes, length)) {
+    value = VSABinaryPlist::decode(bytes, length, &why);
+  } else if (accept == Accept::BinaryOnly) {
+    why = "not a binary property list";
+  } else {
+    value = parseXML(bytes, length, &why);
+  }
+  if (!value) VSASetError(error, parseError(why));
+  return value;
 }
 
 bool VSAWriteFileAtomically(const std::string& path, const std::vector<uint8_t>& bytes, mode_t mode,
@@ -236,42 +357,65 @@ int VSAMakeDirectories(const std::string& path, mode_t mode) {
   return S_ISDIR(st.st_mode) ? 0 : ENOTDIR;
 }
 
-std::optional<std::vector<uint8_t>> VSAReadFile(const std::string& path, VSAErrorRef* error,
-                                                size_t limit) {
-  int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
-  if (fd < 0) {
-    VSASetError(error, VSA_POSIX_ERROR(errno));
-    return std::nullopt;
-  }
+int VSAReadRegularFile(const std::string& path, size_t limit, std::vector<uint8_t>* bytes,
+                       struct stat* status) {
+  bytes->clear();
+  // O_NONBLOCK: opening a FIFO for reading would otherwise wait for a writer
+  // for ever. It changes nothing for the regular files read below.
+  // No link anywhere in the path: a directory that a user owns and swapped
+  // for a link must not make the daemon read from elsewhere.
+  struct open_how how {};
+  how.flags = O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY;
+  how.resolve = RESOLVE_NO_SYMLINKS;
+  int fd = static_cast<int>(::syscall(SYS_openat2, AT_FDCWD, path.c_str(), &how, sizeof how));
+  if (fd < 0 && errno == ENOSYS)
+    fd = ::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY);
+  if (fd < 0) return errno;
   struct stat st;
-  if (fstat(fd, &st) != 0 || !S_ISREG(st.st_mode) || static_cast<size_t>(st.st_size) > limit) {
-    int err = S_ISREG(st.st_mode) ? EFBIG : EINVAL;
-    ::close(fd);
-    VSASetError(error, VSA_POSIX_ERROR(err));
-    return std::nullopt;
-  }
-  std::vector<uint8_t> out;
-  out.reserve(st.st_size);
-  uint8_t buf[65536];
-  for (;;) {
-    ssize_t r = ::read(fd, buf, sizeof buf);
-    if (r < 0 && errno == EINTR) continue;
-    if (r < 0) {
-      int err = errno;
-      ::close(fd);
-      VSASetError(error, VSA_POSIX_ERROR(err));
-      return std::nullopt;
+  int rc = 0;
+  if (fstat(fd, &st) != 0)
+    rc = errno;
+  else if (!S_ISREG(st.st_mode))
+    rc = EINVAL;
+  else if (st.st_size < 0 || static_cast<uint64_t>(st.st_size) > limit)
+    rc = EFBIG;  // refused by its size: a huge (or sparse) file is never read
+  if (rc == 0) {
+    // The file may grow after fstat: read at most one byte past the limit,
+    // into a buffer sized by what was there when it was checked.
+    bytes->reserve(static_cast<size_t>(st.st_size));
+    uint8_t buf[65536];
+    for (;;) {
+      size_t room = limit - bytes->size();  // never negative: reads stop past the limit
+      size_t want = room >= sizeof buf ? sizeof buf : room + 1;
+      ssize_t n = ::read(fd, buf, want);
+      if (n < 0 && errno == EINTR) continue;
+      if (n < 0) rc = errno;
+      if (n <= 0) break;
+      if (bytes->size() + static_cast<size_t>(n) > limit) {
+        rc = EFBIG;
+        break;
+      }
+      bytes->insert(bytes->end(), buf, buf + n);
     }
-    if (r == 0) break;
-    if (out.size() + r > limit) {
-      ::close(fd);
-      VSASetError(error, VSA_POSIX_ERROR(EFBIG));
-      return std::nullopt;
-    }
-    out.insert(out.end(), buf, buf + r);
   }
   ::close(fd);
-  return out;
+  if (rc != 0) {
+    bytes->clear();
+    bytes->shrink_to_fit();
+  } else if (status) {
+    *status = st;
+  }
+  return rc;
+}
+
+std::optional<std::vector<uint8_t>> VSAReadFile(const std::string& path, VSAErrorRef* error,
+                                                size_t limit) {
+  std::vector<uint8_t> bytes;
+  if (int rc = VSAReadRegularFile(path, limit, &bytes)) {
+    VSASetError(error, VSA_POSIX_ERROR(rc));
+    return std::nullopt;
+  }
+  return bytes;
 }
 
 bool VSA_writeToURL(const VSAValue& dictionary, const std::string& path, uint64_t options,
@@ -283,11 +427,13 @@ bool VSA_writeToURL(const VSAValue& dictionary, const std::string& path, uint64_
 }
 
 std::optional<VSAValue> VSA_dictionaryWithContentsOfURL(const std::string& path, uint64_t options,
-                                                        VSAErrorRef* error) {
-  (void)options;
-  auto bytes = VSAReadFile(path, error);
+                                                        VSAErrorRef* error, size_t limit) {
+  auto bytes = VSAReadFile(path, error, limit);
   if (!bytes) return std::nullopt;
-  auto value = VSAPlist::parse(*bytes, error);
+  auto value =
+      VSAPlist::parse(*bytes, error,
+                      (options & kVSAReadBinaryPropertyListOnly) ? VSAPlist::Accept::BinaryOnly
+                                                                 : VSAPlist::Accept::AnyFormat);
   if (!value) return std::nullopt;
   if (!value->isDictionary()) {
     VSASetError(error,

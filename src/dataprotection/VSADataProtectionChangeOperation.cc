@@ -224,7 +224,8 @@ bool VSADataProtectionChangeOperation::_onQueue_stillMostCurrentUpdate() {
   assert(queue_->isCurrent());
   std::string url = updateFileURL();
   VSAErrorRef error;
-  auto dict = VSA_dictionaryWithContentsOfURL(url, 0, &error);
+  auto dict = VSA_dictionaryWithContentsOfURL(url, kVSAReadBinaryPropertyListOnly, &error,
+                                              kVSADataProtectionUpdateFileMaxSize);
   if (!dict) {
     VSALog(kVSALogError, __func__, "Failed to read data protection update from %@", url);
     return false;

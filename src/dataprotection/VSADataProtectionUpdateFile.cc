@@ -58,7 +58,8 @@ VSADataProtectionUpdate::_readAndValidateDataProtectionUpdateAtURL(const std::st
     return std::nullopt;
   }
   VSAErrorRef underlying;
-  auto dict = VSA_dictionaryWithContentsOfURL(url, 0, &underlying);
+  auto dict = VSA_dictionaryWithContentsOfURL(url, kVSAReadBinaryPropertyListOnly, &underlying,
+                                              kVSADataProtectionUpdateFileMaxSize);
   if (!dict) {
     auto e = VSA_ERROR_UNDERLYING(VSAResult::kInvalidUpdateFile, underlying,
                                   "Failed to read update info at URL %@", url);

@@ -1,7 +1,10 @@
 // The persisted form of one pending protection change: the update file's
 // keys, its writer and its validating reader. The writer goes through the
 // file manager's file system (temporary file, protection class, rename), so
-// a reader never sees half a file and tests can fail any step. Stateless.
+// a reader never sees half a file and tests can fail any step. The reader
+// takes only what the writer makes: a binary property list of at most
+// kVSADataProtectionUpdateFileMaxSize bytes, read without blocking and
+// without following a link. Stateless.
 #pragma once
 
 #include <cstdint>
@@ -23,6 +26,10 @@ inline constexpr const char* kVSADataOperationRetryIfLockedKey = "VSADataOperati
 inline constexpr const char* kVSADataOperationInternalIDKey = "VSADataOperationInternalID";
 inline constexpr const char* kVSADataOperationUserIdentityKey = "VSADataOperationUserIdentity";
 inline constexpr const char* kVSADataOperationUserIdKey = "VSADataOperationUserId";
+
+// The largest update file read: the writer's dictionary (seven scalars and
+// a user identity) takes well under a kilobyte.
+inline constexpr size_t kVSADataProtectionUpdateFileMaxSize = 16u << 10;
 
 struct VSADataProtectionUpdate {
   std::string identifier;

@@ -121,8 +121,8 @@ VSAMetadataRef VSAMetadata::readAndValidateMetadataAtFileUrl(
   const VSAResultCode bad = VSAResult::kInvalidUpdateFile;  // 29
   std::vector<uint8_t> bytes;
   std::optional<VSAValue> dict;
-  if (configuration.fileManager().fileSystem().readFile(file, &bytes) == 0)
-    dict = VSAPlist::parse(bytes, nullptr);
+  if (configuration.fileManager().fileSystem().readFile(file, &bytes, kVSAMetadataFileMaxSize) == 0)
+    dict = VSAPlist::parse(bytes, nullptr, VSAPlist::Accept::BinaryOnly);
   if (!dict || !dict->isDictionary())
     return invalid(error, VSAResult::kMetadataUnreadable, "Failed to read metadata at URL %@",
                    file);

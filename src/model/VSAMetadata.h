@@ -4,7 +4,12 @@
 // The file is a binary property list, always written through a temporary
 // file in the staging directory for the container's owner and class and then
 // moved over the old one: it is never written in place, so a failure at any
-// step leaves the previous file intact. Reading validates every field in a
+// step leaves the previous file intact. The container belongs to an app, so
+// whatever sits at that name is untrusted: it is read through the file
+// system's bounded, non-blocking readFile (at most kVSAMetadataFileMaxSize
+// bytes), only a binary property list is accepted, and a FIFO, link,
+// directory, oversized or XML file is just "unreadable" (code 12) like a
+// missing one. Reading validates every field in a
 // fixed order (codes 12 and 29 with the exact messages) and optionally that
 // the container sits in the directory of its class. Not synchronised: one
 // object belongs to one request.
@@ -17,6 +22,10 @@
 #include "base/VSAError.h"
 #include "base/VSAValue.h"
 #include "model/VSAConcreteContainerIdentity.h"
+
+// The largest metadata file read. The daemon writes a few hundred bytes (an
+// info dictionary adds a little); anything larger was not written by it.
+inline constexpr size_t kVSAMetadataFileMaxSize = 64u << 10;
 
 class VSAGlobalConfiguration;
 class VSAUserIdentityCache;

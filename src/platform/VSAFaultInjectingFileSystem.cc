@@ -142,9 +142,10 @@ int VSAFaultInjectingFileSystem::writeFile(const std::string& path,
   return inner_->writeFile(path, bytes, mode);
 }
 
-int VSAFaultInjectingFileSystem::readFile(const std::string& path, std::vector<uint8_t>* bytes) {
+int VSAFaultInjectingFileSystem::readFile(const std::string& path, std::vector<uint8_t>* bytes,
+                                          size_t maxSize) {
   if (int e = injected(Op::ReadFile)) return e;
-  return inner_->readFile(path, bytes);
+  return inner_->readFile(path, bytes, maxSize);
 }
 
 int VSAFaultInjectingFileSystem::mkdtemp(const std::string& templ, std::string* path) {

@@ -102,7 +102,14 @@ class VSAFileSystem {
   // Creates or truncates `path` with `bytes` and syncs it.
   virtual int writeFile(const std::string& path, const std::vector<uint8_t>& bytes,
                         mode_t mode) = 0;
-  virtual int readFile(const std::string& path, std::vector<uint8_t>* bytes) = 0;
+  // Reads regular file `path` whole, but never more than `maxSize` bytes:
+  // opened O_RDONLY|O_NOFOLLOW|O_NONBLOCK|O_CLOEXEC (a FIFO in its place
+  // cannot block the caller) and checked with fstat on the open descriptor.
+  // Errors besides those of open/read: ELOOP for a symbolic link, ENXIO for
+  // a socket, EINVAL for any other non-regular file, EFBIG for a file larger
+  // than `maxSize` (refused by its size, without reading it). Every caller
+  // names the limit of the kind of file it reads.
+  virtual int readFile(const std::string& path, std::vector<uint8_t>* bytes, size_t maxSize) = 0;
   // `templ` ends in "XXXXXX"; the created directory's path comes back in `path`.
   virtual int mkdtemp(const std::string& templ, std::string* path) = 0;
   // Writes one of the system-container ACLs granting group `gid`; a link is

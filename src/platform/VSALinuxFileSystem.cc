@@ -18,6 +18,7 @@
 #include <sstream>
 
 #include "base/VSAPathString.h"
+#include "base/VSAPlist.h"
 
 namespace {
 int err(int rc) { return rc == 0 ? 0 : errno; }
@@ -246,21 +247,10 @@ int VSALinuxFileSystem::writeFile(const std::string& path, const std::vector<uin
   return rc;
 }
 
-int VSALinuxFileSystem::readFile(const std::string& path, std::vector<uint8_t>* bytes) {
-  int fd = ::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC);
-  if (fd < 0) return errno;
-  bytes->clear();
-  uint8_t buf[65536];
-  int rc = 0;
-  for (;;) {
-    ssize_t n = ::read(fd, buf, sizeof buf);
-    if (n < 0 && errno == EINTR) continue;
-    if (n < 0) rc = errno;
-    if (n <= 0) break;
-    bytes->insert(bytes->end(), buf, buf + n);
-  }
-  ::close(fd);
-  return rc;
+int VSALinuxFileSystem::readFile(const std::string& path, std::vector<uint8_t>* bytes,
+                                 size_t maxSize) {
+  // The bounded, non-blocking read shared with the property-list file helpers.
+  return VSAReadRegularFile(path, maxSize, bytes);
 }
 
 int VSALinuxFileSystem::mkdtemp(const std::string& templ, std::string* path) {

@@ -42,7 +42,7 @@ class VSALinuxFileSystem : public VSAFileSystem {
   int copyData(const std::string& from, const std::string& to, mode_t mode) override;
   int symlink(const std::string& target, const std::string& path) override;
   int writeFile(const std::string& path, const std::vector<uint8_t>& bytes, mode_t mode) override;
-  int readFile(const std::string& path, std::vector<uint8_t>* bytes) override;
+  int readFile(const std::string& path, std::vector<uint8_t>* bytes, size_t maxSize) override;
   int mkdtemp(const std::string& templ, std::string* path) override;
   int setSystemContainerACL(const std::string& path, VSASystemContainerACL kind,
                             gid_t gid) override;

@@ -8,6 +8,11 @@
 #include "base/VSAPlist.h"
 
 namespace {
+// The largest process record read: "<start time> <persona id>" is at most
+// 20 + 1 + 10 digits and a newline; anything longer was not written by the
+// launcher.
+constexpr size_t kVSAProcessRecordMaxSize = 64;
+
 thread_local std::optional<std::pair<pid_t, uint64_t>> tServedProcess;
 
 std::optional<VSAPersonaAttributes> parseRecord(const VSAValue& record, const VSASystemRoot& root) {
@@ -125,21 +130,18 @@ std::string VSALinuxPersonaService::processRecordPath(pid_t pid) const {
 
 std::optional<uint32_t> VSALinuxPersonaService::recordedPersonaID(pid_t pid,
                                                                   uint64_t startTime) const {
-  std::string path = processRecordPath(pid);
-  // Checked on the open file, so the record read is the one that was checked.
-  int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
-  if (fd < 0) return std::nullopt;
+  // A bounded, non-blocking read of a regular file whose owner is checked on
+  // the descriptor that was read, so the record read is the one checked and
+  // a FIFO or huge file in its place cannot stall the request.
+  std::vector<uint8_t> bytes;
   struct stat st;
-  char buf[64];
-  ssize_t n = fstat(fd, &st) == 0 && S_ISREG(st.st_mode) && st.st_uid == 0
-                  ? ::read(fd, buf, sizeof buf - 1)
-                  : -1;
-  ::close(fd);
-  if (n <= 0) return std::nullopt;
-  buf[n] = '\0';
+  if (VSAReadRegularFile(processRecordPath(pid), kVSAProcessRecordMaxSize, &bytes, &st) != 0 ||
+      st.st_uid != 0 || bytes.empty())
+    return std::nullopt;
+  std::string text(bytes.begin(), bytes.end());
   unsigned long long recordedStart = 0, persona = 0;
-  if (std::sscanf(buf, "%llu %llu", &recordedStart, &persona) != 2 || recordedStart != startTime ||
-      persona > UINT32_MAX)
+  if (std::sscanf(text.c_str(), "%llu %llu", &recordedStart, &persona) != 2 ||
+      recordedStart != startTime || persona > UINT32_MAX)
     return std::nullopt;
   return static_cast<uint32_t>(persona);
 }

@@ -1,10 +1,13 @@
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <chrono>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <future>
 
 #include "base/VSAPathString.h"
 #include "base/VSAPlist.h"
@@ -44,6 +47,139 @@ TEST(VSAPlist, GarbageIsAnErrorNotACrash) {
   ASSERT_TRUE(error);
   EXPECT_EQ(error->domain(), kVSACocoaErrorDomain);
   EXPECT_FALSE(VSAPlist::parse(nullptr, 0, &error));
+}
+
+std::vector<uint8_t> bytesOf(const std::string& text) { return {text.begin(), text.end()}; }
+
+std::string nestedXML(size_t levels, const char* tag = "array") {
+  std::string xml = "<?xml version=\"1.0\"?><plist version=\"1.0\">";
+  for (size_t i = 0; i < levels; ++i) xml += std::string("<") + tag + ">";
+  for (size_t i = 0; i < levels; ++i) xml += std::string("</") + tag + ">";
+  return xml + "</plist>";
+}
+
+TEST(VSAPlist, DeepXMLIsRefusedBeforeLibplistRecursesIntoIt) {
+  VSAErrorRef error;
+  // 200,000 levels: enough to overflow the stack in libplist's recursion.
+  EXPECT_FALSE(VSAPlist::parse(bytesOf(nestedXML(200000)), &error));
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code(), kVSAPropertyListReadCorruptError);
+  EXPECT_FALSE(VSAPlist::parse(bytesOf(nestedXML(200000, "dict")), &error));
+  // Just past the bound fails, the bound itself (as the binary decoder
+  // counts it) decodes, the same in both formats.
+  VSAValue v{VSAValue::Array{}};
+  for (int i = 0; i < VSABinaryPlist::kMaxDepth; ++i) v = VSAValue(VSAValue::Array{v});
+  for (auto format : {VSAPlist::Format::XML, VSAPlist::Format::Binary}) {
+    auto ok = VSAPlist::serialize(v, format, &error);
+    ASSERT_TRUE(ok);
+    EXPECT_TRUE(VSAPlist::parse(*ok, &error)) << static_cast<int>(format);
+    auto deeper = VSAPlist::serialize(VSAValue(VSAValue::Array{v}), format, &error);
+    EXPECT_FALSE(VSAPlist::parse(*deeper, &error)) << static_cast<int>(format);
+  }
+}
+
+TEST(VSAPlist, XMLNestingScanFollowsLibplistTags) {
+  auto depth = [](const std::string& xml) {
+    return VSAPlist::xmlNestingDepth(reinterpret_cast<const uint8_t*>(xml.data()), xml.size());
+  };
+  EXPECT_EQ(depth(nestedXML(3)), 3u);
+  EXPECT_EQ(depth("<dict><key>a</key><array/><dict/><array><true/></array></dict>"), 2u);
+  // Tags inside comments, CDATA, processing instructions and DOCTYPE
+  // subsets are text to libplist, and so to the scan.
+  EXPECT_EQ(depth("<array><!-- </array><array><array> --><array></array></array>"), 2u);
+  EXPECT_EQ(depth("<array><string><![CDATA[<array><array>]]></string></array>"), 1u);
+  EXPECT_EQ(depth("<?pi <array><array> ?><!DOCTYPE x [ <array><array> ]><array></array>"), 1u);
+  // A closing tag libplist would not take as one does not close a level.
+  EXPECT_EQ(depth("<array></array-x><array></ array><array>"), 3u);
+  // Tags with attributes or odd names err on the deep side.
+  EXPECT_EQ(depth("<array a=\"1\"><arrayish><dict\t>"), 3u);
+}
+
+TEST(VSAPlist, NULInXMLTextIsRefusedNotFatal) {
+  // libplist asserts that a string or key has no NUL in it; such text must
+  // never reach it (found by fuzzing).
+  VSAErrorRef error;
+  for (const char* tag : {"string", "key"}) {
+    std::string xml = std::string("<plist version=\"1.0\"><dict><key>k</key><") + tag + ">ab" +
+                      std::string(3, '\0') + "cd</" + tag + "></dict></plist>";
+    EXPECT_FALSE(VSAPlist::parse(bytesOf(xml), &error)) << tag;
+  }
+  std::string cdata =
+      std::string("<plist version=\"1.0\"><string><![CDATA[x") + '\0' + "y]]></string></plist>";
+  EXPECT_FALSE(VSAPlist::parse(bytesOf(cdata), &error));
+  // A character reference to NUL is refused by libplist itself.
+  std::string entity =
+      "<plist version=\"1.0\"><dict><key>a&#0;b</key><string>a&#0;b</string>"
+      "</dict></plist>";
+  EXPECT_FALSE(VSAPlist::parse(bytesOf(entity), &error));
+}
+
+TEST(VSAPlist, OversizedXMLIsRefusedUnread) {
+  std::string xml = "<plist version=\"1.0\"><string>" +
+                    std::string(kVSAMaxXMLPropertyListSize, 'a') + "</string></plist>";
+  VSAErrorRef error;
+  EXPECT_FALSE(VSAPlist::parse(bytesOf(xml), &error));
+  ASSERT_TRUE(error);
+  EXPECT_NE(error->message().find("XML property list too large"), std::string::npos)
+      << error->message();
+}
+
+TEST(VSAPlist, BinaryOnlyRefusesXML) {
+  VSAValue v = VSAValue::Dictionary{{"k", VSAValue("v")}};
+  VSAErrorRef error;
+  auto xml = VSAPlist::serialize(v, VSAPlist::Format::XML, &error);
+  auto binary = VSAPlist::serialize(v, VSAPlist::Format::Binary, &error);
+  EXPECT_TRUE(VSAPlist::parse(*xml, &error));
+  EXPECT_FALSE(VSAPlist::parse(*xml, &error, VSAPlist::Accept::BinaryOnly));
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code(), kVSAPropertyListReadCorruptError);
+  auto back = VSAPlist::parse(*binary, &error, VSAPlist::Accept::BinaryOnly);
+  ASSERT_TRUE(back);
+  EXPECT_EQ(*back, v);
+}
+
+TEST_F(VSAPlistFiles, BoundedReadRefusesWhatIsNotASmallRegularFile) {
+  std::vector<uint8_t> bytes;
+  std::string file = VSAPathJoin(dir_, "file");
+  std::ofstream(file) << std::string(100, 'x');
+  EXPECT_EQ(VSAReadRegularFile(file, 100, &bytes), 0);
+  EXPECT_EQ(bytes.size(), 100u);
+  EXPECT_EQ(VSAReadRegularFile(file, 99, &bytes), EFBIG);
+  EXPECT_TRUE(bytes.empty());
+  // A 64 GiB sparse file is refused by its size, not read.
+  std::string sparse = VSAPathJoin(dir_, "sparse");
+  int fd = ::open(sparse.c_str(), O_WRONLY | O_CREAT, 0644);
+  ASSERT_GE(fd, 0);
+  ASSERT_EQ(ftruncate(fd, off_t{64} << 30), 0);
+  ::close(fd);
+  EXPECT_EQ(VSAReadRegularFile(sparse, 64 << 10, &bytes), EFBIG);
+  std::string link = VSAPathJoin(dir_, "link");
+  ASSERT_EQ(::symlink(file.c_str(), link.c_str()), 0);
+  EXPECT_EQ(VSAReadRegularFile(link, 1 << 20, &bytes), ELOOP);
+  EXPECT_EQ(VSAReadRegularFile(dir_, 1 << 20, &bytes), EINVAL);
+  std::string fifo = VSAPathJoin(dir_, "fifo");
+  ASSERT_EQ(::mkfifo(fifo.c_str(), 0644), 0);
+  EXPECT_EQ(VSAReadRegularFile(fifo, 1 << 20, &bytes), EINVAL);
+  struct stat st;
+  EXPECT_EQ(VSAReadRegularFile(file, 100, &bytes, &st), 0);
+  EXPECT_EQ(st.st_size, 100);
+}
+
+TEST_F(VSAPlistFiles, AFIFOInPlaceOfAPropertyListDoesNotBlock) {
+  std::string fifo = VSAPathJoin(dir_, "fifo.plist");
+  ASSERT_EQ(::mkfifo(fifo.c_str(), 0644), 0);
+  auto read = std::async(std::launch::async, [&] {
+    VSAErrorRef error;
+    bool refused = !VSA_dictionaryWithContentsOfURL(fifo, 0, &error);
+    return refused && error && error->code() == EINVAL;
+  });
+  if (read.wait_for(std::chrono::seconds(20)) != std::future_status::ready) {
+    ADD_FAILURE() << "reading a FIFO blocked";
+    // Give the blocked reader a writer (then end of file) so the test ends.
+    int w = ::open(fifo.c_str(), O_WRONLY | O_NONBLOCK);
+    if (w >= 0) ::close(w);
+  }
+  EXPECT_TRUE(read.get());
 }
 
 TEST_F(VSAPlistFiles, WriteIsAtomicAndReadsBack) {

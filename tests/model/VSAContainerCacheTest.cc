@@ -1,7 +1,12 @@
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
+#include <chrono>
 #include <filesystem>
 #include <fstream>
+#include <future>
 
 #include "VSATestTempDir.h"
 #include "base/VSAPlist.h"
@@ -94,6 +99,79 @@ TEST_F(Cache, BuildsFromDiskSkippingBadNamesAndWrongClasses) {
   EXPECT_EQ(cache_->allContainersForUserIdentity(personal_, 12, false, false, nullptr)->size(), 1u);
   EXPECT_FALSE(VSAContainerCache::containerURLIsValidForContainerClass(
       "/x/com.wellknown", 13, [](const std::string&, VSAContainerClass c) { return c == 12; }));
+}
+
+TEST_F(Cache, HostileMetadataFilesCostOnlyTheirOwnContainer) {
+  onDisk(personal_, "com.good", 2);
+  auto file = [](const VSAMetadataRef& m) { return m->url() + "/" + kVSAMetadataFileName; };
+  // A FIFO: opening it for reading would wait for a writer for ever.
+  auto fifo = onDisk(personal_, "com.fifo", 2);
+  fs::remove(file(fifo));
+  ASSERT_EQ(::mkfifo(file(fifo).c_str(), 0644), 0);
+  // A well-formed metadata file padded past the size limit.
+  auto big = onDisk(personal_, "com.big", 2);
+  big->setInfo(VSAValue(VSAValue::Dictionary{{"pad", VSAValue(std::string(100 << 10, 'p'))}}));
+  ASSERT_TRUE(big->writeMetadataToDiskWithError(*config_, nullptr));
+  // The same metadata as XML text: never what the daemon writes.
+  auto xml = onDisk(personal_, "com.xml", 2);
+  VSAValue dict = *VSA_dictionaryWithContentsOfURL(file(xml), 0, nullptr);
+  auto text = VSAPlist::serialize(dict, VSAPlist::Format::XML, nullptr);
+  ASSERT_TRUE(VSAWriteFileAtomically(file(xml), *text, 0644, nullptr));
+  // A symbolic link to a valid metadata file, and a directory in its place.
+  auto link = onDisk(personal_, "com.link", 2);
+  auto elsewhere = onDisk(personal_, "com.elsewhere", 4);
+  fs::remove(file(link));
+  fs::create_symlink(file(elsewhere), file(link));
+  auto dir = onDisk(personal_, "com.dir", 2);
+  fs::remove(file(dir));
+  fs::create_directory(file(dir));
+
+  auto listing = std::async(std::launch::async, [&] {
+    return cache_->allContainersForUserIdentity(personal_, 2, false, false, nullptr);
+  });
+  if (listing.wait_for(std::chrono::seconds(20)) != std::future_status::ready) {
+    ADD_FAILURE() << "listing the class blocked on a FIFO";
+    int w = ::open(file(fifo).c_str(), O_WRONLY | O_NONBLOCK);  // let the reader go
+    if (w >= 0) ::close(w);
+  }
+  auto all = listing.get();
+  ASSERT_TRUE(all);
+  std::vector<std::string> ids;
+  for (const auto& m : *all) ids.push_back(m->identifier());
+  EXPECT_EQ(ids, std::vector<std::string>{"com.good"});
+
+  // Each one alone is the "unreadable" failure, code 12.
+  for (const auto& m : {fifo, big, xml, link, dir}) {
+    VSAErrorRef error;
+    EXPECT_FALSE(VSAMetadata::readAndValidateMetadataAtUrl(m->url(), personal_, true, *config_,
+                                                           *identities_, &error))
+        << m->identifier();
+    ASSERT_TRUE(error) << m->identifier();
+    EXPECT_EQ(error->resultCode(0), VSAResult::kMetadataUnreadable) << m->identifier();
+  }
+  // Just under the limit is still read.
+  auto fits = onDisk(personal_, "com.fits", 2);
+  fits->setInfo(VSAValue(VSAValue::Dictionary{{"pad", VSAValue(std::string(60 << 10, 'p'))}}));
+  ASSERT_TRUE(fits->writeMetadataToDiskWithError(*config_, nullptr));
+  EXPECT_TRUE(VSAMetadata::readAndValidateMetadataAtUrl(fits->url(), personal_, true, *config_,
+                                                        *identities_, nullptr));
+}
+
+TEST_F(Cache, HugeSparseMetadataFileIsRefusedByItsSize) {
+  onDisk(personal_, "com.good", 2);
+  auto sparse = onDisk(personal_, "com.sparse", 2);
+  std::string path = sparse->url() + "/" + kVSAMetadataFileName;
+  // 64 GiB of holes: reading it whole would exhaust memory at every start.
+  ASSERT_EQ(::truncate(path.c_str(), off_t{64} << 30), 0);
+  auto all = cache_->allContainersForUserIdentity(personal_, 2, false, false, nullptr);
+  ASSERT_TRUE(all);
+  ASSERT_EQ(all->size(), 1u);
+  EXPECT_EQ((*all)[0]->identifier(), "com.good");
+  VSAErrorRef error;
+  EXPECT_FALSE(VSAMetadata::readAndValidateMetadataAtUrl(sparse->url(), personal_, true, *config_,
+                                                         *identities_, &error));
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->resultCode(0), VSAResult::kMetadataUnreadable);
 }
 
 TEST_F(Cache, VanishedMetadataIsReportedOnceThenNotFound) {

@@ -1,9 +1,12 @@
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <atomic>
 #include <filesystem>
 #include <fstream>
+#include <future>
 #include <thread>
 
 #include "VSATestTempDir.h"
@@ -123,6 +126,32 @@ TEST_F(PersonaFiles, ProcessRecordMustBeARootOwnedRegularFile) {
   EXPECT_EQ(service.recordedPersonaID(getpid(), start), 2u);
   std::ofstream(record) << "garbage";
   EXPECT_FALSE(service.recordedPersonaID(getpid(), start));
+}
+
+TEST_F(PersonaFiles, ProcessRecordIsReadWithoutBlockingAndWithinItsLimit) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to own the record";
+  write(VSAValue::Array{record(1, "personal", VSAValue("P")),
+                        record(2, "enterprise", VSAValue("E"))});
+  VSALinuxPersonaService service{VSASystemRoot(root_)};
+  uint64_t start = VSAAuditToken::processStartTime(getpid());
+  std::string record = service.processRecordPath(getpid());
+  // A FIFO in place of the record: opening it must not wait for a writer.
+  ASSERT_EQ(::mkfifo(record.c_str(), 0644), 0);
+  auto read =
+      std::async(std::launch::async, [&] { return service.recordedPersonaID(getpid(), start); });
+  if (read.wait_for(20s) != std::future_status::ready) {
+    ADD_FAILURE() << "reading a FIFO record blocked";
+    int w = ::open(record.c_str(), O_WRONLY | O_NONBLOCK);  // let the reader go
+    if (w >= 0) ::close(w);
+  }
+  EXPECT_FALSE(read.get());
+  std::filesystem::remove(record);
+  // A record that starts right but runs past the limit was not written by
+  // the launcher.
+  std::ofstream(record) << start << " 2\n" << std::string(4096, ' ');
+  EXPECT_FALSE(service.recordedPersonaID(getpid(), start));
+  std::ofstream(record, std::ios::trunc) << start << " 2\n";
+  EXPECT_EQ(service.recordedPersonaID(getpid(), start), 2u);
 }
 
 TEST_F(PersonaFiles, ObserverHearsFileChanges) {
