@@ -7,13 +7,24 @@
 
 #include "platform/VSAFrameCodec.h"
 
-VSAIPCConnection::VSAIPCConnection(int fd, uint64_t identifier, VSAAuditToken auditToken)
-    : fd_(fd), identifier_(identifier), auditToken_(auditToken) {
+VSAIPCConnection::VSAIPCConnection(int fd, uint64_t identifier, VSAAuditToken auditToken,
+                                   VSAClientRegistry* registry)
+    : fd_(fd),
+      identifier_(identifier),
+      auditToken_(auditToken),
+      executable_(VSAPeerExecutable::ofProcess(auditToken)) {
   struct timeval tv = {5, 0};
   setsockopt(fd_, SOL_SOCKET, SO_SNDTIMEO, &tv, sizeof tv);
+  // The entry is looked up once, for the file the peer ran when it connected.
+  if (registry && executable_ && !executable_->path.empty())
+    registryEntry_ = registry->entryForPeer(auditToken_, executable_->path);
 }
 
 VSAIPCConnection::~VSAIPCConnection() { ::close(fd_); }
+
+bool VSAIPCConnection::peerIsUnchanged() const {
+  return executable_ && executable_->isRunBy(auditToken_);
+}
 
 bool VSAIPCConnection::send(const VSAValue& message, VSAErrorRef* error) {
   auto frame = VSAFrameCodec::encode(message, error);

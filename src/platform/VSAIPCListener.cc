@@ -21,10 +21,12 @@ struct VSAIPCListener::Peer {
 };
 
 VSAIPCListener::VSAIPCListener(std::string socketPath, VSAWorkQueue::Ref queue,
-                               std::shared_ptr<VSATransactions> transactions)
+                               std::shared_ptr<VSATransactions> transactions,
+                               std::shared_ptr<VSAClientRegistry> registry)
     : socketPath_(std::move(socketPath)),
       queue_(std::move(queue)),
-      transactions_(std::move(transactions)) {}
+      transactions_(std::move(transactions)),
+      registry_(std::move(registry)) {}
 
 VSAIPCListener::~VSAIPCListener() { stop(); }
 
@@ -170,7 +172,10 @@ void VSAIPCListener::acceptPeers() {
     auto peer = std::make_unique<Peer>();
     {
       std::lock_guard lock(peersMutex_);
-      peer->connection = std::make_shared<VSAIPCConnection>(fd, nextIdentifier_++, *token);
+      // Pins the peer's executable and identity now, before it can exec
+      // anything else.
+      peer->connection =
+          std::make_shared<VSAIPCConnection>(fd, nextIdentifier_++, *token, registry_.get());
       peers_[fd] = std::move(peer);
     }
     epoll_event ev{};
@@ -206,7 +211,8 @@ void VSAIPCListener::readPeer(int fd) {
     if (n < 0 && errno == EINTR) continue;
     if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) return;
     if (n <= 0) {
-      // A peer that goes away between frames is ordinary; inside a frame it is not.
+      // A peer that goes away between frames is ordinary; inside a frame it is
+      // not.
       dropPeer(fd, n == 0 && peer->reader.pending() > 0 ? "stream ended inside a frame" : nullptr);
       return;
     }

@@ -20,6 +20,7 @@
 
 #include "base/VSAError.h"
 #include "base/VSAWorkQueue.h"
+#include "platform/VSAClientRegistry.h"
 #include "platform/VSAIPCMessage.h"
 #include "platform/VSATransactions.h"
 
@@ -27,8 +28,10 @@ class VSAIPCListener {
  public:
   using Handler = std::function<void(const VSAIPCMessageRef&)>;
 
+  // `registry` (may be null) gives each accepted peer its registry entry.
   VSAIPCListener(std::string socketPath, VSAWorkQueue::Ref queue,
-                 std::shared_ptr<VSATransactions> transactions);
+                 std::shared_ptr<VSATransactions> transactions,
+                 std::shared_ptr<VSAClientRegistry> registry = nullptr);
   ~VSAIPCListener();
   VSAIPCListener(const VSAIPCListener&) = delete;
   VSAIPCListener& operator=(const VSAIPCListener&) = delete;
@@ -54,6 +57,7 @@ class VSAIPCListener {
   std::string socketPath_;
   VSAWorkQueue::Ref queue_;
   std::shared_ptr<VSATransactions> transactions_;
+  std::shared_ptr<VSAClientRegistry> registry_;
   std::mutex handlerMutex_;
   Handler handler_;
   int listenFd_ = -1;

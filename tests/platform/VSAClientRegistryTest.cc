@@ -1,7 +1,7 @@
 // Registry entries are refused when their executable could be rewritten by a
-// non-root user, and an entry naming a "User" only identifies peers of that
-// uid.
+// non-root user, and an entry naming a "User" only identifies peers of that uid.
 #include <gtest/gtest.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -12,6 +12,7 @@
 #include "VSATestTempDir.h"
 #include "base/VSAPlist.h"
 #include "platform/VSAClientRegistry.h"
+#include "platform/VSAIPCConnection.h"
 
 namespace {
 
@@ -67,8 +68,7 @@ TEST_F(VSAClientRegistryTest, ExecutablesWritableByOthersThanRootAreRefused) {
                           "/opt/open/tool", "/opt/user/tool"})
     EXPECT_FALSE(registry.entryForExecutable(host(exe))) << exe;
 
-  // An executable opened up after its entry was loaded no longer identifies
-  // anyone.
+  // An executable opened up after its entry was loaded no longer identifies anyone.
   auto me = tokenWithUID(0);
   EXPECT_TRUE(registry.entryForPeer(me, host("/usr/bin/good")));
   chmod((root_ + "/usr/bin/good").c_str(), 0777);
@@ -99,10 +99,48 @@ TEST_F(VSAClientRegistryTest, AnEntryNamingAUserIdentifiesOnlyThatUID) {
   EXPECT_FALSE(registry.entryForPeer(mobile, host("/usr/bin/rootname")));
   for (auto* token : {&root, &mobile, &other})
     EXPECT_TRUE(registry.entryForPeer(*token, host("/usr/bin/anyone")));
-  // A user that cannot be resolved, or a value of the wrong type, refuses the
-  // entry.
+  // A user that cannot be resolved, or a value of the wrong type, refuses the entry.
   EXPECT_FALSE(registry.entryForPeer(root, host("/usr/bin/unknown")));
   EXPECT_FALSE(registry.entryForPeer(root, host("/usr/bin/malformed")));
+}
+
+TEST_F(VSAClientRegistryTest, AConnectionPinsItsPeersEntryOnlyForTheRightUser) {
+  // This test process is the peer; it runs as root.
+  ASSERT_EQ(geteuid(), 0u);
+  char buf[PATH_MAX];
+  ssize_t n = readlink("/proc/self/exe", buf, sizeof buf - 1);
+  ASSERT_GT(n, 0);
+  fs::create_symlink(std::string(buf, n), root_ + "/usr/bin/self");
+  auto registerSelf = [&](const VSAValue& user) {
+    VSAErrorRef error;
+    ASSERT_TRUE(VSA_writeToURL(VSAValue::Dictionary{{"Executable", VSAValue("/usr/bin/self")},
+                                                    {"SigningIdentifier", VSAValue("com.self")},
+                                                    {"User", user}},
+                               root_ + "/etc/vessad/clients.d/self.plist", 0, &error));
+  };
+  auto connect = [&](VSAClientRegistry& registry) {
+    int fds[2];
+    EXPECT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, fds), 0);
+    ::close(fds[1]);
+    return std::make_shared<VSAIPCConnection>(fds[0], 1, *VSAAuditToken::fromSocket(fds[0]),
+                                              &registry);
+  };
+  registerSelf(VSAValue("mobile"));
+  {
+    VSAClientRegistry registry{VSASystemRoot(root_)};
+    auto connection = connect(registry);
+    EXPECT_FALSE(connection->registryEntry()) << "uid 0 is not the entry's user";
+    EXPECT_TRUE(connection->peerIsUnchanged());
+  }
+  registerSelf(VSAValue(0));
+  {
+    VSAClientRegistry registry{VSASystemRoot(root_)};
+    auto connection = connect(registry);
+    ASSERT_TRUE(connection->registryEntry());
+    EXPECT_EQ(connection->registryEntry()->signingIdentifier, "com.self");
+    ASSERT_TRUE(connection->executable());
+    EXPECT_EQ(connection->executable()->path, std::string(buf, n));
+  }
 }
 
 }  // namespace
