@@ -9,24 +9,38 @@
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 
 #include "base/VSALog.h"
 #include "platform/VSAFrameCodec.h"
 
+namespace {
+constexpr const char* kOrigin = "VSAIPCListener";
+// How long accepting pauses when not even the reserve descriptor can be had.
+constexpr auto kAcceptPause = std::chrono::milliseconds(100);
+constexpr auto kRefusalLogInterval = std::chrono::seconds(1);
+}  // namespace
+
 struct VSAIPCListener::Peer {
   VSAIPCConnectionRef connection;
   VSAFrameReader reader;
+  uid_t uid = 0;
+  Clock::time_point lastFrame;     // accept, or the last complete frame
+  Clock::time_point frameStarted;  // first byte of the incomplete frame; epoch if none
+  size_t countedInput = 0;         // this peer's share of bufferedInput_
 };
 
 VSAIPCListener::VSAIPCListener(std::string socketPath, VSAWorkQueue::Ref queue,
                                std::shared_ptr<VSATransactions> transactions,
-                               std::shared_ptr<VSAClientRegistry> registry)
+                               std::shared_ptr<VSAClientRegistry> registry,
+                               VSAIPCListenerLimits limits)
     : socketPath_(std::move(socketPath)),
       queue_(std::move(queue)),
       transactions_(std::move(transactions)),
-      registry_(std::move(registry)) {}
+      registry_(std::move(registry)),
+      limits_(limits) {}
 
 VSAIPCListener::~VSAIPCListener() { stop(); }
 
@@ -47,7 +61,14 @@ bool socketIsServed(const sockaddr_un& addr) {
   ::close(fd);
   return served;
 }
+
+int openReserve() { return ::open("/dev/null", O_RDONLY | O_CLOEXEC); }
 }  // namespace
+
+bool VSAIPCListener::isValidMessageID(const VSAValue& id) {
+  if (id.isInteger()) return true;
+  return id.isString() && id.stringValue()->size() <= kVSAMaxMessageIDLength;
+}
 
 bool VSAIPCListener::listen(VSAErrorRef* error) {
   if (sd_listen_fds(0) >= 1 &&
@@ -77,8 +98,9 @@ bool VSAIPCListener::listen(VSAErrorRef* error) {
   }
   fcntl(listenFd_, F_SETFL, fcntl(listenFd_, F_GETFL) | O_NONBLOCK);
   epollFd_ = epoll_create1(EPOLL_CLOEXEC);
-  stopFd_ = eventfd(0, EFD_CLOEXEC);
-  if (epollFd_ < 0 || stopFd_ < 0) {
+  stopFd_ = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
+  reserveFd_ = openReserve();
+  if (epollFd_ < 0 || stopFd_ < 0 || reserveFd_ < 0) {
     VSASetError(error, VSA_POSIX_ERROR(errno));
     return false;
   }
@@ -88,6 +110,7 @@ bool VSAIPCListener::listen(VSAErrorRef* error) {
   epoll_ctl(epollFd_, EPOLL_CTL_ADD, listenFd_, &ev);
   ev.data.fd = stopFd_;
   epoll_ctl(epollFd_, EPOLL_CTL_ADD, stopFd_, &ev);
+  accepting_ = true;
   return true;
 }
 
@@ -98,32 +121,67 @@ void VSAIPCListener::setHandler(Handler handler) {
 
 void VSAIPCListener::resume() {
   if (listenFd_ < 0 || thread_.joinable()) return;
-  thread_ = std::thread([this] { run(); });
+  thread_ = std::thread([this] {
+    run();
+    std::lock_guard lock(controlMutex_);
+    threadExited_ = true;
+    controlChanged_.notify_all();
+  });
 }
 
-void VSAIPCListener::stopAccepting() {
-  if (thread_.joinable()) {
-    uint64_t one = 1;
-    (void)!::write(stopFd_, &one, sizeof one);
-    thread_.join();
-  }
+void VSAIPCListener::_onThread_stopAccepting() {
   if (listenFd_ >= 0) {
+    epoll_ctl(epollFd_, EPOLL_CTL_DEL, listenFd_, nullptr);
     ::close(listenFd_);
     if (ownsSocketFile_) ::unlink(socketPath_.c_str());
   }
   listenFd_ = -1;
+  accepting_ = false;
+  std::lock_guard lock(peersMutex_);
+  for (auto& [fd, peer] : peers_) peer->connection->setReading(false);
+}
+
+void VSAIPCListener::stopAccepting() {
+  std::unique_lock lock(controlMutex_);
+  if (thread_.joinable() && !threadExited_) {
+    if (!acceptingStopped_) {
+      stopAcceptingRequested_ = true;
+      uint64_t one = 1;
+      (void)!::write(stopFd_, &one, sizeof one);
+      controlChanged_.wait(lock, [this] { return acceptingStopped_ || threadExited_; });
+    }
+    if (acceptingStopped_) return;
+  }
+  lock.unlock();
+  _onThread_stopAccepting();  // the I/O thread is not running: nothing races
 }
 
 void VSAIPCListener::stop() {
   stopAccepting();
+  if (thread_.joinable()) {
+    {
+      std::lock_guard lock(controlMutex_);
+      stopRequested_ = true;
+    }
+    uint64_t one = 1;
+    (void)!::write(stopFd_, &one, sizeof one);
+    thread_.join();
+  }
   {
     std::lock_guard lock(peersMutex_);
-    for (auto& [fd, peer] : peers_) peer->connection->cancel();
+    for (auto& [fd, peer] : peers_) {
+      // Detached first: a late reply must not touch the epoll set closed below.
+      peer->connection->attachToPoller(-1);
+      peer->connection->cancel();
+    }
     peers_.clear();
+    connectionsPerUID_.clear();
+    bufferedInput_ = 0;
   }
   if (epollFd_ >= 0) ::close(epollFd_);
   if (stopFd_ >= 0) ::close(stopFd_);
-  epollFd_ = stopFd_ = -1;
+  if (reserveFd_ >= 0) ::close(reserveFd_);
+  epollFd_ = stopFd_ = reserveFd_ = -1;
 }
 
 size_t VSAIPCListener::connectionCount() const {
@@ -133,35 +191,99 @@ size_t VSAIPCListener::connectionCount() const {
 
 void VSAIPCListener::run() {
   pthread_setname_np(pthread_self(), "vessa-ipc");
+  // Deadlines are checked by a periodic sweep, a fraction of the shortest one.
+  auto interval =
+      std::clamp<Clock::duration>(std::min(limits_.idleTimeout, limits_.frameTimeout) / 4,
+                                  std::chrono::milliseconds(10), std::chrono::seconds(1));
+  auto nextSweep = Clock::now() + interval;
   epoll_event events[64];
   for (;;) {
-    int n = epoll_wait(epollFd_, events, 64, -1);
+    auto wait = std::chrono::ceil<std::chrono::milliseconds>(nextSweep - Clock::now()).count();
+    int n = epoll_wait(epollFd_, events, 64, static_cast<int>(std::max<int64_t>(wait, 0)));
     if (n < 0) {
       if (errno == EINTR) continue;
-      VSALogIn(VSALogCategory::Relay, kVSALogError, "VSAIPCListener", "epoll_wait failed: %s",
+      VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin, "epoll_wait failed: %s",
                strerror(errno));
       return;
     }
     for (int i = 0; i < n; ++i) {
       int fd = events[i].data.fd;
-      if (fd == stopFd_) return;
-      if (fd == listenFd_) {
-        acceptPeers();
+      uint32_t what = events[i].events;
+      if (fd == stopFd_) {
+        uint64_t count;
+        (void)!::read(stopFd_, &count, sizeof count);
+        std::unique_lock lock(controlMutex_);
+        if (stopRequested_) return;
+        if (stopAcceptingRequested_ && !acceptingStopped_) {
+          lock.unlock();
+          _onThread_stopAccepting();
+          lock.lock();
+          acceptingStopped_ = true;
+          controlChanged_.notify_all();
+        }
+      } else if (fd == listenFd_) {
+        if (accepting_) acceptPeers();
       } else {
-        readPeer(fd);
+        if (what & EPOLLOUT) writePeer(fd);
+        if (what & (EPOLLIN | EPOLLRDHUP | EPOLLHUP | EPOLLERR)) {
+          if (accepting_) {
+            readPeer(fd);
+          } else if (what & (EPOLLHUP | EPOLLERR)) {
+            dropPeer(fd, nullptr);  // gone while its late replies were awaited
+          }
+        }
       }
+    }
+    auto now = Clock::now();
+    if (now >= nextSweep) {
+      sweep(now);
+      nextSweep = now + interval;
     }
   }
 }
 
+void VSAIPCListener::noteRefusal(const char* why) {
+  ++refusalsSinceLog_;
+  lastRefusal_ = why;
+  auto now = Clock::now();
+  if (now - lastRefusalLog_ < kRefusalLogInterval) return;
+  VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin,
+           "Refused %zu connection(s) in the last second; last reason: %s", refusalsSinceLog_,
+           lastRefusal_);
+  lastRefusalLog_ = now;
+  refusalsSinceLog_ = 0;
+}
+
+bool VSAIPCListener::shedOnePeer() {
+  if (reserveFd_ < 0) reserveFd_ = openReserve();
+  if (reserveFd_ < 0) return false;
+  ::close(reserveFd_);
+  int fd = accept4(listenFd_, nullptr, nullptr, SOCK_CLOEXEC);
+  if (fd >= 0) ::close(fd);
+  reserveFd_ = openReserve();
+  noteRefusal("out of file descriptors");
+  return fd >= 0;
+}
+
 void VSAIPCListener::acceptPeers() {
   for (;;) {
-    int fd = accept4(listenFd_, nullptr, nullptr, SOCK_CLOEXEC);
+    int fd = accept4(listenFd_, nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK);
     if (fd < 0) {
-      if (errno == EINTR) continue;
-      if (errno != EAGAIN && errno != EWOULDBLOCK)
-        VSALogIn(VSALogCategory::Relay, kVSALogError, "VSAIPCListener", "accept failed: %s",
-                 strerror(errno));
+      if (errno == EINTR || errno == ECONNABORTED) continue;
+      if (errno == EAGAIN || errno == EWOULDBLOCK) return;
+      if (errno == EMFILE || errno == ENFILE) {
+        // The peer stays queued and the socket stays readable: it must be taken
+        // off the queue, or the loop would spin without serving anyone.
+        if (shedOnePeer()) continue;
+        if (reserveFd_ < 0) {
+          noteRefusal("out of file descriptors, no reserve");
+          epoll_ctl(epollFd_, EPOLL_CTL_DEL, listenFd_, nullptr);
+          acceptPaused_ = true;
+          acceptPausedUntil_ = Clock::now() + kAcceptPause;
+        }
+        return;
+      }
+      noteRefusal(strerror(errno));
       return;
     }
     auto token = VSAAuditToken::fromSocket(fd);
@@ -169,19 +291,31 @@ void VSAIPCListener::acceptPeers() {
       ::close(fd);
       continue;
     }
-    auto peer = std::make_unique<Peer>();
     {
       std::lock_guard lock(peersMutex_);
-      // Pins the peer's executable and identity now, before it can exec
-      // anything else.
-      peer->connection =
-          std::make_shared<VSAIPCConnection>(fd, nextIdentifier_++, *token, registry_.get());
+      if (connectionsPerUID_[token->uid] >= limits_.maxConnectionsPerUID) {
+        ::close(fd);
+        noteRefusal("too many connections from one uid");
+        continue;
+      }
+    }
+    // Pins the peer's executable and identity now, before it can exec anything else.
+    auto peer = std::make_unique<Peer>();
+    peer->connection = std::make_shared<VSAIPCConnection>(
+        fd, nextIdentifier_++, *token, registry_.get(), limits_.maxPendingOutput);
+    peer->uid = token->uid;
+    peer->lastFrame = Clock::now();
+    VSAIPCConnection& connection = *peer->connection;
+    {
+      std::lock_guard lock(peersMutex_);
+      ++connectionsPerUID_[peer->uid];
       peers_[fd] = std::move(peer);
     }
     epoll_event ev{};
     ev.events = EPOLLIN | EPOLLRDHUP;
     ev.data.fd = fd;
     epoll_ctl(epollFd_, EPOLL_CTL_ADD, fd, &ev);
+    connection.attachToPoller(epollFd_);
   }
 }
 
@@ -190,11 +324,27 @@ void VSAIPCListener::dropPeer(int fd, const char* why) {
   std::lock_guard lock(peersMutex_);
   auto it = peers_.find(fd);
   if (it == peers_.end()) return;
+  Peer& peer = *it->second;
   if (why)
-    VSALogIn(VSALogCategory::Relay, kVSALogError, "VSAIPCListener", "Dropping %@: %s",
-             it->second->connection->description(), why);
-  it->second->connection->cancel();
+    VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin, "Dropping %@: %s",
+             peer.connection->description(), why);
+  peer.connection->attachToPoller(-1);
+  peer.connection->cancel();
+  bufferedInput_ -= peer.countedInput;
+  if (--connectionsPerUID_[peer.uid] == 0) connectionsPerUID_.erase(peer.uid);
   peers_.erase(it);
+}
+
+void VSAIPCListener::writePeer(int fd) {
+  VSAIPCConnectionRef connection;
+  {
+    std::lock_guard lock(peersMutex_);
+    auto it = peers_.find(fd);
+    if (it == peers_.end()) return;
+    connection = it->second->connection;
+  }
+  // A peer that went away while replies waited is an ordinary disconnect.
+  if (!connection->flushPendingOutput()) dropPeer(fd, nullptr);
 }
 
 void VSAIPCListener::readPeer(int fd) {
@@ -206,39 +356,98 @@ void VSAIPCListener::readPeer(int fd) {
     peer = it->second.get();
   }
   uint8_t buf[65536];
-  for (;;) {
+  // A bounded number of reads per wake-up: a peer that writes without pause
+  // must not keep the thread from the others (epoll reports it again).
+  for (int round = 0; round < 16; ++round) {
     ssize_t n = recv(fd, buf, sizeof buf, MSG_DONTWAIT);
     if (n < 0 && errno == EINTR) continue;
     if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) return;
     if (n <= 0) {
-      // A peer that goes away between frames is ordinary; inside a frame it is
-      // not.
+      // A peer that goes away between frames is ordinary; inside a frame it is not.
       dropPeer(fd, n == 0 && peer->reader.pending() > 0 ? "stream ended inside a frame" : nullptr);
       return;
     }
     peer->reader.append(buf, static_cast<size_t>(n));
     std::vector<uint8_t> payload;
+    bool completed = false;
     for (;;) {
       auto status = peer->reader.next(payload);
       if (status == VSAFrameReader::Status::NeedMore) break;
       if (status == VSAFrameReader::Status::Oversized) {
-        VSALogIn(VSALogCategory::Relay, kVSALogError, "VSAIPCListener",
+        VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin,
                  "Frame of %u bytes exceeds the limit of %u bytes", peer->reader.oversizedLength(),
                  VSAFrameCodec::kMaxFrameSize);
         dropPeer(fd, "oversized frame");
         return;
       }
+      completed = true;
       std::string why;
       auto body = VSAFrameCodec::decodePayload(payload.data(), payload.size(), &why);
+      if (body && body->isDictionary()) {
+        const VSAValue* id = body->get(kVSAMessageIDKey);
+        if (id && !isValidMessageID(*id)) {
+          // A reply could not carry it back; the request is one without reply context.
+          body.reset();
+          why = "\"MessageID\" is neither an integer nor a string of at most 64 bytes";
+        }
+      }
       deliver(peer->connection, std::move(body), why);
+    }
+    auto now = Clock::now();
+    if (completed) peer->lastFrame = now;
+    size_t pending = peer->reader.pending();
+    if (pending == 0) {
+      peer->frameStarted = {};
+    } else if (completed || peer->frameStarted == Clock::time_point{}) {
+      peer->frameStarted = now;  // the first bytes of a new frame arrived in this read
+    }
+    bufferedInput_ = bufferedInput_ - peer->countedInput + pending;
+    peer->countedInput = pending;
+    if (bufferedInput_ > limits_.maxBufferedInput) {
+      dropPeer(fd, "incomplete frames of all connections exceed the input budget");
+      return;
     }
   }
 }
 
+void VSAIPCListener::sweep(Clock::time_point now) {
+  if (acceptPaused_ && now >= acceptPausedUntil_ && accepting_ && listenFd_ >= 0) {
+    epoll_event ev{};
+    ev.events = EPOLLIN;
+    ev.data.fd = listenFd_;
+    epoll_ctl(epollFd_, EPOLL_CTL_ADD, listenFd_, &ev);
+    acceptPaused_ = false;
+  }
+  std::vector<std::pair<int, const char*>> expired;
+  {
+    std::lock_guard lock(peersMutex_);
+    for (auto& [fd, peer] : peers_) {
+      if (peer->frameStarted != Clock::time_point{} &&
+          now - peer->frameStarted > limits_.frameTimeout) {
+        expired.emplace_back(fd, "a frame was not completed in time");
+        continue;
+      }
+      const VSAIPCConnection& c = *peer->connection;
+      // Waiting for a late reply is not idleness; a peer that stops reading is.
+      if (c.requestsInFlight() > 0) continue;
+      auto active = std::max(peer->lastFrame, c.lastRequestEnded());
+      if (now - active > limits_.idleTimeout) expired.emplace_back(fd, "idle for too long");
+    }
+  }
+  for (auto& [fd, why] : expired) dropPeer(fd, why);
+}
+
 void VSAIPCListener::deliver(const VSAIPCConnectionRef& connection, std::optional<VSAValue> body,
                              std::string problem) {
-  auto message = std::make_shared<VSAIPCMessage>(connection, std::move(body), std::move(problem),
-                                                 transactions_->open());
+  connection->requestBegan();
+  // The request is in flight until its message is gone: replied, or dropped.
+  VSAIPCMessageRef message(
+      new VSAIPCMessage(connection, std::move(body), std::move(problem), transactions_->open()),
+      [](VSAIPCMessage* m) {
+        VSAIPCConnectionRef c = m->connection();
+        delete m;
+        c->requestEnded();
+      });
   Handler handler;
   {
     std::lock_guard lock(handlerMutex_);
