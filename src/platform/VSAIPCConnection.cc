@@ -91,7 +91,7 @@ bool VSAIPCConnection::_lock_writePending(int* err) {
 void VSAIPCConnection::_lock_updateInterest() {
   if (epollFd_ < 0) return;
   uint32_t want = 0;
-  if (reading_) want |= EPOLLIN | EPOLLRDHUP;
+  if (reading_ && !throttled_.load()) want |= EPOLLIN | EPOLLRDHUP;
   if (out_.size() > outSent_) want |= EPOLLOUT;
   if (want == interest_) return;
   epoll_event ev{};
@@ -128,9 +128,15 @@ size_t VSAIPCConnection::pendingOutput() const {
 
 void VSAIPCConnection::requestBegan() { ++inFlight_; }
 
-void VSAIPCConnection::requestEnded() {
+size_t VSAIPCConnection::requestEnded() {
   lastRequestEnded_.store(std::chrono::steady_clock::now().time_since_epoch().count());
-  --inFlight_;
+  return --inFlight_;
+}
+
+void VSAIPCConnection::setThrottled(bool throttled) {
+  std::lock_guard lock(outMutex_);
+  throttled_.store(throttled);
+  _lock_updateInterest();
 }
 
 std::chrono::steady_clock::time_point VSAIPCConnection::lastRequestEnded() const {

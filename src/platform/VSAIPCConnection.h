@@ -74,12 +74,16 @@ class VSAIPCConnection {
   void attachToPoller(int epollFd);
   // Whether the poller should report input (false once the listener stops reading).
   void setReading(bool reading);
+  // Input paused because the peer has too many requests in flight.
+  void setThrottled(bool throttled);
+  bool isThrottled() const { return throttled_.load(); }
   // Writes pending output; false when the connection broke (it is cancelled).
   bool flushPendingOutput();
   size_t pendingOutput() const;
   // Requests received and not yet finished (their message is still alive).
   void requestBegan();
-  void requestEnded();
+  // Returns the number still in flight.
+  size_t requestEnded();
   size_t requestsInFlight() const { return inFlight_.load(); }
   // When the last request finished (steady clock); the epoch before any.
   std::chrono::steady_clock::time_point lastRequestEnded() const;
@@ -104,6 +108,7 @@ class VSAIPCConnection {
   uint32_t interest_ = 0;
 
   std::atomic<bool> cancelled_{false};
+  std::atomic<bool> throttled_{false};
   std::atomic<size_t> inFlight_{0};
   std::atomic<int64_t> lastRequestEnded_{0};
 };

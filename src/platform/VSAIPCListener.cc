@@ -32,6 +32,23 @@ struct VSAIPCListener::Peer {
   size_t countedInput = 0;         // this peer's share of bufferedInput_
 };
 
+// Connections whose input may resume, handed from whichever thread finished
+// their requests to the I/O thread. Shared with the messages, which can
+// outlive the listener: once it stops, `fd` is -1 and posts are ignored.
+struct VSAIPCListener::Resumer {
+  std::mutex mutex;
+  int fd = -1;
+  std::vector<std::weak_ptr<VSAIPCConnection>> waiting;
+
+  void post(const VSAIPCConnectionRef& connection) {
+    std::lock_guard lock(mutex);
+    if (fd < 0) return;
+    waiting.push_back(connection);
+    uint64_t one = 1;
+    (void)!::write(fd, &one, sizeof one);
+  }
+};
+
 VSAIPCListener::VSAIPCListener(std::string socketPath, VSAWorkQueue::Ref queue,
                                std::shared_ptr<VSATransactions> transactions,
                                std::shared_ptr<VSAClientRegistry> registry,
@@ -40,7 +57,8 @@ VSAIPCListener::VSAIPCListener(std::string socketPath, VSAWorkQueue::Ref queue,
       queue_(std::move(queue)),
       transactions_(std::move(transactions)),
       registry_(std::move(registry)),
-      limits_(limits) {}
+      limits_(limits),
+      resumer_(std::make_shared<Resumer>()) {}
 
 VSAIPCListener::~VSAIPCListener() { stop(); }
 
@@ -100,7 +118,8 @@ bool VSAIPCListener::listen(VSAErrorRef* error) {
   epollFd_ = epoll_create1(EPOLL_CLOEXEC);
   stopFd_ = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
   reserveFd_ = openReserve();
-  if (epollFd_ < 0 || stopFd_ < 0 || reserveFd_ < 0) {
+  resumer_->fd = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
+  if (epollFd_ < 0 || stopFd_ < 0 || reserveFd_ < 0 || resumer_->fd < 0) {
     VSASetError(error, VSA_POSIX_ERROR(errno));
     return false;
   }
@@ -110,6 +129,8 @@ bool VSAIPCListener::listen(VSAErrorRef* error) {
   epoll_ctl(epollFd_, EPOLL_CTL_ADD, listenFd_, &ev);
   ev.data.fd = stopFd_;
   epoll_ctl(epollFd_, EPOLL_CTL_ADD, stopFd_, &ev);
+  ev.data.fd = resumer_->fd;
+  epoll_ctl(epollFd_, EPOLL_CTL_ADD, resumer_->fd, &ev);
   accepting_ = true;
   return true;
 }
@@ -178,6 +199,12 @@ void VSAIPCListener::stop() {
     connectionsPerUID_.clear();
     bufferedInput_ = 0;
   }
+  {
+    std::lock_guard lock(resumer_->mutex);
+    if (resumer_->fd >= 0) ::close(resumer_->fd);
+    resumer_->fd = -1;
+    resumer_->waiting.clear();
+  }
   if (epollFd_ >= 0) ::close(epollFd_);
   if (stopFd_ >= 0) ::close(stopFd_);
   if (reserveFd_ >= 0) ::close(reserveFd_);
@@ -221,6 +248,8 @@ void VSAIPCListener::run() {
           acceptingStopped_ = true;
           controlChanged_.notify_all();
         }
+      } else if (fd == resumer_->fd) {
+        resumePeers();
       } else if (fd == listenFd_) {
         if (accepting_) acceptPeers();
       } else {
@@ -355,6 +384,7 @@ void VSAIPCListener::readPeer(int fd) {
     if (it == peers_.end()) return;
     peer = it->second.get();
   }
+  if (peer->connection->isThrottled()) return;  // reported before its input was paused
   uint8_t buf[65536];
   // A bounded number of reads per wake-up: a peer that writes without pause
   // must not keep the thread from the others (epoll reports it again).
@@ -368,45 +398,82 @@ void VSAIPCListener::readPeer(int fd) {
       return;
     }
     peer->reader.append(buf, static_cast<size_t>(n));
-    std::vector<uint8_t> payload;
-    bool completed = false;
-    for (;;) {
-      auto status = peer->reader.next(payload);
-      if (status == VSAFrameReader::Status::NeedMore) break;
-      if (status == VSAFrameReader::Status::Oversized) {
-        VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin,
-                 "Frame of %u bytes exceeds the limit of %u bytes", peer->reader.oversizedLength(),
-                 VSAFrameCodec::kMaxFrameSize);
-        dropPeer(fd, "oversized frame");
-        return;
+    if (!processFrames(fd, *peer) || peer->connection->isThrottled()) return;
+  }
+}
+
+bool VSAIPCListener::processFrames(int fd, Peer& peer) {
+  std::vector<uint8_t> payload;
+  bool completed = false;
+  for (;;) {
+    VSAIPCConnection& connection = *peer.connection;
+    if (connection.requestsInFlight() >= limits_.maxRequestsInFlight) {
+      connection.setThrottled(true);
+      // A request that ended before the flag was set did not see it: look again.
+      if (connection.requestsInFlight() > limits_.maxRequestsInFlight / 2) break;
+      connection.setThrottled(false);
+    }
+    auto status = peer.reader.next(payload);
+    if (status == VSAFrameReader::Status::NeedMore) break;
+    if (status == VSAFrameReader::Status::Oversized) {
+      VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin,
+               "Frame of %u bytes exceeds the limit of %u bytes", peer.reader.oversizedLength(),
+               VSAFrameCodec::kMaxFrameSize);
+      dropPeer(fd, "oversized frame");
+      return false;
+    }
+    completed = true;
+    std::string why;
+    auto body = VSAFrameCodec::decodePayload(payload.data(), payload.size(), &why);
+    if (body && body->isDictionary()) {
+      const VSAValue* id = body->get(kVSAMessageIDKey);
+      if (id && !isValidMessageID(*id)) {
+        // A reply could not carry it back; the request is one without reply context.
+        body.reset();
+        why = "\"MessageID\" is neither an integer nor a string of at most 64 bytes";
       }
-      completed = true;
-      std::string why;
-      auto body = VSAFrameCodec::decodePayload(payload.data(), payload.size(), &why);
-      if (body && body->isDictionary()) {
-        const VSAValue* id = body->get(kVSAMessageIDKey);
-        if (id && !isValidMessageID(*id)) {
-          // A reply could not carry it back; the request is one without reply context.
-          body.reset();
-          why = "\"MessageID\" is neither an integer nor a string of at most 64 bytes";
-        }
-      }
-      deliver(peer->connection, std::move(body), why);
     }
-    auto now = Clock::now();
-    if (completed) peer->lastFrame = now;
-    size_t pending = peer->reader.pending();
-    if (pending == 0) {
-      peer->frameStarted = {};
-    } else if (completed || peer->frameStarted == Clock::time_point{}) {
-      peer->frameStarted = now;  // the first bytes of a new frame arrived in this read
+    deliver(peer.connection, std::move(body), why);
+  }
+  auto now = Clock::now();
+  if (completed) peer.lastFrame = now;
+  size_t pending = peer.reader.pending();
+  if (pending == 0) {
+    peer.frameStarted = {};
+  } else if (completed || peer.frameStarted == Clock::time_point{}) {
+    peer.frameStarted = now;  // the first bytes of a new frame arrived in this read
+  }
+  bufferedInput_ = bufferedInput_ - peer.countedInput + pending;
+  peer.countedInput = pending;
+  if (bufferedInput_ > limits_.maxBufferedInput) {
+    dropPeer(fd, "incomplete frames of all connections exceed the input budget");
+    return false;
+  }
+  return true;
+}
+
+void VSAIPCListener::resumePeers() {
+  uint64_t count;
+  (void)!::read(resumer_->fd, &count, sizeof count);
+  std::vector<std::weak_ptr<VSAIPCConnection>> waiting;
+  {
+    std::lock_guard lock(resumer_->mutex);
+    waiting.swap(resumer_->waiting);
+  }
+  if (!accepting_) return;  // no more requests are taken in
+  for (auto& weak : waiting) {
+    auto connection = weak.lock();
+    if (!connection || !connection->isThrottled()) continue;
+    Peer* peer = nullptr;
+    {
+      std::lock_guard lock(peersMutex_);
+      auto it = peers_.find(connection->fd());
+      if (it != peers_.end() && it->second->connection == connection) peer = it->second.get();
     }
-    bufferedInput_ = bufferedInput_ - peer->countedInput + pending;
-    peer->countedInput = pending;
-    if (bufferedInput_ > limits_.maxBufferedInput) {
-      dropPeer(fd, "incomplete frames of all connections exceed the input budget");
-      return;
-    }
+    if (!peer) continue;
+    connection->setThrottled(false);
+    // Frames already read come first; the socket is polled again from here on.
+    processFrames(connection->fd(), *peer);
   }
 }
 
@@ -422,8 +489,10 @@ void VSAIPCListener::sweep(Clock::time_point now) {
   {
     std::lock_guard lock(peersMutex_);
     for (auto& [fd, peer] : peers_) {
-      if (peer->frameStarted != Clock::time_point{} &&
-          now - peer->frameStarted > limits_.frameTimeout) {
+      if (peer->connection->isThrottled() && peer->frameStarted != Clock::time_point{}) {
+        peer->frameStarted = now;  // not read while paused: its frame's clock waits too
+      } else if (peer->frameStarted != Clock::time_point{} &&
+                 now - peer->frameStarted > limits_.frameTimeout) {
         expired.emplace_back(fd, "a frame was not completed in time");
         continue;
       }
@@ -441,12 +510,13 @@ void VSAIPCListener::deliver(const VSAIPCConnectionRef& connection, std::optiona
                              std::string problem) {
   connection->requestBegan();
   // The request is in flight until its message is gone: replied, or dropped.
+  // A connection paused for having too many is resumed once half are done.
   VSAIPCMessageRef message(
       new VSAIPCMessage(connection, std::move(body), std::move(problem), transactions_->open()),
-      [](VSAIPCMessage* m) {
+      [resumer = resumer_, resumeAt = limits_.maxRequestsInFlight / 2](VSAIPCMessage* m) {
         VSAIPCConnectionRef c = m->connection();
         delete m;
-        c->requestEnded();
+        if (c->requestEnded() <= resumeAt && c->isThrottled()) resumer->post(c);
       });
   Handler handler;
   {

@@ -22,7 +22,10 @@
 //  - the bytes of incomplete frames held for all connections together stay
 //    within `maxBufferedInput`: the connection whose input would exceed it
 //    is dropped;
-//  - replies waiting for one peer stay within `maxPendingOutput`.
+//  - replies waiting for one peer stay within `maxPendingOutput`;
+//  - a peer with `maxRequestsInFlight` requests received and not yet finished
+//    is not read until half of them are done, so the listener queue never
+//    holds an unbounded number of one client's requests.
 // Refusals are logged at most once per second with a count.
 //
 // stopAccepting() closes the listening socket and stops reading requests;
@@ -52,6 +55,7 @@ struct VSAIPCListenerLimits {
   size_t maxConnectionsPerUID = 64;
   size_t maxPendingOutput = kVSADefaultMaxPendingOutput;  // per connection
   size_t maxBufferedInput = 64u << 20;                    // all connections together
+  size_t maxRequestsInFlight = 256;                       // per connection
   std::chrono::milliseconds idleTimeout = std::chrono::minutes(10);
   std::chrono::milliseconds frameTimeout = std::chrono::seconds(10);
 };
@@ -82,12 +86,18 @@ class VSAIPCListener {
 
  private:
   struct Peer;
+  struct Resumer;
   using Clock = std::chrono::steady_clock;
   void run();
   void acceptPeers();
   // Accepts and closes one waiting peer using the reserve descriptor.
   bool shedOnePeer();
   void readPeer(int fd);
+  // Delivers the complete frames read so far (pausing the peer when it has
+  // too many requests in flight); false when the peer was dropped.
+  bool processFrames(int fd, Peer& peer);
+  // Resumes the paused peers whose requests have drained.
+  void resumePeers();
   void writePeer(int fd);
   void dropPeer(int fd, const char* why);
   void sweep(Clock::time_point now);
@@ -103,6 +113,7 @@ class VSAIPCListener {
   std::shared_ptr<VSATransactions> transactions_;
   std::shared_ptr<VSAClientRegistry> registry_;
   VSAIPCListenerLimits limits_;
+  std::shared_ptr<Resumer> resumer_;
   std::mutex handlerMutex_;
   Handler handler_;
   int listenFd_ = -1;

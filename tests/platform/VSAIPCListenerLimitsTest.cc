@@ -215,6 +215,44 @@ TEST_F(VSAIPCListenerLimitsTest, AReplyBacklogOverTheBoundDropsTheConnection) {
   EXPECT_EQ(*reply->get("Echo")->stringValue(), "ok");
 }
 
+TEST_F(VSAIPCListenerLimitsTest, APeerWithTooManyRequestsInFlightIsNotReadUntilHalfAreDone) {
+  VSAIPCListenerLimits limits;
+  limits.maxRequestsInFlight = 4;
+  start(limits);
+  VSAErrorRef error;
+  VSAIPCClient client;
+  ASSERT_TRUE(client.connect(path_, &error));
+  // Every message holds a transaction from its receipt to its reply, so the
+  // open transactions are the requests taken in and not yet finished.
+  std::atomic<bool> done{false};
+  std::atomic<int> most{0};
+  std::thread sampler([&] {
+    while (!done) {
+      int open = transactions_->openCount();
+      if (open > most) most = open;
+      std::this_thread::sleep_for(200us);
+    }
+  });
+  constexpr int kRequests = 60;
+  std::vector<uint64_t> ids;
+  for (int i = 0; i < kRequests; ++i) {
+    auto id =
+        client.send(VSAValue::Dictionary{{"Value", VSAValue(i)}, {"Hold", VSAValue(10)}}, &error);
+    ASSERT_TRUE(id);
+    ids.push_back(*id);
+  }
+  bool all = true;
+  for (int i = 0; i < kRequests && all; ++i) {
+    auto reply = client.waitForReply(ids[i], 5s, &error);
+    all = reply && reply->get("Echo")->int64Value() == i;
+  }
+  done = true;
+  sampler.join();
+  EXPECT_TRUE(all) << "every request is answered, in order, once the peer is read again";
+  EXPECT_GE(most.load(), 2) << "the sampler saw requests in flight";
+  EXPECT_LE(most.load(), 4) << "requests taken in at once";
+}
+
 TEST_F(VSAIPCListenerLimitsTest, MessageIDIsAnIntegerOrAShortString) {
   start();
   struct Case {
