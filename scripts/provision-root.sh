@@ -1,14 +1,19 @@
 #!/usr/bin/env bash
 # Lays out a minimal demo device under a system root:
-#   scripts/provision-root.sh ROOT VESSACTL
+#   scripts/provision-root.sh ROOT VESSACTL [CLIENT_USER]
 # - /etc/passwd and /etc/group with root and the "mobile" user (501)
 # - /etc/vessad/device.plist (an internal build, so debug lines reach the log)
 # - /etc/vessad/personas.plist: a personal, an enterprise and a universal persona
 # - a registered client "demo-installer" (a copy of vessactl holding the
-#   full-client entitlement) in /usr/bin and /etc/vessad/clients.d
+#   full-client entitlement) in /usr/bin and /etc/vessad/clients.d; with
+#   CLIENT_USER (a uid or a user name of the device), its entry carries "User"
+#   and it is recognised only when run as that user
+# The executable and its directory are root-owned and writable by root only:
+# the daemon refuses registry entries whose program others could rewrite.
 set -euo pipefail
 root=$1
 vessactl=$2
+client_user=${3:-}
 mkdir -p "$root"/{etc/vessad/clients.d,usr/bin,run/vessad,tmp,private/var/mobile}
 cat > "$root/etc/passwd" <<'PW'
 root:x:0:0:root:/private/var/root:/bin/sh
@@ -41,7 +46,17 @@ cat > "$root/etc/vessad/personas.plist" <<'PL'
 PL
 mkdir -p "$root/private/var/enterprise/1001"
 cp "$vessactl" "$root/usr/bin/demo-installer"
-cat > "$root/etc/vessad/clients.d/demo-installer.plist" <<'PL'
+chown 0:0 "$root/usr/bin" "$root/usr/bin/demo-installer"
+chmod 0755 "$root/usr/bin" "$root/usr/bin/demo-installer"
+user_key=
+if [[ -n $client_user ]]; then
+  if [[ $client_user =~ ^[0-9]+$ ]]; then
+    user_key="  <key>User</key><integer>$client_user</integer>"
+  else
+    user_key="  <key>User</key><string>$client_user</string>"
+  fi
+fi
+cat > "$root/etc/vessad/clients.d/demo-installer.plist" <<PL
 <?xml version="1.0" encoding="UTF-8"?>
 <plist version="1.0"><dict>
   <key>Executable</key><string>/usr/bin/demo-installer</string>
@@ -51,6 +66,7 @@ cat > "$root/etc/vessad/clients.d/demo-installer.plist" <<'PL'
     <key>com.tamsk.private.Vessa.userManagedAssets</key><true/>
   </dict>
   <key>Sandboxed</key><false/>
+$user_key
 </dict></plist>
 PL
 chmod 0644 "$root"/etc/vessad/clients.d/*.plist

@@ -24,9 +24,9 @@ VSAClientIdentity::VSAClientIdentity(std::string bundleIdentifier, uint32_t uid,
       kernel_(kernel) {}
 
 VSAClientIdentityRef VSAClientIdentity::clientIdentityWithRelayConnection(
-    const VSAIPCConnection& connection, VSAClientRegistry& registry, VSAUserIdentityCache& cache) {
+    const VSAIPCConnection& connection, VSAUserIdentityCache& cache) {
   const VSAAuditToken& token = connection.auditToken();
-  auto entry = registry.entryForAuditToken(token);
+  const auto& entry = connection.registryEntry();
   if (!entry) {
     VSALogIn(VSALogCategory::Relay, kVSALogError, __func__,
              "Failed to copy signing ID for pid %d : %@", token.pid, "no client registry entry");

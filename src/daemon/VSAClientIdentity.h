@@ -1,10 +1,10 @@
 // Who is asking: an IPC peer, the kernel (upcalls) or the daemon itself.
 //
 // Immutable after creation and shared freely. A peer's identity comes from
-// its audit token and the client registry (signing identifier, entitlements,
-// sandboxed flag); a peer without a registry entry has no signing identifier
-// and therefore no identity. One identity is cached: the installer service's,
-// reused while its audit token matches byte for byte.
+// its audit token and the registry entry its connection resolved when it was
+// accepted (signing identifier, entitlements, sandboxed flag); a peer without
+// a registry entry has no signing identifier and therefore no identity. One identity is cached: the
+// installer service's, reused while its audit token matches byte for byte.
 #pragma once
 
 #include <array>
@@ -31,11 +31,12 @@ class VSAClientIdentity {
                     VSAUserIdentityRef userIdentity, VSAValue entitlements, bool sandboxed,
                     std::array<uint8_t, 32> auditToken, bool kernel);
 
-  // The peer's identity; its user identity is that of the persona the
-  // calling thread serves (see VSACurrentPersonaScope). Nothing without a
-  // registry entry, entitlements or user identity.
+  // The peer's identity, from the registry entry pinned on its connection;
+  // its user identity is that of the persona the calling thread serves (see
+  // VSACurrentPersonaScope). Nothing without a registry entry, entitlements
+  // or user identity. The caller has checked that the peer still runs the
+  // executable the entry was resolved for.
   static VSAClientIdentityRef clientIdentityWithRelayConnection(const VSAIPCConnection& connection,
-                                                                VSAClientRegistry& registry,
                                                                 VSAUserIdentityCache& cache);
   static VSAClientIdentityRef privilegedClientIdentityWithUserIdentity(
       const VSAUserIdentityRef& userIdentity, bool kernel);

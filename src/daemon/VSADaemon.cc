@@ -36,8 +36,9 @@ int VSADaemon::run() {
   dispatcher_ = std::make_unique<VSARelayDispatcher>(*context_);
   {
     std::lock_guard lock(listenerMutex_);
-    listener_ = std::make_unique<VSAIPCListener>(context_->systemRoot.socketPath(),
-                                                 context_->listenerQueue, context_->transactions);
+    listener_ =
+        std::make_unique<VSAIPCListener>(context_->systemRoot.socketPath(), context_->listenerQueue,
+                                         context_->transactions, context_->clientRegistry);
     VSAErrorRef error;
     if (!stopping_ && listener_->listen(&error)) {
       listener_->setHandler(

@@ -49,6 +49,15 @@ const VSACommandTableEntry* VSARelayDispatcher::checkCommand(uint64_t command) c
 }
 
 void VSARelayDispatcher::processRelayEvent(const VSAIPCMessageRef& message) {
+  if (!message->connection()->peerIsUnchanged()) {
+    const auto& pinned = message->connection()->executable();
+    VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin,
+             "Dropping %@: the peer no longer runs %@ it connected with",
+             message->connection()->description(),
+             pinned ? pinned->description() : std::string("the executable"));
+    message->connection()->cancel();
+    return;
+  }
   VSAResultCode result = VSAResult::kSuccess;
   auto reply = message->createReply();
   if (!reply) {
@@ -74,8 +83,8 @@ void VSARelayDispatcher::processRelayEvent(const VSAIPCMessageRef& message) {
     const VSAAuditToken& token = message->connection()->auditToken();
     // While this request is served, the thread runs as the client's persona.
     VSACurrentPersonaScope persona(token.pid, token.startTime);
-    identity = VSAClientIdentity::clientIdentityWithRelayConnection(
-        *message->connection(), *context_.clientRegistry, *context_.userIdentityCache);
+    identity = VSAClientIdentity::clientIdentityWithRelayConnection(*message->connection(),
+                                                                    *context_.userIdentityCache);
     VSAGrants grants = VSADeriveGrants(*entry, identity.get());
     if (identity && grants.admitted) {
       VSAResultCode registered = context_.codeSigningMapping->processCallerRegisteredEntitlements(

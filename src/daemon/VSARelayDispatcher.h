@@ -1,6 +1,11 @@
 // The request dispatcher (log origin "VSAProcessRelayEvent").
 //
-// For each message on a peer connection, on the listener queue: reads
+// For each message on a peer connection, on the listener queue: first checks
+// that the peer still runs the executable its connection pinned when it was
+// accepted (a process that has exec'd another program since, or whose socket
+// is used by another process after such an exec, must not act with the
+// identity resolved for the original one): if not, the connection is dropped
+// (logged) and nothing is served. Then reads
 // "Command", checks it against the command table (49 for an invalid, absent
 // or retired command), builds the client's identity and grants (55 for a
 // client that is refused), creates the request's VSAClientConnection and

@@ -11,6 +11,7 @@
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
 #include "base/VSAPlist.h"
+#include "platform/VSAUserDatabase.h"
 
 VSAClientRegistry::VSAClientRegistry(VSASystemRoot root) : root_(std::move(root)) {}
 
@@ -19,7 +20,32 @@ std::string canonical(const std::string& path) {
   char buf[PATH_MAX];
   return realpath(path.c_str(), buf) ? std::string(buf) : std::string();
 }
+
+// Writable by someone other than root: a non-root owner can always make it
+// writable, and group or other write bits open it to more users.
+bool writableByOthers(const struct stat& st) {
+  return st.st_uid != 0 || (st.st_mode & (S_IWGRP | S_IWOTH)) != 0;
+}
 }  // namespace
+
+bool VSAClientRegistry::executableIsRootControlled(const std::string& hostPath,
+                                                   const std::string& origin) {
+  struct stat st;
+  const char* why = nullptr;
+  std::string dir = hostPath.substr(0, hostPath.find_last_of('/'));
+  if (dir.empty()) dir = "/";
+  if (stat(hostPath.c_str(), &st) != 0 || !S_ISREG(st.st_mode)) {
+    why = "the executable is not a regular file";
+  } else if (writableByOthers(st)) {
+    why = "the executable is writable by users other than root";
+  } else if (stat(dir.c_str(), &st) != 0 || !S_ISDIR(st.st_mode) || writableByOthers(st)) {
+    why = "the executable's directory is writable by users other than root";
+  }
+  if (!why) return true;
+  VSALogIn(VSALogCategory::Relay, kVSALogError, "VSAClientRegistry",
+           "Ignoring client registry entry %s for %s: %s", origin, hostPath, why);
+  return false;
+}
 
 std::optional<VSAClientRegistryEntry> VSAClientRegistry::loadEntry(const std::string& file) {
   struct stat st;
@@ -50,8 +76,22 @@ std::optional<VSAClientRegistryEntry> VSAClientRegistry::loadEntry(const std::st
     if (v && !v->isBool()) return bad("\"Sandboxed\" and \"KernelBridge\" must be booleans");
   }
   VSAClientRegistryEntry entry;
+  if (const VSAValue* user = dict->get("User")) {
+    if (user->isInteger()) {
+      auto uid = user->uint64Value();
+      if (!uid || *uid > UINT32_MAX - 1) return bad("\"User\" is not a valid uid");
+      entry.user = static_cast<uid_t>(*uid);
+    } else if (user->isString()) {
+      auto account = VSAUserDatabase(root_).userNamed(*user->stringValue());
+      if (!account) return bad("\"User\" names no user of the device");
+      entry.user = account->uid;
+    } else {
+      return bad("\"User\" must be a uid or a user name");
+    }
+  }
   entry.executable = canonical(root_.resolve(*exe->stringValue()));
   if (entry.executable.empty()) return bad("the executable does not exist");
+  if (!executableIsRootControlled(entry.executable, file)) return std::nullopt;
   entry.signingIdentifier = *sid->stringValue();
   if (ent) entry.entitlements = *ent;
   if (auto v = dict->get("Sandboxed")) entry.sandboxed = *v->boolValue();
@@ -104,5 +144,20 @@ std::optional<VSAClientRegistryEntry> VSAClientRegistry::entryForAuditToken(
   std::string exe = n > 0 && n < static_cast<ssize_t>(sizeof buf) ? std::string(buf, n) : "";
   // Check after resolving the path, so the path surely belongs to this process.
   if (exe.empty() || !token.isCurrent()) return std::nullopt;
-  return entryForExecutable(exe);
+  return entryForPeer(token, exe);
+}
+
+std::optional<VSAClientRegistryEntry> VSAClientRegistry::entryForPeer(
+    const VSAAuditToken& token, const std::string& executable) {
+  auto entry = entryForExecutable(executable);
+  if (!entry) return std::nullopt;
+  if (entry->user && *entry->user != token.uid) {
+    VSALogIn(VSALogCategory::Relay, kVSALogError, "VSAClientRegistry",
+             "Peer %@ runs %s as uid %u, but its registry entry requires uid %u: no identity",
+             token, executable, token.uid, *entry->user);
+    return std::nullopt;
+  }
+  // The files may have changed hands since the entry was loaded.
+  if (!executableIsRootControlled(entry->executable, entry->signingIdentifier)) return std::nullopt;
+  return entry;
 }

@@ -3,10 +3,16 @@
 // Each root-owned file `<root>/etc/vessad/clients.d/*.plist` describes one
 // executable: "Executable" (its path on the device, resolved below the system
 // root), "SigningIdentifier", "Entitlements" (dictionary), "Sandboxed" and
-// "KernelBridge" (booleans). A peer is matched on the real path of its
-// /proc/<pid>/exe, and only while its audit token still names the same
-// process. A file that is not owned by root, is writable by others, or is
-// malformed is skipped with a log line: such an entry gives no identity
+// "KernelBridge" (booleans) and optionally "User" (the uid the client must run
+// as: an integer, or a user name from the root's user database). A peer is
+// matched on the real path of its /proc/<pid>/exe, only while its audit token
+// still names the same process, and only when its uid is the entry's "User"
+// (if one is named). A file that is not owned by root, is writable by others,
+// or is malformed is skipped with a log line, and so is an entry whose
+// executable, or the directory holding it, could be changed by anyone but
+// root (not root-owned, or group/world-writable): whoever can rewrite the
+// program can act with its entitlements. That check is made when the entry is
+// loaded and again whenever it is matched. Such entries give no identity
 // rather than a wrong one. The directory is re-read when it changes.
 // Thread-safe.
 #pragma once
@@ -27,6 +33,7 @@ struct VSAClientRegistryEntry {
   VSAValue entitlements = VSAValue::dictionary();
   bool sandboxed = false;
   bool kernelBridge = false;
+  std::optional<uid_t> user;  // the uid the peer must have, when named
 };
 
 class VSAClientRegistry {
@@ -36,11 +43,17 @@ class VSAClientRegistry {
   std::string directory() const { return root_.resolve("/etc/vessad/clients.d"); }
   // The entry of the process named by `token`, if it is registered.
   std::optional<VSAClientRegistryEntry> entryForAuditToken(const VSAAuditToken& token);
+  // The entry for a peer with audit token `token` whose executable's real
+  // path is `executable` (already known to belong to that process).
+  std::optional<VSAClientRegistryEntry> entryForPeer(const VSAAuditToken& token,
+                                                     const std::string& executable);
   // The entry registered for a host executable path.
   std::optional<VSAClientRegistryEntry> entryForExecutable(const std::string& hostPath);
 
  private:
   void reloadIfChanged();
+  // The executable and its directory can be changed only by root; logs why not.
+  static bool executableIsRootControlled(const std::string& hostPath, const std::string& origin);
   std::optional<VSAClientRegistryEntry> loadEntry(const std::string& file);
 
   VSASystemRoot root_;

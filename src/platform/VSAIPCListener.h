@@ -3,14 +3,39 @@
 // listen() binds the socket (or adopts one passed by systemd socket
 // activation). Nothing is accepted until resume(): then an I/O thread accepts
 // peers, reassembles frames and submits each message, in arrival order, to
-// the listener's serial work queue, where the handler runs. Bad input is
-// contained per connection: an oversized length or a stream that ends inside
-// a frame drops that connection (and is logged); a frame that does not decode
-// is delivered as a message without reply context. stop() closes the socket
-// and every connection and joins the thread.
+// the listener's serial work queue, where the handler runs. The same thread
+// writes out replies that a peer's socket did not take at once (see
+// VSAIPCConnection), so the handler never waits for a slow reader.
+//
+// Bad input is contained per connection: an oversized length or a stream that
+// ends inside a frame drops that connection (and is logged); a frame that does
+// not decode, or whose "MessageID" is neither an integer nor a string of at
+// most kVSAMaxMessageIDLength bytes, is delivered as a message without reply
+// context. Resources are bounded by VSAIPCListenerLimits:
+//  - connections per uid (root included); the excess is accepted and closed;
+//  - when the process is out of descriptors, a reserve descriptor is given up
+//    for a moment to accept and close the waiting peer, so the accept loop
+//    neither spins nor starves those already connected;
+//  - a connection with no request in flight and no complete frame for
+//    `idleTimeout`, or whose current frame is not complete `frameTimeout`
+//    after its first byte, is dropped;
+//  - the bytes of incomplete frames held for all connections together stay
+//    within `maxBufferedInput`: the connection whose input would exceed it
+//    is dropped;
+//  - replies waiting for one peer stay within `maxPendingOutput`;
+//  - a peer with `maxRequestsInFlight` requests received and not yet finished
+//    is not read until half of them are done, so the listener queue never
+//    holds an unbounded number of one client's requests.
+// Refusals are logged at most once per second with a count.
+//
+// stopAccepting() closes the listening socket and stops reading requests;
+// the I/O thread keeps writing late replies until stop(), which closes every
+// connection and joins the thread.
 #pragma once
 
 #include <atomic>
+#include <chrono>
+#include <condition_variable>
 #include <functional>
 #include <map>
 #include <memory>
@@ -20,15 +45,30 @@
 
 #include "base/VSAError.h"
 #include "base/VSAWorkQueue.h"
+#include "platform/VSAClientRegistry.h"
 #include "platform/VSAIPCMessage.h"
 #include "platform/VSATransactions.h"
+
+inline constexpr size_t kVSAMaxMessageIDLength = 64;
+
+struct VSAIPCListenerLimits {
+  size_t maxConnectionsPerUID = 64;
+  size_t maxPendingOutput = kVSADefaultMaxPendingOutput;  // per connection
+  size_t maxBufferedInput = 64u << 20;                    // all connections together
+  size_t maxRequestsInFlight = 256;                       // per connection
+  std::chrono::milliseconds idleTimeout = std::chrono::minutes(10);
+  std::chrono::milliseconds frameTimeout = std::chrono::seconds(10);
+};
 
 class VSAIPCListener {
  public:
   using Handler = std::function<void(const VSAIPCMessageRef&)>;
 
+  // `registry` (may be null) gives each accepted peer its registry entry.
   VSAIPCListener(std::string socketPath, VSAWorkQueue::Ref queue,
-                 std::shared_ptr<VSATransactions> transactions);
+                 std::shared_ptr<VSATransactions> transactions,
+                 std::shared_ptr<VSAClientRegistry> registry = nullptr,
+                 VSAIPCListenerLimits limits = VSAIPCListenerLimits());
   ~VSAIPCListener();
   VSAIPCListener(const VSAIPCListener&) = delete;
   VSAIPCListener& operator=(const VSAIPCListener&) = delete;
@@ -41,27 +81,65 @@ class VSAIPCListener {
   // stopAccepting() and closes every connection.
   void stop();
   size_t connectionCount() const;
+  // A "MessageID" a reply can carry back: an integer or a short string.
+  static bool isValidMessageID(const VSAValue& id);
 
  private:
   struct Peer;
+  struct Resumer;
+  using Clock = std::chrono::steady_clock;
   void run();
   void acceptPeers();
+  // Accepts and closes one waiting peer using the reserve descriptor.
+  bool shedOnePeer();
   void readPeer(int fd);
+  // Delivers the complete frames read so far (pausing the peer when it has
+  // too many requests in flight); false when the peer was dropped.
+  bool processFrames(int fd, Peer& peer);
+  // Resumes the paused peers whose requests have drained.
+  void resumePeers();
+  void writePeer(int fd);
   void dropPeer(int fd, const char* why);
+  void sweep(Clock::time_point now);
+  void noteRefusal(const char* why);
   void deliver(const VSAIPCConnectionRef& connection, std::optional<VSAValue> body,
                std::string problem);
+  // Closes the listening socket and stops reading requests; on the I/O thread
+  // once it runs.
+  void _onThread_stopAccepting();
 
   std::string socketPath_;
   VSAWorkQueue::Ref queue_;
   std::shared_ptr<VSATransactions> transactions_;
+  std::shared_ptr<VSAClientRegistry> registry_;
+  VSAIPCListenerLimits limits_;
+  std::shared_ptr<Resumer> resumer_;
   std::mutex handlerMutex_;
   Handler handler_;
   int listenFd_ = -1;
   int epollFd_ = -1;
   int stopFd_ = -1;
+  int reserveFd_ = -1;
   bool ownsSocketFile_ = false;
+  std::atomic<bool> accepting_{false};
   std::thread thread_;
+  // Hand-over between stopAccepting()/stop() and the I/O thread.
+  std::mutex controlMutex_;
+  std::condition_variable controlChanged_;
+  bool stopAcceptingRequested_ = false;
+  bool acceptingStopped_ = false;
+  bool stopRequested_ = false;
+  bool threadExited_ = false;
   mutable std::mutex peersMutex_;
   std::map<int, std::unique_ptr<Peer>> peers_;
+  std::map<uid_t, size_t> connectionsPerUID_;
+  size_t bufferedInput_ = 0;  // I/O thread only
   uint64_t nextIdentifier_ = 1;
+  // Accepting pauses briefly when even the reserve descriptor is gone.
+  Clock::time_point acceptPausedUntil_{};
+  bool acceptPaused_ = false;
+  // Rate-limited refusal log (I/O thread only).
+  Clock::time_point lastRefusalLog_{};
+  size_t refusalsSinceLog_ = 0;
+  const char* lastRefusal_ = "";
 };

@@ -76,7 +76,8 @@ class VSARelayDispatcherTest : public ::testing::Test {
     int fds[2];
     ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, fds), 0);
     peer_ = fds[1];
-    connection_ = std::make_shared<VSAIPCConnection>(fds[0], 1, *VSAAuditToken::fromSocket(fds[0]));
+    connection_ = std::make_shared<VSAIPCConnection>(fds[0], 1, *VSAAuditToken::fromSocket(fds[0]),
+                                                     context_->clientRegistry.get());
   }
   void TearDown() override {
     ::close(peer_);

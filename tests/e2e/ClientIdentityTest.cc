@@ -1,0 +1,161 @@
+// End to end: a client's identity is the one fixed when its connection was
+// accepted. A process that connects and then execs a registered client's
+// executable, while another process keeps using the socket, must not be
+// served with that client's entitlements.
+#include <gtest/gtest.h>
+#include <poll.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <climits>
+#include <cstring>
+#include <filesystem>
+
+#include "base/VSAPlist.h"
+#include "e2e/VSATestDaemon.h"
+#include "platform/VSAFrameCodec.h"
+
+namespace {
+
+using namespace std::chrono_literals;
+
+const char* kAllowed = "com.tamsk.private.Vessa.allowed";
+
+uint64_t replyError(const std::optional<VSAValue>& reply) {
+  if (!reply || !reply->get("ReplyError")) return 0;
+  return reply->get("ReplyError")->uint64Value().value_or(0);
+}
+
+// Sends a frame and reads bytes until the reply frame is complete, the peer
+// closes, or two seconds pass. Uses system calls only, so it is safe in a
+// child forked from this multithreaded process.
+ssize_t exchange(int fd, const std::vector<uint8_t>& request, uint8_t* reply, size_t capacity) {
+  if (::send(fd, request.data(), request.size(), MSG_NOSIGNAL) !=
+      static_cast<ssize_t>(request.size()))
+    return -1;
+  size_t got = 0;
+  for (;;) {
+    if (got >= 4) {
+      size_t length =
+          (size_t(reply[0]) << 24) | (size_t(reply[1]) << 16) | (size_t(reply[2]) << 8) | reply[3];
+      if (got >= 4 + length || got == capacity) return static_cast<ssize_t>(got);
+    }
+    pollfd pfd{fd, POLLIN, 0};
+    if (poll(&pfd, 1, 2000) <= 0) return static_cast<ssize_t>(got);
+    ssize_t n = recv(fd, reply + got, capacity - got, 0);
+    if (n <= 0) return static_cast<ssize_t>(got);
+    got += static_cast<size_t>(n);
+  }
+}
+
+std::optional<VSAValue> decodeReply(const uint8_t* bytes, size_t length) {
+  VSAFrameReader reader;
+  reader.append(bytes, length);
+  std::vector<uint8_t> payload;
+  if (reader.next(payload) != VSAFrameReader::Status::Frame) return std::nullopt;
+  std::string why;
+  return VSAFrameCodec::decodePayload(payload.data(), payload.size(), &why);
+}
+
+TEST(ClientIdentity, ExecingARegisteredExecutableAfterConnectingGainsNothing) {
+  VSATestDaemon d;
+  // The registered client: a long-running program, so that its process is
+  // alive while the socket is used behind its back.
+  std::string registered = d.path("/usr/bin/registered-sleeper");
+  std::filesystem::copy_file("/bin/sleep", registered);
+  chmod(registered.c_str(), 0755);
+  VSAErrorRef error;
+  ASSERT_TRUE(VSA_writeToURL(
+      VSAValue::Dictionary{{"Executable", VSAValue("/usr/bin/registered-sleeper")},
+                           {"SigningIdentifier", VSAValue("com.example.sleeper")},
+                           {"Entitlements", VSAValue::Dictionary{{kAllowed, VSAValue(true)}}}},
+      d.path("/etc/vessad/clients.d/sleeper.plist"), 0, &error));
+  ASSERT_TRUE(d.start());
+
+  // Command 19 without an identifier: an entitled client is told 18, anyone else 55.
+  auto request = *VSAFrameCodec::encode(
+      VSAValue::Dictionary{{"Command", VSAValue(19u)}, {"MessageID", VSAValue(1u)}}, &error);
+  std::string socketPath = d.socketPath();
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  std::strncpy(addr.sun_path, socketPath.c_str(), sizeof addr.sun_path - 1);
+
+  int report[2];
+  ASSERT_EQ(pipe(report), 0);
+  pid_t connector = fork();
+  if (connector == 0) {
+    // The connecting process: connects, is served once as itself, then hands
+    // the socket to a child and becomes the registered program.
+    ::close(report[0]);
+    int fd = socket(AF_UNIX, SOCK_STREAM, 0);
+    if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) _exit(2);
+    uint8_t first[4096];
+    ssize_t n = exchange(fd, request, first, sizeof first);
+    (void)!write(report[1], &n, sizeof n);
+    if (n > 0) (void)!write(report[1], first, static_cast<size_t>(n));
+    pid_t self = getpid();
+    if (fork() == 0) {
+      // The child waits until its parent runs the registered executable, then
+      // asks again on the parent's connection.
+      char link[64], target[PATH_MAX];
+      snprintf(link, sizeof link, "/proc/%d/exe", self);
+      for (int i = 0; i < 500; ++i) {
+        ssize_t len = readlink(link, target, sizeof target - 1);
+        if (len > 0) {
+          target[len] = '\0';
+          if (std::strstr(target, "registered-sleeper")) break;
+        }
+        usleep(10000);
+      }
+      uint8_t second[4096];
+      ssize_t m = exchange(fd, request, second, sizeof second);
+      (void)!write(report[1], &m, sizeof m);
+      if (m > 0) (void)!write(report[1], second, static_cast<size_t>(m));
+      _exit(0);
+    }
+    ::close(report[1]);
+    char arg0[] = "registered-sleeper", arg1[] = "30";
+    char* argv[] = {arg0, arg1, nullptr};
+    execv(registered.c_str(), argv);
+    _exit(127);
+  }
+  ASSERT_GT(connector, 0);
+  ::close(report[1]);
+  auto readReport = [&]() -> std::optional<VSAValue> {
+    ssize_t n = -1;
+    if (read(report[0], &n, sizeof n) != sizeof n || n <= 0) return std::nullopt;
+    std::vector<uint8_t> bytes(static_cast<size_t>(n));
+    size_t got = 0;
+    while (got < bytes.size()) {
+      ssize_t r = read(report[0], bytes.data() + got, bytes.size() - got);
+      if (r <= 0) break;
+      got += static_cast<size_t>(r);
+    }
+    return decodeReply(bytes.data(), got);
+  };
+  auto before = readReport();
+  auto after = readReport();
+  kill(connector, SIGKILL);
+  waitpid(connector, nullptr, 0);
+  ::close(report[0]);
+
+  ASSERT_TRUE(before) << "the connecting process is served as itself";
+  EXPECT_EQ(replyError(before), 55u) << "unregistered, it is not entitled";
+  // After the exec, the connection is dropped: no reply, and above all never
+  // the registered client's answer (18).
+  EXPECT_FALSE(after) << "served after exec with ReplyError " << replyError(after);
+  EXPECT_NE(replyError(after), 18u);
+
+  // The registered program itself, connecting afresh, is entitled: the
+  // check above would have seen the entitlement. (Shown with this test
+  // process registered under the same entitlements.)
+  d.registerSelf("com.example.self", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
+  EXPECT_EQ(replyError(d.request(VSAValue::Dictionary{{"Command", VSAValue(19u)}})), 18u);
+  EXPECT_EQ(d.stop(), 0);
+}
+
+}  // namespace
