@@ -2,12 +2,14 @@
 
 #include <sqlite3.h>
 
+#include <cstring>
 #include <exception>
 
 #include "base/VSACrash.h"
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
 #include "base/VSAPlist.h"
+#include "platform/VSAPrivateFile.h"
 
 namespace {
 constexpr const char* kOrigin = "VSASQLiteDB";
@@ -160,6 +162,14 @@ VSASQLiteDB::VSASQLiteDB(const std::string& parentDirectory)
 VSASQLiteDB::~VSASQLiteDB() { closeDB(); }
 
 sqlite3* VSASQLiteDB::openDBWithURL(const std::string& path) {
+  // The database holds every app's entitlements: root's alone. SQLite gives
+  // its journal files the database's mode, so the file exists with 0600
+  // before they do; files left wider by an older daemon are narrowed.
+  for (const char* suffix : {"", "-wal", "-shm"}) {
+    if (int rc = VSAMakeFileOwnerOnly(path + suffix, suffix[0] == 0))
+      VSALogIn(VSALogCategory::Database, kVSALogError, kOrigin, "Could not make %@%s private: %s",
+               path, suffix, std::strerror(rc));
+  }
   sqlite3* db = nullptr;
   int rc = sqlite3_open_v2(path.c_str(), &db, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr);
   if (rc != SQLITE_OK) {

@@ -1,6 +1,7 @@
 #include "daemon/VSAClientConnection.h"
 
 #include "base/VSALog.h"
+#include "model/VSAPerUserConfiguration.h"
 
 VSAClientConnection::VSAClientConnection(VSADaemonContext& context,
                                          VSAClientIdentityRef clientIdentity, bool entitled,
@@ -68,6 +69,16 @@ void VSAClientConnection::rebootKeeperCleanupWithCompletion(std::function<void()
   if (!deathRow._moveItemAtURLToDeathRow(bundles, true, false, &error))
     VSALogIn(VSALogCategory::Startup, kVSALogError, __func__,
              "Failed to delete shared transient bundle URL %@ : %@", bundles, error);
+  context_.userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
+      [&](const VSAUserIdentityRef& user) {
+        auto perUser = config.getPerUserConfigurationForUserIdentity(user);
+        if (!perUser || !perUser->existsUserBaseDirectory()) return;
+        std::string userTransient = perUser->transientDirectory();
+        VSAErrorRef userError;
+        if (!deathRow._moveItemAtURLToDeathRow(userTransient, true, false, &userError))
+          VSALogIn(VSALogCategory::Startup, kVSALogError, "rebootKeeperCleanupWithCompletion",
+                   "Failed to delete per-user transient URL %@ : %@", userTransient, userError);
+      });
   VSALogIn(VSALogCategory::Startup, kVSALogNotice, __func__,
            "First-boot cleanup: orphaned-data scans are not available in this build");
   VSADeathRow::_sharedBackgroundQueue()->async(

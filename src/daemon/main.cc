@@ -4,6 +4,7 @@
 //
 // SIGTERM and SIGINT stop it cleanly once open transactions have ended.
 #include <signal.h>
+#include <sys/stat.h>
 
 #include <cstdio>
 #include <cstdlib>
@@ -51,6 +52,9 @@ int main(int argc, char** argv) {
   sigaddset(&set, SIGINT);
   pthread_sigmask(SIG_BLOCK, &set, nullptr);
   signal(SIGPIPE, SIG_IGN);
+  // Whatever started the daemon, what it creates gets the modes it asks for
+  // and nothing wider.
+  umask(022);
 
   VSADaemon daemon(options);
   std::thread([&daemon, set] {

@@ -159,9 +159,22 @@ void VSADataProtectionManager::_startDataProtectionChangeOperation(
 void VSADataProtectionManager::recordProtectionClass(const VSAMetadataRef& metadata,
                                                      int32_t protectionClass) {
   VSAIdentifierLockGuard guard(VSAValue(metadata->uuid().string()), true);
-  auto updated = std::make_shared<VSAMetadata>(*metadata);
-  VSAValue info = metadata->info() && metadata->info()->isDictionary() ? *metadata->info()
-                                                                       : VSAValue::dictionary();
+  // The change may have waited for an unlock for hours: what the metadata
+  // says now is read again under the lock, so that nothing written since is
+  // put back to what it was when the request came.
+  VSAErrorRef readError;
+  VSAMetadataRef current = VSAMetadata::readAndValidateMetadataAtUrl(
+      metadata->url(), metadata->userIdentity(), false, *env_->configuration,
+      *env_->userIdentityCache, &readError);
+  if (!current) {
+    VSALog(kVSALogError, "_startDataProtectionChangeOperation",
+           "Failed to set protection class info for %@ at %@ to %d : %@", metadata->identifier(),
+           metadata->url(), protectionClass, readError);
+    return;
+  }
+  auto updated = std::make_shared<VSAMetadata>(*current);
+  VSAValue info = current->info() && current->info()->isDictionary() ? *current->info()
+                                                                     : VSAValue::dictionary();
   info.set(kVSAContentProtectionClassInfoKey, static_cast<int64_t>(protectionClass));
   updated->setInfo(info);
   VSAErrorRef error;

@@ -99,8 +99,9 @@ VSAContainerCache::ClassMap* VSAContainerCache::_lock_getCache(const VSAUserIden
 VSAMetadataRef VSAContainerCache::_lock_metadataFromSandbox(const VSAContainerIdentity& identity) {
   const auto& user = identity.userIdentity();
   VSASignpostInterval interval(VSALogCategory::Cache, "ReadFromSandbox");
-  auto item = deps_.sandbox->userStateItem(identity.posixUID(), identity.identifier(),
-                                           identity.containerClass());
+  auto item =
+      deps_.sandbox->userStateItem(identity.posixUID(), identity.identifier(),
+                                   identity.containerClass(), user ? user->kernelPersonaID() : 0);
   if (!item) return nullptr;
   if (item->path.empty()) {
     VSALogIn(VSALogCategory::Cache, kVSALogError, kOrigin,

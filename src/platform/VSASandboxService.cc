@@ -86,7 +86,7 @@ const VSASandboxService::Table& VSASandboxService::load(uid_t uid) {
                           cls->uint64Value().value_or(0),
                           static_cast<int32_t>(persona ? persona->int64Value().value_or(0) : 0),
                           *path->stringValue()};
-      items[{item.identifier, item.containerClass}] = std::move(item);
+      items[{item.identifier, item.containerClass, item.personaID}] = std::move(item);
     }
   }
   return tables_[uid] = std::move(items);
@@ -154,10 +154,10 @@ int VSASandboxService::setUserStateItem(uid_t uid, uint64_t itemType, const std:
     load(uid);
     auto& items = tables_[uid];
     if (path)
-      items[{identifier, containerClass}] = {itemType, identifier, containerClass, personaID,
-                                             *path};
+      items[{identifier, containerClass, personaID}] = {itemType, identifier, containerClass,
+                                                        personaID, *path};
     else
-      items.erase({identifier, containerClass});
+      items.erase({identifier, containerClass, personaID});
     dirty_.insert(uid);
   }
   changed_.notify_one();
@@ -178,10 +178,11 @@ int VSASandboxService::iterateUserStateItems(
 
 std::optional<VSASandboxItem> VSASandboxService::userStateItem(uid_t uid,
                                                                const std::string& identifier,
-                                                               uint64_t containerClass) {
+                                                               uint64_t containerClass,
+                                                               int32_t personaID) {
   std::lock_guard lock(mutex_);
   const Table& items = load(uid);
-  auto it = items.find({identifier, containerClass});
+  auto it = items.find({identifier, containerClass, personaID});
   if (it == items.end()) return std::nullopt;
   return it->second;
 }

@@ -29,6 +29,7 @@
 #include <set>
 #include <string>
 #include <thread>
+#include <tuple>
 #include <utility>
 #include <vector>
 
@@ -54,16 +55,17 @@ class VSASandboxService {
   // Writes every changed table now.
   void flush();
 
-  // Stores an item for `uid`, replacing the one of the same identifier and
-  // class; an absent path removes it. Returns 0 or an errno.
+  // Stores an item for `uid`, replacing the one of the same identifier, class
+  // and persona (personas may share a uid); an absent path removes it.
+  // Returns 0 or an errno.
   int setUserStateItem(uid_t uid, uint64_t itemType, const std::string& identifier,
                        uint64_t containerClass, int32_t personaID,
                        const std::optional<std::string>& path);
   // Calls `block` for each item of `uid` until it answers false; 0 or an errno.
   int iterateUserStateItems(uid_t uid, const std::function<bool(const VSASandboxItem&)>& block);
-  // The item of `uid` for `identifier` and `containerClass`, if there is one.
+  // The item of `uid` for `identifier`, `containerClass` and `personaID`.
   std::optional<VSASandboxItem> userStateItem(uid_t uid, const std::string& identifier,
-                                              uint64_t containerClass);
+                                              uint64_t containerClass, int32_t personaID);
 
   // Issues a token granting `auditToken`'s process access to `path`.
   std::optional<std::string> issueFileExtension(const std::string& extensionClass,
@@ -73,7 +75,7 @@ class VSASandboxService {
                            const std::string& path, const VSAAuditToken& auditToken);
 
  private:
-  using Table = std::map<std::pair<std::string, uint64_t>, VSASandboxItem>;
+  using Table = std::map<std::tuple<std::string, uint64_t, int32_t>, VSASandboxItem>;
 
   std::string tablePath(uid_t uid) const;
   const Table& load(uid_t uid);  // caller holds mutex_

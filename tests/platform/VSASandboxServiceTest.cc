@@ -30,10 +30,16 @@ TEST(VSASandboxService, ContainerTableOutlivesTheService) {
     return true;
   });
   ASSERT_EQ(items.size(), 2u);
-  ASSERT_TRUE(reopened.userStateItem(501, "com.app", 2));
-  EXPECT_EQ(reopened.userStateItem(501, "com.app", 2)->path, "/c/B");
-  EXPECT_EQ(reopened.userStateItem(501, "group.g", 7)->path, "/c/G");
-  EXPECT_FALSE(reopened.userStateItem(501, "com.app", 7)) << "the class is part of the key";
+  ASSERT_TRUE(reopened.userStateItem(501, "com.app", 2, 1000));
+  EXPECT_EQ(reopened.userStateItem(501, "com.app", 2, 1000)->path, "/c/B");
+  EXPECT_EQ(reopened.userStateItem(501, "group.g", 7, 1000)->path, "/c/G");
+  EXPECT_FALSE(reopened.userStateItem(501, "com.app", 7, 1000)) << "the class is part of the key";
+  // Two personas of one uid keep their own items of the same identifier and class.
+  ASSERT_EQ(reopened.setUserStateItem(501, 1, "com.app", 2, 1001, std::string("/work/B")), 0);
+  EXPECT_EQ(reopened.userStateItem(501, "com.app", 2, 1000)->path, "/c/B");
+  EXPECT_EQ(reopened.userStateItem(501, "com.app", 2, 1001)->path, "/work/B");
+  ASSERT_EQ(reopened.setUserStateItem(501, 1, "com.app", 2, 1001, std::nullopt), 0);
+  EXPECT_TRUE(reopened.userStateItem(501, "com.app", 2, 1000)) << "the other persona's stays";
   ASSERT_EQ(reopened.setUserStateItem(501, 1, "com.app", 2, 1000, std::nullopt), 0) << "removal";
   int count = 0;
   reopened.iterateUserStateItems(501, [&](const VSASandboxItem&) { return ++count, true; });
