@@ -223,6 +223,11 @@ struct CreateSteps {
         !context.fileManager->setTopLevelSystemContainerACLAtURL(staging, error))
       return nullptr;
     if (!connection._createSubDirectories(staging, *metadata, error)) return nullptr;
+    // Sub-directories made with mode 0 inherit the ACL under a mask of none;
+    // setting each one's ACL again makes the "systemusers" entry count.
+    if (VSAContainerClassIsSystem(c) &&
+        !context.fileManager->standardizeACLsForSystemContainerAtURL(staging, error))
+      return nullptr;
     auto base = config.containerDirectoryURLForUserIdentity(identity.userIdentity(), c, transient);
     std::string live = VSAPathJoin(base.value_or(""), liveName(name));
     VSAErrorRef underlying;

@@ -49,10 +49,15 @@ int openByComponents(const std::string& path, int flags, VSAUniqueFd* fd) {
 
 std::string aclText(VSASystemContainerACL kind, gid_t gid, bool inherited) {
   // The owner, owning group and others get nothing: access is granted by the
-  // "systemusers" entry alone (the mask keeps that entry effective).
+  // "systemusers" entry alone, and the mask is rwx so that the entry counts.
+  // The top level lets members add files and directories but not list it;
+  // on Linux adding needs search (x) as well as write. What a member creates
+  // inherits the entry, under a mask the creation mode's group bits decide,
+  // and stays its creator's (the inherited owner entry is rwx, cut down to
+  // the creation mode by the kernel).
   std::string g = std::to_string(gid);
-  if (kind == VSASystemContainerACL::TopLevel && !inherited)
-    return "u::---,g::---,o::---,m::rwx,g:" + g + ":-w-";
+  if (inherited) return "u::rwx,g::---,o::---,m::rwx,g:" + g + ":rwx";
+  if (kind == VSASystemContainerACL::TopLevel) return "u::---,g::---,o::---,m::rwx,g:" + g + ":-wx";
   return "u::---,g::---,o::---,m::rwx,g:" + g + ":rwx";
 }
 
