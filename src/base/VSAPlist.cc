@@ -344,6 +344,16 @@ bool VSAWriteFileAtomically(const std::string& path, const std::vector<uint8_t>&
     VSASetError(error, VSA_POSIX_ERROR(err));
     return false;
   }
+  if (sync) {
+    // The rename is the commit; it is durable once the directory is synced.
+    size_t slash = path.find_last_of('/');
+    std::string dir = slash == std::string::npos ? "." : slash == 0 ? "/" : path.substr(0, slash);
+    int dirFd = ::open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    if (dirFd >= 0) {
+      ::fsync(dirFd);
+      ::close(dirFd);
+    }
+  }
   return true;
 }
 

@@ -80,7 +80,8 @@ std::optional<VSAValue> VSA_dictionaryWithContentsOfURL(const std::string& path,
                                                         VSAErrorRef* error,
                                                         size_t limit = kVSADefaultReadFileLimit);
 
-// Writes `bytes` to `path` atomically (temporary file + fsync + rename).
+// Writes `bytes` to `path` atomically and durably (temporary file, fsync,
+// rename, fsync of the directory; without `sync`, neither fsync).
 bool VSAWriteFileAtomically(const std::string& path, const std::vector<uint8_t>& bytes, mode_t mode,
                             VSAErrorRef* error, bool sync = true);
 // mkdir -p: creates `path` and its missing parents (parents 0755, `path`

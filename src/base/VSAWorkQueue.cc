@@ -13,6 +13,8 @@
 #include <thread>
 #include <vector>
 
+#include "base/VSALog.h"
+
 // Where root queues hand their work: a thread pool or the main loop.
 class VSAWorkQueueExecutor {
  public:
@@ -347,4 +349,10 @@ void VSAWorkQueue::pumpConcurrent() {
       self->pumpConcurrent();
     });
   }
+}
+
+bool VSACheckOnQueue(const VSAWorkQueue& queue, const char* function) {
+  if (queue.isCurrent()) return true;
+  VSALog(kVSALogFault, function, "Called off its queue %s", queue.label());
+  return false;
 }

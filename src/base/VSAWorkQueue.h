@@ -91,3 +91,8 @@ class VSAWorkQueue : public std::enable_shared_from_this<VSAWorkQueue> {
   int running_ = 0;              // concurrent
   bool barrierRunning_ = false;  // concurrent
 };
+
+// The check of every `_onQueue_` method, kept in release builds: a call from
+// the wrong queue is a logic error, logged at fault level (the caller goes
+// on, as after any fault). Answers whether the caller was on `queue`.
+bool VSACheckOnQueue(const VSAWorkQueue& queue, const char* function);

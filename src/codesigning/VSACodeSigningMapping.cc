@@ -1,6 +1,5 @@
 #include "codesigning/VSACodeSigningMapping.h"
 
-#include <cassert>
 #include <exception>
 
 #include "base/VSALog.h"
@@ -68,7 +67,7 @@ void VSACodeSigningMapping::_onQueue_migrateFromMappingFileToDBIfNecessary() {
 
 std::optional<VSACodeSigningEntry> VSACodeSigningMapping::_onQueue_entry(
     const std::string& identifier, VSAErrorRef* error) {
-  assert(queue_->isCurrent());
+  VSACheckOnQueue(*queue_, __func__);
   VSAErrorRef e;
   auto entry = codeSigningMappingDB_->codeSigningEntryWithIdentifier(identifier, &e);
   if (!entry && e &&
@@ -132,7 +131,7 @@ void VSACodeSigningMapping::_onQueue_queueSystemContainerDeletion(const std::str
 VSAResultCode VSACodeSigningMapping::_onQueue_processCodeSigningInfo(
     const std::optional<VSAValue>& info, const std::string& identifier, const VSAValue& options,
     const std::optional<VSAValue>& oldEntitlements, VSACommandQueue* commandQueue) {
-  assert(queue_->isCurrent());
+  VSACheckOnQueue(*queue_, __func__);
   try {
     std::vector<std::optional<VSACodeSigningEntry>> values;
     std::vector<std::string> identifiers;

@@ -1,7 +1,6 @@
 // Group identifiers, reference counts and the database pass-throughs of
 // VSACodeSigningMapping (registration lives in VSACodeSigningMapping.cc).
 #include <algorithm>
-#include <cassert>
 #include <set>
 
 #include "base/VSALocks.h"
@@ -79,7 +78,7 @@ std::optional<std::vector<std::string>> VSACodeSigningMapping::systemGroupIdenti
 
 std::optional<VSAReferenceCounts> VSACodeSigningMapping::_onQueue_copyReferenceCountSetOfType(
     int type) {
-  assert(queue_->isCurrent());
+  VSACheckOnQueue(*queue_, __func__);
   const char* key =
       type == kVSAGroupTypeSystem ? kVSAEntitlementSystemGroups : kVSAEntitlementApplicationGroups;
   const char* fallback =

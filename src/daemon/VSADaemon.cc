@@ -17,7 +17,8 @@
 
 VSADaemon::VSADaemon(Options options)
     : options_(std::move(options)),
-      context_(std::make_unique<VSADaemonContext>(VSASystemRoot(options_.root))) {
+      context_(std::make_unique<VSADaemonContext>(VSASystemRoot(options_.root),
+                                                  VSADaemonContext::FileSystemWrapper{}, false)) {
   firstBootSemaphore_ =
       VSANamedSemaphore::nameForRoot(kVSAFirstBootSemaphore, context_->systemRoot);
   VSALogger::shared().setLevel(options_.logLevel);
@@ -85,14 +86,19 @@ void VSADaemon::drainForShutdown() {
 }
 
 void VSADaemon::openLogs() {
-  auto& config = *context_->globalConfiguration;
-  std::string path = VSAPathJoin(config.logDirectory(), "vessad.log");
+  // Before any subsystem exists, so that their start-up lines are kept.
+  std::string directory = VSAGlobalConfiguration::logDirectoryForRoot(context_->systemRoot);
+  VSAErrorRef directoryError;
+  if (!context_->fileManager->createDirectoryAtURL(directory, true, 0755, 0, 4, &directoryError))
+    VSALogIn(VSALogCategory::Daemon, kVSALogError, "vessad_init",
+             "Failed to create log directory at \"%@\": %@", directory, directoryError);
+  std::string path = VSAPathJoin(directory, "vessad.log");
   auto& logger = VSALogger::shared();
   if (!logger.openRotatingLog(path, options_.logLevel)) {
     VSALogIn(VSALogCategory::Daemon, kVSALogError, "vessad_init",
              "Failed to set up rotating logs at path %s", path);
   }
-  bool internal = config.isInternalImage();
+  bool internal = context_->deviceProperties->hasInternalContent();
   logger.enableDiskLogging(internal ? 4 : 1, internal ? 262144 : 102400);
   if (logger.level() >= kVSALogDebug)
     VSALogIn(VSALogCategory::Daemon, kVSALogDebug, "vessad_init", "vessad built at %s %s started",
@@ -109,6 +115,7 @@ bool VSADaemon::isFirstBoot() {
 void VSADaemon::initialize() {
   VSASignpostInterval startingUp(VSALogCategory::Startup, "StartingUp");
   openLogs();
+  context_->buildSubsystems();
   context_->deathrowQueue =
       VSAWorkQueue::create("com.tamsk.vessad.deathrow", VSAWorkQueue::Kind::Serial,
                            VSAWorkQueue::global(VSAWorkQueue::Priority::Background));

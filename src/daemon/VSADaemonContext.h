@@ -3,6 +3,12 @@
 // queues. The daemon creates one context at start-up; tests build their own
 // around a temporary root, so several daemons can live in one process.
 // Members are set before the first request and not replaced afterwards.
+//
+// Construction is in two steps. The first makes the platform services (no
+// log lines): the daemon needs them to listen before its log is open. The
+// second, buildSubsystems(), makes the configuration, caches, code-signing
+// database and managers, which log as they start; the daemon runs it in its
+// initialisation routine after opening the log. Tests get both at once.
 #pragma once
 
 #include <memory>
@@ -33,7 +39,8 @@ struct VSADaemonContext {
   // `wrapFileSystem` lets a test put a fault-injecting layer over the real file system.
   using FileSystemWrapper =
       std::function<std::shared_ptr<VSAFileSystem>(std::shared_ptr<VSAFileSystem>)>;
-  explicit VSADaemonContext(const VSASystemRoot& root, const FileSystemWrapper& wrapFileSystem = {})
+  explicit VSADaemonContext(const VSASystemRoot& root, const FileSystemWrapper& wrapFileSystem = {},
+                            bool buildSubsystemsNow = true)
       : systemRoot(root),
         deviceProperties(std::make_shared<VSADeviceProperties>(root)),
         clientRegistry(std::make_shared<VSAClientRegistry>(root)),
@@ -46,14 +53,20 @@ struct VSADaemonContext {
                    return lockState->currentLockState() == 1;
                  }))),
         fileManager(std::make_shared<VSAFileManager>(fileSystem, userDatabase)),
-        globalConfiguration(std::make_shared<VSAGlobalConfiguration>(root, deviceProperties,
-                                                                     userDatabase, fileManager)),
         transactions(std::make_shared<VSATransactions>()),
         sandboxService(std::make_shared<VSASandboxService>(root)),
         subdirectories(std::make_shared<VSAContainerSubdirectories>(root)),
-        deathRow(std::make_shared<VSADeathRow>(globalConfiguration, transactions)),
-        whitelist(VSAWhitelist::load(root.resolve("/etc/vessad/whitelist.plist"),
-                                     globalConfiguration->isInternalImage())) {
+        lockStateQueue(VSAWorkQueue::create("com.tamsk.vessad.lockstate")) {
+    if (buildSubsystemsNow) buildSubsystems();
+  }
+
+  void buildSubsystems() {
+    const VSASystemRoot& root = systemRoot;
+    globalConfiguration =
+        std::make_shared<VSAGlobalConfiguration>(root, deviceProperties, userDatabase, fileManager);
+    deathRow = std::make_shared<VSADeathRow>(globalConfiguration, transactions);
+    whitelist = VSAWhitelist::load(root.resolve("/etc/vessad/whitelist.plist"),
+                                   globalConfiguration->isInternalImage());
     // A device may come without a termination service ("HasTerminationService" NO).
     if (deviceProperties->deviceDictionary().get("HasTerminationService") == nullptr ||
         deviceProperties->deviceDictionary()
@@ -90,7 +103,6 @@ struct VSADaemonContext {
         m->removeCodeSigningDictionariesForIdentifierAndItsChildren(id, &queue);
     };
     codeSigningMapping->setStageForDeleteEnvironment(stageEnvironment);
-    lockStateQueue = VSAWorkQueue::create("com.tamsk.vessad.lockstate");
     auto protection = std::make_shared<VSADataProtectionEnvironment>();
     protection->configuration = globalConfiguration;
     protection->userIdentityCache = userIdentityCache;

@@ -87,8 +87,12 @@ std::string VSAGlobalConfiguration::transientDirectory() {
                          "Failed to create transient dir at \"%@\": %@");
 }
 
+std::string VSAGlobalConfiguration::logDirectoryForRoot(const VSASystemRoot& root) {
+  return root.resolve("/private/var/root/Library/Logs/Vessa");
+}
+
 std::string VSAGlobalConfiguration::logDirectory() {
-  return ensureDirectory(VSAPathJoin(rootHomeDirectory(), "Library/Logs/Vessa"), 0, 4,
+  return ensureDirectory(logDirectoryForRoot(root_), 0, 4,
                          "Failed to create log directory at \"%@\": %@");
 }
 

@@ -53,6 +53,9 @@ class VSAGlobalConfiguration {
   std::string stagingDirectory();
   std::string transientDirectory();
   std::string logDirectory();
+  // The same directory, known before any configuration exists (the daemon
+  // opens its log first).
+  static std::string logDirectoryForRoot(const VSASystemRoot& root);
   std::optional<std::string> legacyTransientBundleDirectory();
 
   static const std::vector<std::string>& appUserDataItemNames();
