@@ -11,6 +11,7 @@
 
 #include "VSATestTempDir.h"
 #include "daemon/VSAClientConnection.h"
+#include "operations/VSACommandStageForDelete.h"
 #include "platform/VSAFaultInjectingFileSystem.h"
 #include "platform/VSALinuxFileSystem.h"
 
@@ -65,6 +66,15 @@ class Lifecycle : public ::testing::Test {
   }
   std::string staging() {
     return context_->globalConfiguration->stagingDirectoryURLForUserIdentity(user_, 2);
+  }
+  // Runs one stage-for-delete command of the context's environment; its code.
+  VSAResultCode stage(std::vector<VSAContainerIdentityRef> identities) {
+    VSACommandQueue queue;
+    queue.insertCommand(VSACommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
+        context_->stageEnvironment, std::move(identities), true, nullptr));
+    VSAResultCode code = VSAResult::kSuccess;
+    queue.executeAllUntilExhaustedOrError(&code);
+    return code;
   }
   // What a container is made of: each item below it, with its type, mode,
   // owner and protection class (the contents of files differ per container).
@@ -306,6 +316,136 @@ TEST_F(Lifecycle, DeletionStagesOnRequestCompletionAndDeathRowEmpties) {
   other->deleteContainerWithContainerIdentity(identity("com.example.doomed"), false, &code);
   EXPECT_EQ(code, VSAResult::kContainerNotFound);
   EXPECT_EQ(other->commandQueue()->count(), 0u);
+}
+
+// Staging a transient bundle container for deletion takes that container,
+// never its permanent twin, drops its entry from the transient class map, and
+// keeps the identifier's code-signing records while the permanent one remains.
+TEST_F(Lifecycle, ATransientBundleWithAPermanentTwinKeepsTheCodeSigningRecords) {
+  auto c = installer();
+  VSAResultCode code;
+  std::vector<std::string> forgotten;
+  context_->stageEnvironment->removeCodeSigning = [&](const std::string& id, VSACommandQueue&) {
+    forgotten.push_back(id);
+  };
+  auto permanent = create(*c, "com.example.twin", &code, false, 1);
+  ASSERT_TRUE(permanent) << code;
+  auto transient = create(*c, "com.example.twin", &code, true, 1);
+  ASSERT_TRUE(transient) << code;
+  // A transient container is named by its concrete identity (its UUID).
+  ASSERT_EQ(stage({transient->containerIdentity()}), VSAResult::kSuccess);
+  EXPECT_FALSE(fs::exists(transient->url()));
+  EXPECT_TRUE(fs::exists(permanent->url() + "/" + kVSAMetadataFileName));
+  EXPECT_TRUE(forgotten.empty());
+  VSAErrorRef error;
+  EXPECT_FALSE(context_->containerCache->containerForContainerIdentity(
+      *identity("com.example.twin", 1), true, false, false, &error));
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code(), VSAResult::kContainerNotFound);  // dropped, not found stale (44)
+  auto still =
+      context_->containerCache->containerForContainerIdentity(*identity("com.example.twin", 1));
+  ASSERT_TRUE(still);
+  EXPECT_EQ(still->uuid(), permanent->uuid());
+
+  // A transient bundle container without a permanent twin takes the records along.
+  auto lonely = create(*c, "com.example.lonely", &code, true, 1);
+  ASSERT_TRUE(lonely) << code;
+  ASSERT_EQ(stage({lonely->containerIdentity()}), VSAResult::kSuccess);
+  EXPECT_FALSE(fs::exists(lonely->url()));
+  EXPECT_EQ(forgotten, std::vector<std::string>{"com.example.lonely"});
+  error = nullptr;
+  EXPECT_FALSE(context_->containerCache->containerForContainerIdentity(
+      *identity("com.example.lonely", 1), true, false, false, &error));
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code(), VSAResult::kContainerNotFound);
+
+  // Deleting the permanent container forgets the records too.
+  c->deleteContainerWithContainerIdentity(identity("com.example.twin", 1), false, &code);
+  ASSERT_TRUE(c->completeWithError(&code)) << code;
+  EXPECT_FALSE(fs::exists(permanent->url()));
+  EXPECT_EQ(forgotten, (std::vector<std::string>{"com.example.lonely", "com.example.twin"}));
+}
+
+TEST_F(Lifecycle, AContainerThatCannotBeMovedToDeathRowIsRemovedInPlace) {
+  auto c = installer();
+  VSAResultCode code;
+  auto m = create(*c, "com.example.stuck", &code);
+  ASSERT_TRUE(m) << code;
+  std::string deathrow = context_->globalConfiguration->deathrowDirectory();
+  size_t staged = entries(deathrow);
+  c->deleteContainerWithContainerIdentity(identity("com.example.stuck"), false, &code);
+  ASSERT_EQ(code, VSAResult::kSuccess);
+  faults_->reset();
+  faults_->failNth(Op::Rename, 1, EBUSY);
+  EXPECT_TRUE(c->completeWithError(&code)) << code;
+  EXPECT_EQ(faults_->callCount(Op::Rename), 1);  // the one move, which failed
+  faults_->reset();
+  EXPECT_FALSE(fs::exists(m->url()));
+  EXPECT_EQ(entries(deathrow), staged);  // removed where it was
+  EXPECT_FALSE(c->createOrLookupContainerWithContainerIdentity(identity("com.example.stuck"), false,
+                                                               false, true, &code));
+  EXPECT_EQ(code, VSAResult::kContainerNotFound);
+}
+
+// A container that can be neither moved nor removed fails the command with 28
+// and keeps its cache entry; the containers after it are still staged.
+TEST_F(Lifecycle, AContainerThatCannotBeRemovedKeepsItsEntryAndFailsWith28) {
+  auto c = installer();
+  VSAResultCode code;
+  auto kept = create(*c, "com.example.kept", &code);
+  auto gone = create(*c, "com.example.gone", &code);
+  ASSERT_TRUE(kept && gone);
+  std::vector<VSAResultCode> reported;
+  VSACommandQueue queue;
+  queue.insertCommand(VSACommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
+      context_->stageEnvironment, {identity("com.example.kept"), identity("com.example.gone")},
+      true, [&](VSAResultCode failure) { reported.push_back(failure); }));
+  faults_->reset();
+  faults_->failNth(Op::Rename, 1, EBUSY);
+  faults_->failAll(Op::Unlink, EPERM);
+  faults_->failAll(Op::Rmdir, EPERM);
+  code = VSAResult::kSuccess;
+  EXPECT_FALSE(queue.executeAllUntilExhaustedOrError(&code));
+  faults_->reset();
+  EXPECT_EQ(code, 28u);
+  EXPECT_EQ(reported, std::vector<VSAResultCode>{28});
+  EXPECT_TRUE(fs::exists(kept->url() + "/" + kVSAMetadataFileName));
+  auto entry =
+      context_->containerCache->containerForContainerIdentity(*identity("com.example.kept"));
+  ASSERT_TRUE(entry);
+  EXPECT_EQ(entry->uuid(), kept->uuid());
+  EXPECT_FALSE(fs::exists(gone->url()));
+  EXPECT_FALSE(
+      context_->containerCache->containerForContainerIdentity(*identity("com.example.gone")));
+}
+
+// When the cache cannot drop a staged container (its class map is gone and
+// cannot be rebuilt), the command fails with 46 and stages nothing more.
+TEST_F(Lifecycle, ACacheThatCannotDropAStagedContainerStopsTheCommandWith46) {
+  auto c = installer();
+  VSAResultCode code;
+  auto first = create(*c, "com.example.first", &code, false, 1);
+  auto second = create(*c, "com.example.second", &code, false, 1);
+  ASSERT_TRUE(first && second);
+  // The class map goes away while the command runs (an identity
+  // invalidation), and the class directory cannot be listed any more.
+  auto environment = std::make_shared<VSAStageForDeleteEnvironment>(*context_->stageEnvironment);
+  environment->removeCodeSigning = [this](const std::string&, VSACommandQueue&) {
+    context_->containerCache->invalidateUserIdentity(user_);
+    faults_->failAll(Op::ReadDirectory, EIO);
+  };
+  std::vector<VSAResultCode> reported;
+  VSACommandQueue queue;
+  queue.insertCommand(VSACommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
+      environment, {identity("com.example.first", 1), identity("com.example.second", 1)}, true,
+      [&](VSAResultCode failure) { reported.push_back(failure); }));
+  code = VSAResult::kSuccess;
+  EXPECT_FALSE(queue.executeAllUntilExhaustedOrError(&code));
+  faults_->reset();
+  EXPECT_EQ(code, 46u);
+  EXPECT_EQ(reported, std::vector<VSAResultCode>{46});
+  EXPECT_FALSE(fs::exists(first->url()));  // staged before the cache refused
+  EXPECT_TRUE(fs::exists(second->url() + "/" + kVSAMetadataFileName));  // never reached
 }
 
 TEST_F(Lifecycle, DeathRowEntriesThatResistRemovalEndInTmp) {
