@@ -195,19 +195,29 @@ struct CreateSteps {
             &underlying)) {
       *error = failure(kStagingCreateFailed, underlying,
                        VSAFormat("Failed to create staging dir at %@ : %@", staging, underlying));
+      // The directory may exist although a later step of its creation (its
+      // protection class, its owner) failed; its name is fresh, so it is ours.
+      discard(staging, error);
       return nullptr;
     }
-    VSAMetadataRef metadata = assemble(staging, name, error);
-    if (metadata) return metadata;
-    // Nothing of a failed creation stays outside death row.
-    VSAErrorRef cleanup;
-    if (!context.deathRow->_moveItemAtURLToDeathRow(staging, true, true, &cleanup))
-      *error = failure(kStagingRemovalFailed, *error,
-                       VSAFormat("Failed to remove staging dir: %@", staging));
-    return nullptr;
+    // Where the new container is: in staging until it has been renamed into place.
+    std::string made = staging;
+    VSAMetadataRef metadata = assemble(staging, name, &made, error);
+    if (!metadata) discard(made, error);
+    return metadata;
   }
 
-  VSAMetadataRef assemble(const std::string& staging, const std::string& name, VSAErrorRef* error) {
+  // Nothing of a failed creation stays outside death row. A directory that
+  // is not there (its mkdir failed) is no failure.
+  void discard(const std::string& directory, VSAErrorRef* error) {
+    VSAErrorRef cleanup;
+    if (!context.deathRow->_moveItemAtURLToDeathRow(directory, true, true, &cleanup))
+      *error = failure(kStagingRemovalFailed, *error,
+                       VSAFormat("Failed to remove staging dir: %@", directory));
+  }
+
+  VSAMetadataRef assemble(const std::string& staging, const std::string& name, std::string* made,
+                          VSAErrorRef* error) {
     VSAContainerClass c = identity.containerClass();
     auto& config = *context.globalConfiguration;
     VSAResultCode code = VSAResult::kSuccess;
@@ -236,6 +246,7 @@ struct CreateSteps {
                        VSAFormat("Failed to move staging dir: %@ to live dir: %@", staging, live));
       return nullptr;
     }
+    *made = live;
     if (context.deviceProperties->isFeatureEnabled("fast_container_sizing"))
       context.fileManager->fastDiskUsageForURL(live);
     metadata->setUrl(live);
@@ -246,8 +257,9 @@ struct CreateSteps {
       *error = failure(kCacheAddFailed, underlying,
                        VSAFormat("Failed to add to cache : %@, url: %@, transient: %d", *metadata,
                                  live, transient));
-      // The container is complete on disk; it goes to death row with the staging clean-up.
-      context.fileManager->moveItemAtURL(live, staging, nullptr);
+      // The container is complete on disk but unknown to the cache; the caller
+      // sends it to death row from where it is, so that no later creation of
+      // the identity finds a twin in the class directory.
       return nullptr;
     }
     return metadata;

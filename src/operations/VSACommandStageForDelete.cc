@@ -30,19 +30,58 @@ VSACommandStageForDelete::VSACommandStageForDelete(
       useLocking_(useLocking),
       onError_(std::move(onError)) {}
 
+VSAMetadataRef VSACommandStageForDelete::find(const VSAContainerIdentity& identity) const {
+  auto& cache = *environment_->cache;
+  // A plain identity names the live container of its identifier.
+  if (!identity.isConcrete())
+    return cache.containerForContainerIdentity(identity, false, true, false, nullptr);
+  // A concrete identity names one directory, which may be a transient
+  // container (deleting one names it by its UUID); its permanent twin of the
+  // same identifier, if any, must not be taken for it.
+  const VSAUUID& uuid = static_cast<const VSAConcreteContainerIdentity&>(identity).uuid();
+  VSAMetadataRef live = cache.containerForContainerIdentity(identity);
+  if (live && live->uuid() == uuid) return live;
+  VSAMetadataRef transient =
+      cache.containerForContainerIdentity(identity, true, false, false, nullptr);
+  if (transient && transient->uuid() == uuid) return transient;
+  return live;
+}
+
+bool VSACommandStageForDelete::hasPermanentTwin(const VSAMetadata& container) const {
+  if (!container.transient()) return false;
+  VSAResultCode code = VSAResult::kSuccess;
+  auto permanentIdentity = VSAContainerIdentity::containerIdentityWithUserIdentity(
+      container.userIdentity(), container.identifier(), container.containerClass(), &code);
+  if (!permanentIdentity) {
+    VSALog(kVSALogError, "fromQueue",
+           "Could not construct container identity from %@ to check for permanent copy: %llu",
+           container, static_cast<unsigned long long>(code));
+    return false;
+  }
+  VSAErrorRef error;
+  if (!environment_->cache->containerForContainerIdentity(*permanentIdentity, false, false, false,
+                                                          &error))
+    return false;
+  VSALog(kVSALogNotice, "fromQueue",
+         "Skipping removal of code sign mapping since container to be deleted [%@] is transient "
+         "and there's a permanent one; error = %@",
+         container, error);
+  return true;
+}
+
 bool VSACommandStageForDelete::stage(const VSAContainerIdentity& identity, VSACommandQueue& queue,
                                      VSAResultCode* code) {
   auto& cache = *environment_->cache;
   auto& config = *environment_->configuration;
-  // A concrete identity names one directory; a plain one, the live container.
-  VSAMetadataRef container = identity.isConcrete() ? cache.containerForContainerIdentity(identity)
-                                                   : cache.containerForContainerIdentity(
-                                                         identity, false, true, false, nullptr);
+  VSAMetadataRef container = find(identity);
   if (!container) return true;  // nothing to stage
   std::string destination =
       VSAPathJoin(config.deathrowDirectory(), VSALastPathComponent(container->url()));
-  if (VSAContainerClassIsBundle(identity.containerClass()) && environment_->removeCodeSigning)
-    environment_->removeCodeSigning(identity.identifier(), queue);
+  // A transient copy of a bundle goes while its permanent container stays,
+  // and the permanent one still needs the identifier's code-signing records.
+  if (VSAContainerClassIsBundle(container->containerClass()) && environment_->removeCodeSigning &&
+      !hasPermanentTwin(*container))
+    environment_->removeCodeSigning(container->identifier(), queue);
   VSAErrorRef error;
   if (!config.fileManager().moveItemAtURL(container->url(), destination, &error)) {
     VSALog(kVSALogDebug, "fromQueue", "Couldn't stage for deletion from %@ to %@: %@",
@@ -54,11 +93,12 @@ bool VSACommandStageForDelete::stage(const VSAContainerIdentity& identity, VSACo
       return true;  // keep the cache entry; go on with the next container
     }
   }
+  bool transient = container->transient();
   if (!cache.removeContainerForUserIdentity(container->userIdentity(), container->containerClass(),
-                                            container->identifier(), false, &error)) {
+                                            container->identifier(), transient, &error)) {
     VSALog(kVSALogError, "fromQueue",
            "Failed to remove from cache id: %@, class: %ld, transient: %d", container->identifier(),
-           static_cast<long>(container->containerClass()), 0);
+           static_cast<long>(container->containerClass()), transient);
     *code = kCacheRemovalFailed;
     return false;
   }

@@ -1,7 +1,8 @@
 // The deferred deletion of containers (command type 3). When the request's
 // command queue is drained, each listed container is found in the cache,
 // renamed into death row (or, when that fails, removed in place) and dropped
-// from the cache; a deleted bundle's code-signing records go too. It runs
+// from the cache; a deleted bundle's code-signing records go too, unless the
+// deleted container is a transient copy whose permanent container remains. It runs
 // under the all-identifiers write lock unless the caller already holds it.
 // The background task that empties death row comes with the deletion
 // operations.
@@ -36,6 +37,11 @@ class VSACommandStageForDelete : public VSACommand {
   bool useLocking() const { return useLocking_; }
 
  private:
+  // The cached container an identity names, or null.
+  VSAMetadataRef find(const VSAContainerIdentity& identity) const;
+  // Whether `container` is transient and a permanent container of its
+  // identifier and class exists (logged when so).
+  bool hasPermanentTwin(const VSAMetadata& container) const;
   // Stages one container; false with `code` set when the loop must stop.
   bool stage(const VSAContainerIdentity& identity, VSACommandQueue& queue, VSAResultCode* code);
 

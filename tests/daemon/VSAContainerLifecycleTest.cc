@@ -1,6 +1,9 @@
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <sys/xattr.h>
 
+#include <array>
+#include <cstdio>
 #include <filesystem>
 #include <fstream>
 #include <future>
@@ -8,7 +11,9 @@
 
 #include "VSATestTempDir.h"
 #include "daemon/VSAClientConnection.h"
+#include "operations/VSACommandStageForDelete.h"
 #include "platform/VSAFaultInjectingFileSystem.h"
+#include "platform/VSALinuxFileSystem.h"
 
 namespace fs = std::filesystem;
 using Op = VSAFileSystem::Op;
@@ -59,8 +64,35 @@ class Lifecycle : public ::testing::Test {
     return *context_->globalConfiguration->containerDirectoryURLForUserIdentity(user_, c,
                                                                                 transient);
   }
-  std::string staging() {
-    return context_->globalConfiguration->stagingDirectoryURLForUserIdentity(user_, 2);
+  std::string staging(VSAContainerClass c = 2) {
+    return context_->globalConfiguration->stagingDirectoryURLForUserIdentity(user_, c);
+  }
+  void sweepCreation(VSAContainerClass cls);
+  int injectedFaults_ = 0;  // by sweepCreation
+  // Runs one stage-for-delete command of the context's environment; its code.
+  VSAResultCode stage(std::vector<VSAContainerIdentityRef> identities) {
+    VSACommandQueue queue;
+    queue.insertCommand(VSACommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
+        context_->stageEnvironment, std::move(identities), true, nullptr));
+    VSAResultCode code = VSAResult::kSuccess;
+    queue.executeAllUntilExhaustedOrError(&code);
+    return code;
+  }
+  // What a container is made of: each item below it, with its type, mode,
+  // owner and protection class (the contents of files differ per container).
+  static std::map<std::string, std::string> shapeOf(const std::string& dir) {
+    std::map<std::string, std::string> shape;
+    for (const auto& entry : fs::recursive_directory_iterator(dir)) {
+      struct stat st;
+      if (::lstat(entry.path().c_str(), &st) != 0) continue;
+      char protection[16] = {};
+      ssize_t size = ::lgetxattr(entry.path().c_str(), kVSAProtectionClassXattr, protection,
+                                 sizeof(protection) - 1);
+      shape[fs::relative(entry.path(), dir).string()] =
+          std::to_string(st.st_mode) + " " + std::to_string(st.st_uid) + ":" +
+          std::to_string(st.st_gid) + " class " + (size > 0 ? protection : "none");
+    }
+    return shape;
   }
   VSAResultCode emptyDeathRow() {
     std::promise<VSAResultCode> done;
@@ -190,37 +222,87 @@ TEST_F(Lifecycle, AccessTestsComeBeforeAnyLookup) {
   EXPECT_EQ(entries(classDirectory()), 3u);
 }
 
-TEST_F(Lifecycle, AFailureAtAnyStepOfCreationLeavesNothingBehind) {
+// Fails, one at a time, every call of every operation type that a clean
+// creation makes. A creation that fails leaves no staging directory, no cache
+// entry and nothing in the class directory, and the identity can be created
+// afterwards; one that succeeds despite the fault (a step whose failure is only
+// logged) yields a complete container that a lookup finds. Counts the faults
+// injected in injectedFaults_.
+void Lifecycle::sweepCreation(VSAContainerClass cls) {
   auto c = installer();
   VSAResultCode code;
-  // Count the calls of one successful creation, then fail each in turn.
-  const Op ops[] = {Op::Mkdir,     Op::Chown,    Op::Chmod,   Op::Rename,
-                    Op::WriteFile, Op::SetClass, Op::Mkdtemp, Op::Lstat};
-  std::map<Op, int> before;
-  for (Op op : ops) before[op] = faults_->callCount(op);
-  ASSERT_TRUE(create(*c, "com.example.counted", &code));
-  int cases = 0;
-  for (Op op : ops) {
-    int calls = faults_->callCount(op) - before[op];
-    for (int n = 1; n <= calls; ++n) {
-      std::string id =
-          "com.example.fail." + std::string(VSAFileSystem::opName(op)) + "." + std::to_string(n);
-      size_t live = entries(classDirectory());
-      faults_->failNth(op, n, EIO);
-      auto m = create(*c, id, &code);
-      faults_->reset();
-      if (m) continue;  // a step whose failure is only logged
-      ++cases;
+  std::string deathrow = context_->globalConfiguration->deathrowDirectory();
+  // The first creation also builds the class maps and the directories above
+  // the class; the second is the clean run whose calls are counted.
+  ASSERT_TRUE(create(*c, "com.example.warmup", &code, false, cls)) << code;
+  faults_->reset();
+  auto counted = create(*c, "com.example.counted", &code, false, cls);
+  ASSERT_TRUE(counted) << code;
+  std::array<int, static_cast<size_t>(Op::Count)> calls{};
+  int total = 0;
+  for (size_t i = 0; i < calls.size(); ++i) total += calls[i] = faults_->callCount(Op(i));
+  faults_->reset();
+  const auto shape = shapeOf(counted->url());
+  ASSERT_GE(shape.size(), 2u);  // the metadata file and sub-directories
+  EXPECT_EQ(emptyDeathRow(), VSAResult::kSuccess);
+
+  int injected = 0, failed = 0, survived = 0;
+  for (size_t i = 0; i < calls.size(); ++i) {
+    Op op = Op(i);
+    for (int n = 1; n <= calls[i]; ++n) {
+      std::string id = "com.example.fail." + std::to_string(cls) + "." +
+                       std::string(VSAFileSystem::opName(op)) + "." + std::to_string(n);
       SCOPED_TRACE(id);
-      EXPECT_NE(code, VSAResult::kSuccess);
-      EXPECT_EQ(entries(staging()), 0u);
-      EXPECT_FALSE(context_->containerCache->containerForContainerIdentity(*identity(id)));
-      EXPECT_EQ(entries(classDirectory()), live);  // nothing reached the live directory
+      size_t live = entries(classDirectory(cls));
+      faults_->reset();
+      faults_->failNth(op, n, EIO);
+      auto m = create(*c, id, &code, false, cls);
+      bool reached = faults_->callCount(op) >= n;
+      faults_->reset();
+      ASSERT_TRUE(reached) << "the creation no longer makes this call";
+      ++injected;
+      EXPECT_EQ(entries(staging(cls)), 0u);
+      if (m) {
+        ++survived;
+        std::printf("  survived: %s\n", id.c_str());
+        EXPECT_EQ(shapeOf(m->url()), shape);
+        auto found = c->createOrLookupContainerWithContainerIdentity(identity(id, cls), false,
+                                                                     false, true, &code);
+        ASSERT_TRUE(found) << code;
+        EXPECT_EQ(found->url(), m->url());
+        EXPECT_EQ(found->uuid(), m->uuid());
+        EXPECT_EQ(entries(classDirectory(cls)), live + 1);
+      } else {
+        ++failed;
+        EXPECT_NE(code, VSAResult::kSuccess);
+        EXPECT_FALSE(context_->containerCache->containerForContainerIdentity(*identity(id, cls)));
+        EXPECT_EQ(entries(classDirectory(cls)), live);  // nothing reached the live directory
+        auto again = create(*c, id, &code, false, cls);
+        ASSERT_TRUE(again) << code;
+        EXPECT_FALSE(again->existed());
+        EXPECT_EQ(shapeOf(again->url()), shape);
+      }
       EXPECT_EQ(emptyDeathRow(), VSAResult::kSuccess);
+      EXPECT_EQ(entries(deathrow), 0u);
     }
   }
-  EXPECT_GT(cases, 5);
-  ASSERT_TRUE(create(*c, "com.example.fail.Mkdir.1", &code)) << code;
+  for (size_t i = 0; i < calls.size(); ++i)
+    if (calls[i]) std::printf("  %s: %d calls\n", VSAFileSystem::opName(Op(i)), calls[i]);
+  EXPECT_EQ(injected, total);
+  EXPECT_GT(failed, 10);
+  std::printf(
+      "creation sweep of class %llu: %d injected faults (%d failed the creation, %d were "
+      "survived)\n",
+      static_cast<unsigned long long>(cls), injected, failed, survived);
+  injectedFaults_ += injected;
+}
+
+TEST_F(Lifecycle, AFailureOfAnyCallOfCreationLeavesNothingBehind) {
+  sweepCreation(2);
+  if (HasFatalFailure()) return;
+  sweepCreation(13);  // a system class: an ACL and system owners
+  std::printf("creation sweeps: %d injected faults\n", injectedFaults_);
+  RecordProperty("injected_faults", injectedFaults_);
 }
 
 TEST_F(Lifecycle, DeletionStagesOnRequestCompletionAndDeathRowEmpties) {
@@ -247,6 +329,136 @@ TEST_F(Lifecycle, DeletionStagesOnRequestCompletionAndDeathRowEmpties) {
   other->deleteContainerWithContainerIdentity(identity("com.example.doomed"), false, &code);
   EXPECT_EQ(code, VSAResult::kContainerNotFound);
   EXPECT_EQ(other->commandQueue()->count(), 0u);
+}
+
+// Staging a transient bundle container for deletion takes that container,
+// never its permanent twin, drops its entry from the transient class map, and
+// keeps the identifier's code-signing records while the permanent one remains.
+TEST_F(Lifecycle, ATransientBundleWithAPermanentTwinKeepsTheCodeSigningRecords) {
+  auto c = installer();
+  VSAResultCode code;
+  std::vector<std::string> forgotten;
+  context_->stageEnvironment->removeCodeSigning = [&](const std::string& id, VSACommandQueue&) {
+    forgotten.push_back(id);
+  };
+  auto permanent = create(*c, "com.example.twin", &code, false, 1);
+  ASSERT_TRUE(permanent) << code;
+  auto transient = create(*c, "com.example.twin", &code, true, 1);
+  ASSERT_TRUE(transient) << code;
+  // A transient container is named by its concrete identity (its UUID).
+  ASSERT_EQ(stage({transient->containerIdentity()}), VSAResult::kSuccess);
+  EXPECT_FALSE(fs::exists(transient->url()));
+  EXPECT_TRUE(fs::exists(permanent->url() + "/" + kVSAMetadataFileName));
+  EXPECT_TRUE(forgotten.empty());
+  VSAErrorRef error;
+  EXPECT_FALSE(context_->containerCache->containerForContainerIdentity(
+      *identity("com.example.twin", 1), true, false, false, &error));
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code(), VSAResult::kContainerNotFound);  // dropped, not found stale (44)
+  auto still =
+      context_->containerCache->containerForContainerIdentity(*identity("com.example.twin", 1));
+  ASSERT_TRUE(still);
+  EXPECT_EQ(still->uuid(), permanent->uuid());
+
+  // A transient bundle container without a permanent twin takes the records along.
+  auto lonely = create(*c, "com.example.lonely", &code, true, 1);
+  ASSERT_TRUE(lonely) << code;
+  ASSERT_EQ(stage({lonely->containerIdentity()}), VSAResult::kSuccess);
+  EXPECT_FALSE(fs::exists(lonely->url()));
+  EXPECT_EQ(forgotten, std::vector<std::string>{"com.example.lonely"});
+  error = nullptr;
+  EXPECT_FALSE(context_->containerCache->containerForContainerIdentity(
+      *identity("com.example.lonely", 1), true, false, false, &error));
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code(), VSAResult::kContainerNotFound);
+
+  // Deleting the permanent container forgets the records too.
+  c->deleteContainerWithContainerIdentity(identity("com.example.twin", 1), false, &code);
+  ASSERT_TRUE(c->completeWithError(&code)) << code;
+  EXPECT_FALSE(fs::exists(permanent->url()));
+  EXPECT_EQ(forgotten, (std::vector<std::string>{"com.example.lonely", "com.example.twin"}));
+}
+
+TEST_F(Lifecycle, AContainerThatCannotBeMovedToDeathRowIsRemovedInPlace) {
+  auto c = installer();
+  VSAResultCode code;
+  auto m = create(*c, "com.example.stuck", &code);
+  ASSERT_TRUE(m) << code;
+  std::string deathrow = context_->globalConfiguration->deathrowDirectory();
+  size_t staged = entries(deathrow);
+  c->deleteContainerWithContainerIdentity(identity("com.example.stuck"), false, &code);
+  ASSERT_EQ(code, VSAResult::kSuccess);
+  faults_->reset();
+  faults_->failNth(Op::Rename, 1, EBUSY);
+  EXPECT_TRUE(c->completeWithError(&code)) << code;
+  EXPECT_EQ(faults_->callCount(Op::Rename), 1);  // the one move, which failed
+  faults_->reset();
+  EXPECT_FALSE(fs::exists(m->url()));
+  EXPECT_EQ(entries(deathrow), staged);  // removed where it was
+  EXPECT_FALSE(c->createOrLookupContainerWithContainerIdentity(identity("com.example.stuck"), false,
+                                                               false, true, &code));
+  EXPECT_EQ(code, VSAResult::kContainerNotFound);
+}
+
+// A container that can be neither moved nor removed fails the command with 28
+// and keeps its cache entry; the containers after it are still staged.
+TEST_F(Lifecycle, AContainerThatCannotBeRemovedKeepsItsEntryAndFailsWith28) {
+  auto c = installer();
+  VSAResultCode code;
+  auto kept = create(*c, "com.example.kept", &code);
+  auto gone = create(*c, "com.example.gone", &code);
+  ASSERT_TRUE(kept && gone);
+  std::vector<VSAResultCode> reported;
+  VSACommandQueue queue;
+  queue.insertCommand(VSACommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
+      context_->stageEnvironment, {identity("com.example.kept"), identity("com.example.gone")},
+      true, [&](VSAResultCode failure) { reported.push_back(failure); }));
+  faults_->reset();
+  faults_->failNth(Op::Rename, 1, EBUSY);
+  faults_->failAll(Op::Unlink, EPERM);
+  faults_->failAll(Op::Rmdir, EPERM);
+  code = VSAResult::kSuccess;
+  EXPECT_FALSE(queue.executeAllUntilExhaustedOrError(&code));
+  faults_->reset();
+  EXPECT_EQ(code, 28u);
+  EXPECT_EQ(reported, std::vector<VSAResultCode>{28});
+  EXPECT_TRUE(fs::exists(kept->url() + "/" + kVSAMetadataFileName));
+  auto entry =
+      context_->containerCache->containerForContainerIdentity(*identity("com.example.kept"));
+  ASSERT_TRUE(entry);
+  EXPECT_EQ(entry->uuid(), kept->uuid());
+  EXPECT_FALSE(fs::exists(gone->url()));
+  EXPECT_FALSE(
+      context_->containerCache->containerForContainerIdentity(*identity("com.example.gone")));
+}
+
+// When the cache cannot drop a staged container (its class map is gone and
+// cannot be rebuilt), the command fails with 46 and stages nothing more.
+TEST_F(Lifecycle, ACacheThatCannotDropAStagedContainerStopsTheCommandWith46) {
+  auto c = installer();
+  VSAResultCode code;
+  auto first = create(*c, "com.example.first", &code, false, 1);
+  auto second = create(*c, "com.example.second", &code, false, 1);
+  ASSERT_TRUE(first && second);
+  // The class map goes away while the command runs (an identity
+  // invalidation), and the class directory cannot be listed any more.
+  auto environment = std::make_shared<VSAStageForDeleteEnvironment>(*context_->stageEnvironment);
+  environment->removeCodeSigning = [this](const std::string&, VSACommandQueue&) {
+    context_->containerCache->invalidateUserIdentity(user_);
+    faults_->failAll(Op::ReadDirectory, EIO);
+  };
+  std::vector<VSAResultCode> reported;
+  VSACommandQueue queue;
+  queue.insertCommand(VSACommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
+      environment, {identity("com.example.first", 1), identity("com.example.second", 1)}, true,
+      [&](VSAResultCode failure) { reported.push_back(failure); }));
+  code = VSAResult::kSuccess;
+  EXPECT_FALSE(queue.executeAllUntilExhaustedOrError(&code));
+  faults_->reset();
+  EXPECT_EQ(code, 46u);
+  EXPECT_EQ(reported, std::vector<VSAResultCode>{46});
+  EXPECT_FALSE(fs::exists(first->url()));  // staged before the cache refused
+  EXPECT_TRUE(fs::exists(second->url() + "/" + kVSAMetadataFileName));  // never reached
 }
 
 TEST_F(Lifecycle, DeathRowEntriesThatResistRemovalEndInTmp) {
