@@ -5,6 +5,7 @@
 #include <future>
 
 #include "VSATestTempDir.h"
+#include "base/VSALocks.h"
 #include "base/VSAPlist.h"
 #include "dataprotection/VSADataProtectionManager.h"
 #include "dataprotection/VSADataProtectionUpdateFile.h"
@@ -399,6 +400,38 @@ TEST_F(Protection, RepliesBeyondTheCapAreAnsweredAtOnceAndTheirChangesStillRun) 
     EXPECT_FALSE(fs::exists(updateFile(containers[i]))) << i;
   }
   EXPECT_EQ(capped.pendingReplyCount(), 0u);
+}
+
+TEST_F(Protection, TheClassIsRecordedOnTheMetadataAsItIsAtTheUnlock) {
+  auto m = container("com.app");
+  setClassOfTree(m->url(), 1);
+  locked_ = true;
+  lockStateQueue_->suspend();
+  std::promise<VSAResultCode> done;
+  manager_->setDataProtectionOnDataContainerForContainerIdentity(
+      *m->containerIdentity(), 3, false, true, [&](VSAResultCode c) { done.set_value(c); });
+  {
+    // Meanwhile someone records another info value, the way metadata is written.
+    VSAIdentifierLockGuard guard(VSAValue(m->uuid().string()), true);
+    auto current = VSAMetadata::readAndValidateMetadataAtUrl(m->url(), user_, false, *config_,
+                                                             *identities_, nullptr);
+    ASSERT_TRUE(current);
+    VSAValue info = current->info() ? *current->info() : VSAValue::dictionary();
+    info.set("com.example.Other", VSAValue("kept"));
+    current->setInfo(info);
+    ASSERT_TRUE(current->writeMetadataToDiskWithError(*config_, nullptr));
+  }
+  locked_ = false;
+  lockStateQueue_->resume();
+  EXPECT_EQ(done.get_future().get(), VSAResult::kSuccess);
+  auto reread = VSAMetadata::readAndValidateMetadataAtUrl(m->url(), user_, false, *config_,
+                                                          *identities_, nullptr);
+  ASSERT_TRUE(reread);
+  ASSERT_TRUE(reread->info());
+  const VSAValue* other = reread->info()->get("com.example.Other");
+  ASSERT_TRUE(other);
+  EXPECT_EQ(*other->stringValue(), "kept");
+  EXPECT_EQ(VSADataProtectionManager::currentProtectionClassOfMetadata(*reread), 3);
 }
 
 }  // namespace
