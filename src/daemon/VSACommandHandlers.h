@@ -10,10 +10,11 @@
 
 class VSAClientConnection;
 
-// Sends the reply of a command that replies from its completion (4, 21):
-// `reply` with "ReplyError" set to `code`, exactly once; failures are logged.
-void VSASendLateReply(const VSAIPCMessageRef& message, VSAValue reply, VSAResultCode code,
-                      uint64_t command);
+// Sends the reply of a command that replies from its completion (4, 21): a
+// reply with "ReplyError" set to `code`, exactly once; failures are logged.
+// Such handlers keep the request's reply context, not its message, so the
+// request dictionary is freed as soon as it has been dispatched.
+void VSASendLateReply(const VSAIPCReplyContextRef& context, VSAResultCode code, uint64_t command);
 
 using VSACommandHandler = void (*)(const VSAValue& request, VSAValue& reply,
                                    VSAClientConnection& connection, VSAResultCode* result);

@@ -73,7 +73,8 @@ struct VSADaemonContext {
             .get("HasTerminationService")
             ->boolValue()
             .value_or(true))
-      terminationService = std::make_shared<VSAApplicationTerminationService>(root, clientRegistry);
+      terminationService =
+          std::make_shared<VSAApplicationTerminationService>(root, clientRegistry, fileSystem);
     userIdentityCache = VSAUserIdentitySharedCache::create(
         {personaService, userDatabase, globalConfiguration->currentMobileUserId(),
          globalConfiguration->currentMobileGroupId(),

@@ -133,11 +133,12 @@ void VSAHandleStageForDelete(const VSAValue& request, VSAValue&, VSAClientConnec
           connection.context().stageEnvironment, std::move(identities), true, nullptr));
 }
 
-void VSAHandleDeleteDeathRow(const VSAValue&, VSAValue& reply, VSAClientConnection& connection,
+void VSAHandleDeleteDeathRow(const VSAValue&, VSAValue&, VSAClientConnection& connection,
                              VSAResultCode*) {
-  VSAIPCMessageRef message = connection.relayMessage();
+  VSAIPCReplyContextRef context =
+      connection.relayMessage() ? connection.relayMessage()->replyContext() : nullptr;
   connection.context().deathRow->deleteContainersOnDeathRowWithCompletion(
-      [message, reply](VSAResultCode code) { VSASendLateReply(message, reply, code, 4); });
+      [context](VSAResultCode code) { VSASendLateReply(context, code, 4); });
 }
 
 void VSAHandleContainerMetadata(const VSAValue& request, VSAValue& reply,

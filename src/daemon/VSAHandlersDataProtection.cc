@@ -4,9 +4,10 @@
 #include "daemon/VSARequestArguments.h"
 
 // The reply is sent by the change's completion, which may come at the next
-// unlock; the request's message (and its transaction) lives until then.
-void VSAHandleSetDataProtection(const VSAValue& request, VSAValue& reply,
-                                VSAClientConnection& connection, VSAResultCode* result) {
+// unlock; only the request's reply context (connection, "MessageID",
+// transaction) lives until then, never the request itself.
+void VSAHandleSetDataProtection(const VSAValue& request, VSAValue&, VSAClientConnection& connection,
+                                VSAResultCode* result) {
   VSARequestArguments args(request, connection, result);
   auto identity = args.containerIdentity();
   if (!identity) return;
@@ -19,19 +20,20 @@ void VSAHandleSetDataProtection(const VSAValue& request, VSAValue& reply,
     args.fail(VSAResult::kInvalidArgument);
     return;
   }
-  VSAIPCMessageRef message = connection.relayMessage();
+  VSAIPCReplyContextRef context =
+      connection.relayMessage() ? connection.relayMessage()->replyContext() : nullptr;
   connection.context().dataProtectionManager->setDataProtectionOnDataContainerForContainerIdentity(
       *identity, static_cast<int32_t>(*protectionClass), args.boolValue("IsThirdParty"),
       args.boolValue("RetryIfLocked"),
-      [message, reply](VSAResultCode code) { VSASendLateReply(message, reply, code, 21); });
+      [context](VSAResultCode code) { VSASendLateReply(context, code, 21); });
 }
 
-void VSASendLateReply(const VSAIPCMessageRef& message, VSAValue reply, VSAResultCode code,
-                      uint64_t command) {
-  if (!message) return;
+void VSASendLateReply(const VSAIPCReplyContextRef& context, VSAResultCode code, uint64_t command) {
+  if (!context) return;
+  VSAValue reply = context->createReply();
   reply.set("ReplyError", VSAValue(code));
   VSAErrorRef error;
-  if (!message->sendReply(reply, &error))
+  if (!context->sendReply(reply, &error))
     VSALogIn(VSALogCategory::Relay, kVSALogError, "VSASendLateReply",
              "Failed to send reply for command %llu: %@", static_cast<unsigned long long>(command),
              error);

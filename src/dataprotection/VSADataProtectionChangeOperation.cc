@@ -182,17 +182,21 @@ void VSADataProtectionChangeOperation::performChangeOperation() {
   auto completion = std::move(completionBlock_);
   completionBlock_ = nullptr;
   retryStartBlock_ = nullptr;
+  retryScheduler_ = nullptr;
   if (completion) completion(needRetry, error);
 }
 
 void VSADataProtectionChangeOperation::scheduleRetry() {
   auto self = shared_from_this();
+  if (retryScheduler_) return retryScheduler_(self);
   auto token = env_->transactions ? env_->transactions->open() : nullptr;
-  env_->lockStateQueue->async([self, token] {
-    if (!self->retried_ && self->retryStartBlock_) self->retryStartBlock_();
-    self->retried_ = true;
-    self->performChangeOperation();
-  });
+  env_->lockStateQueue->async([self, token] { self->retry(); });
+}
+
+void VSADataProtectionChangeOperation::retry() {
+  if (!retried_ && retryStartBlock_) retryStartBlock_();
+  retried_ = true;
+  performChangeOperation();
 }
 
 bool VSADataProtectionChangeOperation::_deleteUpdateFileWithError(VSAErrorRef* error) {

@@ -61,6 +61,14 @@ class VSADataProtectionChangeOperation
   bool retried() const { return retried_; }
   void setCompletionBlock(CompletionBlock block) { completionBlock_ = std::move(block); }
   void setRetryStartBlock(std::function<void()> block) { retryStartBlock_ = std::move(block); }
+  // Takes the retry of a change that met the locked device. Without one the
+  // operation submits itself to the lock-state queue; a scheduler that keeps
+  // one waiting change per container (the manager) gives its own, and later
+  // calls retry() on the operation it chose to run.
+  using RetryScheduler = std::function<void(const Ref& operation)>;
+  void setRetryScheduler(RetryScheduler scheduler) { retryScheduler_ = std::move(scheduler); }
+  // One retry: the retry start block before the first one, then the change.
+  void retry();
 
   bool writeToDiskWithError(VSAErrorRef* error);
   bool _onQueue_writeToDiskWithError(VSAErrorRef* error);
@@ -99,6 +107,7 @@ class VSADataProtectionChangeOperation
   bool retried_ = false;
   CompletionBlock completionBlock_;
   std::function<void()> retryStartBlock_;
+  RetryScheduler retryScheduler_;
   VSAWorkQueue::Ref queue_;
   std::shared_ptr<const VSADataProtectionEnvironment> env_;
 };

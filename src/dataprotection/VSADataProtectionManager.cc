@@ -39,9 +39,37 @@ VSAResultCode fail(VSAErrorRef e) {
 }
 }  // namespace
 
+// One caller's request for a change: its completion (taken exactly once,
+// under pendingMutex_) and the termination assertion that keeps the app
+// stopped while the change waits. The assertion is touched only by whoever
+// runs the change, or by the manager while the change waits (never both).
+struct VSADataProtectionManager::Request {
+  uint64_t sequence = 0;
+  Completion completion;
+  std::unique_ptr<VSAApplicationTerminationAssertion> assertion;
+  ~Request() {
+    if (assertion) assertion->invalidate();
+  }
+};
+
 VSADataProtectionManager::VSADataProtectionManager(
-    std::shared_ptr<const VSADataProtectionEnvironment> env)
-    : env_(std::move(env)), queue_(VSAWorkQueue::create(kQueueLabel)) {}
+    std::shared_ptr<const VSADataProtectionEnvironment> env, size_t maxPendingReplies)
+    : env_(std::move(env)),
+      queue_(VSAWorkQueue::create(kQueueLabel)),
+      maxPendingReplies_(maxPendingReplies) {}
+
+size_t VSADataProtectionManager::pendingChangeCount() const {
+  std::lock_guard lock(pendingMutex_);
+  size_t count = 0;
+  for (const auto& [key, waiting] : waiting_)
+    if (waiting.operation) ++count;
+  return count;
+}
+
+size_t VSADataProtectionManager::pendingReplyCount() const {
+  std::lock_guard lock(pendingMutex_);
+  return pendingReplies_;
+}
 
 int32_t VSADataProtectionManager::currentProtectionClassOfMetadata(const VSAMetadata& metadata) {
   if (!metadata.info()) return 0;
@@ -96,6 +124,11 @@ void VSADataProtectionManager::setDataProtectionOnDataContainerForContainerIdent
              deleteError);
       return completion(VSAResult::kRemoveFailed);
     }
+    // A change still waiting for the unlock would undo this request.
+    supersedeWaitingChange(
+        VSADataProtectionChangeOperation::urlForProtectionOperationWithContainerIdentity(
+            identity, *env_->configuration),
+        nullptr);
     return completion(VSAResult::kSuccess);
   }
   if (dataProtectionClass == 2)
@@ -125,35 +158,173 @@ void VSADataProtectionManager::setDataProtectionOnDataContainerForContainerIdent
 
 void VSADataProtectionManager::_startDataProtectionChangeOperation(
     const VSADataProtectionChangeOperation::Ref& operation, Completion completion) {
-  using Assertion = std::unique_ptr<VSAApplicationTerminationAssertion>;
-  auto assertion = std::make_shared<Assertion>();
+  auto request = std::make_shared<Request>();
+  request->completion = std::move(completion);
+  {
+    std::lock_guard lock(pendingMutex_);
+    request->sequence = ++nextSequence_;
+  }
   VSAMetadataRef metadata = operation->dataContainerMetadata();
+  std::string key =
+      VSADataProtectionChangeOperation::urlForProtectionOperationWithContainerIdentity(
+          *metadata->containerIdentity(), *env_->configuration);
+  // This change's update file has replaced that of any change still waiting
+  // for the unlock; running both would only let the older one win or lose by
+  // timing.
+  supersedeWaitingChange(key, request);
   int32_t newClass = operation->newDataProtectionClass();
   bool retryIfLocked = operation->retryIfLocked();
   auto service = env_->terminationService;
-  operation->setRetryStartBlock([assertion, service, metadata] {
+  operation->setRetryStartBlock([request, service, metadata] {
     // The app stays terminated while its container waits for the unlock.
-    *assertion = VSAApplicationTerminationAssertion::initWithBundleIdentifier(
-        service.get(), metadata->identifier(), 0);
+    if (!request->assertion)
+      request->assertion = VSAApplicationTerminationAssertion::initWithBundleIdentifier(
+          service.get(), metadata->identifier(), 0);
   });
+  operation->setRetryScheduler(
+      [this, key, request](const VSADataProtectionChangeOperation::Ref& waiting) {
+        scheduleRetry(key, waiting, request);
+      });
   operation->setCompletionBlock(
-      [this, assertion, metadata, newClass, retryIfLocked, completion = std::move(completion)](
-          bool wasLocked, const VSAErrorRef& error) {
-        if (*assertion) (*assertion)->invalidate();
-        assertion->reset();
+      [this, request, metadata, newClass, retryIfLocked](bool wasLocked, const VSAErrorRef& error) {
+        if (request->assertion) request->assertion->invalidate();
+        request->assertion.reset();
         if (wasLocked && retryIfLocked)
           VSALog(kVSALogError, "_startDataProtectionChangeOperation",
                  "Unexpectedly got completion block called with wasLocked");
+        VSAResultCode code = VSAResult::kSuccess;
         if (error) {
           VSALog(kVSALogError, "_startDataProtectionChangeOperation",
                  "Failed to set data protection on container with identifier %@ at %@ to %d: %@",
                  metadata->identifier(), metadata->url(), newClass, error);
-          return completion(error->resultCode(VSAResult::kWriteFailed));
+          code = error->resultCode(VSAResult::kWriteFailed);
+        } else {
+          recordProtectionClass(metadata, newClass);
         }
-        recordProtectionClass(metadata, newClass);
-        completion(VSAResult::kSuccess);
+        Completion completion;
+        {
+          std::lock_guard lock(pendingMutex_);
+          completion = std::move(request->completion);
+          request->completion = nullptr;
+        }
+        // Nothing left when the request was answered before its change ran.
+        if (completion) completion(code);
       });
   operation->performChangeOperation();
+}
+
+void VSADataProtectionManager::_lock_releaseReply(const RequestRef& request) {
+  if (request && request->completion) --pendingReplies_;
+}
+
+void VSADataProtectionManager::handOverAssertion(const RequestRef& from, const RequestRef& to) {
+  if (!from || !from->assertion) return;
+  if (to && !to->assertion) {
+    to->assertion = std::move(from->assertion);
+    return;
+  }
+  from->assertion->invalidate();
+  from->assertion.reset();
+}
+
+void VSADataProtectionManager::supersedeWaitingChange(const std::string& key,
+                                                      const RequestRef& successor) {
+  RequestRef replaced;
+  Completion answer;
+  {
+    std::lock_guard lock(pendingMutex_);
+    auto it = waiting_.find(key);
+    if (it == waiting_.end() || !it->second.operation) return;
+    // Its retry stays queued and runs whatever waits for this container then.
+    replaced = std::move(it->second.request);
+    it->second.operation.reset();
+    _lock_releaseReply(replaced);
+    if (replaced) answer = std::move(replaced->completion);
+    if (replaced) replaced->completion = nullptr;
+    // The replaced change is not running (its retry has not started) and the
+    // successor has not started either; under the lock, no other request
+    // can reach either of them.
+    handOverAssertion(replaced, successor);
+  }
+  VSALog(kVSALogNotice, "_startDataProtectionChangeOperation",
+         "Protection change waiting for an unlock at %@ replaced by a newer request; answering "
+         "the older request with %llu",
+         key, kVSAProtectionChangeSupersededResult);
+  if (answer) answer(kVSAProtectionChangeSupersededResult);
+}
+
+void VSADataProtectionManager::scheduleRetry(const std::string& key,
+                                             const VSADataProtectionChangeOperation::Ref& operation,
+                                             const RequestRef& request) {
+  RequestRef loser;
+  Completion supersededAnswer;
+  Completion earlyAnswer;
+  size_t waitingReplies = 0;
+  bool queueRetry = false;
+  {
+    std::lock_guard lock(pendingMutex_);
+    auto [it, inserted] = waiting_.try_emplace(key);
+    Waiting& waiting = it->second;
+    queueRetry = inserted;
+    // Another change for this container went to wait in the meantime (it
+    // was running when this one started): the newer request stays.
+    if (waiting.operation && waiting.request && request &&
+        waiting.request->sequence > request->sequence) {
+      loser = request;
+    } else {
+      loser = std::move(waiting.request);
+      waiting.operation = operation;
+      waiting.request = request;
+      if (request && request->completion) {
+        if (pendingReplies_ < maxPendingReplies_) {
+          ++pendingReplies_;
+        } else {
+          earlyAnswer = std::move(request->completion);
+          request->completion = nullptr;
+          waitingReplies = pendingReplies_;
+        }
+      }
+    }
+    if (loser) {
+      if (loser != request) _lock_releaseReply(loser);
+      supersededAnswer = std::move(loser->completion);
+      loser->completion = nullptr;
+      // Under the lock: once `request` waits, a newer request may take it over.
+      handOverAssertion(loser, loser == request ? waiting.request : request);
+    }
+  }
+  if (loser) {
+    VSALog(kVSALogNotice, "_startDataProtectionChangeOperation",
+           "Protection change waiting for an unlock at %@ replaced by a newer request; answering "
+           "the older request with %llu",
+           key, kVSAProtectionChangeSupersededResult);
+    if (supersededAnswer) supersededAnswer(kVSAProtectionChangeSupersededResult);
+  }
+  if (earlyAnswer) {
+    VSALog(kVSALogError, "_startDataProtectionChangeOperation",
+           "Too many protection change requests waiting for an unlock (%zu): answering the request "
+           "for %@ now with %llu; its change still runs at the next unlock",
+           waitingReplies, key, kVSAProtectionChangeAnsweredEarlyResult);
+    earlyAnswer(kVSAProtectionChangeAnsweredEarlyResult);
+  }
+  if (!queueRetry) return;
+  // One retry per container, run at the next unlock while the daemon is held busy.
+  auto token = env_->transactions ? env_->transactions->open() : nullptr;
+  env_->lockStateQueue->async([this, key, token] { runRetry(key); });
+}
+
+void VSADataProtectionManager::runRetry(const std::string& key) {
+  VSADataProtectionChangeOperation::Ref operation;
+  {
+    std::lock_guard lock(pendingMutex_);
+    auto it = waiting_.find(key);
+    if (it == waiting_.end()) return;
+    operation = std::move(it->second.operation);
+    _lock_releaseReply(it->second.request);
+    waiting_.erase(it);
+  }
+  // Gone when the change was replaced by one that did not need to wait.
+  if (operation) operation->retry();
 }
 
 void VSADataProtectionManager::recordProtectionClass(const VSAMetadataRef& metadata,
@@ -221,7 +392,7 @@ bool VSADataProtectionManager::restartPendingDataProtectionOperationsWithError(V
            "containerClass: %llu",
            operation->newDataProtectionClass(), m->userIdentity(), m->identifier(),
            static_cast<unsigned long long>(m->containerClass()));
-    _startDataProtectionChangeOperation(operation, [](VSAResultCode) {});
+    _startDataProtectionChangeOperation(operation, nullptr);
   }
   return true;
 }

@@ -1,13 +1,21 @@
 // The application termination service: while an assertion for a bundle
 // identifier is held, the application is terminated and may not launch.
 //
-// On Linux the applications of a bundle identifier are the processes whose
-// executable the client registry maps to that signing identifier. Taking an
-// assertion kills them and records the hold in
+// On Linux the applications of a bundle identifier are the processes that run
+// one of the files this system root's client registry names for that signing
+// identifier: each entry's "Executable", looked up inside the root without
+// following links, is compared by device and inode with /proc/<pid>/exe.
+// Several roots (and their daemons) share one host, and the same program may
+// be registered in each of them; a process running another root's file, or a
+// file that a root's entry reaches only through a link, is not this root's.
+//
+// Taking an assertion records the hold in
 // `<root>/run/vessad/termination-assertions/<bundle identifier>`, which the
-// launcher consults before starting an application; the record goes when the
-// last assertion for the identifier is invalidated. Acquisition is reported
-// asynchronously. Thread-safe.
+// launcher consults before starting an application, and then kills the
+// processes; a hold that cannot be recorded is no hold, and taking the
+// assertion fails. The record goes when the last assertion for the
+// identifier is invalidated. Bundle identifiers that are not plain file names
+// are refused. Acquisition is reported asynchronously. Thread-safe.
 #pragma once
 
 #include <functional>
@@ -19,6 +27,7 @@
 
 #include "base/VSAError.h"
 #include "platform/VSAClientRegistry.h"
+#include "platform/VSAFileSystem.h"
 #include "platform/VSASystemRoot.h"
 
 class VSAApplicationTerminationService
@@ -28,10 +37,15 @@ class VSAApplicationTerminationService
   // The three termination reasons of the platform.
   enum class Reason { UserInitiated = 0, System = 1, Other = 2 };
 
-  VSAApplicationTerminationService(VSASystemRoot root, std::shared_ptr<VSAClientRegistry> registry);
+  // `fileSystem` examines the registered executables (a link-refusing Linux
+  // file system when null).
+  VSAApplicationTerminationService(VSASystemRoot root, std::shared_ptr<VSAClientRegistry> registry,
+                                   std::shared_ptr<VSAFileSystem> fileSystem = nullptr);
 
-  // Creates an assertion; nothing when it cannot be created. `acquired` is
-  // called later, with an error when the applications could not be stopped.
+  // Creates an assertion; nothing when it cannot be created (a bundle
+  // identifier that is not a safe file name, or a hold that could not be
+  // recorded). `acquired` is called later, with an error when the
+  // applications could not be stopped.
   std::optional<Handle> createAssertion(const std::string& bundleIdentifier, Reason reason,
                                         std::function<void(VSAErrorRef)> acquired);
   void invalidate(Handle handle);
@@ -43,6 +57,7 @@ class VSAApplicationTerminationService
 
   VSASystemRoot root_;
   std::shared_ptr<VSAClientRegistry> registry_;
+  std::shared_ptr<VSAFileSystem> fileSystem_;
   mutable std::mutex mutex_;
   Handle next_ = 1;
   std::map<Handle, std::string> handles_;

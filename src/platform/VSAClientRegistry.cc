@@ -89,7 +89,8 @@ std::optional<VSAClientRegistryEntry> VSAClientRegistry::loadEntry(const std::st
       return bad("\"User\" must be a uid or a user name");
     }
   }
-  entry.executable = canonical(root_.resolve(*exe->stringValue()));
+  entry.rootPath = root_.resolve(*exe->stringValue());
+  entry.executable = canonical(entry.rootPath);
   if (entry.executable.empty()) return bad("the executable does not exist");
   if (!executableIsRootControlled(entry.executable, file)) return std::nullopt;
   entry.signingIdentifier = *sid->stringValue();
@@ -130,6 +131,16 @@ std::optional<VSAClientRegistryEntry> VSAClientRegistry::entryForExecutable(
   auto it = byExecutable_.find(hostPath);
   if (it == byExecutable_.end()) return std::nullopt;
   return it->second;
+}
+
+std::vector<VSAClientRegistryEntry> VSAClientRegistry::entriesForSigningIdentifier(
+    const std::string& signingIdentifier) {
+  std::lock_guard lock(mutex_);
+  reloadIfChanged();
+  std::vector<VSAClientRegistryEntry> entries;
+  for (const auto& [path, entry] : byExecutable_)
+    if (entry.signingIdentifier == signingIdentifier) entries.push_back(entry);
+  return entries;
 }
 
 std::optional<VSAClientRegistryEntry> VSAClientRegistry::entryForAuditToken(

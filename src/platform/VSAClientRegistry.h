@@ -22,6 +22,7 @@
 #include <mutex>
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "base/VSAValue.h"
 #include "platform/VSAAuditToken.h"
@@ -29,6 +30,8 @@
 
 struct VSAClientRegistryEntry {
   std::string executable;  // host path of the executable, canonical
+  // "Executable" resolved below the system root, before any link is followed.
+  std::string rootPath;
   std::string signingIdentifier;
   VSAValue entitlements = VSAValue::dictionary();
   bool sandboxed = false;
@@ -49,6 +52,9 @@ class VSAClientRegistry {
                                                      const std::string& executable);
   // The entry registered for a host executable path.
   std::optional<VSAClientRegistryEntry> entryForExecutable(const std::string& hostPath);
+  // Every entry of this root whose "SigningIdentifier" is `signingIdentifier`.
+  std::vector<VSAClientRegistryEntry> entriesForSigningIdentifier(
+      const std::string& signingIdentifier);
 
  private:
   void reloadIfChanged();

@@ -509,15 +509,15 @@ void VSAIPCListener::sweep(Clock::time_point now) {
 void VSAIPCListener::deliver(const VSAIPCConnectionRef& connection, std::optional<VSAValue> body,
                              std::string problem) {
   connection->requestBegan();
-  // The request is in flight until its message is gone: replied, or dropped.
+  // The request is in flight until it is answered, or dropped with all that
+  // could still answer it (its message and its reply context).
   // A connection paused for having too many is resumed once half are done.
-  VSAIPCMessageRef message(
-      new VSAIPCMessage(connection, std::move(body), std::move(problem), transactions_->open()),
-      [resumer = resumer_, resumeAt = limits_.maxRequestsInFlight / 2](VSAIPCMessage* m) {
-        VSAIPCConnectionRef c = m->connection();
-        delete m;
-        if (c->requestEnded() <= resumeAt && c->isThrottled()) resumer->post(c);
-      });
+  std::shared_ptr<void> inFlight(nullptr, [c = connection, resumer = resumer_,
+                                           resumeAt = limits_.maxRequestsInFlight / 2](void*) {
+    if (c->requestEnded() <= resumeAt && c->isThrottled()) resumer->post(c);
+  });
+  auto message = std::make_shared<VSAIPCMessage>(connection, std::move(body), std::move(problem),
+                                                 transactions_->open(), std::move(inFlight));
   Handler handler;
   {
     std::lock_guard lock(handlerMutex_);

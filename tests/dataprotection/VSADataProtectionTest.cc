@@ -5,6 +5,7 @@
 #include <future>
 
 #include "VSATestTempDir.h"
+#include "base/VSALocks.h"
 #include "base/VSAPlist.h"
 #include "dataprotection/VSADataProtectionManager.h"
 #include "dataprotection/VSADataProtectionUpdateFile.h"
@@ -291,6 +292,145 @@ TEST_F(Protection, RestartFinishesSurvivingChangesAndSkipsDamagedFiles) {
   EXPECT_TRUE(fs::exists(damaged));
   auto reread = VSAMetadata::readAndValidateMetadataAtUrl(a->url(), user_, false, *config_,
                                                           *identities_, nullptr);
+  EXPECT_EQ(VSADataProtectionManager::currentProtectionClassOfMetadata(*reread), 3);
+}
+
+// Replies seen by one request's completion.
+struct Replies {
+  std::atomic<int> count{0};
+  std::atomic<VSAResultCode> code{0};
+  VSADataProtectionManager::Completion completion() {
+    return [this](VSAResultCode c) {
+      code = c;
+      ++count;
+    };
+  }
+};
+
+TEST_F(Protection, RequestsForOneContainerWhileLockedLeaveOneWaitingChange) {
+  auto m = container("com.app");
+  setClassOfTree(m->url(), 1);
+  locked_ = true;
+  lockStateQueue_->suspend();
+  const int32_t classes[] = {3, 4, 1, 3, 4};
+  constexpr size_t n = std::size(classes);
+  Replies replies[n];
+  for (size_t i = 0; i < n; ++i) {
+    manager_->setDataProtectionOnDataContainerForContainerIdentity(
+        *m->containerIdentity(), classes[i], false, true, replies[i].completion());
+    // The change it replaced is answered at once, and only that one.
+    if (i > 0) {
+      EXPECT_EQ(replies[i - 1].count, 1) << i;
+      EXPECT_EQ(replies[i - 1].code, kVSAProtectionChangeSupersededResult) << i;
+    }
+    EXPECT_EQ(replies[i].count, 0) << i;
+  }
+  EXPECT_EQ(manager_->pendingChangeCount(), 1u);
+  EXPECT_EQ(manager_->pendingReplyCount(), 1u);
+  EXPECT_EQ(transactions_->openCount(), 1);  // one retry queued, not five
+  EXPECT_EQ(classOf(m->url() + "/Library/file"), 1);
+
+  locked_ = false;
+  lockStateQueue_->resume();
+  lockStateQueue_->sync([] {});
+  for (size_t i = 0; i < n; ++i) EXPECT_EQ(replies[i].count, 1) << i;
+  EXPECT_EQ(replies[n - 1].code, VSAResult::kSuccess);
+  EXPECT_EQ(classOf(m->url() + "/Library/file"), 4);
+  EXPECT_EQ(classOf(m->url() + "/Library/Caches"), 4);
+  EXPECT_FALSE(fs::exists(updateFile(m)));
+  auto reread = VSAMetadata::readAndValidateMetadataAtUrl(m->url(), user_, false, *config_,
+                                                          *identities_, nullptr);
+  ASSERT_TRUE(reread);
+  EXPECT_EQ(VSADataProtectionManager::currentProtectionClassOfMetadata(*reread), 4);
+  EXPECT_EQ(manager_->pendingChangeCount(), 0u);
+  EXPECT_EQ(manager_->pendingReplyCount(), 0u);
+  EXPECT_EQ(transactions_->openCount(), 0);
+}
+
+TEST_F(Protection, AskingForTheCurrentClassWithdrawsAWaitingChange) {
+  auto m = container("com.app");
+  setClassOfTree(m->url(), 1);
+  locked_ = true;
+  lockStateQueue_->suspend();
+  Replies waiting;
+  manager_->setDataProtectionOnDataContainerForContainerIdentity(*m->containerIdentity(), 3, false,
+                                                                 true, waiting.completion());
+  ASSERT_EQ(manager_->pendingChangeCount(), 1u);
+  // Nothing is recorded yet, so class 0 is the current one.
+  EXPECT_EQ(setClass(m, 0), VSAResult::kSuccess);
+  EXPECT_EQ(waiting.count, 1);
+  EXPECT_EQ(waiting.code, kVSAProtectionChangeSupersededResult);
+  EXPECT_EQ(manager_->pendingChangeCount(), 0u);
+  locked_ = false;
+  lockStateQueue_->resume();
+  lockStateQueue_->sync([] {});
+  EXPECT_EQ(waiting.count, 1);
+  EXPECT_EQ(classOf(m->url() + "/Library/file"), 1);
+  EXPECT_FALSE(fs::exists(updateFile(m)));
+  EXPECT_EQ(transactions_->openCount(), 0);
+}
+
+TEST_F(Protection, RepliesBeyondTheCapAreAnsweredAtOnceAndTheirChangesStillRun) {
+  VSADataProtectionManager capped(env_, 2);
+  std::vector<VSAMetadataRef> containers;
+  for (const char* id : {"com.a", "com.b", "com.c"}) {
+    containers.push_back(container(id));
+    setClassOfTree(containers.back()->url(), 1);
+  }
+  locked_ = true;
+  lockStateQueue_->suspend();
+  Replies replies[3];
+  for (size_t i = 0; i < 3; ++i)
+    capped.setDataProtectionOnDataContainerForContainerIdentity(
+        *containers[i]->containerIdentity(), 3, false, true, replies[i].completion());
+  EXPECT_EQ(replies[0].count, 0);
+  EXPECT_EQ(replies[1].count, 0);
+  EXPECT_EQ(replies[2].count, 1);
+  EXPECT_EQ(replies[2].code, kVSAProtectionChangeAnsweredEarlyResult);
+  EXPECT_EQ(capped.pendingChangeCount(), 3u);
+  EXPECT_EQ(capped.pendingReplyCount(), 2u);
+  EXPECT_TRUE(fs::exists(updateFile(containers[2])));
+
+  locked_ = false;
+  lockStateQueue_->resume();
+  lockStateQueue_->sync([] {});
+  for (size_t i = 0; i < 3; ++i) {
+    EXPECT_EQ(replies[i].count, 1) << i;
+    EXPECT_EQ(classOf(containers[i]->url() + "/Library/file"), 3) << i;
+    EXPECT_FALSE(fs::exists(updateFile(containers[i]))) << i;
+  }
+  EXPECT_EQ(capped.pendingReplyCount(), 0u);
+}
+
+TEST_F(Protection, TheClassIsRecordedOnTheMetadataAsItIsAtTheUnlock) {
+  auto m = container("com.app");
+  setClassOfTree(m->url(), 1);
+  locked_ = true;
+  lockStateQueue_->suspend();
+  std::promise<VSAResultCode> done;
+  manager_->setDataProtectionOnDataContainerForContainerIdentity(
+      *m->containerIdentity(), 3, false, true, [&](VSAResultCode c) { done.set_value(c); });
+  {
+    // Meanwhile someone records another info value, the way metadata is written.
+    VSAIdentifierLockGuard guard(VSAValue(m->uuid().string()), true);
+    auto current = VSAMetadata::readAndValidateMetadataAtUrl(m->url(), user_, false, *config_,
+                                                             *identities_, nullptr);
+    ASSERT_TRUE(current);
+    VSAValue info = current->info() ? *current->info() : VSAValue::dictionary();
+    info.set("com.example.Other", VSAValue("kept"));
+    current->setInfo(info);
+    ASSERT_TRUE(current->writeMetadataToDiskWithError(*config_, nullptr));
+  }
+  locked_ = false;
+  lockStateQueue_->resume();
+  EXPECT_EQ(done.get_future().get(), VSAResult::kSuccess);
+  auto reread = VSAMetadata::readAndValidateMetadataAtUrl(m->url(), user_, false, *config_,
+                                                          *identities_, nullptr);
+  ASSERT_TRUE(reread);
+  ASSERT_TRUE(reread->info());
+  const VSAValue* other = reread->info()->get("com.example.Other");
+  ASSERT_TRUE(other);
+  EXPECT_EQ(*other->stringValue(), "kept");
   EXPECT_EQ(VSADataProtectionManager::currentProtectionClassOfMetadata(*reread), 3);
 }
 
