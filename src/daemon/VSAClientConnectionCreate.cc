@@ -125,8 +125,11 @@ bool VSAClientConnection::_createSubDirectories(const std::string& url, const VS
       itemClass = 0;
     std::string path = VSAPathJoin(url, name);
     VSAErrorRef underlying;
+    // A system sub-directory made with mode 0 inherits the ACL under a mask
+    // of none; setting its ACL again makes the "systemusers" entry count.
     if (!context_.fileManager->createDirectoryAtURL(
-            path, true, mode, owner, static_cast<uint32_t>(itemClass), &underlying, group)) {
+            path, true, mode, owner, static_cast<uint32_t>(itemClass), &underlying, group) ||
+        (system && !context_.fileManager->setSystemContainerDirectoryACLAtURL(path, &underlying))) {
       auto e = VSA_ERROR_UNDERLYING(underlying->resultCode(kStagingCreateFailed), underlying,
                                     "Failed to create sub-dir for %@ at %@ (protClass: %d)", name,
                                     url, itemClass);
@@ -233,11 +236,6 @@ struct CreateSteps {
         !context.fileManager->setTopLevelSystemContainerACLAtURL(staging, error))
       return nullptr;
     if (!connection._createSubDirectories(staging, *metadata, error)) return nullptr;
-    // Sub-directories made with mode 0 inherit the ACL under a mask of none;
-    // setting each one's ACL again makes the "systemusers" entry count.
-    if (VSAContainerClassIsSystem(c) &&
-        !context.fileManager->standardizeACLsForSystemContainerAtURL(staging, error))
-      return nullptr;
     auto base = config.containerDirectoryURLForUserIdentity(identity.userIdentity(), c, transient);
     std::string live = VSAPathJoin(base.value_or(""), liveName(name));
     VSAErrorRef underlying;

@@ -1,6 +1,5 @@
 #include "dataprotection/VSADataProtectionChangeOperation.h"
 
-#include <cassert>
 #include <cstring>
 
 #include "base/VSAFormat.h"
@@ -67,7 +66,7 @@ bool VSADataProtectionChangeOperation::writeToDiskWithError(VSAErrorRef* error) 
 }
 
 bool VSADataProtectionChangeOperation::_onQueue_writeToDiskWithError(VSAErrorRef* error) {
-  assert(queue_->isCurrent());
+  VSACheckOnQueue(*queue_, __func__);
   if (!metadata_ || !isValidChangeType(changeType_)) {
     auto e = VSA_ERROR(VSAResult::kOutOfRange, "Invalid Update Info: metadata: %@, changeType: %u",
                        metadata_ ? metadata_->description() : std::string("(null)"), changeType_);
@@ -206,7 +205,7 @@ bool VSADataProtectionChangeOperation::_deleteUpdateFileWithError(VSAErrorRef* e
 }
 
 bool VSADataProtectionChangeOperation::_onQueue_deleteUpdateFileWithError(VSAErrorRef* error) {
-  assert(queue_->isCurrent());
+  VSACheckOnQueue(*queue_, __func__);
   if (!_onQueue_stillMostCurrentUpdate()) {
     VSALog(kVSALogNotice, __func__,
            "Nothing to delete because there is a newer update for user: %@, id: %@, "
@@ -225,7 +224,7 @@ bool VSADataProtectionChangeOperation::_stillMostCurrentUpdate() {
 }
 
 bool VSADataProtectionChangeOperation::_onQueue_stillMostCurrentUpdate() {
-  assert(queue_->isCurrent());
+  VSACheckOnQueue(*queue_, __func__);
   std::string url = updateFileURL();
   VSAErrorRef error;
   auto dict = VSA_dictionaryWithContentsOfURL(url, kVSAReadBinaryPropertyListOnly, &error,

@@ -79,6 +79,8 @@ class VSAFileManager {
   bool standardizeOwnershipAtURL(const std::string& path, uid_t uid, gid_t gid, VSAErrorRef* error);
 
   bool setTopLevelSystemContainerACLAtURL(const std::string& path, VSAErrorRef* error);
+  // The ACL of a directory inside a system container, on one directory.
+  bool setSystemContainerDirectoryACLAtURL(const std::string& path, VSAErrorRef* error);
   bool standardizeACLsAtURL(const std::string& path, bool isSystemContainer, VSAErrorRef* error);
   bool standardizeACLsForSystemContainerAtURL(const std::string& path, VSAErrorRef* error) {
     return standardizeACLsAtURL(path, true, error);
@@ -136,6 +138,8 @@ class VSAFileManager {
   int openParent(const std::string& path, int* fd, std::string* name);
   std::optional<std::string> realPathAllowingMissing(const std::string& path);
   std::optional<gid_t> systemUsersGroup(VSAErrorRef* error);
+  bool setSystemContainerACLAtURL(const std::string& path, VSASystemContainerACL kind,
+                                  VSAErrorRef* error);
   // mkdir -p from the bottom up: 0 or an errno.
   // `created` tells whether `path` itself was made by this call.
   int makePath(const std::string& path, mode_t mode, bool* created, int depth = 0);

@@ -290,9 +290,19 @@ std::optional<gid_t> VSAFileManager::systemUsersGroup(VSAErrorRef* error) {
 
 bool VSAFileManager::setTopLevelSystemContainerACLAtURL(const std::string& path,
                                                         VSAErrorRef* error) {
+  return setSystemContainerACLAtURL(path, VSASystemContainerACL::TopLevel, error);
+}
+
+bool VSAFileManager::setSystemContainerDirectoryACLAtURL(const std::string& path,
+                                                         VSAErrorRef* error) {
+  return setSystemContainerACLAtURL(path, VSASystemContainerACL::Directory, error);
+}
+
+bool VSAFileManager::setSystemContainerACLAtURL(const std::string& path, VSASystemContainerACL kind,
+                                                VSAErrorRef* error) {
   auto gid = systemUsersGroup(error);
   if (!gid) return false;
-  if (int rc = fs_->setSystemContainerACL(path, VSASystemContainerACL::TopLevel, *gid)) {
+  if (int rc = fs_->setSystemContainerACL(path, kind, *gid)) {
     VSASetError(error, failACL("setTopLevelSystemContainerACLAtURL", "Failed to set ACL on %@: %s",
                                path, std::strerror(rc)));
     return false;
