@@ -176,6 +176,20 @@ TEST_F(Lifecycle, TransientContainersAreAlwaysMadeFresh) {
   EXPECT_EQ(entries(classDirectory(2, true)), 1u);
 }
 
+TEST_F(Lifecycle, TransientContainersOfEveryUserGoAtTheFirstStartAfterABoot) {
+  auto c = installer();
+  VSAResultCode code;
+  auto temp = create(*c, "com.example.temp", &code, true);
+  ASSERT_TRUE(temp) << code;
+  auto kept = create(*c, "com.example.kept", &code);
+  ASSERT_TRUE(kept) << code;
+  std::promise<void> done;
+  c->rebootKeeperCleanupWithCompletion([&] { done.set_value(); });
+  done.get_future().wait();
+  EXPECT_FALSE(fs::exists(temp->url())) << "a per-user transient container survived a reboot";
+  EXPECT_TRUE(fs::exists(kept->url()));
+}
+
 TEST_F(Lifecycle, WellKnownSystemGroupsLiveUnderTheirNameWithSystemOwners) {
   auto c = installer();
   VSAResultCode code;

@@ -196,6 +196,8 @@ TEST(DaemonSpine, StopsCleanlyAndRemovesItsSocket) {
   std::string text((std::istreambuf_iterator<char>(log)), std::istreambuf_iterator<char>());
   EXPECT_NE(text.find("vessad stopped"), std::string::npos);
   EXPECT_NE(text.find("vessad performing first boot initialization"), std::string::npos);
+  // The subsystems are built after the log is open: their start-up lines are in it.
+  EXPECT_NE(text.find("Current mobile user ID is"), std::string::npos);
 }
 
 }  // namespace
