@@ -24,6 +24,8 @@ step "An unregistered client is not entitled to command 27: 55"
 ctl "$build/vessactl" --root "$root" Command=27
 step "A request without a Command key: 49"
 ctl "$installer" --root "$root" Identifier=com.example.demo
+step "An identifier that would leave its directory is refused at the door: 11"
+ctl "$installer" --root "$root" Command=0 Identifier=../../../etc ContainerClass=2 CreateIfNecessary=true
 
 step "Personas the installer may use (it is listed by the universal persona, so all of them)"
 ctl "$installer" --root "$root" --json Command=32
