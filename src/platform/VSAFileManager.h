@@ -134,7 +134,7 @@ class VSAFileManager {
   void removeDirectoryContents(Removal& r, int directory, const std::string& path, int depth);
   int unlinkUnlocking(int directory, const std::string& name, const std::string& path,
                       bool isDirectory);
-  // Opens the directory holding `path`; false with `error` set (as `fn`) on failure.
+  // Opens the directory holding `path` and names its last component: 0 or an errno.
   int openParent(const std::string& path, int* fd, std::string* name);
   std::optional<std::string> realPathAllowingMissing(const std::string& path);
   std::optional<gid_t> systemUsersGroup(VSAErrorRef* error);
