@@ -15,6 +15,8 @@
 #include <stdexcept>
 #include <string_view>
 
+#include "base/VSAPathString.h"
+
 namespace {
 
 // ---- libplist <-> VSAValue (XML only) -------------------------------------
@@ -346,9 +348,8 @@ bool VSAWriteFileAtomically(const std::string& path, const std::vector<uint8_t>&
   }
   if (sync) {
     // The rename is the commit; it is durable once the directory is synced.
-    size_t slash = path.find_last_of('/');
-    std::string dir = slash == std::string::npos ? "." : slash == 0 ? "/" : path.substr(0, slash);
-    int dirFd = ::open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    std::string dir = VSADirectoryName(path);
+    int dirFd = ::open(dir.empty() ? "." : dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
     if (dirFd >= 0) {
       ::fsync(dirFd);
       ::close(dirFd);

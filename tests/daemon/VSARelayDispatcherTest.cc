@@ -6,6 +6,7 @@
 #include <filesystem>
 #include <fstream>
 
+#include "VSATestReplies.h"
 #include "base/VSAPlist.h"
 #include "daemon/VSAClientConnection.h"
 #include "daemon/VSAEntitlements.h"
@@ -90,20 +91,7 @@ class VSARelayDispatcherTest : public ::testing::Test {
         std::make_shared<VSAIPCMessage>(connection_, body, "", context_->transactions->open());
     dispatcher_->processRelayEvent(message);
     message.reset();
-    std::vector<VSAValue> replies;
-    VSAFrameReader reader;
-    uint8_t buf[65536];
-    for (;;) {
-      ssize_t n = recv(peer_, buf, sizeof buf, MSG_DONTWAIT);
-      if (n <= 0) break;
-      reader.append(buf, n);
-    }
-    std::vector<uint8_t> payload;
-    while (reader.next(payload) == VSAFrameReader::Status::Frame) {
-      std::string why;
-      replies.push_back(*VSAFrameCodec::decodePayload(payload.data(), payload.size(), &why));
-    }
-    return replies;
+    return VSADrainReplies(peer_);
   }
 
   std::string root_;

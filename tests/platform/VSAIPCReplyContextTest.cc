@@ -5,6 +5,7 @@
 #include <memory>
 #include <vector>
 
+#include "VSATestReplies.h"
 #include "platform/VSAFrameCodec.h"
 #include "platform/VSAIPCMessage.h"
 
@@ -28,22 +29,7 @@ class ReplyContext : public ::testing::Test {
     return std::make_shared<VSAIPCMessage>(connection_, body, "", transactions_->open(),
                                            std::move(inFlight));
   }
-  std::vector<VSAValue> replies() {
-    std::vector<VSAValue> out;
-    VSAFrameReader reader;
-    uint8_t buf[65536];
-    for (;;) {
-      ssize_t n = recv(peer_, buf, sizeof buf, MSG_DONTWAIT);
-      if (n <= 0) break;
-      reader.append(buf, n);
-    }
-    std::vector<uint8_t> payload;
-    while (reader.next(payload) == VSAFrameReader::Status::Frame) {
-      std::string why;
-      out.push_back(*VSAFrameCodec::decodePayload(payload.data(), payload.size(), &why));
-    }
-    return out;
-  }
+  std::vector<VSAValue> replies() { return VSADrainReplies(peer_); }
 
   int peer_ = -1;
   VSAIPCConnectionRef connection_;
