@@ -1,7 +1,11 @@
 #include "daemon/VSAClientConnection.h"
 
-#include "base/VSALog.h"
-#include "model/VSAPerUserConfiguration.h"
+#include "operations/VSABootKeeper.h"
+#include "operations/VSAContainerDeletion.h"
+#include "operations/VSAContainerLookup.h"
+#include "operations/VSAContainerMaintenance.h"
+#include "operations/VSAContentWipe.h"
+#include "operations/VSAReplaceOperation.h"
 
 VSAClientConnection::VSAClientConnection(VSADaemonContext& context,
                                          VSAClientIdentityRef clientIdentity, bool entitled,
@@ -10,13 +14,20 @@ VSAClientConnection::VSAClientConnection(VSADaemonContext& context,
                                          std::optional<VSAValue> entitledWipeIdentifiers,
                                          std::shared_ptr<VSACommandQueue> commandQueue)
     : context_(context),
+      services_(*context.operationServices),
       clientIdentity_(std::move(clientIdentity)),
-      entitled_(entitled),
-      allowOtherIdLookup_(allowOtherIdLookup),
-      unrestricted_(unrestricted),
-      lookup_(std::move(lookup)),
-      entitledWipeIdentifiers_(std::move(entitledWipeIdentifiers)),
-      commandQueue_(std::move(commandQueue)) {}
+      commandQueue_(std::move(commandQueue)) {
+  if (clientIdentity_) {
+    grants_.clientIdentifier = clientIdentity_->bundleIdentifier();
+    grants_.clientUserIdentity = clientIdentity_->userIdentity();
+    grants_.clientIsKernel = clientIdentity_->isKernel();
+  }
+  grants_.entitled = entitled;
+  grants_.allowOtherIdLookup = allowOtherIdLookup;
+  grants_.unrestricted = unrestricted;
+  grants_.lookup = std::move(lookup);
+  grants_.entitledWipeIdentifiers = std::move(entitledWipeIdentifiers);
+}
 
 std::unique_ptr<VSAClientConnection> VSAClientConnection::sharedClientConnection(
     VSADaemonContext& context) {
@@ -29,95 +40,79 @@ bool VSAClientConnection::completeWithError(VSAResultCode* error) {
   return commandQueue_->executeAllUntilExhaustedOrError(error);
 }
 
-// Boot-time setup and cleanup. Steps not built yet (build-upgrade migration,
-// system container restore, group reconciliation, replace recovery, orphan
-// scans) say so in the log; the cleanups always complete so that start-up
-// posts its notifications.
-void VSAClientConnection::rebootKeeperSetup() {
-  VSALogIn(VSALogCategory::Startup, kVSALogNotice, __func__,
-           "First-boot setup: migration and system container restore are not available in this "
-           "build");
+VSAMetadataRef VSAClientConnection::createOrLookupContainerWithContainerIdentity(
+    const VSAContainerIdentityRef& identity, bool createIfNecessary, bool transient,
+    bool useLocking, VSAResultCode* withError) {
+  return VSAContainerLookup(services_, grants_)
+      .createOrLookupContainerWithContainerIdentity(identity, createIfNecessary, transient,
+                                                    useLocking, withError);
 }
 
-void VSAClientConnection::keeperSetup() {
-  VSALogIn(VSALogCategory::Startup, kVSALogNotice, __func__,
-           "Boot setup: replace-operation recovery is not available in this build");
-  VSAErrorRef error;
-  if (!context_.dataProtectionManager->restartPendingDataProtectionOperationsWithError(&error))
-    VSALogIn(VSALogCategory::Startup, kVSALogError, __func__,
-             "Failed restarting pending data protection operations: %@", error);
+std::optional<std::vector<VSAMetadataRef>> VSAClientConnection::containersWithClass(
+    VSAContainerClass containerClass, bool transient, VSAResultCode* withError) {
+  return VSAContainerLookup(services_, grants_)
+      .containersWithClass(containerClass, transient, withError);
 }
+
+VSAMetadataRef VSAClientConnection::metadataWithContainerIdentity(
+    const VSAContainerIdentityRef& identity, VSAResultCode* withError) {
+  return VSAContainerLookup(services_, grants_).metadataWithContainerIdentity(identity, withError);
+}
+
+void VSAClientConnection::deleteContainerWithContainerIdentity(
+    const VSAContainerIdentityRef& identity, bool transient, VSAResultCode* withError) {
+  VSAContainerDeletion(services_, grants_, *commandQueue_)
+      .deleteContainerWithContainerIdentity(identity, transient, withError);
+}
+
+void VSAClientConnection::deleteDataContainerContentWithContainerIdentity(
+    const VSAContainerIdentityRef& identity, VSAResultCode* withError) {
+  VSAContentWipe(services_, grants_)
+      .deleteDataContainerContentWithContainerIdentity(identity, withError);
+}
+
+bool VSAClientConnection::replaceContainerIdentity(
+    const VSAContainerIdentityRef& oldIdentity,
+    const VSAContainerIdentityRef& withContainerIdentity, bool preserveOldUUID,
+    bool startDeletionThread, VSAResultCode* withError) {
+  return VSAReplaceOperation(services_).replaceContainerIdentity(
+      oldIdentity, withContainerIdentity, preserveOldUUID, startDeletionThread, withError);
+}
+
+bool VSAClientConnection::regenerateDirectoryUUIDWithContainerIdentity(
+    const VSAContainerIdentityRef& identity, VSAResultCode* withError) {
+  return VSAContainerMaintenance(services_).regenerateDirectoryUUIDWithContainerIdentity(identity,
+                                                                                         withError);
+}
+
+bool VSAClientConnection::recreateDefaultStructureWithContainerIdentity(
+    const VSAContainerIdentityRef& identity, VSAResultCode* withError) {
+  return VSAContainerMaintenance(services_).recreateDefaultStructureWithContainerIdentity(
+      identity, withError);
+}
+
+std::optional<VSAValue> VSAClientConnection::infoValueForKey(
+    const VSAValue* key, const VSAContainerIdentityRef& containerIdentity, bool useLocking,
+    VSAResultCode* withError) {
+  return VSAContainerMaintenance(services_).infoValueForKey(key, containerIdentity, useLocking,
+                                                            withError);
+}
+
+bool VSAClientConnection::setInfoValue(const VSAValue* value, const VSAValue* forKey,
+                                       const VSAContainerIdentityRef& containerIdentity,
+                                       bool useLocking, VSAResultCode* withError) {
+  return VSAContainerMaintenance(services_).setInfoValue(value, forKey, containerIdentity,
+                                                         useLocking, withError);
+}
+
+void VSAClientConnection::rebootKeeperSetup() { VSABootKeeper(services_).rebootKeeperSetup(); }
+
+void VSAClientConnection::keeperSetup() { VSABootKeeper(services_).keeperSetup(); }
 
 void VSAClientConnection::rebootKeeperCleanupWithCompletion(std::function<void()> completion) {
-  auto& config = *context_.globalConfiguration;
-  auto& deathRow = *context_.deathRow;
-  auto token = context_.transactions->open();
-  // Transient containers do not survive a reboot.
-  VSAErrorRef error;
-  std::string transient = config.transientDirectory();
-  if (!deathRow._moveItemAtURLToDeathRow(transient, true, false, &error))
-    VSALogIn(VSALogCategory::Startup, kVSALogError, __func__,
-             "Failed to delete shared transient URL %@ : %@", transient, error);
-  if (auto legacy = config.legacyTransientBundleDirectory()) {
-    VSALogIn(VSALogCategory::Startup, kVSALogNotice, __func__,
-             "Sentencing legacy transient bundle directory [%@] to final deletion", *legacy);
-    if (!deathRow._moveItemAtURLToDeathRow(*legacy, true, false, &error))
-      VSALogIn(VSALogCategory::Startup, kVSALogError, __func__,
-               "Failed to delete legacy shared transient bundle URL %@ : %@", *legacy, error);
-  }
-  std::string bundles = config.transientBundleDirectory();
-  if (!deathRow._moveItemAtURLToDeathRow(bundles, true, false, &error))
-    VSALogIn(VSALogCategory::Startup, kVSALogError, __func__,
-             "Failed to delete shared transient bundle URL %@ : %@", bundles, error);
-  context_.userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
-      [&](const VSAUserIdentityRef& user) {
-        auto perUser = config.getPerUserConfigurationForUserIdentity(user);
-        if (!perUser || !perUser->existsUserBaseDirectory()) return;
-        std::string userTransient = perUser->transientDirectory();
-        VSAErrorRef userError;
-        if (!deathRow._moveItemAtURLToDeathRow(userTransient, true, false, &userError))
-          VSALogIn(VSALogCategory::Startup, kVSALogError, "rebootKeeperCleanupWithCompletion",
-                   "Failed to delete per-user transient URL %@ : %@", userTransient, userError);
-      });
-  VSALogIn(VSALogCategory::Startup, kVSALogNotice, __func__,
-           "First-boot cleanup: orphaned-data scans are not available in this build");
-  VSADeathRow::_sharedBackgroundQueue()->async(
-      [token, completion = std::move(completion)] { completion(); });
+  VSABootKeeper(services_).rebootKeeperCleanupWithCompletion(std::move(completion));
 }
 
 void VSAClientConnection::keeperCleanupWithCompletion(std::function<void()> completion) {
-  auto token = context_.transactions->open();
-  auto& config = *context_.globalConfiguration;
-  auto& fm = *context_.fileManager;
-  std::set<std::string> staged;  // per-class staging may share a directory
-  auto collect = [&](const std::string& directory, const char* failureFormat) {
-    VSAErrorRef error;
-    auto items = fm.urlsForItemsInDirectoryAtURL(directory, &error);
-    if (!items) {
-      if (!(error && error->domain() == kVSAPOSIXErrorDomain && error->code() == ENOENT))
-        VSALogIn(VSALogCategory::Startup, kVSALogError, "keeperCleanupWithCompletion",
-                 failureFormat, directory, error);
-      return;
-    }
-    for (const auto& item : *items) staged.insert(item.path);
-  };
-  collect(config.stagingDirectory(), "Failed to get items at global staging URL: %@ : %@");
-  context_.userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
-      [&](const VSAUserIdentityRef& user) {
-        for (VSAContainerClass c : {2, 4, 6, 7, 9, 10, 11})
-          collect(config.stagingDirectoryURLForUserIdentity(user, c),
-                  "Failed to get items at per-user staging URL: %@ : %@");
-      });
-  // Staging directories are never resumed: whatever a crash left there goes.
-  auto deathRow = context_.deathRow;
-  VSADeathRow::_sharedBackgroundQueue()->async(
-      [deathRow, staged = std::move(staged), token, completion = std::move(completion)] {
-        for (const auto& item : staged) {
-          VSAErrorRef error;
-          if (!deathRow->_moveItemAtURLToDeathRow(item, true, false, &error))
-            VSALog(kVSALogError, "keeperCleanupWithCompletion", "%@", error);
-        }
-        deathRow->deleteContainersOnDeathRowWithCompletion(
-            [token, completion](VSAResultCode) { completion(); });
-      });
+  VSABootKeeper(services_).keeperCleanupWithCompletion(std::move(completion));
 }

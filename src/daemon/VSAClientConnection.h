@@ -1,18 +1,16 @@
 // One request's view of its client: the identity and the grants the
 // dispatcher derived for the command, the request's command queue, and the
-// operations that handlers call. Lives for one request (or one boot-time
+// container operations that handlers call. The operations themselves live in
+// operations/, one class per family; the members here forward to them with
+// this request's grants, so a handler (and a reader grepping for an
+// operation's name) starts here. Lives for one request (or one boot-time
 // run) on the listener queue; not shared between threads.
 //
-// Grants: `entitled` (the command's operation on the client's own
-// identifiers), `allowOtherIdLookup` (other identifiers, non-well-known
-// system containers), `allowGroupIdLookup` (group containers the caller is not
-// entitled to; kernel only), `unrestricted` (no per-identifier limits),
-// `lookup` (the lookup entitlement dictionary) and `entitledWipeIdentifiers`.
+// Grants: see VSAOperationGrants.
 #pragma once
 
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <set>
 #include <string>
@@ -22,9 +20,11 @@
 #include "base/VSAValue.h"
 #include "daemon/VSAClientIdentity.h"
 #include "daemon/VSADaemonContext.h"
+#include "model/VSAConcreteContainerIdentity.h"
 #include "model/VSAContainerIdentity.h"
 #include "model/VSAMetadata.h"
 #include "operations/VSACommandQueue.h"
+#include "operations/VSAOperationGrants.h"
 #include "platform/VSAIPCMessage.h"
 
 class VSAClientConnection {
@@ -41,57 +41,69 @@ class VSAClientConnection {
 
   VSADaemonContext& context() const { return context_; }
   const VSAClientIdentityRef& clientIdentity() const { return clientIdentity_; }
-  bool entitled() const { return entitled_; }
-  bool allowOtherIdLookup() const { return allowOtherIdLookup_; }
-  bool allowGroupIdLookup() const { return allowGroupIdLookup_; }
-  bool unrestricted() const { return unrestricted_; }
-  const std::optional<VSAValue>& lookup() const { return lookup_; }
+  const VSAOperationGrants& grants() const { return grants_; }
+  bool entitled() const { return grants_.entitled; }
+  bool allowOtherIdLookup() const { return grants_.allowOtherIdLookup; }
+  bool allowGroupIdLookup() const { return grants_.allowGroupIdLookup; }
+  bool unrestricted() const { return grants_.unrestricted; }
+  const std::optional<VSAValue>& lookup() const { return grants_.lookup; }
   const std::optional<VSAValue>& entitledWipeIdentifiers() const {
-    return entitledWipeIdentifiers_;
+    return grants_.entitledWipeIdentifiers;
   }
   const std::shared_ptr<VSACommandQueue>& commandQueue() const { return commandQueue_; }
-  void setUnrestricted(bool v) { unrestricted_ = v; }
-  void setAllowOtherIdLookup(bool v) { allowOtherIdLookup_ = v; }
-  void setAllowGroupIdLookup(bool v) { allowGroupIdLookup_ = v; }
+  void setUnrestricted(bool v) { grants_.unrestricted = v; }
+  void setAllowOtherIdLookup(bool v) { grants_.allowOtherIdLookup = v; }
+  void setAllowGroupIdLookup(bool v) { grants_.allowGroupIdLookup = v; }
 
   // The IPC message being served; handlers that reply later keep it.
   void setRelayMessage(VSAIPCMessageRef message) { relayMessage_ = std::move(message); }
   const VSAIPCMessageRef& relayMessage() const { return relayMessage_; }
 
-  // The container named by `identity`, created first when it is missing and
-  // `createIfNecessary` (in staging under a fresh UUID name, then renamed
-  // into place). Takes the all-identifiers lock unless `useLocking` is false.
+  // Create and look up (VSAContainerLookup).
   VSAMetadataRef createOrLookupContainerWithContainerIdentity(
       const VSAContainerIdentityRef& identity, bool createIfNecessary, bool transient,
       bool useLocking, VSAResultCode* withError);
   bool isEntitledForLookupWithClass(VSAContainerClass containerClass,
-                                    const std::string& identifier);
-  // The identifiers the lookup entitlement lists for a class (nothing when
-  // the client has none, or for a class outside 1-13).
-  std::optional<std::set<std::string>> _lookupForContainerClass(VSAContainerClass containerClass);
-  bool _createTopLevelContainerDirectory(const std::string& url, VSAContainerClass containerClass,
-                                         uid_t owner, gid_t group, VSAErrorRef* error);
-  bool _createSubDirectories(const std::string& url, const VSAMetadata& containerMetadata,
-                             VSAErrorRef* error);
-  int32_t _dataProtectionClassForContainerMetadata(const VSAMetadata& metadata);
-
-  // Looks the container up (with the caller's access test) and queues its
-  // staging for when the request completes.
-  void deleteContainerWithContainerIdentity(const VSAContainerIdentityRef& identity, bool transient,
-                                            VSAResultCode* withError);
-  // The client's containers of one class (its own user identity).
+                                    const std::string& identifier) const {
+    return grants_.isEntitledForLookupWithClass(containerClass, identifier);
+  }
+  std::optional<std::set<std::string>> _lookupForContainerClass(
+      VSAContainerClass containerClass) const {
+    return grants_.lookupForContainerClass(containerClass);
+  }
   std::optional<std::vector<VSAMetadataRef>> containersWithClass(VSAContainerClass containerClass,
                                                                  bool transient,
                                                                  VSAResultCode* withError);
-  // A live container's metadata, under its identifier read lock.
   VSAMetadataRef metadataWithContainerIdentity(const VSAContainerIdentityRef& identity,
                                                VSAResultCode* withError);
+
+  // Deletion (VSAContainerDeletion): queues the staging for request completion.
+  void deleteContainerWithContainerIdentity(const VSAContainerIdentityRef& identity, bool transient,
+                                            VSAResultCode* withError);
+  // Content wipe (VSAContentWipe).
+  void deleteDataContainerContentWithContainerIdentity(const VSAContainerIdentityRef& identity,
+                                                       VSAResultCode* withError);
+  // Replace (VSAReplaceOperation).
+  bool replaceContainerIdentity(const VSAContainerIdentityRef& oldIdentity,
+                                const VSAContainerIdentityRef& withContainerIdentity,
+                                bool preserveOldUUID, bool startDeletionThread,
+                                VSAResultCode* withError);
+  // Maintenance (VSAContainerMaintenance).
+  bool regenerateDirectoryUUIDWithContainerIdentity(const VSAContainerIdentityRef& identity,
+                                                    VSAResultCode* withError);
+  bool recreateDefaultStructureWithContainerIdentity(const VSAContainerIdentityRef& identity,
+                                                     VSAResultCode* withError);
+  std::optional<VSAValue> infoValueForKey(const VSAValue* key,
+                                          const VSAContainerIdentityRef& containerIdentity,
+                                          bool useLocking, VSAResultCode* withError);
+  bool setInfoValue(const VSAValue* value, const VSAValue* forKey,
+                    const VSAContainerIdentityRef& containerIdentity, bool useLocking,
+                    VSAResultCode* withError);
 
   // Runs the request's deferred commands; a failing command's code lands in `error`.
   bool completeWithError(VSAResultCode* error);
 
-  // Boot-time work: the two setups run synchronously; each cleanup calls its
-  // completion when done, possibly later and on another queue.
+  // Boot-time work (VSABootKeeper).
   void rebootKeeperSetup();
   void keeperSetup();
   void rebootKeeperCleanupWithCompletion(std::function<void()> completion);
@@ -99,15 +111,9 @@ class VSAClientConnection {
 
  private:
   VSADaemonContext& context_;
+  const VSAOperationServices& services_;
   VSAClientIdentityRef clientIdentity_;
-  bool entitled_;
-  bool allowOtherIdLookup_;
-  bool allowGroupIdLookup_ = false;
-  bool unrestricted_;
-  std::optional<VSAValue> lookup_;
-  std::optional<VSAValue> entitledWipeIdentifiers_;
+  VSAOperationGrants grants_;
   std::shared_ptr<VSACommandQueue> commandQueue_;
   VSAIPCMessageRef relayMessage_;
-  std::mutex lookupCacheMutex_;
-  std::optional<std::map<std::string, std::set<std::string>>> lookupCache_;
 };

@@ -63,3 +63,19 @@ void VSAHandleSystemContainerPath(const VSAValue& request, VSAValue& reply,
                                   VSAClientConnection& connection, VSAResultCode* result);
 void VSAHandleSystemGroupContainerPath(const VSAValue& request, VSAValue& reply,
                                        VSAClientConnection& connection, VSAResultCode* result);
+
+// Per-container maintenance, replace and wipe; see VSAHandlersMaintenance.cc.
+void VSAHandleSetInfoValue(const VSAValue& request, VSAValue& reply,
+                           VSAClientConnection& connection, VSAResultCode* result);
+void VSAHandleInfoValue(const VSAValue& request, VSAValue& reply, VSAClientConnection& connection,
+                        VSAResultCode* result);
+void VSAHandleRecreateDefaultStructure(const VSAValue& request, VSAValue& reply,
+                                       VSAClientConnection& connection, VSAResultCode* result);
+void VSAHandleRegenerateDirectoryUUID(const VSAValue& request, VSAValue& reply,
+                                      VSAClientConnection& connection, VSAResultCode* result);
+void VSAHandleReplaceContainer(const VSAValue& request, VSAValue& reply,
+                               VSAClientConnection& connection, VSAResultCode* result);
+void VSAHandleWipePluginData(const VSAValue& request, VSAValue& reply,
+                             VSAClientConnection& connection, VSAResultCode* result);
+void VSAHandleDeleteContainerContent(const VSAValue& request, VSAValue& reply,
+                                     VSAClientConnection& connection, VSAResultCode* result);

@@ -10,19 +10,22 @@ const char* const testability = kVSAEntitlementTestability;
 
 // Handlers arrive with the operations they call; a null handler answers 49.
 const std::array<VSACommandTableEntry, kVSACommandCount> kTable = {{
-    {0, VSAHandleCreateOrLookup, allowed, R, O, L},  // create or look up a container
-    {1, VSAHandleListContainers, allowed, R, _, L},  // list containers of a class
-    {2, nullptr, allowed, R, _, _},                  // replace a container by another
-    {3, VSAHandleStageForDelete, allowed, R, _, _},  // stage containers for deletion
-    {4, VSAHandleDeleteDeathRow, uma, _, _, _},  // empty death row (replies from its completion)
-    {5, nullptr, allowed, R, _, _},              // set a metadata info value
-    {6, nullptr, allowed, R, _, _},              // read a metadata info value
+    {0, VSAHandleCreateOrLookup, allowed, R, O, L},    // create or look up a container
+    {1, VSAHandleListContainers, allowed, R, _, L},    // list containers of a class
+    {2, VSAHandleReplaceContainer, allowed, R, _, _},  // replace a container by another
+    {3, VSAHandleStageForDelete, allowed, R, _, _},    // stage containers for deletion
+    {4, VSAHandleDeleteDeathRow, uma, _, _, _},    // empty death row (replies from its completion)
+    {5, VSAHandleSetInfoValue, allowed, R, _, _},  // set a metadata info value
+    {6, VSAHandleInfoValue, allowed, R, _, _},     // read a metadata info value
     {7, VSAHandleContainerMetadata, allowed, R, _, _},  // read a container's metadata
-    {8, nullptr, allowed, R, _, _},                     // recreate a container's default structure
-    {9, nullptr, allowed, R, _, _},                     // regenerate a container's directory UUID
-    {10, VSAHandleDeleteContainer, allowed, R, _, _},   // delete a container
-    {11, nullptr, kVSAEntitlementWipeContainer, R, _, _},           // wipe data of class 4
-    {12, nullptr, kVSAEntitlementDeleteContainerContent, R, _, _},  // delete data content
+    {8, VSAHandleRecreateDefaultStructure, allowed, R, _,
+     _},  // recreate a container's default structure
+    {9, VSAHandleRegenerateDirectoryUUID, allowed, R, _,
+     _},                                               // regenerate a container's directory UUID
+    {10, VSAHandleDeleteContainer, allowed, R, _, _},  // delete a container
+    {11, VSAHandleWipePluginData, kVSAEntitlementWipeContainer, R, _, _},  // wipe data of class 4
+    {12, VSAHandleDeleteContainerContent, kVSAEntitlementDeleteContainerContent, R, _,
+     _},                              // delete data content
     {13, nullptr, allowed, R, O, L},  // group containers with tokens and personas
     {14, nullptr, allowed, R, _, L},  // group container identifiers of an owner
     {15, VSAHandleSystemContainerPath, allowed, R, O, L},       // path of a system container
@@ -32,8 +35,9 @@ const std::array<VSACommandTableEntry, kVSACommandCount> kTable = {{
     {19, VSAHandleReadCodeSigningInfo, allowed, R, _, _},       // read code-signing information
     {20, VSAHandleInvalidateAppsWithoutBundle, allowed, R, _, _},  // invalidate apps without bundle
     {21, VSAHandleSetDataProtection, allowed, _, _,
-     _},                              // change data protection (replies from its completion)
-    {22, nullptr, allowed, R, _, _},  // recreate a container's default structure
+     _},  // change data protection (replies from its completion)
+    {22, VSAHandleRecreateDefaultStructure, allowed, R, _,
+     _},                              // recreate a container's default structure
     {23, nullptr, allowed, R, _, L},  // disk usage of a container
     {24, nullptr, kVSAEntitlementDataMigration, R, _, _},       // data migration
     {25, nullptr, testability, R, _, _},                        // crash-retry test

@@ -21,6 +21,7 @@
 #include "model/VSAGlobalConfiguration.h"
 #include "model/VSAUserIdentitySharedCache.h"
 #include "operations/VSADeathRow.h"
+#include "operations/VSAOperationServices.h"
 #include "platform/VSAApplicationTerminationService.h"
 #include "platform/VSAClientRegistry.h"
 #include "platform/VSAContainerSubdirectories.h"
@@ -116,6 +117,48 @@ struct VSADaemonContext {
       return m ? m->entitlementsForIdentifier(id) : std::nullopt;
     };
     dataProtectionManager = std::make_shared<VSADataProtectionManager>(protection);
+    buildOperationServices(mapping);
+  }
+
+  // What the container operations work with; the code-signing, whitelist and
+  // data-protection answers are functions over this context's objects.
+  void buildOperationServices(const std::weak_ptr<VSACodeSigningMapping>& mapping) {
+    auto s = std::make_shared<VSAOperationServices>();
+    s->configuration = globalConfiguration;
+    s->fileManager = fileManager;
+    s->containerCache = containerCache;
+    s->deathRow = deathRow;
+    s->userIdentityCache = userIdentityCache;
+    s->subdirectories = subdirectories;
+    s->deviceProperties = deviceProperties;
+    s->transactions = transactions;
+    s->stageEnvironment = stageEnvironment;
+    s->isLookupWhitelisted = [list = whitelist](const std::string& client, VSAContainerClass c,
+                                                const std::string& id) {
+      return list->isLookupWhitelistedFromCodeSignIdentifier(client, c, id);
+    };
+    s->wellknownContainerForId = [list = whitelist](const std::string& id, VSAContainerClass c) {
+      return list->wellknownContainerForId(id, c);
+    };
+    s->identifierHasSystemContainer = [mapping](const std::string& id) {
+      auto m = mapping.lock();
+      return m && m->identifierHasSystemContainer(id);
+    };
+    s->invalidateCodeSigningInfoForIdentifierAndItsChildren = [mapping](const std::string& id,
+                                                                        VSAErrorRef* error) {
+      auto m = mapping.lock();
+      return m && m->invalidateCodeSigningInfoForIdentifierAndItsChildren(id, error);
+    };
+    std::weak_ptr<VSADataProtectionManager> protection = dataProtectionManager;
+    s->intendedDataProtectionClass = [protection](const std::string& id) -> int32_t {
+      auto p = protection.lock();
+      return p ? p->intendedDataProtectionClassBasedOnEntitlementsForIdentifier(id) : 0;
+    };
+    s->restartPendingDataProtectionOperations = [protection](VSAErrorRef* error) {
+      auto p = protection.lock();
+      return p && p->restartPendingDataProtectionOperationsWithError(error);
+    };
+    operationServices = std::move(s);
   }
 
   VSASystemRoot systemRoot;
@@ -139,6 +182,7 @@ struct VSADaemonContext {
   std::shared_ptr<VSAApplicationTerminationService> terminationService;  // may be null
   std::shared_ptr<VSADataProtectionManager> dataProtectionManager;
   std::shared_ptr<VSAStageForDeleteEnvironment> stageEnvironment;
+  std::shared_ptr<VSAOperationServices> operationServices;
 
   VSAWorkQueue::Ref listenerQueue;   // "com.tamsk.vessad.listener"
   VSAWorkQueue::Ref deathrowQueue;   // "com.tamsk.vessad.deathrow"

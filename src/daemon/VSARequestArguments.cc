@@ -119,3 +119,9 @@ VSAConcreteContainerIdentityRef VSARequestArguments::concreteContainerIdentity(
   if (!identity) fail(code == VSAResult::kSuccess ? VSAResult::kInvalidArgument : code);
   return identity;
 }
+
+VSAContainerIdentityRef VSARequestArguments::namedContainerIdentity(
+    const VSAIdentityKeys& keys, std::optional<VSAContainerClass> fixedClass) {
+  if (!request_.get(keys.uuid) || fixedClass) return containerIdentity(keys, fixedClass);
+  return concreteContainerIdentity(keys);
+}

@@ -38,6 +38,11 @@ class VSARequestArguments {
   VSAContainerIdentityRef containerIdentity(const VSAIdentityKeys& keys = {},
                                             std::optional<VSAContainerClass> fixedClass = {});
   VSAConcreteContainerIdentityRef concreteContainerIdentity(const VSAIdentityKeys& keys = {});
+  // Concrete when the request carries the UUID key, else plain (the
+  // operation then acts on the live container of the identifier).
+  VSAContainerIdentityRef namedContainerIdentity(const VSAIdentityKeys& keys = {},
+                                                 std::optional<VSAContainerClass> fixedClass = {});
+  const VSAValue* value(const char* key) const { return request_.get(key); }
 
   void fail(VSAResultCode code) { VSASetCode(result_, code); }
   // Refuses (code 11, one rate-limited log line per client) a client string

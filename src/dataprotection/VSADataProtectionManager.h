@@ -34,9 +34,6 @@
 #include "dataprotection/VSADataProtectionEnvironment.h"
 #include "model/VSAContainerIdentity.h"
 
-inline constexpr const char* kVSAContentProtectionClassInfoKey =
-    "com.tamsk.Ferrox.ContentProtectionClass";
-
 // Replies a manager keeps for changes waiting for an unlock, by default.
 inline constexpr size_t kVSAMaxPendingProtectionReplies = 1024;
 // The answer to a request whose waiting change a newer request for the same

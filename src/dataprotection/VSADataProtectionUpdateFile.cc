@@ -121,21 +121,11 @@ VSADataProtectionUpdate::_readAndValidateDataProtectionUpdateAtURL(const std::st
 bool VSAWriteDataProtectionUpdate(const VSADataProtectionUpdate& update, const std::string& url,
                                   VSAFileManager& fm, int protectionClass, mode_t mode,
                                   VSAErrorRef* error) {
-  VSAFileSystem& fs = fm.fileSystem();
   std::string directory = VSADirectoryName(url);
   if (!fm.itemExistsAtURL(directory) &&
       !fm.createDirectoryAtURL(directory, true, 0755, 0, kVSANoProtectionClass, error))
     return false;
   auto bytes = VSAPlist::serialize(update.plist(), VSAPlist::Format::Binary, error);
   if (!bytes) return false;
-  std::string temp = VSAPathJoin(directory, ".tmp-" + VSAUUID::random().string());
-  int rc = fs.writeFile(temp, *bytes, mode);
-  if (rc == 0) rc = fs.setProtectionClass(temp, protectionClass);
-  if (rc == 0) rc = fs.rename(temp, url);
-  if (rc != 0) {
-    fs.unlink(temp);
-    VSASetError(error, VSA_POSIX_ERROR(rc, VSAFormat("writing %@", url)));
-    return false;
-  }
-  return true;
+  return fm.writeFileAtomicallyAtURL(url, *bytes, mode, protectionClass, error);
 }

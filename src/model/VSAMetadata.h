@@ -27,6 +27,10 @@
 // info dictionary adds a little); anything larger was not written by it.
 inline constexpr size_t kVSAMetadataFileMaxSize = 64u << 10;
 
+// The info dictionary key under which a data container's protection class is kept.
+inline constexpr const char* kVSAContentProtectionClassInfoKey =
+    "com.tamsk.Ferrox.ContentProtectionClass";
+
 class VSAGlobalConfiguration;
 class VSAUserIdentityCache;
 class VSAMetadata;

@@ -4,6 +4,7 @@
 
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
+#include "base/VSAUUID.h"
 #include "platform/VSAFileManagerErrors.h"
 
 namespace {
@@ -214,6 +215,21 @@ bool VSAFileManager::moveItemIfExistsAtURL(const std::string& from, const std::s
                                            VSAErrorRef* e) {
   return moveItem(from, to, false, e);
 }
+bool VSAFileManager::writeFileAtomicallyAtURL(const std::string& path,
+                                              const std::vector<uint8_t>& bytes, mode_t mode,
+                                              std::optional<int> protectionClass,
+                                              VSAErrorRef* error) {
+  std::string temp = VSAPathJoin(VSADirectoryName(path), ".tmp-" + VSAUUID::random().string());
+  int rc = fs_->writeFile(temp, bytes, mode);
+  if (rc == 0 && protectionClass) rc = fs_->setProtectionClass(temp, *protectionClass);
+  if (rc == 0) rc = fs_->rename(temp, path);
+  if (rc == 0) return true;
+  fs_->unlink(temp);
+  VSASetError(error, VSAFileManagerFail(rc, "writeFileAtomicallyAtURL", "writing %@ failed: %s",
+                                        path, std::strerror(rc)));
+  return false;
+}
+
 bool VSAFileManager::copyItemAtURL(const std::string& from, const std::string& to, VSAErrorRef* e) {
   return copyItem(from, to, true, e);
 }

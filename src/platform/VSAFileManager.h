@@ -67,6 +67,13 @@ class VSAFileManager {
   bool moveItemAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
   bool moveItemIfExistsAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
   bool copyItemAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
+  // Writes a whole file atomically and durably: a temporary file beside it
+  // (".tmp-" and a fresh UUID), fsynced, given `protectionClass` when set,
+  // renamed over `path`, and the directory fsynced. On failure the temporary
+  // file is removed and `path` is as it was.
+  bool writeFileAtomicallyAtURL(const std::string& path, const std::vector<uint8_t>& bytes,
+                                mode_t mode, std::optional<int> protectionClass,
+                                VSAErrorRef* error);
   bool copyItemIfExistsAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
   // Recursive, through directory descriptors and on one device; a missing
   // item is success; immutable items are unlocked and removed.

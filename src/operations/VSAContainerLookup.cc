@@ -1,12 +1,15 @@
 // Create or look up a container: the access tests, the locked lookup, and
-// creation in staging followed by one rename into place.
+// creation in staging followed by one rename into place; listing a class and
+// reading a container's metadata.
+#include "operations/VSAContainerLookup.h"
+
 #include <exception>
 
 #include "base/VSALocks.h"
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
-#include "daemon/VSAClientConnection.h"
-#include "daemon/VSAEntitlements.h"
+#include "model/VSAConcreteContainerIdentity.h"
+#include "operations/VSAContainerDirectories.h"
 
 namespace {
 const char* const kOrigin = "createOrLookupContainerWithContainerIdentity";
@@ -16,10 +19,6 @@ constexpr VSAResultCode kStagingMoveFailed = 8;
 constexpr VSAResultCode kStagingRemovalFailed = 9;
 constexpr VSAResultCode kException = 40;
 constexpr VSAResultCode kCacheAddFailed = 45;
-
-const char* const kLookupKeys[] = {nullptr,  "app",     "appData",    "plugin",     "pluginData",
-                                   "vpn",    "vpnData", "appGroup",   "framework",  "relayService",
-                                   "daemon", "tempDir", "systemData", "systemGroup"};
 
 VSAErrorRef failure(VSAResultCode code, VSAErrorRef underlying, std::string message) {
   auto e = VSAError::make(code, std::move(underlying), kOrigin, __LINE__, "%@", message);
@@ -53,120 +52,34 @@ bool isNotFound(const VSAErrorRef& e) {
 }
 }  // namespace
 
-std::optional<std::set<std::string>> VSAClientConnection::_lookupForContainerClass(
-    VSAContainerClass c) {
-  if (c == 0 || c > 13) return std::nullopt;
-  std::lock_guard lock(lookupCacheMutex_);
-  if (!lookup_) return std::nullopt;
-  if (!lookupCache_) lookupCache_.emplace();
-  const char* key = kLookupKeys[c];
-  auto it = lookupCache_->find(key);
-  if (it != lookupCache_->end()) return it->second;
-  std::set<std::string> ids;
-  const VSAValue* value = lookup_->get(key);
-  if (value && value->isArray())
-    for (const auto& item : *value->arrayValue())
-      if (item.isString()) ids.insert(*item.stringValue());
-  return (*lookupCache_)[key] = std::move(ids);
-}
-
-bool VSAClientConnection::isEntitledForLookupWithClass(VSAContainerClass c,
-                                                       const std::string& identifier) {
-  auto ids = _lookupForContainerClass(c);
-  return ids && ids->count(identifier) > 0;
-}
-
-int32_t VSAClientConnection::_dataProtectionClassForContainerMetadata(const VSAMetadata& metadata) {
-  if (!VSAContainerClassIsPerUser(metadata.containerClass())) return 0;
-  const VSAValue* recorded =
-      metadata.info() ? metadata.info()->get(kVSAContentProtectionClassInfoKey) : nullptr;
-  if (recorded && recorded->isInteger())
-    return static_cast<int32_t>(recorded->int64Value().value_or(0));
-  return context_.dataProtectionManager
-      ->intendedDataProtectionClassBasedOnEntitlementsForIdentifier(metadata.identifier());
-}
-
-bool VSAClientConnection::_createTopLevelContainerDirectory(const std::string& url,
-                                                            VSAContainerClass c, uid_t owner,
-                                                            gid_t group, VSAErrorRef* error) {
-  if (VSAContainerClassIsBundle(c))
-    owner = CONTAINER_INSTALLATION_UID;
-  else if (VSAContainerClassIsSystem(c))
-    owner = 0;
-  return context_.fileManager->createDirectoryAtURL(url, true, 0755, owner, 0, error, group);
-}
-
-bool VSAClientConnection::_createSubDirectories(const std::string& url, const VSAMetadata& metadata,
-                                                VSAErrorRef* error) {
-  VSAContainerClass c = metadata.containerClass();
-  bool system = VSAContainerClassIsSystem(c);
-  mode_t mode = system ? 0 : 0755;
-  uid_t owner = VSAContainerClassIsBundle(c) ? CONTAINER_INSTALLATION_UID
-                : system                     ? kVSANobodyID
-                         : metadata.userIdentity()->posixUIDForContainerClass(c);
-  gid_t group = system ? kVSANobodyID : metadata.userIdentity()->posixGIDForContainerClass(c);
-  VSAResultCode libraryError = VSAResult::kSuccess;
-  auto names = context_.subdirectories->subdirectoriesForClass(c, &libraryError);
-  if (!names) {
-    auto e = VSA_ERROR(libraryError, "Failed to get subdirectory names for %llu : %llu",
-                       static_cast<unsigned long long>(c), libraryError);
-    VSALog(kVSALogError, __func__, "%@", e->message());
-    VSASetError(error, e);
-    return false;
-  }
-  int32_t protection = _dataProtectionClassForContainerMetadata(metadata);
-  VSALog(kVSALogDebug, __func__, "Creating subdirectories for [%llu:%@] at [%@]",
-         static_cast<unsigned long long>(c), metadata.identifier(), url);
-  const auto& excluded = VSAGlobalConfiguration::excludedFromAppUserData();
-  for (const auto& name : *names) {
-    int32_t itemClass = protection;
-    if (VSAContainerClassIsPerUser(c) &&
-        std::find(excluded.begin(), excluded.end(), name) != excluded.end())
-      itemClass = 0;
-    std::string path = VSAPathJoin(url, name);
-    VSAErrorRef underlying;
-    // A system sub-directory made with mode 0 inherits the ACL under a mask
-    // of none; setting its ACL again makes the "systemusers" entry count.
-    if (!context_.fileManager->createDirectoryAtURL(
-            path, true, mode, owner, static_cast<uint32_t>(itemClass), &underlying, group) ||
-        (system && !context_.fileManager->setSystemContainerDirectoryACLAtURL(path, &underlying))) {
-      auto e = VSA_ERROR_UNDERLYING(underlying->resultCode(kStagingCreateFailed), underlying,
-                                    "Failed to create sub-dir for %@ at %@ (protClass: %d)", name,
-                                    url, itemClass);
-      VSALog(kVSALogError, __func__, "%@", e->message());
-      VSASetError(error, e);
-      return false;
-    }
-  }
-  return true;
-}
-
 namespace {
 struct CreateSteps {
-  VSAClientConnection& connection;
-  VSADaemonContext& context;
+  const VSAOperationServices& services;
+  const VSAOperationGrants& grants;
   const VSAContainerIdentity& identity;
   bool transient;
 
-  // Steps 3 and 4 of the operation: may the client reach this container?
+  bool whitelisted(const std::string& client, VSAContainerClass c, const std::string& id) {
+    return services.isLookupWhitelisted && services.isLookupWhitelisted(client, c, id);
+  }
+
+  // May the client reach this container?
   VSAErrorRef checkAccess() {
-    const auto& client = connection.clientIdentity();
-    std::string bundle = client ? client->bundleIdentifier() : std::string();
+    const std::string& bundle = grants.clientIdentifier;
     VSAContainerClass c = identity.containerClass();
     const std::string& id = identity.identifier();
-    bool entitledLookup = connection.isEntitledForLookupWithClass(c, id);
-    bool allowed = id == bundle || connection.allowOtherIdLookup() ||
-                   ((c == 13 || c == 7) && connection.allowGroupIdLookup()) ||
-                   connection.unrestricted() || entitledLookup ||
-                   context.whitelist->isLookupWhitelistedFromCodeSignIdentifier(bundle, c, id);
+    bool entitledLookup = grants.isEntitledForLookupWithClass(c, id);
+    bool allowed = id == bundle || grants.allowOtherIdLookup ||
+                   ((c == 13 || c == 7) && grants.allowGroupIdLookup) || grants.unrestricted ||
+                   entitledLookup || whitelisted(bundle, c, id);
     if (!allowed)
       return failure(VSAResult::kNotEntitled, nullptr,
                      VSAFormat("%@ not entitled to retrieve container class %ld with identifier %@",
                                bundle, static_cast<long>(c), id));
-    if (c == 12 && !connection.allowOtherIdLookup() && !connection.unrestricted() &&
-        !entitledLookup) {
-      bool passes = context.whitelist->isLookupWhitelistedFromCodeSignIdentifier(bundle, 12, id) ||
-                    (context.codeSigningMapping->identifierHasSystemContainer(id) && id == bundle);
+    if (c == 12 && !grants.allowOtherIdLookup && !grants.unrestricted && !entitledLookup) {
+      bool passes = whitelisted(bundle, 12, id) ||
+                    (services.identifierHasSystemContainer &&
+                     services.identifierHasSystemContainer(id) && id == bundle);
       if (!passes)
         return failure(
             VSAResult::kNotEntitled, nullptr,
@@ -178,7 +91,9 @@ struct CreateSteps {
   std::string liveName(const std::string& uuidName) {
     VSAContainerClass c = identity.containerClass();
     if (c == 12 || c == 13)
-      if (auto name = context.whitelist->wellknownContainerForId(identity.identifier(), c))
+      if (auto name = services.wellknownContainerForId
+                          ? services.wellknownContainerForId(identity.identifier(), c)
+                          : std::nullopt)
         return *name;
     return uuidName;
   }
@@ -187,13 +102,13 @@ struct CreateSteps {
   VSAMetadataRef create(VSAErrorRef* error) {
     VSAContainerClass c = identity.containerClass();
     const auto& user = identity.userIdentity();
-    auto& config = *context.globalConfiguration;
+    auto& config = *services.configuration;
     std::string name = VSAUUID::random().string();
     VSALog(kVSALogInfo, kOrigin, "CreatingContainer uuid=%@ identifier=%@ class=%llu", name,
            identity.identifier(), static_cast<unsigned long long>(c));
     std::string staging = VSAPathJoin(config.stagingDirectoryURLForUserIdentity(user, c), name);
     VSAErrorRef underlying;
-    if (!connection._createTopLevelContainerDirectory(
+    if (!VSAContainerDirectories(services)._createTopLevelContainerDirectory(
             staging, c, user->posixUIDForContainerClass(c), user->posixGIDForContainerClass(c),
             &underlying)) {
       *error = failure(kStagingCreateFailed, underlying,
@@ -214,7 +129,7 @@ struct CreateSteps {
   // is not there (its mkdir failed) is no failure.
   void discard(const std::string& directory, VSAErrorRef* error) {
     VSAErrorRef cleanup;
-    if (!context.deathRow->_moveItemAtURLToDeathRow(directory, true, true, &cleanup))
+    if (!services.deathRow->_moveItemAtURLToDeathRow(directory, true, true, &cleanup))
       *error = failure(kStagingRemovalFailed, *error,
                        VSAFormat("Failed to remove staging dir: %@", directory));
   }
@@ -222,7 +137,7 @@ struct CreateSteps {
   VSAMetadataRef assemble(const std::string& staging, const std::string& name, std::string* made,
                           VSAErrorRef* error) {
     VSAContainerClass c = identity.containerClass();
-    auto& config = *context.globalConfiguration;
+    auto& config = *services.configuration;
     VSAResultCode code = VSAResult::kSuccess;
     auto concrete = VSAConcreteContainerIdentity::containerIdentityWithUUID(
         VSAUUID::random(), identity.userIdentity(), identity.identifier(), c, &code);
@@ -233,25 +148,26 @@ struct CreateSteps {
     auto metadata = std::make_shared<VSAMetadata>(concrete, std::nullopt, staging, std::nullopt);
     if (!metadata->writeMetadataToDiskWithError(config, error)) return nullptr;
     if (VSAContainerClassIsSystem(c) &&
-        !context.fileManager->setTopLevelSystemContainerACLAtURL(staging, error))
+        !services.fileManager->setTopLevelSystemContainerACLAtURL(staging, error))
       return nullptr;
-    if (!connection._createSubDirectories(staging, *metadata, error)) return nullptr;
+    if (!VSAContainerDirectories(services)._createSubDirectories(staging, *metadata, error))
+      return nullptr;
     auto base = config.containerDirectoryURLForUserIdentity(identity.userIdentity(), c, transient);
     std::string live = VSAPathJoin(base.value_or(""), liveName(name));
     VSAErrorRef underlying;
-    if (!base || !context.fileManager->moveItemAtURL(staging, live, &underlying)) {
+    if (!base || !services.fileManager->moveItemAtURL(staging, live, &underlying)) {
       *error = failure(kStagingMoveFailed, underlying,
                        VSAFormat("Failed to move staging dir: %@ to live dir: %@", staging, live));
       return nullptr;
     }
     *made = live;
-    if (context.deviceProperties->isFeatureEnabled("fast_container_sizing"))
-      context.fileManager->fastDiskUsageForURL(live);
+    if (services.deviceProperties->isFeatureEnabled("fast_container_sizing"))
+      services.fileManager->fastDiskUsageForURL(live);
     metadata->setUrl(live);
     metadata->setExisted(false);
     metadata->setTransient(transient);
-    if (!context.containerCache->addContainerMetadata(*metadata, live, transient, true,
-                                                      &underlying)) {
+    if (!services.containerCache->addContainerMetadata(*metadata, live, transient, true,
+                                                       &underlying)) {
       *error = failure(kCacheAddFailed, underlying,
                        VSAFormat("Failed to add to cache : %@, url: %@, transient: %d", *metadata,
                                  live, transient));
@@ -265,29 +181,28 @@ struct CreateSteps {
 };
 }  // namespace
 
-VSAMetadataRef VSAClientConnection::createOrLookupContainerWithContainerIdentity(
+VSAMetadataRef VSAContainerLookup::createOrLookupContainerWithContainerIdentity(
     const VSAContainerIdentityRef& identity, bool createIfNecessary, bool transient,
     bool useLocking, VSAResultCode* withError) {
   VSALog(kVSALogDebug, kOrigin,
          "createOrLookup; identity: %@, createIfNecessary: %d, transient: %d, allowOtherIdLookup: "
          "%d, unrestricted: %d, clientBundleIdentifier: %@",
          identity ? identity->description() : std::string("(null)"), createIfNecessary, transient,
-         allowOtherIdLookup_, unrestricted_,
-         clientIdentity_ ? clientIdentity_->bundleIdentifier() : std::string());
+         grants_.allowOtherIdLookup, grants_.unrestricted, grants_.clientIdentifier);
   if (!identity) {
     VSALog(kVSALogError, kOrigin, "Cannot lookup a nil container identity.");
     VSASetCode(withError, VSAResult::kOutOfRange);
     return nullptr;
   }
-  CreateSteps steps{*this, context_, *identity, transient};
+  CreateSteps steps{services_, grants_, *identity, transient};
   VSAErrorRef error = steps.checkAccess();
   VSAMetadataRef found;
   GlobalLock lock(useLocking);
   try {
     if (!error && !transient) {
       lock.acquire(false);
-      found = context_.containerCache->containerForContainerIdentity(
-          *identity, false, true, !(clientIdentity_ && clientIdentity_->isKernel()), &error);
+      found = services_.containerCache->containerForContainerIdentity(
+          *identity, false, true, !grants_.clientIsKernel, &error);
       if (found) found->setExisted(true);
       if (isNotFound(error)) error = nullptr;
       lock.release();
@@ -298,8 +213,8 @@ VSAMetadataRef VSAClientConnection::createOrLookupContainerWithContainerIdentity
                   VSAFormat("Container with identifier: \"%@\" Not Found", identity->identifier()));
     if (!found && !error) {
       lock.acquire(true);
-      found = context_.containerCache->containerForContainerIdentity(
-          *identity, transient, true, !(clientIdentity_ && clientIdentity_->isKernel()), &error);
+      found = services_.containerCache->containerForContainerIdentity(
+          *identity, transient, true, !grants_.clientIsKernel, &error);
       if (isNotFound(error)) error = nullptr;
       if (found && !transient) {
         found->setExisted(true);
@@ -307,19 +222,19 @@ VSAMetadataRef VSAClientConnection::createOrLookupContainerWithContainerIdentity
         // A transient container is always made fresh.
         VSAErrorRef moveError;
         if (found &&
-            !context_.deathRow->_moveItemAtURLToDeathRow(found->url(), true, true, &moveError)) {
+            !services_.deathRow->_moveItemAtURLToDeathRow(found->url(), true, true, &moveError)) {
           error = failure(kTransientRemovalFailed, moveError,
                           VSAFormat("Failed to remove transient container at %@", found->url()));
         } else {
           if (found)
-            context_.containerCache->removeContainerForUserIdentity(
+            services_.containerCache->removeContainerForUserIdentity(
                 found->userIdentity(), found->containerClass(), found->identifier(), true, nullptr);
           found = steps.create(&error);
         }
       }
     }
   } catch (const std::exception& e) {
-    if (context_.globalConfiguration->isInternalImage()) std::terminate();
+    if (services_.configuration->isInternalImage()) std::terminate();
     error = failure(kException, nullptr,
                     VSAFormat("Got exception: %@ : %@", "std::exception", e.what()));
     found = nullptr;
@@ -329,4 +244,66 @@ VSAMetadataRef VSAClientConnection::createOrLookupContainerWithContainerIdentity
     return nullptr;
   }
   return found;
+}
+
+std::optional<std::vector<VSAMetadataRef>> VSAContainerLookup::containersWithClass(
+    VSAContainerClass containerClass, bool transient, VSAResultCode* withError) {
+  VSAUserIdentityRef user = grants_.clientUserIdentity;
+  if (!user) user = services_.userIdentityCache->defaultUserIdentity();
+  VSAAllIdentifiersLockGuard lock(false);
+  VSAErrorRef error;
+  auto all = services_.containerCache->allContainersForUserIdentity(user, containerClass, transient,
+                                                                    false, &error);
+  if (!all) {
+    VSALog(kVSALogError, __func__, "Failed to list containers of class %llu: %@",
+           static_cast<unsigned long long>(containerClass), error);
+    VSASetCode(withError, error ? error->resultCode(VSAResult::kContainerNotFound)
+                                : VSAResult::kContainerNotFound);
+    return std::nullopt;
+  }
+  // Without a grant for other identifiers a client sees only its own and
+  // those its lookup entitlement lists.
+  if (!grants_.allowOtherIdLookup && !grants_.unrestricted) {
+    std::erase_if(*all, [&](const VSAMetadataRef& m) {
+      return m->identifier() != grants_.clientIdentifier &&
+             !grants_.isEntitledForLookupWithClass(containerClass, m->identifier());
+    });
+  }
+  return all;
+}
+
+VSAMetadataRef VSAContainerLookup::metadataWithContainerIdentity(
+    const VSAContainerIdentityRef& identity, VSAResultCode* withError) {
+  VSAMetadataRef found =
+      createOrLookupContainerWithContainerIdentity(identity, false, false, true, withError);
+  if (!found) return nullptr;
+  // Re-read under the identifier lock so that a concurrent info change is seen whole.
+  VSAIdentifierLockGuard lock(VSAValue(found->uuid().string()), false);
+  VSAErrorRef error;
+  auto fresh = VSAMetadata::readAndValidateMetadataAtUrl(found->url(), found->userIdentity(), false,
+                                                         *services_.configuration,
+                                                         *services_.userIdentityCache, &error);
+  if (!fresh) {
+    VSASetCode(withError, error ? error->resultCode(VSAResult::kMetadataUnreadable)
+                                : VSAResult::kMetadataUnreadable);
+    return nullptr;
+  }
+  fresh->setExisted(true);
+  return fresh;
+}
+
+VSAMetadataRef VSAContainerLookup::containerForIdentity(VSAContainerCache& cache,
+                                                        const VSAContainerIdentity& identity) {
+  const VSAUUID* uuid = identity.isConcrete()
+                            ? &static_cast<const VSAConcreteContainerIdentity&>(identity).uuid()
+                            : nullptr;
+  for (bool transient : {false, true}) {
+    auto m = cache.containerForContainerIdentity(identity, transient, false, false, nullptr);
+    if (m && (!uuid || m->uuid() == *uuid)) {
+      m->setTransient(transient);
+      return m;
+    }
+    if (!uuid) break;
+  }
+  return nullptr;
 }

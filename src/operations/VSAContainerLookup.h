@@ -1,0 +1,48 @@
+// Finding containers for a client: create or look up one container (access
+// tests against the client's grants and the whitelist, a read-locked cache
+// lookup, then a write-locked second lookup and creation in staging followed
+// by one rename into place), list a class, and read a container's metadata.
+// One object serves one request; it reads the request's grants and the
+// daemon's shared services. Locks are taken and released inside each call.
+#pragma once
+
+#include <optional>
+#include <vector>
+
+#include "base/VSAError.h"
+#include "model/VSAContainerIdentity.h"
+#include "model/VSAMetadata.h"
+#include "operations/VSAOperationGrants.h"
+#include "operations/VSAOperationServices.h"
+
+class VSAContainerLookup {
+ public:
+  VSAContainerLookup(const VSAOperationServices& services, const VSAOperationGrants& grants)
+      : services_(services), grants_(grants) {}
+
+  // The container named by `identity`, created first when it is missing and
+  // `createIfNecessary`. A transient container is always made fresh. Takes
+  // the all-identifiers lock unless `useLocking` is false.
+  VSAMetadataRef createOrLookupContainerWithContainerIdentity(
+      const VSAContainerIdentityRef& identity, bool createIfNecessary, bool transient,
+      bool useLocking, VSAResultCode* withError);
+  // The client's containers of one class (its own user identity), filtered
+  // to what its grants let it see.
+  std::optional<std::vector<VSAMetadataRef>> containersWithClass(VSAContainerClass containerClass,
+                                                                 bool transient,
+                                                                 VSAResultCode* withError);
+  // A live container's metadata, re-read under its identifier read lock.
+  VSAMetadataRef metadataWithContainerIdentity(const VSAContainerIdentityRef& identity,
+                                               VSAResultCode* withError);
+
+  // The cached container an identity names, with its transient flag set: a
+  // concrete identity names the live or the transient container whose UUID
+  // it carries; a plain one the live container of its identifier. No access
+  // test, no lock: for operations that hold the lock they need.
+  static VSAMetadataRef containerForIdentity(VSAContainerCache& cache,
+                                             const VSAContainerIdentity& identity);
+
+ private:
+  const VSAOperationServices& services_;
+  const VSAOperationGrants& grants_;
+};

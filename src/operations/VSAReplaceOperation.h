@@ -1,0 +1,39 @@
+// Replace: puts one existing container (the new one, typically a fresh
+// transient container) in the place of another of the same class and user
+// (the old one). The exchange is two renames, journalled in a replace file
+// written before the first: old -> staging, new -> destination. The whole
+// operation holds the all-identifiers write lock.
+//
+// With `preserveOldUUID` the result stands where the old container stood
+// and keeps the old container's UUID (the content wipe); the new
+// container's metadata file is rewritten with that UUID before anything
+// moves, so a crash at any point leaves either the old container or the
+// finished result at the old path. Without it, the result goes to the class
+// directory of the new container's transient state under the new
+// identity's UUID.
+//
+// A failure after the old container has been moved aside moves it back and
+// returns it to the cache; only if that fails too do the staging directory
+// and the replace file stay, for the next start's recovery. Recovery runs
+// once at start-up, before staging directories are cleaned.
+#pragma once
+
+#include "base/VSAError.h"
+#include "model/VSAContainerIdentity.h"
+#include "operations/VSAOperationServices.h"
+
+class VSAReplaceOperation {
+ public:
+  explicit VSAReplaceOperation(const VSAOperationServices& services) : services_(services) {}
+
+  bool replaceContainerIdentity(const VSAContainerIdentityRef& oldIdentity,
+                                const VSAContainerIdentityRef& withContainerIdentity,
+                                bool preserveOldUUID, bool startDeletionThread,
+                                VSAResultCode* withError);
+  // Puts back every old container that a replace file says was moved aside
+  // and not replaced, then discards the replace files.
+  bool _recoverFromReplaceOperationsWithError(VSAErrorRef* error);
+
+ private:
+  const VSAOperationServices& services_;
+};
