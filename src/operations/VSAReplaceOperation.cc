@@ -283,6 +283,10 @@ bool VSAReplaceOperation::_recoverFromReplaceOperationsWithError(VSAErrorRef* er
   const char* fn = "_recoverFromReplaceOperationsWithError";
   auto& fm = *services_.fileManager;
   std::string directory = services_.configuration->replaceDirectory();
+  // A crash while a replace file was written leaves only its temporary file:
+  // that replace never moved anything.
+  if (int removed = fm.removeUnfinishedWritesInDirectoryAtURL(directory))
+    VSALog(kVSALogNotice, fn, "Removed %d unfinished replace files", removed);
   VSAErrorRef listError;
   auto items = fm.urlsForItemsInDirectoryAtURL(directory, &listError);
   if (!items) {

@@ -13,9 +13,20 @@ void VSAFaultInjectingFileSystem::failAll(Op op, int error) {
   rules_.push_back({op, -1, error});
 }
 
+void VSAFaultInjectingFileSystem::crashAfter(int calls) {
+  std::lock_guard lock(mutex_);
+  crashRemaining_ = calls;
+}
+
+bool VSAFaultInjectingFileSystem::crashed() const {
+  std::lock_guard lock(mutex_);
+  return crashRemaining_ == 0;
+}
+
 void VSAFaultInjectingFileSystem::reset() {
   std::lock_guard lock(mutex_);
   rules_.clear();
+  crashRemaining_ = -1;
   counts_.fill(0);
 }
 
@@ -34,6 +45,8 @@ int VSAFaultInjectingFileSystem::totalCalls() const {
 int VSAFaultInjectingFileSystem::injected(Op op) {
   std::lock_guard lock(mutex_);
   ++counts_[static_cast<size_t>(op)];
+  if (crashRemaining_ == 0) return EIO;
+  if (crashRemaining_ > 0) --crashRemaining_;
   for (auto it = rules_.begin(); it != rules_.end(); ++it) {
     if (it->op != op) continue;
     if (it->remaining < 0) return it->error;

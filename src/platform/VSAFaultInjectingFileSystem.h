@@ -5,7 +5,8 @@
 // fails every call of `op`. Call counts per operation let a test enumerate
 // the steps of an operation and fail each in turn. A descriptor-relative call
 // counts as the operation of its path form (statAt as Lstat, unlinkAt as
-// Unlink or Rmdir, ...). Thread-safe.
+// Unlink or Rmdir, ...). crashAfter(n) stops every call after the n-th, for
+// crash-point sweeps. Thread-safe.
 #pragma once
 
 #include <array>
@@ -21,6 +22,11 @@ class VSAFaultInjectingFileSystem : public VSAFileSystem {
 
   void failNth(Op op, int n, int error);
   void failAll(Op op, int error);
+  // A simulated crash: the next `calls` calls of any kind go through, every
+  // later one fails with EIO and changes nothing, as if the process had died
+  // after its `calls`-th file-system call. reset() ends it.
+  void crashAfter(int calls);
+  bool crashed() const;
   void reset();
   int callCount(Op op) const;
   int totalCalls() const;
@@ -80,4 +86,5 @@ class VSAFaultInjectingFileSystem : public VSAFileSystem {
   mutable std::mutex mutex_;
   std::array<int, static_cast<size_t>(Op::Count)> counts_{};
   std::vector<Rule> rules_;
+  int crashRemaining_ = -1;  // -1: no crash planned
 };

@@ -230,6 +230,17 @@ bool VSAFileManager::writeFileAtomicallyAtURL(const std::string& path,
   return false;
 }
 
+int VSAFileManager::removeUnfinishedWritesInDirectoryAtURL(const std::string& directory) {
+  std::vector<VSADirectoryEntry> entries;
+  if (fs_->readDirectory(directory, &entries) != 0) return 0;
+  int removed = 0;
+  for (const auto& entry : entries) {
+    if (entry.type != VSADirectoryEntry::Type::File || entry.name.rfind(".tmp-", 0) != 0) continue;
+    if (fs_->unlink(VSAPathJoin(directory, entry.name)) == 0) ++removed;
+  }
+  return removed;
+}
+
 bool VSAFileManager::copyItemAtURL(const std::string& from, const std::string& to, VSAErrorRef* e) {
   return copyItem(from, to, true, e);
 }

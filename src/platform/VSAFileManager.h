@@ -74,6 +74,9 @@ class VSAFileManager {
   bool writeFileAtomicallyAtURL(const std::string& path, const std::vector<uint8_t>& bytes,
                                 mode_t mode, std::optional<int> protectionClass,
                                 VSAErrorRef* error);
+  // Removes the temporary files that writes interrupted by a crash left in
+  // `directory`; returns how many went.
+  int removeUnfinishedWritesInDirectoryAtURL(const std::string& directory);
   bool copyItemIfExistsAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
   // Recursive, through directory descriptors and on one device; a missing
   // item is success; immutable items are unlocked and removed.

@@ -9,7 +9,7 @@
 #include <future>
 #include <thread>
 
-#include "VSATestTempDir.h"
+#include "VSAContainerTestRoot.h"
 #include "daemon/VSAClientConnection.h"
 #include "operations/VSACommandStageForDelete.h"
 #include "platform/VSAFaultInjectingFileSystem.h"
@@ -20,92 +20,10 @@ using Op = VSAFileSystem::Op;
 
 namespace {
 
-class Lifecycle : public ::testing::Test {
+class Lifecycle : public VSAContainerTestRoot {
  protected:
-  void SetUp() override {
-    root_ = temp_.path();
-    VSAWriteMobileUser(root_);
-    std::ofstream(root_ + "/etc/group") << "mobile:x:501:\nsystemusers:x:600:\n";
-    context_ = std::make_unique<VSADaemonContext>(
-        VSASystemRoot(root_), [this](std::shared_ptr<VSAFileSystem> real) {
-          faults_ = std::make_shared<VSAFaultInjectingFileSystem>(std::move(real));
-          return faults_;
-        });
-    user_ = context_->userIdentityCache->userIdentityForPersonalPersona();
-  }
-
-  std::unique_ptr<VSAClientConnection> connection(const std::string& bundle, bool allowOther,
-                                                  bool unrestricted,
-                                                  std::optional<VSAValue> lookup = std::nullopt) {
-    auto client =
-        std::make_shared<VSAClientIdentity>(bundle, 501, 501, 1234, user_, VSAValue::dictionary(),
-                                            false, std::array<uint8_t, 32>{}, false);
-    return std::make_unique<VSAClientConnection>(*context_, client, true, allowOther, unrestricted,
-                                                 std::move(lookup), std::nullopt,
-                                                 std::make_shared<VSACommandQueue>());
-  }
-  std::unique_ptr<VSAClientConnection> installer() {
-    return connection("com.example.installer", true, true);
-  }
-  VSAContainerIdentityRef identity(const std::string& id, VSAContainerClass c = 2) {
-    return VSAContainerIdentity::containerIdentityWithUserIdentity(user_, id, c, nullptr);
-  }
-  VSAMetadataRef create(VSAClientConnection& c, const std::string& id, VSAResultCode* code,
-                        bool transient = false, VSAContainerClass cls = 2) {
-    *code = VSAResult::kSuccess;
-    return c.createOrLookupContainerWithContainerIdentity(identity(id, cls), true, transient, true,
-                                                          code);
-  }
-  static size_t entries(const std::string& dir) {
-    if (!fs::exists(dir)) return 0;
-    return static_cast<size_t>(std::distance(fs::directory_iterator(dir), {}));
-  }
-  std::string classDirectory(VSAContainerClass c = 2, bool transient = false) {
-    return *context_->globalConfiguration->containerDirectoryURLForUserIdentity(user_, c,
-                                                                                transient);
-  }
-  std::string staging(VSAContainerClass c = 2) {
-    return context_->globalConfiguration->stagingDirectoryURLForUserIdentity(user_, c);
-  }
   void sweepCreation(VSAContainerClass cls);
   int injectedFaults_ = 0;  // by sweepCreation
-  // Runs one stage-for-delete command of the context's environment; its code.
-  VSAResultCode stage(std::vector<VSAContainerIdentityRef> identities) {
-    VSACommandQueue queue;
-    queue.insertCommand(VSACommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
-        context_->stageEnvironment, std::move(identities), true, nullptr));
-    VSAResultCode code = VSAResult::kSuccess;
-    queue.executeAllUntilExhaustedOrError(&code);
-    return code;
-  }
-  // What a container is made of: each item below it, with its type, mode,
-  // owner and protection class (the contents of files differ per container).
-  static std::map<std::string, std::string> shapeOf(const std::string& dir) {
-    std::map<std::string, std::string> shape;
-    for (const auto& entry : fs::recursive_directory_iterator(dir)) {
-      struct stat st;
-      if (::lstat(entry.path().c_str(), &st) != 0) continue;
-      char protection[16] = {};
-      ssize_t size = ::lgetxattr(entry.path().c_str(), kVSAProtectionClassXattr, protection,
-                                 sizeof(protection) - 1);
-      shape[fs::relative(entry.path(), dir).string()] =
-          std::to_string(st.st_mode) + " " + std::to_string(st.st_uid) + ":" +
-          std::to_string(st.st_gid) + " class " + (size > 0 ? protection : "none");
-    }
-    return shape;
-  }
-  VSAResultCode emptyDeathRow() {
-    std::promise<VSAResultCode> done;
-    context_->deathRow->deleteContainersOnDeathRowWithCompletion(
-        [&](VSAResultCode code) { done.set_value(code); });
-    return done.get_future().get();
-  }
-
-  VSATestTempDir temp_{"vessa-lifecycle"};
-  std::string root_;
-  std::shared_ptr<VSAFaultInjectingFileSystem> faults_;
-  std::unique_ptr<VSADaemonContext> context_;
-  VSAUserIdentityRef user_;
 };
 
 TEST_F(Lifecycle, CreatesInPlaceWithMetadataAndSubdirectoriesThenFindsIt) {
