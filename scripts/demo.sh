@@ -53,6 +53,28 @@ step "Its metadata (command 7)"
 ctl "$installer" --root "$root" --json Command=7 Identifier=com.example.demo ContainerClass=2 \
   InfoDictRequested=true
 
+step "An info value in its metadata (commands 5 and 6); an unset key answers 24"
+ctl "$installer" --root "$root" Command=5 Identifier=com.example.demo ContainerClass=2 \
+  Key=com.example.note Value=hello
+ctl "$installer" --root "$root" --json Command=6 Identifier=com.example.demo ContainerClass=2 \
+  Key=com.example.note
+ctl "$installer" --root "$root" Command=6 Identifier=com.example.demo ContainerClass=2 Key=unset
+
+step "Wiping its content (command 12): same path, same UUID, the files are gone"
+echo "secret" > "$path/Documents/diary.txt"
+uuid_of() { "$installer" --root "$root" --json Command=0 Identifier=com.example.demo \
+  ContainerClass=2 | sed -n 's/.*"ReplyUUID": *{"\$data": *"\([^"]*\)".*/\1/p'; }
+before=$(uuid_of)
+echo "before: $(ls "$path/Documents")  UUID $before"
+ctl "$installer" --root "$root" Command=12 Identifier=com.example.demo ContainerClass=2
+after=$(uuid_of)
+echo "after:  Documents holds $(ls -A "$path/Documents" | wc -l) entries  UUID $after"
+if [ -n "$before" ] && [ "$before" = "$after" ]; then
+  echo "(the UUID and the path $(echo "$path" | sed "s|$root|\$ROOT|") are kept)"
+else
+  echo "(the UUID changed: $before -> $after)"
+fi
+
 step "Locking the device, then asking for protection class 1 with retry (command 21)"
 ctl "$installer" --root "$root" --json Command=21 Identifier=com.example.demo ContainerClass=2 \
   DataProtectionClass:i64=3

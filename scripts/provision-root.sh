@@ -64,6 +64,7 @@ cat > "$root/etc/vessad/clients.d/demo-installer.plist" <<PL
   <key>Entitlements</key><dict>
     <key>com.tamsk.private.Vessa.allowed</key><true/>
     <key>com.tamsk.private.Vessa.userManagedAssets</key><true/>
+    <key>com.tamsk.private.Vessa.deleteContainerContent</key><true/>
   </dict>
   <key>Sandboxed</key><false/>
 $user_key

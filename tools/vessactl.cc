@@ -21,39 +21,40 @@
 
 namespace {
 
-const char* kCommandNames[kVSACommandCount] = {"create or look up a container",
-                                               "list containers of a class",
-                                               "replace a container",
-                                               "stage containers for deletion",
-                                               "empty death row",
-                                               "set a metadata info value",
-                                               "read a metadata info value",
-                                               "read a container's metadata",
-                                               "recreate default structure",
-                                               "regenerate directory UUID",
-                                               "delete a container",
-                                               "wipe data content (class 4)",
-                                               "delete data content",
-                                               "group containers with tokens",
-                                               "group container identifiers",
-                                               "path of a system container",
-                                               "group container paths",
-                                               "path of a system group container",
-                                               "record code-signing information",
-                                               "read code-signing information",
-                                               "invalidate apps without bundle container",
-                                               "change data protection class",
-                                               "recreate default structure",
-                                               "disk usage of a container",
-                                               "run the data migration",
-                                               "crash-retry test",
-                                               "stage shared content",
-                                               "retired",
-                                               "user-managed assets path",
-                                               "delete a user-managed asset",
-                                               "run the per-user data migration",
-                                               "set or clear a test lock",
-                                               "persona unique strings"};
+const char* kCommandNames[kVSACommandCount] = {
+    "create or look up a container",
+    "list containers of a class",
+    "replace a container (Old.../New... identity keys)",
+    "stage containers for deletion",
+    "empty death row",
+    "set a metadata info value (Key, Value; none removes)",
+    "read a metadata info value (Key)",
+    "read a container's metadata",
+    "recreate default structure",
+    "regenerate directory UUID",
+    "delete a container",
+    "wipe plug-in data content (class 4)",
+    "wipe a data container's content",
+    "group containers with tokens",
+    "group container identifiers",
+    "path of a system container",
+    "group container paths",
+    "path of a system group container",
+    "record code-signing information",
+    "read code-signing information",
+    "invalidate apps without bundle container",
+    "change data protection class",
+    "recreate default structure",
+    "disk usage of a container",
+    "run the data migration",
+    "crash-retry test",
+    "stage shared content",
+    "retired",
+    "user-managed assets path",
+    "delete a user-managed asset",
+    "run the per-user data migration",
+    "set or clear a test lock",
+    "persona unique strings"};
 
 void usage(FILE* out) {
   std::fprintf(out,
@@ -85,7 +86,11 @@ void usage(FILE* out) {
                  VSACommandTable()[i].handler ? "" : "  (not available yet)");
   std::fprintf(out,
                "\nnotifications    print the notifications the daemon posted, oldest first\n"
-               "\nexample: vessactl --root /tmp/demo Command=0 Identifier=com.example.app "
+               "\nA container is named by Identifier, ContainerClass and, optionally,\n"
+               "PersonaUniqueString and UUID (that very container; without it the live one).\n"
+               "\nexamples: vessactl --root /tmp/demo Command=0 Identifier=com.example.app "
+               "ContainerClass=2\n"
+               "          vessactl --root /tmp/demo Command=12 Identifier=com.example.app "
                "ContainerClass=2\n");
 }
 

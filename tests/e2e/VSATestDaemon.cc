@@ -118,6 +118,13 @@ int VSATestDaemon::stop(std::chrono::seconds timeout) {
   return -1;
 }
 
+void VSATestDaemon::crash() {
+  if (pid_ <= 0) return;
+  kill(pid_, SIGKILL);
+  waitpid(pid_, nullptr, 0);
+  pid_ = -1;
+}
+
 std::optional<VSAValue> VSATestDaemon::request(VSAValue body, std::chrono::milliseconds timeout) {
   VSAIPCClient client;
   if (!client.connect(socketPath(), nullptr)) return std::nullopt;

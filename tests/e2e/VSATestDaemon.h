@@ -51,6 +51,8 @@ class VSATestDaemon {
   bool start(bool waitForSocket = true, std::vector<std::string> extraArgs = {});
   // SIGTERM and wait; returns the exit status (or -1 on a signal/time-out).
   int stop(std::chrono::seconds timeout = std::chrono::seconds(20));
+  // SIGKILL and wait: the daemon dies wherever it is, as in a crash.
+  void crash();
   bool running() const { return pid_ > 0; }
   std::string socketPath() const { return root_ + "/run/vessad/com.tamsk.vessad"; }
 

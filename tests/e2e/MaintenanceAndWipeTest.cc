@@ -1,0 +1,181 @@
+// End to end: info values, default structure, directory UUID, replace and
+// wipe through the real daemon, and a daemon killed inside a wipe.
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <filesystem>
+#include <fstream>
+#include <random>
+#include <thread>
+
+#include "e2e/VSATestDaemon.h"
+
+namespace fs = std::filesystem;
+using namespace std::chrono_literals;
+
+namespace {
+
+const char* kAllowed = "com.tamsk.private.Vessa.allowed";
+
+uint64_t replyError(const std::optional<VSAValue>& reply) {
+  if (!reply || !reply->get("ReplyError")) return 0;
+  return reply->get("ReplyError")->uint64Value().value_or(0);
+}
+
+std::string stringOf(const std::optional<VSAValue>& reply, const char* key) {
+  const VSAValue* v = reply ? reply->get(key) : nullptr;
+  return v && v->isString() ? *v->stringValue() : std::string();
+}
+
+VSAValue request(uint64_t command, const char* id, uint64_t containerClass = 2) {
+  return VSAValue::Dictionary{{"Command", VSAValue(command)},
+                              {"Identifier", VSAValue(id)},
+                              {"ContainerClass", VSAValue(containerClass)}};
+}
+
+VSAValue with(VSAValue body, const char* key, VSAValue value) {
+  body.set(key, std::move(value));
+  return body;
+}
+
+struct Container {
+  std::string path;
+  VSAUUID uuid;
+};
+
+std::optional<Container> lookup(VSATestDaemon& d, const char* id, bool create = false,
+                                uint64_t containerClass = 2) {
+  auto reply = d.request(with(request(0, id, containerClass), "CreateIfNecessary", create));
+  if (replyError(reply) != 1) return std::nullopt;
+  return Container{stringOf(reply, "ReplyPath"), *reply->get("ReplyUUID")->uuidValue()};
+}
+
+size_t entries(const std::string& dir) {
+  if (!fs::exists(dir)) return 0;
+  return static_cast<size_t>(std::distance(fs::directory_iterator(dir), {}));
+}
+
+TEST(DaemonMaintenance, InfoValuesStructureUUIDReplaceAndWipeThroughTheSocket) {
+  VSATestDaemon d;
+  d.registerSelf(
+      "com.example.installer",
+      VSAValue::Dictionary{{kAllowed, VSAValue(true)},
+                           {"com.tamsk.private.Vessa.deleteContainerContent", VSAValue(true)},
+                           {"com.tamsk.private.Vessa.wipeContainer",
+                            VSAValue(VSAValue::Array{VSAValue("com.example.plugin")})}});
+  ASSERT_TRUE(d.start());
+  auto app = lookup(d, "com.example.app", true);
+  ASSERT_TRUE(app);
+
+  // Info values: set, read, unset key, bad key, removal.
+  EXPECT_EQ(replyError(d.request(with(with(request(5, "com.example.app"), "Key", VSAValue("color")),
+                                      "Value", VSAValue("blue")))),
+            1u);
+  auto value = d.request(with(request(6, "com.example.app"), "Key", VSAValue("color")));
+  EXPECT_EQ(stringOf(value, "ReplyInfoValue"), "blue");
+  EXPECT_EQ(replyError(d.request(with(request(6, "com.example.app"), "Key", VSAValue("size")))),
+            24u);
+  EXPECT_EQ(replyError(d.request(with(request(6, "com.example.app"), "Key", VSAValue(int64_t{3})))),
+            38u);
+  EXPECT_EQ(replyError(d.request(with(request(5, "com.example.app"), "Key", VSAValue("color")))),
+            1u);
+  EXPECT_EQ(replyError(d.request(with(request(6, "com.example.app"), "Key", VSAValue("color")))),
+            24u);
+
+  // 8 and 22 make missing default sub-directories again.
+  for (uint64_t command : {8u, 22u}) {
+    fs::remove_all(app->path + "/Library/Caches");
+    EXPECT_EQ(replyError(d.request(request(command, "com.example.app"))), 1u) << command;
+    EXPECT_TRUE(fs::is_directory(app->path + "/Library/Caches")) << command;
+  }
+
+  // 9: a new directory name, the same identity.
+  EXPECT_EQ(replyError(d.request(request(9, "com.example.app"))), 1u);
+  auto renamed = lookup(d, "com.example.app");
+  ASSERT_TRUE(renamed);
+  EXPECT_NE(renamed->path, app->path);
+  EXPECT_EQ(renamed->uuid, app->uuid);
+  EXPECT_FALSE(fs::exists(app->path));
+
+  // 12: the content goes, path and UUID stay.
+  std::ofstream(renamed->path + "/Documents/diary") << "secret";
+  EXPECT_EQ(replyError(d.request(request(12, "com.example.app"))), 1u);
+  auto wiped = lookup(d, "com.example.app");
+  ASSERT_TRUE(wiped);
+  EXPECT_EQ(wiped->path, renamed->path);
+  EXPECT_EQ(wiped->uuid, app->uuid);
+  EXPECT_FALSE(fs::exists(renamed->path + "/Documents/diary"));
+  EXPECT_TRUE(fs::is_directory(renamed->path + "/Documents"));
+
+  // 11: plug-in data, class fixed to 4.
+  auto plugin = lookup(d, "com.example.plugin", true, 4);
+  ASSERT_TRUE(plugin);
+  std::ofstream(plugin->path + "/Documents/cache") << "x";
+  VSAValue wipePlugin = VSAValue::Dictionary{{"Command", VSAValue(11u)},
+                                             {"Identifier", VSAValue("com.example.plugin")}};
+  EXPECT_EQ(replyError(d.request(wipePlugin)), 1u);
+  EXPECT_FALSE(fs::exists(plugin->path + "/Documents/cache"));
+
+  // 2: b takes a's place under its own UUID; a is gone.
+  auto a = lookup(d, "com.example.a", true);
+  auto b = lookup(d, "com.example.b", true);
+  ASSERT_TRUE(a && b);
+  VSAValue replace = VSAValue::Dictionary{{"Command", VSAValue(2u)},
+                                          {"OldIdentifier", VSAValue("com.example.a")},
+                                          {"OldContainerClass", VSAValue(2u)},
+                                          {"OldContainerUUID", VSAValue(a->uuid)},
+                                          {"NewIdentifier", VSAValue("com.example.b")},
+                                          {"NewContainerClass", VSAValue(2u)},
+                                          {"NewContainerUUID", VSAValue(b->uuid)}};
+  EXPECT_EQ(replyError(d.request(replace)), 1u);
+  EXPECT_FALSE(lookup(d, "com.example.a"));
+  auto moved = lookup(d, "com.example.b");
+  ASSERT_TRUE(moved);
+  EXPECT_EQ(fs::path(moved->path).filename().string(), b->uuid.string());
+  EXPECT_EQ(replyError(d.request(replace)), 21u);  // a no longer exists
+  EXPECT_EQ(d.stop(), 0);
+}
+
+// SIGKILL lands at random moments of a stream of wipes until one lands
+// inside a replace (its journal is on disk); every restart must find the
+// container whole at its path with its UUID, and no journal left.
+TEST(DaemonCrash, KilledInsideAWipeRestartsWithTheContainerWhole) {
+  VSATestDaemon d;
+  d.registerSelf(
+      "com.example.installer",
+      VSAValue::Dictionary{{kAllowed, VSAValue(true)},
+                           {"com.tamsk.private.Vessa.deleteContainerContent", VSAValue(true)}});
+  ASSERT_TRUE(d.start());
+  auto app = lookup(d, "com.example.app", true);
+  ASSERT_TRUE(app);
+  const std::string journals = d.path("/private/var/root/Library/Vessa/Replace");
+  const std::string classDir = fs::path(app->path).parent_path().string();
+  std::mt19937 random(42);
+  int killsInsideAReplace = 0, kills = 0;
+  while (killsInsideAReplace == 0 && kills < 60) {
+    std::atomic<bool> stop{false};
+    std::thread wiper([&] {
+      while (!stop && replyError(d.request(request(12, "com.example.app"), 2s)) == 1) {
+      }
+    });
+    std::this_thread::sleep_for(std::chrono::milliseconds(5 + random() % 60));
+    d.crash();
+    ++kills;
+    stop = true;
+    wiper.join();
+    if (entries(journals) > 0) ++killsInsideAReplace;
+    ASSERT_TRUE(d.start());
+    auto found = lookup(d, "com.example.app");
+    ASSERT_TRUE(found) << "after kill " << kills;
+    EXPECT_EQ(found->path, app->path);
+    EXPECT_EQ(found->uuid, app->uuid);
+    EXPECT_EQ(entries(journals), 0u);
+    EXPECT_EQ(entries(classDir), 1u);
+    if (::testing::Test::HasFailure()) break;
+  }
+  std::printf("%d kills, %d inside a replace\n", kills, killsInsideAReplace);
+  EXPECT_GT(killsInsideAReplace, 0);
+  EXPECT_EQ(d.stop(), 0);
+}
+
+}  // namespace
