@@ -1,0 +1,145 @@
+// Per-container maintenance: a new directory UUID, the default structure
+// made again, and info values read and written through the metadata file.
+#include <gtest/gtest.h>
+#include <sys/acl.h>
+
+#include <filesystem>
+#include <fstream>
+
+#include "VSAContainerTestRoot.h"
+
+namespace fs = std::filesystem;
+
+namespace {
+
+class Maintenance : public VSAContainerTestRoot {
+ protected:
+  VSAMetadataRef lookup(const std::string& id, VSAContainerClass c = 2) {
+    VSAResultCode code = VSAResult::kSuccess;
+    return installer()->createOrLookupContainerWithContainerIdentity(identity(id, c), false, false,
+                                                                     true, &code);
+  }
+  VSAResultCode regenerate(const VSAContainerIdentityRef& identity) {
+    VSAResultCode code = VSAResult::kSuccess;
+    installer()->regenerateDirectoryUUIDWithContainerIdentity(identity, &code);
+    return code;
+  }
+  VSAResultCode setInfo(const std::string& id, const std::optional<VSAValue>& value,
+                        const VSAValue& key = VSAValue("k")) {
+    VSAResultCode code = VSAResult::kSuccess;
+    installer()->setInfoValue(value ? &*value : nullptr, &key, identity(id), true, &code);
+    return code;
+  }
+  std::optional<VSAValue> info(const std::string& id, VSAResultCode* code,
+                               const VSAValue& key = VSAValue("k")) {
+    *code = VSAResult::kSuccess;
+    return installer()->infoValueForKey(&key, identity(id), true, code);
+  }
+  static std::string aclOf(const std::string& path) {
+    acl_t acl = acl_get_file(path.c_str(), ACL_TYPE_ACCESS);
+    if (!acl) return "none";
+    char* text = acl_to_text(acl, nullptr);
+    std::string result = text ? text : "";
+    acl_free(text);
+    acl_free(acl);
+    return result;
+  }
+};
+
+TEST_F(Maintenance, RegeneratingRenamesTheDirectoryAndKeepsTheIdentity) {
+  VSAResultCode code;
+  auto made = create(*installer(), "com.example.app", &code);
+  ASSERT_TRUE(made) << code;
+  std::ofstream(made->url() + "/Documents/kept") << "x";
+  std::string first = made->url();
+  for (VSAContainerIdentityRef named : std::vector<VSAContainerIdentityRef>{
+           made->containerIdentity(), identity("com.example.app")}) {
+    ASSERT_EQ(regenerate(named), VSAResult::kSuccess);
+    auto moved = lookup("com.example.app");
+    ASSERT_TRUE(moved);
+    EXPECT_NE(moved->url(), first);
+    EXPECT_EQ(fs::path(moved->url()).parent_path(), fs::path(first).parent_path());
+    EXPECT_EQ(moved->uuid(), made->uuid());
+    EXPECT_TRUE(fs::exists(moved->url() + "/Documents/kept"));
+    EXPECT_FALSE(fs::exists(first));
+    first = moved->url();
+  }
+  EXPECT_EQ(entries(classDirectory()), 1u);
+  // A UUID that names no container, and a well-known system container, whose
+  // directory carries its name rather than a UUID.
+  auto stranger = VSAConcreteContainerIdentity::containerIdentityWithUUID(
+      VSAUUID::random(), user_, "com.example.app", 2, nullptr);
+  EXPECT_EQ(regenerate(stranger), VSAResult::kContainerNotFound);
+  auto wellKnown = create(*installer(), "systemgroup.com.tamsk.launcher", &code, false, 13);
+  ASSERT_TRUE(wellKnown) << code;
+  EXPECT_EQ(regenerate(wellKnown->containerIdentity()), VSAResult::kInvalidArgument);
+  EXPECT_TRUE(fs::is_directory(wellKnown->url()));
+  // A failed rename (48) leaves the container where it was and findable.
+  faults_->failAll(VSAFileSystem::Op::Rename, EIO);
+  EXPECT_EQ(regenerate(made->containerIdentity()), 48u);
+  faults_->reset();
+  EXPECT_EQ(lookup("com.example.app")->url(), first);
+}
+
+TEST_F(Maintenance, RecreatingTheStructureRestoresMissingDirectoriesAndSystemACLs) {
+  VSAResultCode code;
+  auto app = create(*installer(), "com.example.app", &code);
+  auto system = create(*installer(), "systemgroup.com.example.shared", &code, false, 13);
+  ASSERT_TRUE(app && system) << code;
+  const auto appShape = shapeOf(app->url());
+  const auto systemShape = shapeOf(system->url());
+  const std::string libraryACL = aclOf(system->url() + "/Library");
+  fs::remove_all(app->url() + "/Library");
+  fs::create_directories(system->url() + "/Library/Stray");
+  ASSERT_EQ(::chmod((system->url() + "/Library").c_str(), 0777), 0);
+  ASSERT_NE(aclOf(system->url() + "/Library"), libraryACL);
+  for (const auto& m : {app, system})
+    EXPECT_TRUE(
+        installer()->recreateDefaultStructureWithContainerIdentity(m->containerIdentity(), &code))
+        << code;
+  EXPECT_EQ(shapeOf(app->url()), appShape);
+  EXPECT_EQ(aclOf(system->url() + "/Library"), libraryACL);
+  auto systemNow = shapeOf(system->url());
+  EXPECT_EQ(systemNow.erase("Library/Stray"), 1u);  // kept, and given the system ACL
+  EXPECT_EQ(systemNow, systemShape);
+  code = VSAResult::kSuccess;
+  EXPECT_FALSE(installer()->recreateDefaultStructureWithContainerIdentity(
+      identity("com.example.no"), &code));
+  EXPECT_EQ(code, VSAResult::kContainerNotFound);
+}
+
+TEST_F(Maintenance, InfoValuesAreWrittenThroughTheMetadataFileAndRemovable) {
+  VSAResultCode code;
+  auto made = create(*installer(), "com.example.app", &code);
+  ASSERT_TRUE(made) << code;
+  EXPECT_FALSE(info("com.example.app", &code));
+  EXPECT_EQ(code, 24u);
+  EXPECT_EQ(setInfo("com.example.app", VSAValue(VSAValue::Array{VSAValue("a"), VSAValue(2u)})),
+            VSAResult::kSuccess);
+  auto value = info("com.example.app", &code);
+  ASSERT_TRUE(value) << code;
+  EXPECT_EQ(value->arrayValue()->size(), 2u);
+  // On disk, so that a new daemon reads it too; and nothing left in staging.
+  restart();
+  EXPECT_TRUE(info("com.example.app", &code)) << code;
+  EXPECT_EQ(entries(staging(2)), 0u);
+  // Keys must be strings; values must leave a file the daemon can read back.
+  EXPECT_FALSE(info("com.example.app", &code, VSAValue(int64_t{1})));
+  EXPECT_EQ(code, VSAResult::kOutOfRange);
+  EXPECT_EQ(setInfo("com.example.app", VSAValue("v"), VSAValue(true)), VSAResult::kOutOfRange);
+  EXPECT_EQ(setInfo("com.example.app", VSAValue(std::string(kVSAMetadataFileMaxSize, 'x'))),
+            VSAResult::kOutOfRange);
+  EXPECT_TRUE(lookup("com.example.app"));
+  // A failed write changes nothing.
+  faults_->failAll(VSAFileSystem::Op::Rename, EIO);
+  EXPECT_EQ(setInfo("com.example.app", VSAValue("other")), VSAResult::kWriteFailed);
+  faults_->reset();
+  EXPECT_EQ(info("com.example.app", &code)->arrayValue()->size(), 2u);
+  // No value removes the key.
+  EXPECT_EQ(setInfo("com.example.app", std::nullopt), VSAResult::kSuccess);
+  EXPECT_FALSE(info("com.example.app", &code));
+  EXPECT_EQ(code, 24u);
+  EXPECT_EQ(setInfo("com.example.missing", VSAValue("v")), VSAResult::kContainerNotFound);
+}
+
+}  // namespace
