@@ -25,11 +25,6 @@ using namespace std::chrono_literals;
 
 const char* kAllowed = "com.tamsk.private.Vessa.allowed";
 
-uint64_t replyError(const std::optional<VSAValue>& reply) {
-  if (!reply || !reply->get("ReplyError")) return 0;
-  return reply->get("ReplyError")->uint64Value().value_or(0);
-}
-
 // Sends a frame and reads bytes until the reply frame is complete, the peer
 // closes, or two seconds pass. Uses system calls only, so it is safe in a
 // child forked from this multithreaded process.
@@ -144,17 +139,17 @@ TEST(ClientIdentity, ExecingARegisteredExecutableAfterConnectingGainsNothing) {
   ::close(report[0]);
 
   ASSERT_TRUE(before) << "the connecting process is served as itself";
-  EXPECT_EQ(replyError(before), 55u) << "unregistered, it is not entitled";
+  EXPECT_EQ(VSAReplyError(before), 55u) << "unregistered, it is not entitled";
   // After the exec, the connection is dropped: no reply, and above all never
   // the registered client's answer (18).
-  EXPECT_FALSE(after) << "served after exec with ReplyError " << replyError(after);
-  EXPECT_NE(replyError(after), 18u);
+  EXPECT_FALSE(after) << "served after exec with ReplyError " << VSAReplyError(after);
+  EXPECT_NE(VSAReplyError(after), 18u);
 
   // The registered program itself, connecting afresh, is entitled: the
   // check above would have seen the entitlement. (Shown with this test
   // process registered under the same entitlements.)
   d.registerSelf("com.example.self", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
-  EXPECT_EQ(replyError(d.request(VSAValue::Dictionary{{"Command", VSAValue(19u)}})), 18u);
+  EXPECT_EQ(VSAReplyError(d.request(VSAValue::Dictionary{{"Command", VSAValue(19u)}})), 18u);
   EXPECT_EQ(d.stop(), 0);
 }
 

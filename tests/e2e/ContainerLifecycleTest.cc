@@ -21,21 +21,11 @@ namespace {
 
 const char* kAllowed = "com.tamsk.private.Vessa.allowed";
 
-uint64_t replyError(const std::optional<VSAValue>& reply) {
-  if (!reply || !reply->get("ReplyError")) return 0;
-  return reply->get("ReplyError")->uint64Value().value_or(0);
-}
-
 VSAValue createRequest(const char* id, bool create = true, uint64_t containerClass = 2) {
   return VSAValue::Dictionary{{"Command", VSAValue(0u)},
                               {"Identifier", VSAValue(id)},
                               {"ContainerClass", VSAValue(containerClass)},
                               {"CreateIfNecessary", VSAValue(create)}};
-}
-
-std::string stringOf(const std::optional<VSAValue>& reply, const char* key) {
-  const VSAValue* v = reply ? reply->get(key) : nullptr;
-  return v && v->isString() ? *v->stringValue() : std::string();
 }
 
 // Runs this test process in persona `personaID` of the daemon's root.
@@ -70,44 +60,44 @@ TEST(DaemonContainers, CreateLookUpDeleteAndEmptyDeathRow) {
                            {"com.tamsk.private.Vessa.userManagedAssets", VSAValue(true)}});
   ASSERT_TRUE(d.start());
   auto created = d.request(createRequest("com.example.app"));
-  ASSERT_EQ(replyError(created), 1u);
+  ASSERT_EQ(VSAReplyError(created), 1u);
   EXPECT_FALSE(*created->get("ReplyExisted")->boolValue());
-  std::string path = stringOf(created, "ReplyPath");
+  std::string path = VSAReplyString(created, "ReplyPath");
   EXPECT_TRUE(fs::exists(path + "/.com.tamsk.vessa_keeper.metadata.plist"));
   EXPECT_TRUE(created->get("ReplyUUID")->uuidValue());
   auto found = d.request(createRequest("com.example.app", false));
   EXPECT_TRUE(*found->get("ReplyExisted")->boolValue());
-  EXPECT_EQ(stringOf(found, "ReplyPath"), path);
+  EXPECT_EQ(VSAReplyString(found, "ReplyPath"), path);
   // Metadata with and without the info dictionary.
   VSAValue meta = VSAValue::Dictionary{{"Command", VSAValue(7u)},
                                        {"Identifier", VSAValue("com.example.app")},
                                        {"ContainerClass", VSAValue(2u)}};
   auto plain = d.request(meta);
-  EXPECT_EQ(stringOf(plain, "ReplyPath"), path);
+  EXPECT_EQ(VSAReplyString(plain, "ReplyPath"), path);
   EXPECT_FALSE(plain->get("ReplyInfoDictionary"));
   meta.set("InfoDictRequested", VSAValue(true));
   EXPECT_TRUE(d.request(meta)->get("ReplyInfoDictionary"));
   // Listing shows it.
   auto list =
       d.request(VSAValue::Dictionary{{"Command", VSAValue(1u)}, {"ContainerClass", VSAValue(2u)}});
-  ASSERT_EQ(replyError(list), 1u);
+  ASSERT_EQ(VSAReplyError(list), 1u);
   EXPECT_EQ(list->get("ReplyIdsArray")->arrayValue()->size(), 1u);
   // Argument errors.
-  EXPECT_EQ(replyError(d.request(createRequest("com.example.app", false, 14))), 20u);
-  EXPECT_EQ(replyError(d.request(
+  EXPECT_EQ(VSAReplyError(d.request(createRequest("com.example.app", false, 14))), 20u);
+  EXPECT_EQ(VSAReplyError(d.request(
                 VSAValue::Dictionary{{"Command", VSAValue(0u)}, {"ContainerClass", VSAValue(2u)}})),
             18u);
   VSAValue badPersona = createRequest("com.example.app", false);
   badPersona.set("PersonaUniqueString", VSAValue("NO-SUCH-PERSONA"));
-  EXPECT_EQ(replyError(d.request(badPersona)), 76u);
+  EXPECT_EQ(VSAReplyError(d.request(badPersona)), 76u);
   // Delete, then empty death row (command 4 replies from its completion).
   VSAValue del = VSAValue::Dictionary{{"Command", VSAValue(10u)},
                                       {"Identifier", VSAValue("com.example.app")},
                                       {"ContainerClass", VSAValue(2u)}};
-  EXPECT_EQ(replyError(d.request(del)), 1u);
+  EXPECT_EQ(VSAReplyError(d.request(del)), 1u);
   EXPECT_FALSE(fs::exists(path));
-  EXPECT_EQ(replyError(d.request(del)), 21u);
-  EXPECT_EQ(replyError(d.request(VSAValue::Dictionary{{"Command", VSAValue(4u)}})), 1u);
+  EXPECT_EQ(VSAReplyError(d.request(del)), 21u);
+  EXPECT_EQ(VSAReplyError(d.request(VSAValue::Dictionary{{"Command", VSAValue(4u)}})), 1u);
   EXPECT_TRUE(fs::is_empty(d.path("/private/var/root/Library/Caches/com.tamsk.vessad/Dead")) ||
               !fs::exists(d.path("/private/var/root/Library/Caches/com.tamsk.vessad/Dead")));
   EXPECT_EQ(d.stop(), 0);
@@ -151,17 +141,17 @@ TEST(DaemonContainers, SandboxTokensOnlyForEnterpriseContainers) {
   d.registerSelf("com.example.work", VSAValue::Dictionary{{kAllowed, VSAValue(true)}}, true);
   ASSERT_TRUE(d.start());
   auto personal = d.request(createRequest("com.example.work"));
-  ASSERT_EQ(replyError(personal), 1u);
+  ASSERT_EQ(VSAReplyError(personal), 1u);
   EXPECT_FALSE(personal->get("ReplySandboxToken"));
   enterPersona(d, 1001);
   auto enterprise = d.request(createRequest("com.example.work"));
-  ASSERT_EQ(replyError(enterprise), 1u);
-  EXPECT_EQ(stringOf(enterprise, "ReplyPersonaUniqueString"), "WORK-1001");
-  EXPECT_NE(stringOf(enterprise, "ReplyPath"), stringOf(personal, "ReplyPath"));
-  EXPECT_FALSE(stringOf(enterprise, "ReplySandboxToken").empty());
+  ASSERT_EQ(VSAReplyError(enterprise), 1u);
+  EXPECT_EQ(VSAReplyString(enterprise, "ReplyPersonaUniqueString"), "WORK-1001");
+  EXPECT_NE(VSAReplyString(enterprise, "ReplyPath"), VSAReplyString(personal, "ReplyPath"));
+  EXPECT_FALSE(VSAReplyString(enterprise, "ReplySandboxToken").empty());
   // Class 1 (a bundle) gets no token even there.
   auto bundle = d.request(createRequest("com.example.work", true, 1));
-  ASSERT_EQ(replyError(bundle), 1u);
+  ASSERT_EQ(VSAReplyError(bundle), 1u);
   EXPECT_FALSE(bundle->get("ReplySandboxToken"));
   fs::remove(d.path("/run/vessad/process-personas/" + std::to_string(getpid())));
   EXPECT_EQ(d.stop(), 0);
@@ -172,15 +162,15 @@ TEST(DaemonContainers, ProtectionChangeWaitsForTheUnlock) {
   d.registerSelf("com.example.installer", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
   ASSERT_TRUE(d.start());
   auto created = d.request(createRequest("com.example.app"));
-  ASSERT_EQ(replyError(created), 1u);
-  std::string path = stringOf(created, "ReplyPath");
+  ASSERT_EQ(VSAReplyError(created), 1u);
+  std::string path = VSAReplyString(created, "ReplyPath");
   std::ofstream(path + "/Library/notes") << "secret";
   VSAValue protect = VSAValue::Dictionary{{"Command", VSAValue(21u)},
                                           {"Identifier", VSAValue("com.example.app")},
                                           {"ContainerClass", VSAValue(2u)},
                                           {"DataProtectionClass", VSAValue(3)},
                                           {"RetryIfLocked", VSAValue(true)}};
-  ASSERT_EQ(replyError(d.request(protect)), 1u);
+  ASSERT_EQ(VSAReplyError(d.request(protect)), 1u);
   VSALinuxFileSystem files;
   int c = 0;
   ASSERT_EQ(files.getProtectionClass(path + "/Library/notes", &c), 0);
@@ -198,13 +188,13 @@ TEST(DaemonContainers, ProtectionChangeWaitsForTheUnlock) {
       1);
   ASSERT_TRUE(device.setLockState(0));
   auto reply = pending.get();
-  EXPECT_EQ(replyError(reply), 1u);
+  EXPECT_EQ(VSAReplyError(reply), 1u);
   ASSERT_EQ(files.getProtectionClass(path + "/Library/notes", &c), 0);
   EXPECT_EQ(c, 1);
   EXPECT_TRUE(fs::is_empty(d.path("/private/var/root/Library/Vessa/PendingUpdates")));
   // Class 2 is always refused.
   protect.set("DataProtectionClass", VSAValue(2));
-  EXPECT_EQ(replyError(d.request(protect)), 11u);
+  EXPECT_EQ(VSAReplyError(d.request(protect)), 11u);
   EXPECT_EQ(d.stop(), 0);
 }
 

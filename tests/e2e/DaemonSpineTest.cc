@@ -28,11 +28,6 @@ const char* kAllowed = "com.tamsk.private.Vessa.allowed";
 
 VSAValue command(uint64_t n) { return VSAValue::Dictionary{{"Command", VSAValue(n)}}; }
 
-uint64_t replyError(const std::optional<VSAValue>& reply) {
-  if (!reply || !reply->get("ReplyError")) return 0;
-  return reply->get("ReplyError")->uint64Value().value_or(0);
-}
-
 // Starts `d` (with this process registered as a full client) and sends
 // command 27 on `client`; the caller holds initialisation beforehand.
 std::optional<uint64_t> sendWhileInitialisationIsHeld(VSATestDaemon& d, VSAIPCClient& client) {
@@ -49,14 +44,14 @@ TEST(DaemonSpine, InvalidCommandsGetOnlyReplyError49) {
   for (uint64_t n : {33ull, 34ull, 1000ull, 27ull}) {
     auto reply = d.request(command(n));
     ASSERT_TRUE(reply) << n;
-    EXPECT_EQ(replyError(reply), 49u) << n;
+    EXPECT_EQ(VSAReplyError(reply), 49u) << n;
     VSAValue keys = *reply;
     keys.remove("MessageID");
     EXPECT_EQ(keys.dictionaryValue()->size(), 1u) << reply->description();
   }
   // A request without "Command", or with one of the wrong type, is refused too.
-  EXPECT_EQ(replyError(d.request(VSAValue::Dictionary{{"Identifier", VSAValue("x")}})), 49u);
-  EXPECT_EQ(replyError(d.request(VSAValue::Dictionary{{"Command", VSAValue("0")}})), 49u);
+  EXPECT_EQ(VSAReplyError(d.request(VSAValue::Dictionary{{"Identifier", VSAValue("x")}})), 49u);
+  EXPECT_EQ(VSAReplyError(d.request(VSAValue::Dictionary{{"Command", VSAValue("0")}})), 49u);
   EXPECT_EQ(d.stop(), 0);
 }
 
@@ -77,9 +72,9 @@ TEST(DaemonSpine, EntitlementGatesThroughRealClients) {
   std::string why;
   auto parse = [&](const std::string& out) { return VSAJSON::parse(out, &why); };
   EXPECT_EQ(full.status, 1);
-  EXPECT_EQ(replyError(parse(full.output)), 49u) << full.output;
-  EXPECT_EQ(replyError(parse(lookup.output)), 55u) << lookup.output;
-  EXPECT_EQ(replyError(parse(unknown.output)), 55u) << unknown.output;
+  EXPECT_EQ(VSAReplyError(parse(full.output)), 49u) << full.output;
+  EXPECT_EQ(VSAReplyError(parse(lookup.output)), 55u) << lookup.output;
+  EXPECT_EQ(VSAReplyError(parse(unknown.output)), 55u) << unknown.output;
   EXPECT_EQ(unknown.status, 1);
   std::string log = d.daemonOutput();
   EXPECT_NE(log.find("(com.example.lookup) is not entitled"), std::string::npos);
@@ -98,7 +93,7 @@ TEST(DaemonSpine, RequestSentDuringInitialisationIsAnsweredAfterIt) {
   EXPECT_FALSE(client.waitForReply(*id, 500ms, &error)) << "answered before initialisation";
   hold.release();
   auto reply = client.waitForReply(*id, 10s, &error);
-  EXPECT_EQ(replyError(reply), 49u);
+  EXPECT_EQ(VSAReplyError(reply), 49u);
   std::string out = d.daemonOutput();
   EXPECT_LT(out.find("end StartingUp"), out.find("command=27, client="));
   EXPECT_EQ(d.stop(), 0);
@@ -178,7 +173,7 @@ TEST(DaemonSpine, GarbageFramesLeaveTheDaemonServingOthers) {
   EXPECT_TRUE(garbage.waitForClose(5s));
   EXPECT_TRUE(oversized.waitForClose(5s));
   EXPECT_TRUE(array.waitForClose(5s));
-  EXPECT_EQ(replyError(good.sendRequest(command(27), 5s, &error)), 49u);
+  EXPECT_EQ(VSAReplyError(good.sendRequest(command(27), 5s, &error)), 49u);
   std::string out = d.daemonOutput();
   EXPECT_NE(out.find("Dictionary does not have reply context"), std::string::npos);
   EXPECT_NE(out.find("exceeds the limit"), std::string::npos);
@@ -270,7 +265,7 @@ TEST(DaemonShutdown, WaitsForOpenTransactionsBeforeExiting) {
   std::this_thread::sleep_for(300ms);
   // The stop is waiting on the request's transaction; release initialisation.
   hold.release();
-  EXPECT_EQ(replyError(client.waitForReply(*id, 10s, &error)), 49u)
+  EXPECT_EQ(VSAReplyError(client.waitForReply(*id, 10s, &error)), 49u)
       << "the request received before SIGTERM is still answered";
   stopper.join();
   EXPECT_FALSE(std::filesystem::exists(d.socketPath()));
@@ -296,21 +291,21 @@ TEST(DaemonCodeSigning, RecordThenReadThroughTheRealDaemon) {
                                           {"CodeSigningInfo", info},
                                           {"OptionsDictionary", options}});
   };
-  EXPECT_EQ(replyError(record("com.example.app", VSAValue::dictionary())), 1u);
+  EXPECT_EQ(VSAReplyError(record("com.example.app", VSAValue::dictionary())), 1u);
   auto read = d.request(VSAValue::Dictionary{{"Command", VSAValue(19u)},
                                              {"Identifier", VSAValue("com.example.app")}});
   ASSERT_TRUE(read && read->get("ReplyInfoDictionary"));
   EXPECT_EQ(*read->get("ReplyInfoDictionary"), info);
   // A placeholder is recorded but not shown to clients.
-  EXPECT_EQ(replyError(record(
+  EXPECT_EQ(VSAReplyError(record(
                 "com.example.placeholder",
                 VSAValue::Dictionary{{"com.tamsk.Vessa.PlaceholderEntitlements", VSAValue(true)}})),
             1u);
   auto hidden = d.request(VSAValue::Dictionary{
       {"Command", VSAValue(19u)}, {"Identifier", VSAValue("com.example.placeholder")}});
-  EXPECT_EQ(replyError(hidden), 1u);
+  EXPECT_EQ(VSAReplyError(hidden), 1u);
   EXPECT_FALSE(hidden->get("ReplyInfoDictionary"));
-  EXPECT_EQ(replyError(d.request(VSAValue::Dictionary{{"Command", VSAValue(19u)}})), 18u);
+  EXPECT_EQ(VSAReplyError(d.request(VSAValue::Dictionary{{"Command", VSAValue(19u)}})), 18u);
   EXPECT_TRUE(
       std::filesystem::exists(d.path("/private/var/root/Library/Vessa/containers.sqlite3")));
   EXPECT_EQ(d.stop(), 0);
@@ -330,7 +325,7 @@ TEST(DaemonCodeSigning, ASecondDaemonOnTheSameRootStopsAtStartUp) {
   int status = 0;
   waitpid(pid, &status, 0);
   EXPECT_TRUE(WIFSIGNALED(status) || (WIFEXITED(status) && WEXITSTATUS(status) != 0));
-  EXPECT_EQ(replyError(first.request(command(27))), 55u) << "the first daemon still serves";
+  EXPECT_EQ(VSAReplyError(first.request(command(27))), 55u) << "the first daemon still serves";
   EXPECT_EQ(first.stop(), 0);
 }
 

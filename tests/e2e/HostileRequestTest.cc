@@ -16,11 +16,6 @@ namespace {
 
 const char* kAllowed = "com.tamsk.private.Vessa.allowed";
 
-uint64_t replyError(const std::optional<VSAValue>& reply) {
-  if (!reply || !reply->get("ReplyError")) return 0;
-  return reply->get("ReplyError")->uint64Value().value_or(0);
-}
-
 VSAValue request(uint64_t command, const std::string& id, uint64_t containerClass = 2) {
   return VSAValue::Dictionary{{"Command", VSAValue(command)},
                               {"Identifier", VSAValue(id)},
@@ -49,21 +44,21 @@ TEST(HostileRequests, NamesThatCouldLeaveTheirDirectoryAreRefusedWithEleven) {
                                             "/abs", nul, std::string(256, 'a')};
   for (const auto& id : hostile) {
     SCOPED_TRACE(id.size() > 40 ? "long identifier" : id);
-    EXPECT_EQ(replyError(d.request(request(0, id))), 11u);
-    EXPECT_EQ(replyError(d.request(request(10, id))), 11u);
+    EXPECT_EQ(VSAReplyError(d.request(request(0, id))), 11u);
+    EXPECT_EQ(VSAReplyError(d.request(request(10, id))), 11u);
     VSAValue protect = request(21, id);
     protect.set("DataProtectionClass", VSAValue(int64_t{3}));
-    EXPECT_EQ(replyError(d.request(protect)), 11u);
-    EXPECT_EQ(replyError(d.request(request(19, id))), 11u);
+    EXPECT_EQ(VSAReplyError(d.request(protect)), 11u);
+    EXPECT_EQ(VSAReplyError(d.request(request(19, id))), 11u);
     VSAValue record = request(18, id);
     record.set("CodeSigningInfo", VSAValue::dictionary());
-    EXPECT_EQ(replyError(d.request(record)), 11u);
+    EXPECT_EQ(VSAReplyError(d.request(record)), 11u);
   }
   VSAValue persona = request(0, "com.example.app");
   persona.set("PersonaUniqueString", VSAValue("../../x"));
-  EXPECT_EQ(replyError(d.request(persona)), 11u);
+  EXPECT_EQ(VSAReplyError(d.request(persona)), 11u);
   // The longest name allowed still works.
-  EXPECT_EQ(replyError(d.request(request(0, std::string(255, 'b')))), 1u);
+  EXPECT_EQ(VSAReplyError(d.request(request(0, std::string(255, 'b')))), 1u);
   EXPECT_TRUE(fs::exists(d.path("/private/var/victim/file")));
   // Nothing was made for any refused request (only the allowed one's container).
   std::set<std::string> made;
@@ -80,7 +75,7 @@ TEST(HostileRequests, AUsersDirectorySwappedForALinkLeadsNowhere) {
   VSATestDaemon d;
   d.registerSelf("com.example.installer", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
   ASSERT_TRUE(d.start());
-  ASSERT_EQ(replyError(d.request(request(0, "com.example.first"))), 1u);
+  ASSERT_EQ(VSAReplyError(d.request(request(0, "com.example.first"))), 1u);
   // The user owns Containers/: it replaces Data with a link to a root-owned
   // place and waits for the next creation.
   std::string data = d.path("/private/var/mobile/Containers/Data");
@@ -90,7 +85,7 @@ TEST(HostileRequests, AUsersDirectorySwappedForALinkLeadsNowhere) {
   fs::rename(data, data + ".real");
   fs::create_directory_symlink(target, data);
   auto reply = d.request(request(0, "com.example.second"));
-  EXPECT_NE(replyError(reply), 1u);
+  EXPECT_NE(VSAReplyError(reply), 1u);
   EXPECT_TRUE(fs::is_empty(target + "/Application")) << "a container was assembled outside";
   struct stat st;
   ASSERT_EQ(lstat(target.c_str(), &st), 0);
@@ -103,7 +98,7 @@ TEST(HostileRequests, AUsersDirectorySwappedForALinkLeadsNowhere) {
   fs::rename(data + ".real", data);
   if (fs::exists(staging)) fs::rename(staging, staging + ".real");
   fs::create_directory_symlink(target, staging);
-  EXPECT_NE(replyError(d.request(request(0, "com.example.third"))), 1u);
+  EXPECT_NE(VSAReplyError(d.request(request(0, "com.example.third"))), 1u);
   EXPECT_TRUE(fs::is_empty(target + "/Application"));
   EXPECT_EQ(std::distance(fs::directory_iterator(target), {}), 1) << "nothing but what was there";
   EXPECT_EQ(d.stop(), 0);
@@ -115,7 +110,7 @@ TEST(HostileRequests, TheCodeSigningDatabaseIsReadableByRootAlone) {
   ASSERT_TRUE(d.start());
   VSAValue record = request(18, "com.example.app");
   record.set("CodeSigningInfo", VSAValue::dictionary());
-  ASSERT_EQ(replyError(d.request(record)), 1u);
+  ASSERT_EQ(VSAReplyError(d.request(record)), 1u);
   std::string dir = d.path("/private/var/root/Library/Vessa");
   size_t checked = 0;
   for (const auto& e : fs::directory_iterator(dir)) {

@@ -17,16 +17,6 @@ namespace {
 
 const char* kAllowed = "com.tamsk.private.Vessa.allowed";
 
-uint64_t replyError(const std::optional<VSAValue>& reply) {
-  if (!reply || !reply->get("ReplyError")) return 0;
-  return reply->get("ReplyError")->uint64Value().value_or(0);
-}
-
-std::string stringOf(const std::optional<VSAValue>& reply, const char* key) {
-  const VSAValue* v = reply ? reply->get(key) : nullptr;
-  return v && v->isString() ? *v->stringValue() : std::string();
-}
-
 VSAValue request(uint64_t command, const char* id, uint64_t containerClass = 2) {
   return VSAValue::Dictionary{{"Command", VSAValue(command)},
                               {"Identifier", VSAValue(id)},
@@ -46,8 +36,8 @@ struct Container {
 std::optional<Container> lookup(VSATestDaemon& d, const char* id, bool create = false,
                                 uint64_t containerClass = 2) {
   auto reply = d.request(with(request(0, id, containerClass), "CreateIfNecessary", create));
-  if (replyError(reply) != 1) return std::nullopt;
-  return Container{stringOf(reply, "ReplyPath"), *reply->get("ReplyUUID")->uuidValue()};
+  if (VSAReplyError(reply) != 1) return std::nullopt;
+  return Container{VSAReplyString(reply, "ReplyPath"), *reply->get("ReplyUUID")->uuidValue()};
 }
 
 size_t entries(const std::string& dir) {
@@ -68,29 +58,31 @@ TEST(DaemonMaintenance, InfoValuesStructureUUIDReplaceAndWipeThroughTheSocket) {
   ASSERT_TRUE(app);
 
   // Info values: set, read, unset key, bad key, removal.
-  EXPECT_EQ(replyError(d.request(with(with(request(5, "com.example.app"), "Key", VSAValue("color")),
-                                      "Value", VSAValue("blue")))),
-            1u);
+  EXPECT_EQ(
+      VSAReplyError(d.request(with(with(request(5, "com.example.app"), "Key", VSAValue("color")),
+                                   "Value", VSAValue("blue")))),
+      1u);
   auto value = d.request(with(request(6, "com.example.app"), "Key", VSAValue("color")));
-  EXPECT_EQ(stringOf(value, "ReplyInfoValue"), "blue");
-  EXPECT_EQ(replyError(d.request(with(request(6, "com.example.app"), "Key", VSAValue("size")))),
+  EXPECT_EQ(VSAReplyString(value, "ReplyInfoValue"), "blue");
+  EXPECT_EQ(VSAReplyError(d.request(with(request(6, "com.example.app"), "Key", VSAValue("size")))),
             24u);
-  EXPECT_EQ(replyError(d.request(with(request(6, "com.example.app"), "Key", VSAValue(int64_t{3})))),
-            38u);
-  EXPECT_EQ(replyError(d.request(with(request(5, "com.example.app"), "Key", VSAValue("color")))),
+  EXPECT_EQ(
+      VSAReplyError(d.request(with(request(6, "com.example.app"), "Key", VSAValue(int64_t{3})))),
+      38u);
+  EXPECT_EQ(VSAReplyError(d.request(with(request(5, "com.example.app"), "Key", VSAValue("color")))),
             1u);
-  EXPECT_EQ(replyError(d.request(with(request(6, "com.example.app"), "Key", VSAValue("color")))),
+  EXPECT_EQ(VSAReplyError(d.request(with(request(6, "com.example.app"), "Key", VSAValue("color")))),
             24u);
 
   // 8 and 22 make missing default sub-directories again.
   for (uint64_t command : {8u, 22u}) {
     fs::remove_all(app->path + "/Library/Caches");
-    EXPECT_EQ(replyError(d.request(request(command, "com.example.app"))), 1u) << command;
+    EXPECT_EQ(VSAReplyError(d.request(request(command, "com.example.app"))), 1u) << command;
     EXPECT_TRUE(fs::is_directory(app->path + "/Library/Caches")) << command;
   }
 
   // 9: a new directory name, the same identity.
-  EXPECT_EQ(replyError(d.request(request(9, "com.example.app"))), 1u);
+  EXPECT_EQ(VSAReplyError(d.request(request(9, "com.example.app"))), 1u);
   auto renamed = lookup(d, "com.example.app");
   ASSERT_TRUE(renamed);
   EXPECT_NE(renamed->path, app->path);
@@ -99,7 +91,7 @@ TEST(DaemonMaintenance, InfoValuesStructureUUIDReplaceAndWipeThroughTheSocket) {
 
   // 12: the content goes, path and UUID stay.
   std::ofstream(renamed->path + "/Documents/diary") << "secret";
-  EXPECT_EQ(replyError(d.request(request(12, "com.example.app"))), 1u);
+  EXPECT_EQ(VSAReplyError(d.request(request(12, "com.example.app"))), 1u);
   auto wiped = lookup(d, "com.example.app");
   ASSERT_TRUE(wiped);
   EXPECT_EQ(wiped->path, renamed->path);
@@ -113,7 +105,7 @@ TEST(DaemonMaintenance, InfoValuesStructureUUIDReplaceAndWipeThroughTheSocket) {
   std::ofstream(plugin->path + "/Documents/cache") << "x";
   VSAValue wipePlugin = VSAValue::Dictionary{{"Command", VSAValue(11u)},
                                              {"Identifier", VSAValue("com.example.plugin")}};
-  EXPECT_EQ(replyError(d.request(wipePlugin)), 1u);
+  EXPECT_EQ(VSAReplyError(d.request(wipePlugin)), 1u);
   EXPECT_FALSE(fs::exists(plugin->path + "/Documents/cache"));
 
   // 2: b takes a's place under its own UUID; a is gone.
@@ -127,12 +119,12 @@ TEST(DaemonMaintenance, InfoValuesStructureUUIDReplaceAndWipeThroughTheSocket) {
                                           {"NewIdentifier", VSAValue("com.example.b")},
                                           {"NewContainerClass", VSAValue(2u)},
                                           {"NewContainerUUID", VSAValue(b->uuid)}};
-  EXPECT_EQ(replyError(d.request(replace)), 1u);
+  EXPECT_EQ(VSAReplyError(d.request(replace)), 1u);
   EXPECT_FALSE(lookup(d, "com.example.a"));
   auto moved = lookup(d, "com.example.b");
   ASSERT_TRUE(moved);
   EXPECT_EQ(fs::path(moved->path).filename().string(), b->uuid.string());
-  EXPECT_EQ(replyError(d.request(replace)), 21u);  // a no longer exists
+  EXPECT_EQ(VSAReplyError(d.request(replace)), 21u);  // a no longer exists
   EXPECT_EQ(d.stop(), 0);
 }
 
@@ -155,7 +147,7 @@ TEST(DaemonCrash, KilledInsideAWipeRestartsWithTheContainerWhole) {
   while (killsInsideAReplace == 0 && kills < 60) {
     std::atomic<bool> stop{false};
     std::thread wiper([&] {
-      while (!stop && replyError(d.request(request(12, "com.example.app"), 2s)) == 1) {
+      while (!stop && VSAReplyError(d.request(request(12, "com.example.app"), 2s)) == 1) {
       }
     });
     std::this_thread::sleep_for(std::chrono::milliseconds(5 + random() % 60));

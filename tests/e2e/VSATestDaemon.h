@@ -32,6 +32,17 @@ class VSAInitialisationHold {
   std::thread reader_;
 };
 
+// The result code of a reply (0 when there is no reply or no code).
+inline uint64_t VSAReplyError(const std::optional<VSAValue>& reply) {
+  const VSAValue* v = reply ? reply->get("ReplyError") : nullptr;
+  return v ? v->uint64Value().value_or(0) : 0;
+}
+// A string reply key ("" when absent or not a string).
+inline std::string VSAReplyString(const std::optional<VSAValue>& reply, const char* key) {
+  const VSAValue* v = reply ? reply->get(key) : nullptr;
+  return v && v->isString() ? *v->stringValue() : std::string();
+}
+
 class VSATestDaemon {
  public:
   VSATestDaemon();
