@@ -31,6 +31,7 @@ class VSAContainerTestRoot : public ::testing::Test {
 
   // A daemon context on the root, over a fresh fault-injecting file system.
   void startContext() {
+    context_.reset();  // one database opener at a time
     context_ = std::make_unique<VSADaemonContext>(
         VSASystemRoot(root_), [this](std::shared_ptr<VSAFileSystem> real) {
           faults_ = std::make_shared<VSAFaultInjectingFileSystem>(std::move(real));

@@ -5,6 +5,7 @@
 #include "operations/VSAContainerLookup.h"
 #include "operations/VSAContainerMaintenance.h"
 #include "operations/VSAContentWipe.h"
+#include "operations/VSAGroupContainerLookup.h"
 #include "operations/VSAReplaceOperation.h"
 
 VSAClientConnection::VSAClientConnection(VSADaemonContext& context,
@@ -103,6 +104,22 @@ bool VSAClientConnection::setInfoValue(const VSAValue* value, const VSAValue* fo
                                        bool useLocking, VSAResultCode* withError) {
   return VSAContainerMaintenance(services_).setInfoValue(value, forKey, containerIdentity,
                                                          useLocking, withError);
+}
+
+std::optional<std::vector<std::pair<std::string, VSAMetadataRef>>>
+VSAClientConnection::groupContainersForOwnerIdentifier(const std::string& owner,
+                                                       const VSAUserIdentityRef& userIdentity,
+                                                       VSAContainerClass groupContainerClass,
+                                                       VSAResultCode* withError) {
+  return VSAGroupContainerLookup(services_, grants_)
+      .groupContainersForOwnerIdentifier(owner, userIdentity, groupContainerClass, withError);
+}
+
+std::optional<std::vector<std::string>>
+VSAClientConnection::groupContainerIdentifiersForOwnerIdentifier(
+    const std::string& owner, VSAContainerClass groupContainerClass, VSAResultCode* withError) {
+  return VSAGroupContainerLookup(services_, grants_)
+      .groupContainerIdentifiersForOwnerIdentifier(owner, groupContainerClass, withError);
 }
 
 void VSAClientConnection::rebootKeeperSetup() { VSABootKeeper(services_).rebootKeeperSetup(); }

@@ -100,6 +100,15 @@ class VSAClientConnection {
                     const VSAContainerIdentityRef& containerIdentity, bool useLocking,
                     VSAResultCode* withError);
 
+  // Groups of an owner (VSAGroupContainerLookup).
+  std::optional<std::vector<std::pair<std::string, VSAMetadataRef>>>
+  groupContainersForOwnerIdentifier(const std::string& owner,
+                                    const VSAUserIdentityRef& userIdentity,
+                                    VSAContainerClass groupContainerClass,
+                                    VSAResultCode* withError);
+  std::optional<std::vector<std::string>> groupContainerIdentifiersForOwnerIdentifier(
+      const std::string& owner, VSAContainerClass groupContainerClass, VSAResultCode* withError);
+
   // Runs the request's deferred commands; a failing command's code lands in `error`.
   bool completeWithError(VSAResultCode* error);
 

@@ -6,6 +6,7 @@
 
 #include "base/VSAError.h"
 #include "base/VSAValue.h"
+#include "model/VSAMetadata.h"
 #include "platform/VSAIPCMessage.h"
 
 class VSAClientConnection;
@@ -79,3 +80,17 @@ void VSAHandleWipePluginData(const VSAValue& request, VSAValue& reply,
                              VSAClientConnection& connection, VSAResultCode* result);
 void VSAHandleDeleteContainerContent(const VSAValue& request, VSAValue& reply,
                                      VSAClientConnection& connection, VSAResultCode* result);
+
+// Group commands; see VSAHandlersGroups.cc.
+void VSAHandleGroupContainers(const VSAValue& request, VSAValue& reply,
+                              VSAClientConnection& connection, VSAResultCode* result);
+void VSAHandleGroupContainerIdentifiers(const VSAValue& request, VSAValue& reply,
+                                        VSAClientConnection& connection, VSAResultCode* result);
+void VSAHandleGroupContainerPaths(const VSAValue& request, VSAValue& reply,
+                                  VSAClientConnection& connection, VSAResultCode* result);
+
+// Adds a sandbox token for the container to `target` under `key` when the
+// client is sandboxed and the container belongs to an enterprise persona
+// and is of a class with a sandbox extension (2, 4, 6, 10; 7).
+void VSAAddSandboxToken(VSAClientConnection& connection, const VSAMetadata& m, VSAValue& target,
+                        const std::string& key);

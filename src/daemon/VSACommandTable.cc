@@ -25,11 +25,12 @@ const std::array<VSACommandTableEntry, kVSACommandCount> kTable = {{
     {10, VSAHandleDeleteContainer, allowed, R, _, _},  // delete a container
     {11, VSAHandleWipePluginData, kVSAEntitlementWipeContainer, R, _, _},  // wipe data of class 4
     {12, VSAHandleDeleteContainerContent, kVSAEntitlementDeleteContainerContent, R, _,
-     _},                              // delete data content
-    {13, nullptr, allowed, R, O, L},  // group containers with tokens and personas
-    {14, nullptr, allowed, R, _, L},  // group container identifiers of an owner
+     _},                                               // delete data content
+    {13, VSAHandleGroupContainers, allowed, R, O, L},  // group containers with tokens and personas
+    {14, VSAHandleGroupContainerIdentifiers, allowed, R, _,
+     L},  // group container identifiers of an owner
     {15, VSAHandleSystemContainerPath, allowed, R, O, L},       // path of a system container
-    {16, nullptr, allowed, R, O, L},                            // group container paths of an owner
+    {16, VSAHandleGroupContainerPaths, allowed, R, O, L},       // group container paths of an owner
     {17, VSAHandleSystemGroupContainerPath, allowed, R, O, L},  // path of a system group container
     {18, VSAHandleRecordCodeSigningInfo, allowed, R, _, _},     // record code-signing information
     {19, VSAHandleReadCodeSigningInfo, allowed, R, _, _},       // read code-signing information

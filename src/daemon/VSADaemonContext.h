@@ -15,6 +15,7 @@
 
 #include "base/VSAWorkQueue.h"
 #include "codesigning/VSACodeSigningMapping.h"
+#include "codesigning/VSAGroupManager.h"
 #include "codesigning/VSAWhitelist.h"
 #include "dataprotection/VSADataProtectionManager.h"
 #include "model/VSAContainerCache.h"
@@ -117,6 +118,9 @@ struct VSADaemonContext {
       return m ? m->entitlementsForIdentifier(id) : std::nullopt;
     };
     dataProtectionManager = std::make_shared<VSADataProtectionManager>(protection);
+    groupManager =
+        std::make_shared<VSAGroupManager>(userIdentityCache, codeSigningMapping, containerCache,
+                                          globalConfiguration, stageEnvironment);
     buildOperationServices(mapping);
   }
 
@@ -148,6 +152,15 @@ struct VSADaemonContext {
                                                                         VSAErrorRef* error) {
       auto m = mapping.lock();
       return m && m->invalidateCodeSigningInfoForIdentifierAndItsChildren(id, error);
+    };
+    std::weak_ptr<VSAGroupManager> groups = groupManager;
+    s->groupContainerIdentifiersForOwner =
+        [groups](const std::string& owner, VSAContainerClass c,
+                 VSAResultCode* error) -> std::optional<std::vector<std::string>> {
+      auto g = groups.lock();
+      if (!g) return std::nullopt;
+      VSAValue ownerValue(owner);
+      return g->groupContainerIdentifiersForOwnerIdentifier(&ownerValue, c, true, error);
     };
     std::weak_ptr<VSADataProtectionManager> protection = dataProtectionManager;
     s->intendedDataProtectionClass = [protection](const std::string& id) -> int32_t {
@@ -181,6 +194,7 @@ struct VSADaemonContext {
   std::shared_ptr<VSAContainerCache> containerCache;
   std::shared_ptr<VSAApplicationTerminationService> terminationService;  // may be null
   std::shared_ptr<VSADataProtectionManager> dataProtectionManager;
+  std::shared_ptr<VSAGroupManager> groupManager;  // the default group manager
   std::shared_ptr<VSAStageForDeleteEnvironment> stageEnvironment;
   std::shared_ptr<VSAOperationServices> operationServices;
 

@@ -11,6 +11,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "base/VSAError.h"
 #include "model/VSAContainerCache.h"
@@ -45,6 +46,11 @@ struct VSAOperationServices {
   // Code signing: forget the cached information of an identifier and its children.
   std::function<bool(const std::string& identifier, VSAErrorRef* error)>
       invalidateCodeSigningInfoForIdentifierAndItsChildren;
+  // Groups: the group identifiers an owner identifier is entitled to, for a
+  // group container class (7 or 13); nothing (and the code) on failure.
+  std::function<std::optional<std::vector<std::string>>(
+      const std::string& owner, VSAContainerClass groupClass, VSAResultCode* error)>
+      groupContainerIdentifiersForOwner;
   // Data protection: the class an identifier's entitlements ask for.
   std::function<int32_t(const std::string& identifier)> intendedDataProtectionClass;
   // Data protection: restart the changes persisted before the last stop.

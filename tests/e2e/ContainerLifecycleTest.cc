@@ -157,6 +157,51 @@ TEST(DaemonContainers, SandboxTokensOnlyForEnterpriseContainers) {
   EXPECT_EQ(d.stop(), 0);
 }
 
+TEST(DaemonContainers, GroupContainersOfAnOwnerCarryTokensOnlyInEnterprisePersonas) {
+  VSATestDaemon d;
+  writePersonas(d, "com.example.work");
+  d.registerSelf("com.example.work",
+                 VSAValue::Dictionary{{kAllowed, VSAValue(true)},
+                                      {"com.tamsk.security.application-groups",
+                                       VSAValue(VSAValue::Array{VSAValue("group.example.work")})}},
+                 true);
+  ASSERT_TRUE(d.start());
+  VSAValue groups = VSAValue::Dictionary{{"Command", VSAValue(13u)},
+                                         {"Identifier", VSAValue("com.example.work")},
+                                         {"ContainerClass", VSAValue(7u)}};
+  auto dict = [](const std::optional<VSAValue>& reply, const char* key, const char* id) {
+    const VSAValue* d = reply ? reply->get(key) : nullptr;
+    const VSAValue* v = d ? d->get(id) : nullptr;
+    return v && v->isString() ? *v->stringValue() : std::string();
+  };
+  auto ids = d.request(VSAValue::Dictionary{{"Command", VSAValue(14u)},
+                                            {"Identifier", VSAValue("com.example.work")},
+                                            {"ContainerClass", VSAValue(7u)}});
+  ASSERT_EQ(VSAReplyError(ids), 1u);
+  ASSERT_EQ(ids->get("ReplyGroupIdentifiersArray")->arrayValue()->size(), 1u);
+  auto personal = d.request(groups);
+  ASSERT_EQ(VSAReplyError(personal), 1u);
+  std::string personalPath = dict(personal, "ReplyGroupContainerDict", "group.example.work");
+  EXPECT_TRUE(fs::is_directory(personalPath));
+  EXPECT_EQ(dict(personal, "ReplySandboxTokenDict", "group.example.work"), "");
+  EXPECT_EQ(dict(personal, "ReplyPersonaUniqueStringDict", "group.example.work"), "PERSONAL-1000");
+  enterPersona(d, 1001);
+  auto work = d.request(groups);
+  ASSERT_EQ(VSAReplyError(work), 1u);
+  EXPECT_NE(dict(work, "ReplyGroupContainerDict", "group.example.work"), personalPath);
+  EXPECT_FALSE(dict(work, "ReplySandboxTokenDict", "group.example.work").empty());
+  EXPECT_EQ(dict(work, "ReplyPersonaUniqueStringDict", "group.example.work"), "WORK-1001");
+  VSAValue paths = groups;
+  paths.set("Command", VSAValue(16u));
+  auto pathsOnly = d.request(paths);
+  ASSERT_EQ(VSAReplyError(pathsOnly), 1u);
+  EXPECT_EQ(dict(pathsOnly, "ReplyGroupContainerDict", "group.example.work"),
+            dict(work, "ReplyGroupContainerDict", "group.example.work"));
+  EXPECT_FALSE(pathsOnly->get("ReplySandboxTokenDict"));
+  fs::remove(d.path("/run/vessad/process-personas/" + std::to_string(getpid())));
+  EXPECT_EQ(d.stop(), 0);
+}
+
 TEST(DaemonContainers, ProtectionChangeWaitsForTheUnlock) {
   VSATestDaemon d;
   d.registerSelf("com.example.installer", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
