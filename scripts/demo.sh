@@ -75,6 +75,32 @@ else
   echo "(the UUID changed: $before -> $after)"
 fi
 
+step "Two apps share a group container (commands 18 and 16)"
+cat > "$root/tmp/shared.json" <<'JSON'
+{"Command": 18, "OptionsDictionary": {},
+ "CodeSigningInfo": {"com.tamsk.Vessa.Entitlements":
+                       {"com.tamsk.security.application-groups": ["group.com.example.shared"]}}}
+JSON
+cat > "$root/tmp/alone.json" <<'JSON'
+{"Command": 18, "OptionsDictionary": {}, "CodeSigningInfo": {"com.tamsk.Vessa.Entitlements": {}}}
+JSON
+ctl "$installer" --root "$root" --file "$root/tmp/shared.json" Identifier=com.example.second
+ctl "$installer" --root "$root" --json Command=16 Identifier=com.example.demo ContainerClass=7
+group=$("$installer" --root "$root" --json Command=16 Identifier=com.example.second \
+  ContainerClass=7 | sed -n 's/.*"group.com.example.shared": *"\([^"]*\)".*/\1/p')
+step "The first app drops the group: one reference is left, the container stays"
+ctl "$installer" --root "$root" --file "$root/tmp/alone.json" Identifier=com.example.demo
+[ -d "$group" ] && echo "group container still at $(echo "$group" | sed "s|$root|\$ROOT|")"
+step "The second app drops it too: the last reference went, the container is staged for deletion"
+ctl "$installer" --root "$root" --file "$root/tmp/alone.json" Identifier=com.example.second
+if [ -d "$group" ]; then echo "group container still there (unexpected)"; else
+  echo "group container gone from its place; death row:"
+  ls -A "$root/private/var/root/Library/Caches/com.tamsk.vessad/Dead" | sed 's/^/  /'
+fi
+echo "the daemon's log, at the first drop (once per user with a home):"
+grep -o 'ID: group.com.example.shared is [0-9]*' "$root/vessad.out" |
+  sed 's/ID: \(.*\) is \([0-9]*\)/  \1 kept: reference count \2/' || true
+
 step "Locking the device, then asking for protection class 1 with retry (command 21)"
 ctl "$installer" --root "$root" --json Command=21 Identifier=com.example.demo ContainerClass=2 \
   DataProtectionClass:i64=3
