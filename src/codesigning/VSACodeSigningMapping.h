@@ -9,6 +9,7 @@
 // `_onQueue_` methods assert that they run on it.
 #pragma once
 
+#include <functional>
 #include <map>
 #include <memory>
 #include <optional>
@@ -119,6 +120,13 @@ class VSACodeSigningMapping {
                                                     VSAErrorRef* error);
   std::optional<VSAValue> _onQueue_entitlementsForIdentifier(const std::string& identifier);
   std::optional<VSAReferenceCounts> _onQueue_copyReferenceCountSetOfType(int groupType);
+  // Hands `block` every entry's group list, read with `key` or, when that
+  // gives nothing or an empty list, with `fallBackKey`. False when the
+  // enumeration failed (logged).
+  bool _onQueue_iterateGroupIdsWithKey(
+      const char* key, const char* fallBackKey,
+      const std::function<void(const std::string&, const std::optional<std::vector<std::string>>&)>&
+          block);
   void _onQueue_handleChangeFromOldGroupContainerIds(
       const std::optional<std::vector<std::string>>& oldIds,
       const std::optional<std::vector<std::string>>& newIds, int groupType,

@@ -76,29 +76,44 @@ std::optional<std::vector<std::string>> VSACodeSigningMapping::systemGroupIdenti
   return systemGroupIds(id, e ? &*e : nullptr, true);
 }
 
+bool VSACodeSigningMapping::_onQueue_iterateGroupIdsWithKey(
+    const char* key, const char* fallBackKey,
+    const std::function<void(const std::string&, const std::optional<std::vector<std::string>>&)>&
+        block) {
+  VSACheckOnQueue(*queue_, __func__);
+  VSAErrorRef error = codeSigningMappingDB_->enumerateIdentifiersAndCodeSigningInfoUsingBlock(
+      [&](const std::string& identifier, const VSACodeSigningEntry& entry) {
+        const VSAValue* e = entry.codeSigningInfo().get(kVSAEntitlementsKey);
+        auto ids = copyApplicationGroupEntitlementForIdentifier(identifier, e, key);
+        if (fallBackKey && (!ids || ids->empty()))
+          ids = copyApplicationGroupEntitlementForIdentifier(identifier, e, fallBackKey);
+        block(identifier, ids);
+      });
+  if (!error) return true;
+  logMapping(kVSALogError, "Failed to enumerate code signing info: %@", error);
+  return false;
+}
+
 std::optional<VSAReferenceCounts> VSACodeSigningMapping::_onQueue_copyReferenceCountSetOfType(
     int type) {
-  VSACheckOnQueue(*queue_, __func__);
   const char* key =
       type == kVSAGroupTypeSystem ? kVSAEntitlementSystemGroups : kVSAEntitlementApplicationGroups;
   const char* fallback =
       type == kVSAGroupTypeSystem ? kVSAEntitlementSystemGroupContainers : nullptr;
   VSAReferenceCounts counts;
-  VSAErrorRef error = codeSigningMappingDB_->enumerateIdentifiersAndCodeSigningInfoUsingBlock(
-      [&](const std::string& identifier, const VSACodeSigningEntry& entry) {
-        const VSAValue* e = entry.codeSigningInfo().get(kVSAEntitlementsKey);
-        auto ids = copyApplicationGroupEntitlementForIdentifier(identifier, e, key);
-        if (fallback && (!ids || ids->empty()))
-          ids = copyApplicationGroupEntitlementForIdentifier(identifier, e, fallback);
+  bool ok = _onQueue_iterateGroupIdsWithKey(
+      key, fallback,
+      [&](const std::string& identifier, const std::optional<std::vector<std::string>>& ids) {
         if (!ids) return;
-        for (const auto& id : *ids) ++counts[id];
-        logMapping(kVSALogDebug, "Entitlements for identifier %@ references container IDs: %zu",
-                   identifier, ids->size());
+        std::string list;
+        for (const auto& id : *ids) {
+          ++counts[id];
+          list += (list.empty() ? "" : ", ") + id;
+        }
+        logMapping(kVSALogDebug, "Entitlements for identifier %@ references container IDs: %@",
+                   identifier, "(" + list + ")");
       });
-  if (error) {
-    logMapping(kVSALogError, "Failed to enumerate code signing info: %@", error);
-    return std::nullopt;
-  }
+  if (!ok) return std::nullopt;
   return counts;
 }
 
@@ -148,6 +163,9 @@ void VSACodeSigningMapping::_onQueue_removeGroupContainersIfNeededforUserIdentit
   for (const auto& id : ids) {
     int& count = counts[id];
     if (count == 1) {
+      logMapping(kVSALogNotice,
+                 "Reference count for user: %@, ID: %@ is 1: removing its group container", user,
+                 id);
       VSAResultCode code = VSAResult::kSuccess;
       auto identity = VSAContainerIdentity::containerIdentityWithUserIdentity(
           user, id, groupContainerClass, &code);
