@@ -101,6 +101,13 @@ echo "the daemon's log, at the first drop (once per user with a home):"
 grep -o 'ID: group.com.example.shared is [0-9]*' "$root/vessad.out" |
   sed 's/ID: \(.*\) is \([0-9]*\)/  \1 kept: reference count \2/' || true
 
+step "The kernel launches the app: its containers through the upcall (vessa-upcall, the kernel bridge)"
+ctl "$root/usr/bin/vessa-upcall" --root "$root" --signing-id com.example.demo --uid 501 \
+  --persona 1000 --group group.com.example.launch --system-group systemgroup.com.example.demo
+echo "(a process that is not the kernel bridge is answered with return code 5:)"
+cp "$build/vessa-upcall" "$root/tmp/not-the-kernel"
+ctl "$root/tmp/not-the-kernel" --root "$root" --signing-id com.example.demo --uid 501 --persona 1000
+
 step "Locking the device, then asking for protection class 1 with retry (command 21)"
 ctl "$installer" --root "$root" --json Command=21 Identifier=com.example.demo ContainerClass=2 \
   DataProtectionClass:i64=3

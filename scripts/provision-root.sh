@@ -8,6 +8,8 @@
 #   full-client entitlement) in /usr/bin and /etc/vessad/clients.d; with
 #   CLIENT_USER (a uid or a user name of the device), its entry carries "User"
 #   and it is recognised only when run as that user
+# - when vessa-upcall sits beside VESSACTL: a copy in /usr/bin registered as
+#   the kernel bridge ("KernelBridge"), the kernel's side of the upcall
 # The executable and its directory are root-owned and writable by root only:
 # the daemon refuses registry entries whose program others could rewrite.
 set -euo pipefail
@@ -70,5 +72,20 @@ cat > "$root/etc/vessad/clients.d/demo-installer.plist" <<PL
 $user_key
 </dict></plist>
 PL
+upcall="$(dirname "$vessactl")/vessa-upcall"
+if [[ -x $upcall ]]; then
+  cp "$upcall" "$root/usr/bin/vessa-upcall"
+  chown 0:0 "$root/usr/bin/vessa-upcall"
+  chmod 0755 "$root/usr/bin/vessa-upcall"
+  cat > "$root/etc/vessad/clients.d/kernel-bridge.plist" <<PL
+<?xml version="1.0" encoding="UTF-8"?>
+<plist version="1.0"><dict>
+  <key>Executable</key><string>/usr/bin/vessa-upcall</string>
+  <key>SigningIdentifier</key><string>com.tamsk.kernel.sandbox-bridge</string>
+  <key>Entitlements</key><dict/>
+  <key>KernelBridge</key><true/>
+</dict></plist>
+PL
+fi
 chmod 0644 "$root"/etc/vessad/clients.d/*.plist
 echo "provisioned $root"

@@ -1,7 +1,7 @@
 #!/usr/bin/env bash
 # Runs vessa-bench against a fresh demo device: provisions a system root,
-# registers vessa-bench as a full client, starts vessad, runs the three
-# scenarios and stops the daemon.
+# registers vessa-bench as a full client and as the kernel bridge, starts
+# vessad, runs the four scenarios and stops the daemon.
 #   scripts/vessa-bench.sh [DIR]
 set -euo pipefail
 cd "$(dirname "$0")/.."
@@ -14,6 +14,7 @@ cat > "$root/etc/vessad/clients.d/vessa-bench.plist" <<'PL'
   <key>Executable</key><string>/usr/bin/vessa-bench</string>
   <key>SigningIdentifier</key><string>com.tamsk.vessa-bench</string>
   <key>Entitlements</key><dict><key>com.tamsk.private.Vessa.allowed</key><true/></dict>
+  <key>KernelBridge</key><true/>
 </dict></plist>
 PL
 chmod 0644 "$root/etc/vessad/clients.d/vessa-bench.plist"
@@ -27,4 +28,7 @@ echo "== Creation, one client"
 echo
 echo "== Mixed requests, 16 clients"
 "$bench" --root "$root" --mode mixed --clients 16 --requests "${MIXED:-10000}"
+echo
+echo "== Kernel upcall: an app with a data and two group containers, one client"
+"$bench" --root "$root" --mode upcall --clients 1 --requests "${UPCALLS:-20000}"
 device_stop_daemon

@@ -6,9 +6,14 @@
 //    against the daemon, and print requests/s and p50/p99 latency as ratios;
 //  - the create mode compares container creation through the daemon with a
 //    raw loop doing the same directory work (staging directory,
-//    sub-directories, metadata file, rename) in the same root.
+//    sub-directories, metadata file, rename) in the same root;
+//  - the upcall mode launches one app (data container and two group
+//    containers, made by the first launch) over the upcall's seqpacket
+//    socket, against an echo server on the daemon's own upcall transport
+//    that sends the same packet and a memfd of the same bytes back.
 // The client must be registered in the root's client registry with the
-// "com.tamsk.private.Vessa.allowed" entitlement (scripts/vessa-bench.sh does it).
+// "com.tamsk.private.Vessa.allowed" entitlement, and as the kernel bridge for
+// the upcall mode (scripts/vessa-bench.sh does both).
 #include <unistd.h>
 
 #include <algorithm>
@@ -29,6 +34,10 @@
 #include "platform/VSAIPCListener.h"
 #include "platform/VSALinuxFileSystem.h"
 #include "platform/VSATransactions.h"
+#include "platform/VSAUpcallClient.h"
+#include "platform/VSAUpcallListener.h"
+#include "upcall/VSAUpcallMessage.h"
+#include "upcall/VSAUpcallPayload.h"
 
 namespace {
 using Clock = std::chrono::steady_clock;
@@ -124,6 +133,82 @@ Result runEcho(const Options& o, const RequestMaker& make) {
   return r;
 }
 
+// Launches of one app over an upcall socket; `served` checks that every
+// reply is a served one with the success flag set.
+Result runUpcalls(const std::string& socket, const Options& o, bool served) {
+  VSAUpcallProcess p;
+  p.codeSignatureID = "com.bench.upcall";
+  p.uid = 501;
+  p.personaID = 1000;
+  p.sandboxType = 0;
+  p.groups = {"group.bench.one", "group.bench.two"};
+  const std::vector<uint8_t> memory = *p.pack();
+  VSAUpcallRequest request;
+  request.descriptorSize = request.requestSize = static_cast<uint32_t>(memory.size());
+  const std::vector<uint8_t> message = request.bytes();
+  std::vector<std::thread> threads;
+  std::vector<Result> parts(o.clients);
+  std::atomic<int> ready{0};
+  std::atomic<bool> go{false};
+  for (int c = 0; c < o.clients; ++c)
+    threads.emplace_back([&, c] {
+      VSAUpcallClient client;
+      std::string why;
+      bool connected = client.connect(socket, &why);
+      ++ready;
+      while (!go) std::this_thread::yield();
+      Result& r = parts[c];
+      std::vector<uint8_t> reply;
+      std::optional<std::vector<uint8_t>> replyMemory;
+      for (int i = 0; i < o.requests; ++i) {
+        auto start = Clock::now();
+        bool ok = connected && client.call(message, &memory, &reply, &replyMemory, &why);
+        r.latenciesUs.push_back(
+            std::chrono::duration<double, std::micro>(Clock::now() - start).count());
+        if (!ok) {
+          ++r.lost;
+          continue;
+        }
+        auto parsed = VSAUpcallReply::parse(reply.data(), reply.size());
+        if (!parsed || !replyMemory) {
+          ++r.errors;
+        } else if (served) {
+          auto answer = VSAUpcallAnswer::read(*replyMemory);
+          if (parsed->returnCode != 0 || answer.success != 1u || answer.groups.size() != 2)
+            ++r.errors;
+        }
+      }
+    });
+  while (ready < o.clients) std::this_thread::yield();
+  auto start = Clock::now();
+  go = true;
+  for (auto& t : threads) t.join();
+  Result all;
+  all.seconds = std::chrono::duration<double>(Clock::now() - start).count();
+  for (auto& part : parts) {
+    all.latenciesUs.insert(all.latenciesUs.end(), part.latenciesUs.begin(), part.latenciesUs.end());
+    all.errors += part.errors;
+    all.lost += part.lost;
+  }
+  return all;
+}
+
+// The daemon's upcall transport, sending every packet and its memory back.
+Result runUpcallEcho(const Options& o) {
+  std::string dir = "/tmp/vessa-bench-upcall-XXXXXX";
+  if (!mkdtemp(dir.data())) return {};
+  VSAUpcallListener echo(dir + "/echo", nullptr, 1u << 20);
+  VSAErrorRef error;
+  if (!echo.start([](VSAUpcallPacket packet,
+                     VSAUpcallListener::Reply reply) { reply(packet.message, &packet.memory); },
+                  &error))
+    return {};
+  Result r = runUpcalls(dir + "/echo", o, false);
+  echo.stop();
+  std::filesystem::remove_all(dir);
+  return r;
+}
+
 void printPair(const char* what, const Result& base, const Result& daemon) {
   std::printf("%-10s %12s %12s %12s\n", what, "requests/s", "p50 (us)", "p99 (us)");
   std::printf("%-10s %12.0f %12.1f %12.1f\n", "baseline", base.perSecond(), base.percentile(0.5),
@@ -181,12 +266,14 @@ double rawCreateLoop(const std::string& root, int count) {
 
 int usage() {
   std::fprintf(stderr,
-               "usage: vessa-bench --root DIR [--mode lookup|create|mixed] [--clients N] "
+               "usage: vessa-bench --root DIR [--mode lookup|create|mixed|upcall] [--clients N] "
                "[--requests N]\n"
                "  lookup: command 0 on one existing container (baseline: echo server)\n"
                "  create: command 0 creating a new container per request (baseline: raw\n"
                "          directory work in the same root)\n"
                "  mixed:  look up, create, read metadata, list, delete (baseline: echo)\n"
+               "  upcall: the kernel's upcall for an app with a data and two group\n"
+               "          containers (baseline: echo on the same seqpacket transport)\n"
                "  --requests counts requests per client (default 10000)\n");
   return 2;
 }
@@ -239,6 +326,32 @@ int main(int argc, char** argv) {
         "%.1f us)\nratio: %.2fx\nerrors: %ld, lost replies: %ld\n",
         raw, daemon.perSecond(), daemon.percentile(0.5), daemon.percentile(0.99),
         daemon.perSecond() / raw, daemon.errors, daemon.lost);
+    return 0;
+  }
+  if (o.mode == "upcall") {
+    std::string upcallSocket = o.root + "/run/vessad/com.tamsk.vessad.upcall";
+    Options one = o;
+    one.clients = one.requests = 1;
+    // An installed app: its code signing says it has a class-2 data container.
+    runClients(
+        socket, one,
+        [](int, int) {
+          return VSAValue(VSAValue::Dictionary{
+              {"Command", VSAValue(18u)},
+              {"Identifier", VSAValue("com.bench.upcall")},
+              {"CodeSigningInfo",
+               VSAValue::Dictionary{{"com.tamsk.Vessa.Entitlements", VSAValue::dictionary()}}},
+              {"OptionsDictionary",
+               VSAValue::Dictionary{{"com.tamsk.Vessa.DataContainerClass", VSAValue(2u)}}}});
+        },
+        true);
+    Result warm = runUpcalls(upcallSocket, one, true);  // makes the containers
+    if (warm.errors || warm.lost) {
+      std::fprintf(stderr, "vessa-bench: the first upcall failed (is this a kernel bridge?)\n");
+      return 1;
+    }
+    Result base = runUpcallEcho(o);
+    printPair("upcall", base, runUpcalls(upcallSocket, o, true));
     return 0;
   }
   if (o.mode == "mixed") {

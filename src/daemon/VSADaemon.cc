@@ -78,6 +78,8 @@ void VSADaemon::drainForShutdown() {
   {
     std::lock_guard lock(listenerMutex_);
     if (listener_) listener_->stopAccepting();
+    // Upcalls already received are still answered: their replies hold the peer.
+    if (upcall_) upcall_->stop();
   }
   if (!context_->transactions->waitUntilIdle(std::chrono::seconds(30)))
     VSALogIn(VSALogCategory::Daemon, kVSALogError, "main",
@@ -140,7 +142,11 @@ void VSADaemon::initialize() {
     VSASignpostInterval interval(VSALogCategory::Startup, "BootSetup");
     sharedConnection_->keeperSetup();
   }
-  // The kernel upcall interface is started here once its server exists.
+  {
+    std::lock_guard lock(listenerMutex_);
+    upcall_ = std::make_unique<VSAKernelUpcall>(*context_, context_->listenerQueue);
+    if (!upcall_->start()) VSACrash("Failed to initialize kernel upcall interface.");
+  }
 
   int status = context_->lockState->registerForLockStatus(
       VSAWorkQueue::main(), [monitor = lockStateMonitor_.get()] { monitor->lockStateDidChange(); });

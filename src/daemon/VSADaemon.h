@@ -19,6 +19,7 @@
 
 #include "daemon/VSAClientConnection.h"
 #include "daemon/VSADaemonContext.h"
+#include "daemon/VSAKernelUpcall.h"
 #include "daemon/VSALockStateMonitor.h"
 #include "daemon/VSARelayDispatcher.h"
 #include "platform/VSAIPCListener.h"
@@ -54,6 +55,7 @@ class VSADaemon {
   std::unique_ptr<VSAIPCListener> listener_;
   std::unique_ptr<VSAClientConnection> sharedConnection_;
   std::unique_ptr<VSALockStateMonitor> lockStateMonitor_;
+  std::unique_ptr<VSAKernelUpcall> upcall_;
   std::string firstBootSemaphore_;
   std::atomic<bool> stopping_{false};
   // Guards listener_: a signal may ask for a stop while run() sets it up.

@@ -22,6 +22,7 @@ class VSASystemRoot {
   std::string runDirectory() const { return resolve("/run/vessad"); }
   std::string configDirectory() const { return resolve("/etc/vessad"); }
   std::string socketPath() const { return resolve("/run/vessad/com.tamsk.vessad"); }
+  std::string upcallSocketPath() const { return resolve("/run/vessad/com.tamsk.vessad.upcall"); }
   // A short stable hash of the root path, for host-global names.
   std::string hashSuffix() const;
 

@@ -49,12 +49,13 @@ std::string VSATestDaemon::firstBootSemaphore() const {
 
 namespace {
 void writeEntry(const std::string& file, const std::string& exe, const std::string& sid,
-                const VSAValue& entitlements, bool sandboxed) {
+                const VSAValue& entitlements, bool sandboxed, bool kernelBridge = false) {
   VSAErrorRef error;
   VSA_writeToURL(VSAValue::Dictionary{{"Executable", VSAValue(exe)},
                                       {"SigningIdentifier", VSAValue(sid)},
                                       {"Entitlements", entitlements},
-                                      {"Sandboxed", VSAValue(sandboxed)}},
+                                      {"Sandboxed", VSAValue(sandboxed)},
+                                      {"KernelBridge", VSAValue(kernelBridge)}},
                  file, 0, &error);
 }
 }  // namespace
@@ -67,6 +68,19 @@ void VSATestDaemon::registerSelf(const std::string& signingIdentifier, const VSA
   fs::create_symlink(std::string(buf, n), root_ + "/usr/bin/e2e-tests");
   writeEntry(root_ + "/etc/vessad/clients.d/e2e-tests.plist", "/usr/bin/e2e-tests",
              signingIdentifier, entitlements, sandboxed);
+}
+
+void VSATestDaemon::registerUpcallTool() {
+  fs::copy_file(VESSA_UPCALL_PATH, root_ + "/usr/bin/vessa-upcall",
+                fs::copy_options::overwrite_existing);
+  writeEntry(root_ + "/etc/vessad/clients.d/vessa-upcall.plist", "/usr/bin/vessa-upcall",
+             "com.tamsk.kernel.sandbox-bridge", VSAValue::dictionary(), false, true);
+}
+
+void VSATestDaemon::registerSelfAsKernelBridge() {
+  registerSelf("com.tamsk.kernel.sandbox-bridge", VSAValue::dictionary());
+  writeEntry(root_ + "/etc/vessad/clients.d/e2e-tests.plist", "/usr/bin/e2e-tests",
+             "com.tamsk.kernel.sandbox-bridge", VSAValue::dictionary(), false, true);
 }
 
 void VSATestDaemon::registerVessactl(const std::string& name, const std::string& signingIdentifier,
@@ -93,7 +107,12 @@ bool VSATestDaemon::start(bool waitForSocket, std::vector<std::string> extraArgs
   if (!waitForSocket) return pid_ > 0;
   for (int i = 0; i < 1000; ++i) {
     VSAIPCClient probe;
-    if (probe.connect(socketPath(), nullptr)) return true;
+    if (probe.connect(socketPath(), nullptr)) {
+      // The upcall socket comes at the end of initialisation, after boot setup.
+      for (int j = 0; j < 1000 && !fs::exists(upcallSocketPath()); ++j)
+        std::this_thread::sleep_for(10ms);
+      return true;
+    }
     std::this_thread::sleep_for(10ms);
   }
   return false;

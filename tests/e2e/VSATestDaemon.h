@@ -54,6 +54,12 @@ class VSATestDaemon {
   // Registers this test process under `signingIdentifier`.
   void registerSelf(const std::string& signingIdentifier, const VSAValue& entitlements,
                     bool sandboxed = false);
+  // Registers this test process as the kernel's side of the upcall.
+  void registerSelfAsKernelBridge();
+  // Installs vessa-upcall as /usr/bin/vessa-upcall, registered as the kernel
+  // bridge; run it with vessactl("vessa-upcall", args).
+  void registerUpcallTool();
+  std::string upcallSocketPath() const { return root_ + "/run/vessad/com.tamsk.vessad.upcall"; }
   // Registers a copy of vessactl installed as /usr/bin/<name>.
   void registerVessactl(const std::string& name, const std::string& signingIdentifier,
                         const VSAValue& entitlements);

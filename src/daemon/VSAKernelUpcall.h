@@ -1,0 +1,35 @@
+// The kernel upcall service of one daemon: the seqpacket listener, the
+// serial queue "com.tamsk.vessad.upcall" (targeted at the listener queue,
+// so upcalls and client requests never overlap) and the server, whose
+// containers are made by a privileged client connection marked as the
+// kernel and granted other-identifier, group and unrestricted lookups.
+// Started once by the daemon's initialisation; stopped with the daemon.
+#pragma once
+
+#include <memory>
+
+#include "base/VSAError.h"
+#include "base/VSAWorkQueue.h"
+#include "daemon/VSADaemonContext.h"
+#include "platform/VSAUpcallListener.h"
+#include "upcall/VSAUpcallServer.h"
+
+class VSAKernelUpcall {
+ public:
+  VSAKernelUpcall(VSADaemonContext& context, VSAWorkQueue::Ref targetQueue);
+  ~VSAKernelUpcall();
+  // Binds the socket and starts serving; false (logged) when it cannot.
+  bool start();
+  void stop();
+
+  // The environment the server works in, over `context` (tests use it directly).
+  static VSAUpcallEnvironment environmentFor(VSADaemonContext& context);
+
+ private:
+  void serve(VSAUpcallPacket packet, const VSAUpcallListener::Reply& reply);
+
+  VSADaemonContext& context_;
+  VSAWorkQueue::Ref queue_;
+  VSAUpcallServer server_;
+  std::unique_ptr<VSAUpcallListener> listener_;
+};

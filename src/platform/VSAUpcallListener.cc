@@ -1,0 +1,226 @@
+#include "platform/VSAUpcallListener.h"
+
+#include <fcntl.h>
+#include <poll.h>
+#include <sys/eventfd.h>
+#include <sys/mman.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <cstring>
+
+#include "base/VSALog.h"
+
+namespace {
+const char* const kOrigin = "VSAUpcallListener";
+// Requests are 56 bytes; a few more are read so that a longer packet is seen as such.
+constexpr size_t kReceiveSize = 256;
+constexpr int kMaxDescriptors = 4;
+
+bool readAll(int fd, std::vector<uint8_t>* out, uint64_t size) {
+  out->resize(size);
+  size_t done = 0;
+  while (done < size) {
+    ssize_t n = ::pread(fd, out->data() + done, size - done, static_cast<off_t>(done));
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) return false;
+    done += static_cast<size_t>(n);
+  }
+  return true;
+}
+
+// A sealed memfd holding `bytes`, or -1.
+int sealedMemfd(const std::vector<uint8_t>& bytes) {
+  int fd = ::memfd_create("vessa-upcall-reply", MFD_CLOEXEC | MFD_ALLOW_SEALING);
+  if (fd < 0) return -1;
+  size_t done = 0;
+  while (done < bytes.size()) {
+    ssize_t n = ::write(fd, bytes.data() + done, bytes.size() - done);
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) {
+      ::close(fd);
+      return -1;
+    }
+    done += static_cast<size_t>(n);
+  }
+  ::fcntl(fd, F_ADD_SEALS, F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE | F_SEAL_SEAL);
+  return fd;
+}
+}  // namespace
+
+struct VSAUpcallListener::Peer {
+  int fd = -1;
+  std::array<uint8_t, 32> token{};
+  bool kernel = false;
+  std::atomic<int> inFlight{0};
+  ~Peer() {
+    if (fd >= 0) ::close(fd);
+  }
+  void send(const std::vector<uint8_t>& message, const std::vector<uint8_t>* memory) {
+    int memfd = memory ? sealedMemfd(*memory) : -1;
+    if (memory && memfd < 0)
+      VSALogIn(VSALogCategory::Upcall, kVSALogError, kOrigin,
+               "Could not copy the reply buffer (%zu bytes): %s", memory->size(),
+               std::strerror(errno));
+    struct iovec iov = {const_cast<uint8_t*>(message.data()), message.size()};
+    alignas(struct cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
+    struct msghdr msg = {};
+    msg.msg_iov = &iov;
+    msg.msg_iovlen = 1;
+    if (memfd >= 0) {
+      msg.msg_control = control;
+      msg.msg_controllen = sizeof control;
+      struct cmsghdr* c = CMSG_FIRSTHDR(&msg);
+      c->cmsg_level = SOL_SOCKET;
+      c->cmsg_type = SCM_RIGHTS;
+      c->cmsg_len = CMSG_LEN(sizeof(int));
+      std::memcpy(CMSG_DATA(c), &memfd, sizeof(int));
+    }
+    if (::sendmsg(fd, &msg, MSG_NOSIGNAL | MSG_DONTWAIT) < 0)
+      VSALogIn(VSALogCategory::Upcall, kVSALogError, kOrigin, "Could not send an upcall reply: %s",
+               std::strerror(errno));
+    if (memfd >= 0) ::close(memfd);
+    --inFlight;
+  }
+};
+
+VSAUpcallListener::VSAUpcallListener(std::string socketPath,
+                                     std::shared_ptr<VSAClientRegistry> registry,
+                                     uint64_t maxMemorySize)
+    : path_(std::move(socketPath)), registry_(std::move(registry)), maxMemorySize_(maxMemorySize) {}
+
+VSAUpcallListener::~VSAUpcallListener() { stop(); }
+
+bool VSAUpcallListener::start(Handler handler, VSAErrorRef* error) {
+  handler_ = std::move(handler);
+  struct sockaddr_un addr = {};
+  addr.sun_family = AF_UNIX;
+  if (path_.size() >= sizeof addr.sun_path) {
+    VSASetError(error, VSA_POSIX_ERROR(ENAMETOOLONG, path_));
+    return false;
+  }
+  std::memcpy(addr.sun_path, path_.c_str(), path_.size() + 1);
+  listenFd_ = ::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
+  wakeFd_ = ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
+  ::unlink(path_.c_str());
+  mode_t old = ::umask(0177);  // the socket is born 0600
+  int rc = listenFd_ < 0 || wakeFd_ < 0
+               ? -1
+               : ::bind(listenFd_, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr);
+  ::umask(old);
+  if (rc != 0 || ::listen(listenFd_, 16) != 0) {
+    int e = errno;
+    VSASetError(error, VSA_POSIX_ERROR(e, VSAFormat("binding %@", path_)));
+    stop();
+    return false;
+  }
+  thread_ = std::thread([this] { run(); });
+  return true;
+}
+
+void VSAUpcallListener::stop() {
+  stopping_ = true;
+  if (wakeFd_ >= 0) {
+    uint64_t one = 1;
+    [[maybe_unused]] ssize_t n = ::write(wakeFd_, &one, sizeof one);
+  }
+  if (thread_.joinable()) thread_.join();
+  peers_.clear();
+  if (listenFd_ >= 0) ::close(listenFd_);
+  if (wakeFd_ >= 0) ::close(wakeFd_);
+  listenFd_ = wakeFd_ = -1;
+}
+
+void VSAUpcallListener::run() {
+  while (!stopping_) {
+    std::vector<struct pollfd> fds = {{wakeFd_, POLLIN, 0}, {listenFd_, POLLIN, 0}};
+    std::vector<std::shared_ptr<Peer>> polled;
+    for (const auto& p : peers_) {
+      if (p->inFlight >= kMaxInFlight) continue;
+      fds.push_back({p->fd, POLLIN, 0});
+      polled.push_back(p);
+    }
+    // A full peer is looked at again soon, when its replies have gone out.
+    int n = ::poll(fds.data(), fds.size(), polled.size() < peers_.size() ? 10 : -1);
+    if (n < 0 && errno != EINTR) break;
+    if (stopping_) break;
+    if (fds[1].revents & POLLIN) acceptPeer();
+    for (size_t i = 0; i < polled.size(); ++i) {
+      if (!fds[i + 2].revents) continue;
+      if (!receive(polled[i])) std::erase(peers_, polled[i]);  // replies still queued keep it alive
+    }
+  }
+}
+
+void VSAUpcallListener::acceptPeer() {
+  int fd = ::accept4(listenFd_, nullptr, nullptr, SOCK_CLOEXEC);
+  if (fd < 0) return;
+  auto peer = std::make_shared<Peer>();
+  peer->fd = fd;
+  auto token = VSAAuditToken::fromSocket(fd);
+  if (!token || peers_.size() >= kMaxPeers) {
+    VSALogIn(VSALogCategory::Upcall, kVSALogError, kOrigin, "Refusing an upcall peer (%zu open)",
+             peers_.size());
+    return;  // the peer's destructor closes it
+  }
+  auto entry = registry_ ? registry_->entryForAuditToken(*token) : std::nullopt;
+  peer->kernel = entry && entry->kernelBridge;
+  VSAAuditToken sender = *token;
+  if (peer->kernel) sender.pid = 0;  // the kernel's messages carry pid 0
+  peer->token = sender.bytes();
+  VSALogIn(VSALogCategory::Upcall, kVSALogDebug, kOrigin, "Upcall peer %@ (kernel: %d)",
+           token->description(), peer->kernel);
+  peers_.push_back(std::move(peer));
+}
+
+bool VSAUpcallListener::receive(const std::shared_ptr<Peer>& peer) {
+  VSAUpcallPacket packet;
+  packet.message.resize(kReceiveSize);
+  struct iovec iov = {packet.message.data(), packet.message.size()};
+  alignas(struct cmsghdr) char control[CMSG_SPACE(sizeof(int) * kMaxDescriptors)] = {};
+  struct msghdr msg = {};
+  msg.msg_iov = &iov;
+  msg.msg_iovlen = 1;
+  msg.msg_control = control;
+  msg.msg_controllen = sizeof control;
+  ssize_t n = ::recvmsg(peer->fd, &msg, MSG_CMSG_CLOEXEC | MSG_DONTWAIT);
+  if (n < 0 && (errno == EAGAIN || errno == EINTR)) return true;
+  std::vector<int> received;
+  for (struct cmsghdr* c = CMSG_FIRSTHDR(&msg); c; c = CMSG_NXTHDR(&msg, c)) {
+    if (c->cmsg_level != SOL_SOCKET || c->cmsg_type != SCM_RIGHTS) continue;
+    size_t count = (c->cmsg_len - CMSG_LEN(0)) / sizeof(int);
+    for (size_t i = 0; i < count; ++i) {
+      int fd;
+      std::memcpy(&fd, CMSG_DATA(c) + i * sizeof(int), sizeof fd);
+      received.push_back(fd);
+    }
+  }
+  if (n <= 0) {
+    for (int fd : received) ::close(fd);
+    return false;
+  }
+  packet.message.resize(static_cast<size_t>(n) + ((msg.msg_flags & MSG_TRUNC) ? 1 : 0));
+  packet.malformedDescriptors = received.size() > 1 || (msg.msg_flags & MSG_CTRUNC);
+  if (received.size() == 1) {
+    struct stat st;
+    if (::fstat(received[0], &st) != 0 || !S_ISREG(st.st_mode)) {
+      packet.malformedDescriptors = true;
+    } else {
+      packet.memorySize = static_cast<uint64_t>(st.st_size);
+      if (*packet.memorySize <= maxMemorySize_ &&
+          !readAll(received[0], &packet.memory, *packet.memorySize))
+        packet.malformedDescriptors = true;
+    }
+  }
+  for (int fd : received) ::close(fd);
+  packet.auditToken = peer->token;
+  packet.fromKernel = peer->kernel;
+  ++peer->inFlight;
+  handler_(std::move(packet),
+           [peer](const std::vector<uint8_t>& message, const std::vector<uint8_t>* memory) {
+             peer->send(message, memory);
+           });
+  return true;
+}

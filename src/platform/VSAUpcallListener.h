@@ -1,0 +1,74 @@
+// The kernel upcall's transport: a Unix SOCK_SEQPACKET socket
+// (`<root>/run/vessad/com.tamsk.vessad.upcall`, mode 0600). Each packet is
+// one request message; its out-of-line memory arrives as one memfd in
+// SCM_RIGHTS. The reply is one packet, with the reply memory as a sealed
+// memfd when there is any.
+//
+// An I/O thread accepts peers and receives packets. Each peer's identity is
+// fixed when it connects (SO_PEERCRED and its start time); a peer whose
+// client-registry entry says "KernelBridge" is the kernel, and its audit
+// token carries pid 0. The memfd is read into memory (at most
+// `maxMemorySize` bytes; a larger one is reported by size only) and closed;
+// extra descriptors make the packet malformed. The handler gets each packet
+// on the I/O thread and answers later, from any thread, through the reply
+// function it is given. Bounded: at most `kMaxPeers` connections, and a
+// peer with `kMaxInFlight` unanswered packets is not read until answered.
+#pragma once
+
+#include <atomic>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "base/VSAError.h"
+#include "platform/VSAAuditToken.h"
+#include "platform/VSAClientRegistry.h"
+
+struct VSAUpcallPacket {
+  std::vector<uint8_t> message;        // the packet's bytes (longer than expected: truncated)
+  std::optional<uint64_t> memorySize;  // the memfd's size, when one came
+  std::vector<uint8_t> memory;         // its bytes, when not larger than the limit
+  bool malformedDescriptors = false;   // several descriptors, or not a regular file
+  std::array<uint8_t, 32> auditToken{};
+  bool fromKernel = false;
+};
+
+class VSAUpcallListener {
+ public:
+  using Reply =
+      std::function<void(const std::vector<uint8_t>& message, const std::vector<uint8_t>* memory)>;
+  using Handler = std::function<void(VSAUpcallPacket packet, Reply reply)>;
+  static constexpr size_t kMaxPeers = 32;
+  static constexpr int kMaxInFlight = 16;
+
+  VSAUpcallListener(std::string socketPath, std::shared_ptr<VSAClientRegistry> registry,
+                    uint64_t maxMemorySize);
+  ~VSAUpcallListener();
+  VSAUpcallListener(const VSAUpcallListener&) = delete;
+  VSAUpcallListener& operator=(const VSAUpcallListener&) = delete;
+
+  // Binds the socket and starts the I/O thread.
+  bool start(Handler handler, VSAErrorRef* error);
+  void stop();
+  const std::string& socketPath() const { return path_; }
+
+ private:
+  struct Peer;
+  void run();
+  void acceptPeer();
+  bool receive(const std::shared_ptr<Peer>& peer);
+
+  std::string path_;
+  std::shared_ptr<VSAClientRegistry> registry_;
+  uint64_t maxMemorySize_;
+  Handler handler_;
+  int listenFd_ = -1;
+  int wakeFd_ = -1;
+  std::atomic<bool> stopping_{false};
+  std::thread thread_;
+  std::vector<std::shared_ptr<Peer>> peers_;
+};
