@@ -1,11 +1,13 @@
 #!/usr/bin/env bash
 # Builds the libFuzzer targets with clang-14 (ASan+UBSan) and runs one.
-#   scripts/fuzz.sh [TARGET] [SECONDS]     TARGET: frame (default), paths, metadata or plist;
-#                                          default 60 s
+#   scripts/fuzz.sh [TARGET] [SECONDS]     TARGET: frame (default), paths, metadata, plist,
+#                                          packbuff or upcall; default 60 s
 #     frame     the socket's frame stream and binary property lists
 #     paths     safe path resolution below a container
 #     metadata  a container's metadata file, read and validated
 #     plist     the property-list decoder's byte budget and nesting bound
+#     packbuff  a peer's pack-buffer storage: every reader, the dump, re-packing
+#     upcall    whole upcall messages and their buffers, served by the upcall server
 set -euo pipefail
 cd "$(dirname "$0")/.."
 scripts/setup.sh
