@@ -10,6 +10,8 @@
 #include <cerrno>
 #include <cstring>
 
+#include "platform/VSADescriptorPassing.h"
+
 namespace {
 bool fail(std::string* why, const std::string& what) {
   if (why) *why = what + ": " + std::strerror(errno);
@@ -40,31 +42,9 @@ bool VSAUpcallClient::call(const std::vector<uint8_t>& message, const std::vecto
                            std::vector<uint8_t>* reply,
                            std::optional<std::vector<uint8_t>>* replyMemory, std::string* why,
                            int timeoutMilliseconds) {
-  int memfd = -1;
-  if (memory) {
-    memfd = ::memfd_create("vessa-upcall-request", MFD_CLOEXEC);
-    if (memfd < 0) return fail(why, "memfd_create");
-    if (!memory->empty() &&
-        ::write(memfd, memory->data(), memory->size()) != static_cast<ssize_t>(memory->size())) {
-      ::close(memfd);
-      return fail(why, "write");
-    }
-  }
-  struct iovec iov = {const_cast<uint8_t*>(message.data()), message.size()};
-  alignas(struct cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
-  struct msghdr msg = {};
-  msg.msg_iov = &iov;
-  msg.msg_iovlen = 1;
-  if (memfd >= 0) {
-    msg.msg_control = control;
-    msg.msg_controllen = sizeof control;
-    struct cmsghdr* c = CMSG_FIRSTHDR(&msg);
-    c->cmsg_level = SOL_SOCKET;
-    c->cmsg_type = SCM_RIGHTS;
-    c->cmsg_len = CMSG_LEN(sizeof(int));
-    std::memcpy(CMSG_DATA(c), &memfd, sizeof(int));
-  }
-  ssize_t sent = ::sendmsg(fd_, &msg, MSG_NOSIGNAL);
+  int memfd = memory ? VSAMemfdWithBytes("vessa-upcall-request", *memory, false) : -1;
+  if (memory && memfd < 0) return fail(why, "memfd");
+  ssize_t sent = VSASendWithDescriptor(fd_, message, memfd, 0);
   if (memfd >= 0) ::close(memfd);
   if (sent < 0) return fail(why, "sendmsg");
 
@@ -88,21 +68,15 @@ bool VSAUpcallClient::call(const std::vector<uint8_t>& message, const std::vecto
   }
   reply->resize(static_cast<size_t>(n));
   replyMemory->reset();
-  for (struct cmsghdr* c = CMSG_FIRSTHDR(&r); c; c = CMSG_NXTHDR(&r, c)) {
-    if (c->cmsg_level != SOL_SOCKET || c->cmsg_type != SCM_RIGHTS) continue;
-    size_t count = (c->cmsg_len - CMSG_LEN(0)) / sizeof(int);
-    for (size_t i = 0; i < count; ++i) {
-      int fd;
-      std::memcpy(&fd, CMSG_DATA(c) + i * sizeof(int), sizeof fd);
-      struct stat st;
-      if (!*replyMemory && ::fstat(fd, &st) == 0) {
-        std::vector<uint8_t> bytes(static_cast<size_t>(st.st_size));
-        if (bytes.empty() ||
-            ::pread(fd, bytes.data(), bytes.size(), 0) == static_cast<ssize_t>(bytes.size()))
-          *replyMemory = std::move(bytes);
-      }
-      ::close(fd);
+  for (int fd : VSAReceivedDescriptors(r)) {
+    struct stat st;
+    if (!*replyMemory && ::fstat(fd, &st) == 0) {
+      std::vector<uint8_t> bytes(static_cast<size_t>(st.st_size));
+      if (bytes.empty() ||
+          ::pread(fd, bytes.data(), bytes.size(), 0) == static_cast<ssize_t>(bytes.size()))
+        *replyMemory = std::move(bytes);
     }
+    ::close(fd);
   }
   return true;
 }

@@ -12,6 +12,7 @@
 #include <cstring>
 
 #include "base/VSALog.h"
+#include "platform/VSADescriptorPassing.h"
 
 namespace {
 const char* const kOrigin = "VSAUpcallListener";
@@ -31,23 +32,6 @@ bool readAll(int fd, std::vector<uint8_t>* out, uint64_t size) {
   return true;
 }
 
-// A sealed memfd holding `bytes`, or -1.
-int sealedMemfd(const std::vector<uint8_t>& bytes) {
-  int fd = ::memfd_create("vessa-upcall-reply", MFD_CLOEXEC | MFD_ALLOW_SEALING);
-  if (fd < 0) return -1;
-  size_t done = 0;
-  while (done < bytes.size()) {
-    ssize_t n = ::write(fd, bytes.data() + done, bytes.size() - done);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) {
-      ::close(fd);
-      return -1;
-    }
-    done += static_cast<size_t>(n);
-  }
-  ::fcntl(fd, F_ADD_SEALS, F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE | F_SEAL_SEAL);
-  return fd;
-}
 }  // namespace
 
 struct VSAUpcallListener::Peer {
@@ -59,26 +43,12 @@ struct VSAUpcallListener::Peer {
     if (fd >= 0) ::close(fd);
   }
   void send(const std::vector<uint8_t>& message, const std::vector<uint8_t>* memory) {
-    int memfd = memory ? sealedMemfd(*memory) : -1;
+    int memfd = memory ? VSAMemfdWithBytes("vessa-upcall-reply", *memory, true) : -1;
     if (memory && memfd < 0)
       VSALogIn(VSALogCategory::Upcall, kVSALogError, kOrigin,
                "Could not copy the reply buffer (%zu bytes): %s", memory->size(),
                std::strerror(errno));
-    struct iovec iov = {const_cast<uint8_t*>(message.data()), message.size()};
-    alignas(struct cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
-    struct msghdr msg = {};
-    msg.msg_iov = &iov;
-    msg.msg_iovlen = 1;
-    if (memfd >= 0) {
-      msg.msg_control = control;
-      msg.msg_controllen = sizeof control;
-      struct cmsghdr* c = CMSG_FIRSTHDR(&msg);
-      c->cmsg_level = SOL_SOCKET;
-      c->cmsg_type = SCM_RIGHTS;
-      c->cmsg_len = CMSG_LEN(sizeof(int));
-      std::memcpy(CMSG_DATA(c), &memfd, sizeof(int));
-    }
-    if (::sendmsg(fd, &msg, MSG_NOSIGNAL | MSG_DONTWAIT) < 0)
+    if (VSASendWithDescriptor(fd, message, memfd, MSG_DONTWAIT) < 0)
       VSALogIn(VSALogCategory::Upcall, kVSALogError, kOrigin, "Could not send an upcall reply: %s",
                std::strerror(errno));
     if (memfd >= 0) ::close(memfd);
@@ -187,16 +157,7 @@ bool VSAUpcallListener::receive(const std::shared_ptr<Peer>& peer) {
   msg.msg_controllen = sizeof control;
   ssize_t n = ::recvmsg(peer->fd, &msg, MSG_CMSG_CLOEXEC | MSG_DONTWAIT);
   if (n < 0 && (errno == EAGAIN || errno == EINTR)) return true;
-  std::vector<int> received;
-  for (struct cmsghdr* c = CMSG_FIRSTHDR(&msg); c; c = CMSG_NXTHDR(&msg, c)) {
-    if (c->cmsg_level != SOL_SOCKET || c->cmsg_type != SCM_RIGHTS) continue;
-    size_t count = (c->cmsg_len - CMSG_LEN(0)) / sizeof(int);
-    for (size_t i = 0; i < count; ++i) {
-      int fd;
-      std::memcpy(&fd, CMSG_DATA(c) + i * sizeof(int), sizeof fd);
-      received.push_back(fd);
-    }
-  }
+  std::vector<int> received = VSAReceivedDescriptors(msg);
   if (n <= 0) {
     for (int fd : received) ::close(fd);
     return false;
