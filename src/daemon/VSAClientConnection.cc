@@ -60,6 +60,11 @@ VSAMetadataRef VSAClientConnection::metadataWithContainerIdentity(
   return VSAContainerLookup(services_, grants_).metadataWithContainerIdentity(identity, withError);
 }
 
+std::optional<uint64_t> VSAClientConnection::diskUsageWithContainerIdentity(
+    const VSAContainerIdentityRef& identity, VSAResultCode* withError) {
+  return VSAContainerLookup(services_, grants_).diskUsageWithContainerIdentity(identity, withError);
+}
+
 void VSAClientConnection::deleteContainerWithContainerIdentity(
     const VSAContainerIdentityRef& identity, bool transient, VSAResultCode* withError) {
   VSAContainerDeletion(services_, grants_, *commandQueue_)

@@ -76,6 +76,8 @@ class VSAClientConnection {
                                                                  VSAResultCode* withError);
   VSAMetadataRef metadataWithContainerIdentity(const VSAContainerIdentityRef& identity,
                                                VSAResultCode* withError);
+  std::optional<uint64_t> diskUsageWithContainerIdentity(const VSAContainerIdentityRef& identity,
+                                                         VSAResultCode* withError);
 
   // Deletion (VSAContainerDeletion): queues the staging for request completion.
   void deleteContainerWithContainerIdentity(const VSAContainerIdentityRef& identity, bool transient,

@@ -58,6 +58,8 @@ void VSAHandleDeleteDeathRow(const VSAValue& request, VSAValue& reply,
                              VSAClientConnection& connection, VSAResultCode* result);
 void VSAHandleContainerMetadata(const VSAValue& request, VSAValue& reply,
                                 VSAClientConnection& connection, VSAResultCode* result);
+void VSAHandleDiskUsage(const VSAValue& request, VSAValue& reply, VSAClientConnection& connection,
+                        VSAResultCode* result);
 void VSAHandleDeleteContainer(const VSAValue& request, VSAValue& reply,
                               VSAClientConnection& connection, VSAResultCode* result);
 void VSAHandleSystemContainerPath(const VSAValue& request, VSAValue& reply,

@@ -38,8 +38,8 @@ const std::array<VSACommandTableEntry, kVSACommandCount> kTable = {{
     {21, VSAHandleSetDataProtection, allowed, _, _,
      _},  // change data protection (replies from its completion)
     {22, VSAHandleRecreateDefaultStructure, allowed, R, _,
-     _},                              // recreate a container's default structure
-    {23, nullptr, allowed, R, _, L},  // disk usage of a container
+     _},                                         // recreate a container's default structure
+    {23, VSAHandleDiskUsage, allowed, R, _, L},  // disk usage of a container
     {24, nullptr, kVSAEntitlementDataMigration, R, _, _},       // data migration
     {25, nullptr, testability, R, _, _},                        // crash-retry test
     {26, nullptr, kVSAEntitlementStageSharedContent, R, _, _},  // stage shared content

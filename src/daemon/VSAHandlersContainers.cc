@@ -1,6 +1,7 @@
 // Handlers of the container commands: create or look up (0), list (1),
 // stage for deletion (3), empty death row (4), metadata (7), delete (10),
-// system container path (15) and system group container path (17).
+// system container path (15), system group container path (17) and disk
+// usage (23, "ReplyDiskUsage").
 #include <algorithm>
 
 #include "base/VSALog.h"
@@ -154,6 +155,15 @@ void VSAHandleContainerMetadata(const VSAValue& request, VSAValue& reply,
     reply.set("ReplyInfoDictionary", m->info() ? *m->info() : VSAValue::dictionary());
   if (auto persona = personaString(*m)) reply.set("ReplyPersonaUniqueString", *persona);
   VSAAddSandboxToken(connection, *m, reply, "ReplySandboxToken");
+}
+
+void VSAHandleDiskUsage(const VSAValue& request, VSAValue& reply, VSAClientConnection& connection,
+                        VSAResultCode* result) {
+  VSARequestArguments args(request, connection, result);
+  auto identity = args.containerIdentity();
+  if (!identity) return;
+  auto bytes = connection.diskUsageWithContainerIdentity(identity, result);
+  if (bytes) reply.set("ReplyDiskUsage", VSAValue(*bytes));
 }
 
 void VSAHandleDeleteContainer(const VSAValue& request, VSAValue&, VSAClientConnection& connection,

@@ -307,3 +307,16 @@ VSAMetadataRef VSAContainerLookup::containerForIdentity(VSAContainerCache& cache
   }
   return nullptr;
 }
+
+std::optional<uint64_t> VSAContainerLookup::diskUsageWithContainerIdentity(
+    const VSAContainerIdentityRef& identity, VSAResultCode* withError) {
+  VSAMetadataRef found =
+      createOrLookupContainerWithContainerIdentity(identity, false, false, true, withError);
+  if (!found) return std::nullopt;
+  // The container keeps its place while it is measured.
+  VSAIdentifierLockGuard lock(VSAValue(found->uuid().string()), false);
+  auto& fm = *services_.fileManager;
+  if (services_.deviceProperties->isFeatureEnabled("fast_container_sizing"))
+    return fm.fastDiskUsageForURL(found->url());
+  return fm.diskUsageForURL(found->url());
+}

@@ -35,6 +35,12 @@ class VSAContainerLookup {
   VSAMetadataRef metadataWithContainerIdentity(const VSAContainerIdentityRef& identity,
                                                VSAResultCode* withError);
 
+  // The bytes a container takes on disk (the client's lookup access test
+  // first; 21 when it does not exist): the file system's statistics when
+  // fast sizing is on and available, else a walk of the tree on its device.
+  std::optional<uint64_t> diskUsageWithContainerIdentity(const VSAContainerIdentityRef& identity,
+                                                         VSAResultCode* withError);
+
   // The cached container an identity names, with its transient flag set: a
   // concrete identity names the live or the transient container whose UUID
   // it carries; a plain one the live container of its identifier. No access

@@ -81,6 +81,13 @@ TEST(DaemonMaintenance, InfoValuesStructureUUIDReplaceAndWipeThroughTheSocket) {
     EXPECT_TRUE(fs::is_directory(app->path + "/Library/Caches")) << command;
   }
 
+  // 23: the bytes it takes.
+  std::ofstream(app->path + "/Documents/blob") << std::string(50000, 'x');
+  auto usage = d.request(request(23, "com.example.app"));
+  ASSERT_EQ(VSAReplyError(usage), 1u);
+  EXPECT_GE(usage->get("ReplyDiskUsage")->uint64Value().value_or(0), 50000u);
+  fs::remove(app->path + "/Documents/blob");
+
   // 9: a new directory name, the same identity.
   EXPECT_EQ(VSAReplyError(d.request(request(9, "com.example.app"))), 1u);
   auto renamed = lookup(d, "com.example.app");

@@ -142,4 +142,25 @@ TEST_F(Maintenance, InfoValuesAreWrittenThroughTheMetadataFileAndRemovable) {
   EXPECT_EQ(setInfo("com.example.missing", VSAValue("v")), VSAResult::kContainerNotFound);
 }
 
+TEST_F(Maintenance, DiskUsageCountsTheContainersBytesForClientsThatMayLookItUp) {
+  VSAResultCode code;
+  auto made = create(*installer(), "com.example.app", &code);
+  ASSERT_TRUE(made) << code;
+  code = VSAResult::kSuccess;
+  auto empty = installer()->diskUsageWithContainerIdentity(identity("com.example.app"), &code);
+  ASSERT_TRUE(empty) << code;
+  std::ofstream(made->url() + "/Documents/blob") << std::string(100000, 'x');
+  auto full = installer()->diskUsageWithContainerIdentity(identity("com.example.app"), &code);
+  ASSERT_TRUE(full) << code;
+  EXPECT_GE(*full, *empty + 100000);
+  EXPECT_LT(*full, *empty + 100000 + 65536);
+  // Another app may not measure it; a missing container is 21.
+  auto stranger = connection("com.example.stranger", false, false);
+  EXPECT_FALSE(stranger->diskUsageWithContainerIdentity(identity("com.example.app"), &code));
+  EXPECT_EQ(code, VSAResult::kNotEntitled);
+  code = VSAResult::kSuccess;
+  EXPECT_FALSE(installer()->diskUsageWithContainerIdentity(identity("com.example.none"), &code));
+  EXPECT_EQ(code, VSAResult::kContainerNotFound);
+}
+
 }  // namespace
