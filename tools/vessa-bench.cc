@@ -67,36 +67,22 @@ struct Result {
 // Request `i` of client `c`.
 using RequestMaker = std::function<VSAValue(int c, int i)>;
 
-Result runClients(const std::string& socket, const Options& o, const RequestMaker& make,
-                  bool checkReplies) {
+// One client's work: request `i`, its outcome added to `r`.
+using ClientStep = std::function<void(int i, Result& r)>;
+
+// Runs `o.clients` threads. Each sets itself up (connects) before the clock
+// starts, then runs its step `o.requests` times; their results are merged.
+Result runThreads(const Options& o, const std::function<ClientStep(int c)>& setUp) {
   std::vector<std::thread> threads;
   std::vector<Result> parts(o.clients);
   std::atomic<int> ready{0};
   std::atomic<bool> go{false};
   for (int c = 0; c < o.clients; ++c)
     threads.emplace_back([&, c] {
-      VSAIPCClient client;
-      VSAErrorRef error;
-      bool connected = client.connect(socket, &error);
+      ClientStep step = setUp(c);
       ++ready;
       while (!go) std::this_thread::yield();
-      Result& r = parts[c];
-      for (int i = 0; i < o.requests; ++i) {
-        if (!connected) {
-          ++r.lost;
-          continue;
-        }
-        auto start = Clock::now();
-        auto reply = client.sendRequest(make(c, i), std::chrono::seconds(60), &error);
-        r.latenciesUs.push_back(
-            std::chrono::duration<double, std::micro>(Clock::now() - start).count());
-        if (!reply) {
-          ++r.lost;
-        } else if (checkReplies) {
-          const VSAValue* e = reply->get("ReplyError");
-          if (!e || e->uint64Value().value_or(0) != 1) ++r.errors;
-        }
-      }
+      for (int i = 0; i < o.requests; ++i) step(i, parts[c]);
     });
   while (ready < o.clients) std::this_thread::yield();
   auto start = Clock::now();
@@ -110,6 +96,32 @@ Result runClients(const std::string& socket, const Options& o, const RequestMake
     all.lost += p.lost;
   }
   return all;
+}
+
+Result runClients(const std::string& socket, const Options& o, const RequestMaker& make,
+                  bool checkReplies) {
+  return runThreads(o, [&](int c) -> ClientStep {
+    auto client = std::make_shared<VSAIPCClient>();
+    VSAErrorRef error;
+    bool connected = client->connect(socket, &error);
+    return [&, c, client, connected](int i, Result& r) {
+      if (!connected) {
+        ++r.lost;
+        return;
+      }
+      VSAErrorRef sendError;
+      auto start = Clock::now();
+      auto reply = client->sendRequest(make(c, i), std::chrono::seconds(60), &sendError);
+      r.latenciesUs.push_back(
+          std::chrono::duration<double, std::micro>(Clock::now() - start).count());
+      if (!reply) {
+        ++r.lost;
+      } else if (checkReplies) {
+        const VSAValue* e = reply->get("ReplyError");
+        if (!e || e->uint64Value().value_or(0) != 1) ++r.errors;
+      }
+    };
+  });
 }
 
 // The daemon's listener, socket and framing, answering every request at once.
@@ -146,51 +158,32 @@ Result runUpcalls(const std::string& socket, const Options& o, bool served) {
   VSAUpcallRequest request;
   request.descriptorSize = request.requestSize = static_cast<uint32_t>(memory.size());
   const std::vector<uint8_t> message = request.bytes();
-  std::vector<std::thread> threads;
-  std::vector<Result> parts(o.clients);
-  std::atomic<int> ready{0};
-  std::atomic<bool> go{false};
-  for (int c = 0; c < o.clients; ++c)
-    threads.emplace_back([&, c] {
-      VSAUpcallClient client;
-      std::string why;
-      bool connected = client.connect(socket, &why);
-      ++ready;
-      while (!go) std::this_thread::yield();
-      Result& r = parts[c];
+  return runThreads(o, [&](int) -> ClientStep {
+    auto client = std::make_shared<VSAUpcallClient>();
+    std::string why;
+    bool connected = client->connect(socket, &why);
+    return [&, client, connected](int, Result& r) {
       std::vector<uint8_t> reply;
       std::optional<std::vector<uint8_t>> replyMemory;
-      for (int i = 0; i < o.requests; ++i) {
-        auto start = Clock::now();
-        bool ok = connected && client.call(message, &memory, &reply, &replyMemory, &why);
-        r.latenciesUs.push_back(
-            std::chrono::duration<double, std::micro>(Clock::now() - start).count());
-        if (!ok) {
-          ++r.lost;
-          continue;
-        }
-        auto parsed = VSAUpcallReply::parse(reply.data(), reply.size());
-        if (!parsed || !replyMemory) {
-          ++r.errors;
-        } else if (served) {
-          auto answer = VSAUpcallAnswer::read(*replyMemory);
-          if (parsed->returnCode != 0 || answer.success != 1u || answer.groups.size() != 2)
-            ++r.errors;
-        }
+      std::string callWhy;
+      auto start = Clock::now();
+      bool ok = connected && client->call(message, &memory, &reply, &replyMemory, &callWhy);
+      r.latenciesUs.push_back(
+          std::chrono::duration<double, std::micro>(Clock::now() - start).count());
+      if (!ok) {
+        ++r.lost;
+        return;
       }
-    });
-  while (ready < o.clients) std::this_thread::yield();
-  auto start = Clock::now();
-  go = true;
-  for (auto& t : threads) t.join();
-  Result all;
-  all.seconds = std::chrono::duration<double>(Clock::now() - start).count();
-  for (auto& part : parts) {
-    all.latenciesUs.insert(all.latenciesUs.end(), part.latenciesUs.begin(), part.latenciesUs.end());
-    all.errors += part.errors;
-    all.lost += part.lost;
-  }
-  return all;
+      auto parsed = VSAUpcallReply::parse(reply.data(), reply.size());
+      if (!parsed || !replyMemory) {
+        ++r.errors;
+      } else if (served) {
+        auto answer = VSAUpcallAnswer::read(*replyMemory);
+        if (parsed->returnCode != 0 || answer.success != 1u || answer.groups.size() != 2)
+          ++r.errors;
+      }
+    };
+  });
 }
 
 // The daemon's upcall transport, sending every packet and its memory back.
