@@ -68,6 +68,19 @@ bool VSAIsSafeFileName(std::string_view name) {
   return name.find('/') == std::string_view::npos && name.find('\0') == std::string_view::npos;
 }
 
+bool VSAIsSafeRelativePath(std::string_view path) {
+  if (path.empty() || path.size() > kVSAMaxClientPathLength || path.front() == '/') return false;
+  size_t start = 0;
+  while (true) {
+    size_t slash = path.find('/', start);
+    std::string_view part = path.substr(
+        start, slash == std::string_view::npos ? std::string_view::npos : slash - start);
+    if (!VSAIsSafeFileName(part)) return false;
+    if (slash == std::string_view::npos) return true;
+    start = slash + 1;
+  }
+}
+
 std::string VSAClientStringForLog(std::string_view text, size_t limit) {
   static const char* hex = "0123456789abcdef";
   std::string out;

@@ -34,6 +34,15 @@ inline constexpr size_t kVSAMaxClientNameLength = 255;
 // directory: not empty, not "." or "..", no '/', no NUL, at most 255 bytes.
 bool VSAIsSafeFileName(std::string_view name);
 
+// The longest relative path a client may give inside a container.
+inline constexpr size_t kVSAMaxClientPathLength = 1024;
+
+// True when `path` can name an item strictly below a directory: relative,
+// at most 1024 bytes, every component a safe file name (so no "..", no
+// ".", no empty component, no NUL). Links on the way are checked where the
+// path is resolved, not here.
+bool VSAIsSafeRelativePath(std::string_view path);
+
 // A client-supplied string made fit for a log line: control bytes escaped as
 // \xNN and anything past `limit` bytes cut off (with the original length).
 std::string VSAClientStringForLog(std::string_view text, size_t limit = 96);

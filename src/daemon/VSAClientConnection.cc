@@ -1,12 +1,14 @@
 #include "daemon/VSAClientConnection.h"
 
 #include "operations/VSABootKeeper.h"
+#include "operations/VSAContainerContent.h"
 #include "operations/VSAContainerDeletion.h"
 #include "operations/VSAContainerLookup.h"
 #include "operations/VSAContainerMaintenance.h"
 #include "operations/VSAContentWipe.h"
 #include "operations/VSAGroupContainerLookup.h"
 #include "operations/VSAReplaceOperation.h"
+#include "operations/VSARetryTest.h"
 
 VSAClientConnection::VSAClientConnection(VSADaemonContext& context,
                                          VSAClientIdentityRef clientIdentity, bool entitled,
@@ -137,4 +139,32 @@ void VSAClientConnection::rebootKeeperCleanupWithCompletion(std::function<void()
 
 void VSAClientConnection::keeperCleanupWithCompletion(std::function<void()> completion) {
   VSABootKeeper(services_).keeperCleanupWithCompletion(std::move(completion));
+}
+
+std::optional<std::string> VSAClientConnection::userManagedAssetsPathWithContainerIdentity(
+    const VSAContainerIdentityRef& identity, bool isRelative, bool createIfNecessary, bool* existed,
+    VSAResultCode* withError) {
+  return VSAContainerContent(services_, grants_)
+      .userManagedAssetsPathWithContainerIdentity(identity, isRelative, createIfNecessary, existed,
+                                                  withError);
+}
+
+bool VSAClientConnection::deleteUserManagedAssetWithContainerIdentity(
+    const VSAContainerIdentityRef& identity, const std::string& relativePath,
+    VSAResultCode* withError) {
+  return VSAContainerContent(services_, grants_)
+      .deleteUserManagedAssetWithContainerIdentity(identity, relativePath, withError);
+}
+
+std::optional<std::string> VSAClientConnection::stageSharedContentForIdentifier(
+    const std::string& identifier, const VSAUserIdentityRef& userIdentity,
+    const std::string& sourceRelativePath, const std::string& destRelativePath,
+    VSAResultCode* withError) {
+  return VSAContainerContent(services_, grants_)
+      .stageSharedContentForIdentifier(identifier, userIdentity, sourceRelativePath,
+                                       destRelativePath, withError);
+}
+
+bool VSAClientConnection::retryTestWithNumCrashes(uint64_t numCrashes, VSAResultCode* withError) {
+  return VSARetryTest(services_).retryTestWithNumCrashes(numCrashes, withError);
 }

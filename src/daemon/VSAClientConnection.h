@@ -111,6 +111,21 @@ class VSAClientConnection {
   std::optional<std::vector<std::string>> groupContainerIdentifiersForOwnerIdentifier(
       const std::string& owner, VSAContainerClass groupContainerClass, VSAResultCode* withError);
 
+  // Content named by client paths (VSAContainerContent).
+  std::optional<std::string> userManagedAssetsPathWithContainerIdentity(
+      const VSAContainerIdentityRef& identity, bool isRelative, bool createIfNecessary,
+      bool* existed, VSAResultCode* withError);
+  bool deleteUserManagedAssetWithContainerIdentity(const VSAContainerIdentityRef& identity,
+                                                   const std::string& relativePath,
+                                                   VSAResultCode* withError);
+  std::optional<std::string> stageSharedContentForIdentifier(const std::string& identifier,
+                                                             const VSAUserIdentityRef& userIdentity,
+                                                             const std::string& sourceRelativePath,
+                                                             const std::string& destRelativePath,
+                                                             VSAResultCode* withError);
+  // The crash-retry test (VSARetryTest); may end the process on purpose.
+  bool retryTestWithNumCrashes(uint64_t numCrashes, VSAResultCode* withError);
+
   // Runs the request's deferred commands; a failing command's code lands in `error`.
   bool completeWithError(VSAResultCode* error);
 

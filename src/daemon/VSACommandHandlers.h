@@ -20,6 +20,20 @@ void VSASendLateReply(const VSAIPCReplyContextRef& context, VSAResultCode code, 
 using VSACommandHandler = void (*)(const VSAValue& request, VSAValue& reply,
                                    VSAClientConnection& connection, VSAResultCode* result);
 
+// Content named by relative paths; see VSAHandlersContent.cc for the keys.
+void VSAHandleUserManagedAssetsPath(const VSAValue& request, VSAValue& reply,
+                                    VSAClientConnection& connection, VSAResultCode* result);
+void VSAHandleDeleteUserManagedAsset(const VSAValue& request, VSAValue& reply,
+                                     VSAClientConnection& connection, VSAResultCode* result);
+void VSAHandleStageSharedContent(const VSAValue& request, VSAValue& reply,
+                                 VSAClientConnection& connection, VSAResultCode* result);
+// Command 25: starts the crash-retry test ("NumRetryCrashes"); internal builds only.
+void VSAHandleRetryTest(const VSAValue& request, VSAValue& reply, VSAClientConnection& connection,
+                        VSAResultCode* result);
+// Command 31: acquires or releases a test lock ("TestLock", "Enable");
+// on other builds it logs and succeeds without doing anything.
+void VSAHandleTestLock(const VSAValue& request, VSAValue& reply, VSAClientConnection& connection,
+                       VSAResultCode* result);
 // Command 27: retired; always fails with 49.
 void VSAHandleRetiredCommand(const VSAValue& request, VSAValue& reply,
                              VSAClientConnection& connection, VSAResultCode* result);

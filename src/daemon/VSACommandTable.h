@@ -25,5 +25,8 @@ struct VSACommandTableEntry {
 };
 
 inline constexpr size_t kVSACommandCount = 33;
+// Test locks: served on their own queue, so that a request frozen at a test
+// lock on the listener queue cannot keep the command that releases it waiting.
+inline constexpr uint64_t kVSATestLockCommand = 31;
 
 const std::array<VSACommandTableEntry, kVSACommandCount>& VSACommandTable();

@@ -8,6 +8,8 @@
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
 #include "base/VSAPlist.h"
+#include "base/VSATestLocks.h"
+#include "daemon/VSACommandTable.h"
 #include "platform/VSANamedSemaphore.h"
 
 #ifndef VESSA_BUILD_DATE
@@ -30,8 +32,11 @@ int VSADaemon::run() {
   VSAMakeDirectories(context_->systemRoot.runDirectory());
   context_->listenerQueue = VSAWorkQueue::create("com.tamsk.vessad.listener");
   auto initTransaction = context_->transactions->open();
+  testLockQueue_ = VSAWorkQueue::create("com.tamsk.vessad.testlocks");
+  testLockQueue_->suspend();
   context_->listenerQueue->async([this, initTransaction = std::move(initTransaction)]() mutable {
     initialize();
+    testLockQueue_->resume();
     initTransaction.reset();  // step 15: start-up is over
   });
   dispatcher_ = std::make_unique<VSARelayDispatcher>(*context_);
@@ -44,6 +49,11 @@ int VSADaemon::run() {
     if (!stopping_ && listener_->listen(&error)) {
       listener_->setHandler(
           [this](const VSAIPCMessageRef& m) { dispatcher_->processRelayEvent(m); });
+      listener_->setRouter([queue = testLockQueue_](const VSAValue& body) -> VSAWorkQueue::Ref {
+        const VSAValue* command = body.get(kVSARequestCommandKey);
+        bool testLock = command && command->uint64Value() == kVSATestLockCommand;
+        return testLock ? queue : nullptr;
+      });
       listener_->resume();
     } else {
       if (!stopping_) {
@@ -81,6 +91,8 @@ void VSADaemon::drainForShutdown() {
     // Upcalls already received are still answered: their replies hold the peer.
     if (upcall_) upcall_->stop();
   }
+  // A request frozen at a test lock would hold its transaction open forever.
+  VSATestLocks::shared().setEnabled(false);
   if (!context_->transactions->waitUntilIdle(std::chrono::seconds(30)))
     VSALogIn(VSALogCategory::Daemon, kVSALogError, "main",
              "Giving up on %d open transactions after 30 seconds",

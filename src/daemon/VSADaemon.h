@@ -53,6 +53,8 @@ class VSADaemon {
   std::unique_ptr<VSADaemonContext> context_;
   std::unique_ptr<VSARelayDispatcher> dispatcher_;
   std::unique_ptr<VSAIPCListener> listener_;
+  // Serves command 31 off the listener queue; resumed once start-up is over.
+  VSAWorkQueue::Ref testLockQueue_;
   std::unique_ptr<VSAClientConnection> sharedConnection_;
   std::unique_ptr<VSALockStateMonitor> lockStateMonitor_;
   std::unique_ptr<VSAKernelUpcall> upcall_;

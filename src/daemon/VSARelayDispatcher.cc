@@ -86,7 +86,9 @@ void VSARelayDispatcher::processRelayEvent(const VSAIPCMessageRef& message) {
     identity = VSAClientIdentity::clientIdentityWithRelayConnection(*message->connection(),
                                                                     *context_.userIdentityCache);
     VSAGrants grants = VSADeriveGrants(*entry, identity.get());
-    if (identity && grants.admitted) {
+    // Command 31 may arrive while a frozen request holds what recording
+    // entitlements waits for (the mapping's queue, the identifier locks).
+    if (identity && grants.admitted && command != kVSATestLockCommand) {
       VSAResultCode registered = context_.codeSigningMapping->processCallerRegisteredEntitlements(
           identity->entitlements(), identity->bundleIdentifier(), commandQueue.get());
       if (registered != VSAResult::kSuccess)

@@ -7,6 +7,7 @@
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
 #include "base/VSAPlist.h"
+#include "base/VSATestLocks.h"
 #include "dataprotection/VSADataProtectionUpdateFile.h"
 
 namespace {
@@ -128,6 +129,7 @@ bool VSADataProtectionChangeOperation::_runChangeOperationNeedToRetry(bool* need
   };
   // Readers of this container may go on; writers wait for the walk.
   VSAIdentifierLockGuard guard(VSAValue(metadata_->uuid().string()), false);
+  VSATestLocks::shared().waitOnLock(kVSATestLockProtectionChange);
   VSAErrorRef walkError;
   bool walked = fm.traverseDirectory(metadata_->url(), &walkError, visit);
   if (lockedFailure) {

@@ -2,6 +2,7 @@
 
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
+#include "base/VSATestLocks.h"
 #include "platform/VSAFileManager.h"
 
 namespace {
@@ -69,6 +70,7 @@ VSAContainerCache::ClassMap* VSAContainerCache::_lock_getCache(const VSAUserIden
   VSALogIn(VSALogCategory::Cache, kVSALogNotice, kOrigin, "Rebuilding container class cache: %@%@",
            key, transientTag(transient));
   VSASignpostInterval interval(VSALogCategory::Cache, "RebuildingCache");
+  VSATestLocks::shared().waitOnLock(kVSATestLockCacheRebuild);
   auto& config = *deps_.configuration;
   auto dir = config.containerDirectoryURLForUserIdentity(user, c, transient);
   if (!dir) {

@@ -57,6 +57,9 @@ class VSAMetadata {
   void setUuid(const VSAUUID& uuid);
   void setInfo(std::optional<VSAValue> info) { info_ = std::move(info); }
   void setUrl(std::string url) { url_ = std::move(url); }
+  void setUserManagedAssetsDirName(std::optional<std::string> name) {
+    assetsDirName_ = std::move(name);
+  }
   void setExisted(bool v) { existed_ = v; }
   void setTransient(bool v) { transient_ = v; }
 

@@ -5,6 +5,7 @@
 #include "base/VSALog.h"
 #include "model/VSAPerUserConfiguration.h"
 #include "operations/VSAReplaceOperation.h"
+#include "operations/VSARetryTest.h"
 
 // Steps not built yet (build-upgrade migration, system container restore,
 // group reconciliation, orphan scans) say so in the log; the cleanups always
@@ -24,6 +25,12 @@ void VSABootKeeper::keeperSetup() {
   if (!services_.restartPendingDataProtectionOperations(&error))
     VSALogIn(VSALogCategory::Startup, kVSALogError, __func__,
              "Failed restarting pending data protection operations: %@", error);
+  // Only internal builds start crash-retry tests; elsewhere a journal is never acted on.
+  VSAResultCode retry = VSAResult::kSuccess;
+  if (services_.configuration->isInternalImage() &&
+      !VSARetryTest(services_).resumeRetryTestIfPending(&retry))
+    VSALogIn(VSALogCategory::Startup, kVSALogError, __func__,
+             "Failed resuming the retry test: %llu", retry);
 }
 
 void VSABootKeeper::rebootKeeperCleanupWithCompletion(std::function<void()> completion) {

@@ -5,6 +5,7 @@
 #include "base/VSALocks.h"
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
+#include "base/VSATestLocks.h"
 #include "model/VSAConcreteContainerIdentity.h"
 
 namespace {
@@ -82,6 +83,7 @@ bool VSACommandStageForDelete::stage(const VSAContainerIdentity& identity, VSACo
   if (VSAContainerClassIsBundle(container->containerClass()) && environment_->removeCodeSigning &&
       !hasPermanentTwin(*container))
     environment_->removeCodeSigning(container->identifier(), queue);
+  VSATestLocks::shared().waitOnLock(kVSATestLockStageForDelete);
   VSAErrorRef error;
   if (!config.fileManager().moveItemAtURL(container->url(), destination, &error)) {
     VSALog(kVSALogDebug, "fromQueue", "Couldn't stage for deletion from %@ to %@: %@",

@@ -8,6 +8,7 @@
 #include "base/VSALocks.h"
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
+#include "base/VSATestLocks.h"
 #include "model/VSAConcreteContainerIdentity.h"
 #include "operations/VSAContainerDirectories.h"
 
@@ -155,6 +156,7 @@ struct CreateSteps {
     auto base = config.containerDirectoryURLForUserIdentity(identity.userIdentity(), c, transient);
     std::string live = VSAPathJoin(base.value_or(""), liveName(name));
     VSAErrorRef underlying;
+    VSATestLocks::shared().waitOnLock(kVSATestLockCreate);
     if (!base || !services.fileManager->moveItemAtURL(staging, live, &underlying)) {
       *error = failure(kStagingMoveFailed, underlying,
                        VSAFormat("Failed to move staging dir: %@ to live dir: %@", staging, live));

@@ -5,6 +5,7 @@
 #include "base/VSALocks.h"
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
+#include "base/VSATestLocks.h"
 #include "model/VSAConcreteContainerIdentity.h"
 #include "operations/VSAContainerLookup.h"
 #include "operations/VSAReplaceFile.h"
@@ -147,6 +148,7 @@ struct ReplaceRun {
                                                                        &invalidateError))
       VSALog(kVSALogError, kOrigin, "Failed to invalidate code signing info for %@",
              oldContainer->identifier());
+    VSATestLocks::shared().waitOnLock(kVSATestLockReplace);
     if (!fm.moveItemAtURL(newContainer->url(), destURL, &error))
       return fail(kMoveToDestinationFailed,
                   VSAFormat("Failed to replace: %@ with: %@ at: %@", oldContainer->url(),

@@ -140,6 +140,11 @@ void VSAIPCListener::setHandler(Handler handler) {
   handler_ = std::move(handler);
 }
 
+void VSAIPCListener::setRouter(Router router) {
+  std::lock_guard lock(handlerMutex_);
+  router_ = std::move(router);
+}
+
 void VSAIPCListener::resume() {
   if (listenFd_ < 0 || thread_.joinable()) return;
   thread_ = std::thread([this] {
@@ -519,11 +524,14 @@ void VSAIPCListener::deliver(const VSAIPCConnectionRef& connection, std::optiona
   auto message = std::make_shared<VSAIPCMessage>(connection, std::move(body), std::move(problem),
                                                  transactions_->open(), std::move(inFlight));
   Handler handler;
+  VSAWorkQueue::Ref queue;
   {
     std::lock_guard lock(handlerMutex_);
     handler = handler_;
+    if (router_) queue = router_(message->body());
   }
-  queue_->async([handler, message] {
+  if (!queue) queue = queue_;
+  queue->async([handler, message] {
     if (handler) handler(message);
   });
 }

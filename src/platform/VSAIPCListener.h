@@ -63,6 +63,8 @@ struct VSAIPCListenerLimits {
 class VSAIPCListener {
  public:
   using Handler = std::function<void(const VSAIPCMessageRef&)>;
+  // Picks the queue a request is handled on; null keeps the listener's queue.
+  using Router = std::function<VSAWorkQueue::Ref(const VSAValue& body)>;
 
   // `registry` (may be null) gives each accepted peer its registry entry.
   VSAIPCListener(std::string socketPath, VSAWorkQueue::Ref queue,
@@ -75,6 +77,9 @@ class VSAIPCListener {
 
   bool listen(VSAErrorRef* error);
   void setHandler(Handler handler);
+  // Requests the router sends elsewhere leave the listener's serial order:
+  // they may overtake requests of the same peer still waiting in its queue.
+  void setRouter(Router router);
   void resume();
   // Stops accepting and reading; open connections stay up for late replies.
   void stopAccepting();
@@ -116,6 +121,7 @@ class VSAIPCListener {
   std::shared_ptr<Resumer> resumer_;
   std::mutex handlerMutex_;
   Handler handler_;
+  Router router_;
   int listenFd_ = -1;
   int epollFd_ = -1;
   int stopFd_ = -1;

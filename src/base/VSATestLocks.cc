@@ -1,0 +1,141 @@
+#include "base/VSATestLocks.h"
+
+#include "base/VSACrash.h"
+#include "base/VSAFormat.h"
+#include "base/VSALocks.h"
+#include "base/VSALog.h"
+#include "base/VSAUUID.h"
+
+namespace {
+constexpr const char* kOrigin = "VSATestLocks";
+
+void logTest(const char* origin, std::string_view format, auto... args) {
+  VSALogIn(VSALogCategory::Test, kVSALogNotice, origin, format, args...);
+}
+
+bool hasGate(uint64_t lock) { return lock >= 2 && lock < kVSATestLockCount; }
+}  // namespace
+
+VSATestLocks& VSATestLocks::shared() {
+  static VSATestLocks* locks = new VSATestLocks();  // lives as long as the process
+  return *locks;
+}
+
+VSATestLocks::VSATestLocks()
+    : stateQueue_(VSAWorkQueue::create("com.tamsk.vessad.VSATestLocks.stateQueue")) {
+  for (uint64_t lock = 2; lock < kVSATestLockCount; ++lock) {
+    gates_[lock].queue = VSAWorkQueue::create("com.tamsk.vessad.VSATestLocks.lockQueue",
+                                              VSAWorkQueue::Kind::Concurrent);
+    gates_[lock].semaphore = std::make_unique<std::binary_semaphore>(0);
+  }
+}
+
+VSATestLocks::~VSATestLocks() { releaseAllLocks(); }
+
+void VSATestLocks::setEnabled(bool enabled) {
+  if (enabled_.exchange(enabled) == enabled) return;
+  if (enabled) {
+    logTest("setEnabled", "Enabled test locks feature.");
+  } else {
+    releaseAllLocks();
+    logTest("setEnabled", "Disabled test locks feature.");
+  }
+}
+
+void VSATestLocks::acquireLock(uint64_t lock) { updateCount(lock, 1); }
+void VSATestLocks::releaseLock(uint64_t lock) { updateCount(lock, -1); }
+
+void VSATestLocks::updateCount(uint64_t lock, int64_t delta) {
+  if (lock >= kVSATestLockCount) return;
+  stateQueue_->sync([&] { _stateQueue_updateCountForLock(lock, delta); });
+}
+
+void VSATestLocks::releaseAllLocks() {
+  stateQueue_->sync([&] {
+    for (uint64_t lock = 0; lock < kVSATestLockCount; ++lock)
+      if (counts_[lock] > 0) _stateQueue_updateCountForLock(lock, -counts_[lock]);
+    logTest("releaseAllLocks", "Released all test locks.");
+  });
+}
+
+int64_t VSATestLocks::countForLock(uint64_t lock) const {
+  if (lock >= kVSATestLockCount) return 0;
+  int64_t count = 0;
+  stateQueue_->sync([&] { count = counts_[lock]; });
+  return count;
+}
+
+void VSATestLocks::_stateQueue_updateCountForLock(uint64_t lock, int64_t delta) {
+  if (delta == 0) return;
+  int64_t from = counts_[lock], to = from + delta;
+  if (to < 0) {
+    std::string message = VSAFormat("Unbalanced update to test lock: %llu by: %ld from: %ld",
+                                    static_cast<unsigned long long>(lock), static_cast<long>(delta),
+                                    static_cast<long>(from));
+    VSALogIn(VSALogCategory::Test, kVSALogFault, "_stateQueue_updateCountForLock", "%@", message);
+    VSACrash(message);
+  }
+  counts_[lock] = to;
+  if (from == 0) take(lock);
+  if (to == 0) release(lock);
+  if (delta > 0)
+    logTest(kOrigin, "Acquired test lock: %llu; count: %ld", static_cast<unsigned long long>(lock),
+            static_cast<long>(to));
+  else
+    logTest(kOrigin, "Released test lock: %llu; count: %ld", static_cast<unsigned long long>(lock),
+            static_cast<long>(to));
+}
+
+void VSATestLocks::take(uint64_t lock) {
+  if (lock == 0) return lock_all_identifiers_write();
+  if (lock == 1) return lock_all_identifiers_read();
+  Gate& gate = gates_[lock];
+  gate.queue->barrierAsync([lock, semaphore = gate.semaphore.get()] {
+    logTest("take", "Blocking waiters for lock: %llu", static_cast<unsigned long long>(lock));
+    semaphore->acquire();
+    logTest("take", "Unblocking waiters for lock: %llu", static_cast<unsigned long long>(lock));
+  });
+}
+
+void VSATestLocks::release(uint64_t lock) {
+  if (lock <= 1) return unlock_all_identifiers();
+  gates_[lock].semaphore->release();
+}
+
+void VSATestLocks::waitOnLock(uint64_t lock) {
+  if (!enabled()) return;
+  std::string mark = VSAUUID::random().string();
+  auto number = static_cast<unsigned long long>(lock);
+  logTest("waitOnLock", "[%s] Waiting on lock: %llu", mark, number);
+  if (hasGate(lock)) gates_[lock].queue->sync([] {});
+  logTest("waitOnLock", "[%s] No longer waiting on lock: %llu", mark, number);
+}
+
+VSAResultCode VSATestLocks::setLockFromCommand(uint64_t lock, bool enable) {
+  if (lock == kVSATestLockCount && !enable) {
+    std::lock_guard guard(maskMutex_);
+    commandMask_ = 0;
+    setEnabled(false);
+    return VSAResult::kSuccess;
+  }
+  if (lock >= kVSATestLockCount) {
+    VSALogIn(VSALogCategory::Test, kVSALogError, "setLockFromCommand", "Invalid test lock: %llu",
+             static_cast<unsigned long long>(lock));
+    return VSAResult::kOutOfRange;
+  }
+  std::lock_guard guard(maskMutex_);
+  uint32_t bit = 1u << lock;
+  if (enable) {
+    if (commandMask_ & bit) return VSAResult::kSuccess;
+    commandMask_ |= bit;
+    setEnabled(true);
+    acquireLock(lock);
+    return VSAResult::kSuccess;
+  }
+  if (!(commandMask_ & bit)) return VSAResult::kSuccess;
+  // Releasing lock 0 or 1 forgets both: the command treats them as one.
+  commandMask_ &= lock <= 1 ? ~3u : ~bit;
+  releaseLock(lock);
+  if (commandMask_ == 0) setEnabled(false);
+  return VSAResult::kSuccess;
+}

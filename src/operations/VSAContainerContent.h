@@ -1,0 +1,79 @@
+// Content inside a container that clients name by relative paths: the
+// user-managed assets directory (path, deletion of one asset) and staging
+// of shared content from an identifier's bundle into its data container.
+//
+// Containers are found as a look-up (55 for a container the client may not
+// reach, 21 when there is none) and worked on under their identifier locks
+// (writing), re-checked once locked (21 if replaced meanwhile).
+//
+// Client paths are hostile: they must be relative, safe component by
+// component (no "..", ".", empty components or NUL; 11 otherwise) and,
+// resolved with the file manager's client-path rules, stay strictly inside
+// their base; the file system layer refuses any link met on the way when
+// the daemon then acts on the path.
+//
+// On disk:
+//  - the user-managed assets directory is "UserManagedAssets" at the top of
+//    the container (the metadata's `userManagedAssetsDirName` once it has
+//    been made), owned by the container's owner, mode 0755. It is made
+//    first and then recorded in the metadata file, so a crash between the
+//    two leaves a directory that the next request adopts.
+//  - deleting an asset moves it to death row (a missing asset is success);
+//    the assets directory itself cannot be named.
+//  - staged shared content is copied (cloned where the file system can)
+//    from the bundle container (class 1) into the data container's staging
+//    directory, given to the data container's owner, then renamed into
+//    place: it lands whole or not at all. A directory already at the
+//    destination goes to death row just before the rename; a file is
+//    replaced by the rename itself. A regular source file that changes
+//    while it is copied fails the request (34) and nothing lands. Leftovers
+//    of a crash stay in staging, which keeper cleanup empties.
+#pragma once
+
+#include <optional>
+#include <string>
+
+#include "base/VSAError.h"
+#include "model/VSAContainerIdentity.h"
+#include "model/VSAMetadata.h"
+#include "operations/VSAOperationGrants.h"
+#include "operations/VSAOperationServices.h"
+
+inline constexpr const char* kVSAUserManagedAssetsDirName = "UserManagedAssets";
+
+class VSAContainerContent {
+ public:
+  VSAContainerContent(const VSAOperationServices& services, const VSAOperationGrants& grants)
+      : services_(services), grants_(grants) {}
+
+  // The assets directory's path (relative to the container, or absolute);
+  // `existed` tells whether it was there before the call. Without
+  // `createIfNecessary` a missing directory is not made: its path is
+  // answered with `existed` NO.
+  std::optional<std::string> userManagedAssetsPathWithContainerIdentity(
+      const VSAContainerIdentityRef& identity, bool isRelative, bool createIfNecessary,
+      bool* existed, VSAResultCode* withError);
+  bool deleteUserManagedAssetWithContainerIdentity(const VSAContainerIdentityRef& identity,
+                                                   const std::string& relativePath,
+                                                   VSAResultCode* withError);
+  // Answers the destination's absolute path.
+  std::optional<std::string> stageSharedContentForIdentifier(const std::string& identifier,
+                                                             const VSAUserIdentityRef& userIdentity,
+                                                             const std::string& sourceRelativePath,
+                                                             const std::string& destRelativePath,
+                                                             VSAResultCode* withError);
+
+ private:
+  VSAMetadataRef find(const VSAContainerIdentityRef& identity, VSAResultCode* withError);
+  // The container again, under its lock: 21 when it is not the one found.
+  VSAMetadataRef recheck(const VSAMetadata& found, VSAResultCode* withError);
+  std::optional<std::string> resolve(const std::string& base, const std::string& relativePath,
+                                     const char* origin, VSAResultCode* withError);
+  std::string assetsDirectory(const VSAMetadata& container) const;
+  bool recordAssetsDirectory(VSAMetadata& container, VSAResultCode* withError);
+  bool copyIntoPlace(const VSAMetadata& data, const std::string& source,
+                     const std::string& destination, VSAResultCode* withError);
+
+  const VSAOperationServices& services_;
+  const VSAOperationGrants& grants_;
+};

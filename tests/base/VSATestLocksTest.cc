@@ -1,0 +1,118 @@
+// Test locks: what freezes and what does not, the command's mask rules, and
+// the unbalanced release that ends the process.
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <chrono>
+#include <future>
+#include <thread>
+
+#include "base/VSALocks.h"
+#include "base/VSATestLocks.h"
+
+namespace {
+
+using namespace std::chrono_literals;
+
+// Starts a waiter on `lock`; the future is ready once it got through.
+std::future<void> waiter(VSATestLocks& locks, uint64_t lock) {
+  return std::async(std::launch::async, [&locks, lock] { locks.waitOnLock(lock); });
+}
+
+TEST(VSATestLocks, AHeldLockStopsItsWaitersUntilReleasedAndOnlyWhenEnabled) {
+  VSATestLocks locks;
+  // Off: counts do not matter.
+  locks.acquireLock(3);
+  EXPECT_EQ(waiter(locks, 3).wait_for(5s), std::future_status::ready);
+  locks.releaseLock(3);
+
+  locks.setEnabled(true);
+  locks.acquireLock(3);
+  locks.acquireLock(3);  // a second hold: one release is not enough
+  EXPECT_EQ(locks.countForLock(3), 2);
+  auto blocked = waiter(locks, 3);
+  auto other = waiter(locks, 4);  // another number is not held
+  EXPECT_EQ(other.wait_for(5s), std::future_status::ready);
+  EXPECT_EQ(blocked.wait_for(200ms), std::future_status::timeout);
+  locks.releaseLock(3);
+  EXPECT_EQ(blocked.wait_for(200ms), std::future_status::timeout);
+  locks.releaseLock(3);
+  EXPECT_EQ(blocked.wait_for(5s), std::future_status::ready);
+  // Taken again, released by turning the feature off.
+  locks.acquireLock(5);
+  auto again = waiter(locks, 5);
+  EXPECT_EQ(again.wait_for(200ms), std::future_status::timeout);
+  locks.setEnabled(false);
+  EXPECT_EQ(again.wait_for(5s), std::future_status::ready);
+  EXPECT_EQ(locks.countForLock(5), 0);
+}
+
+TEST(VSATestLocks, LocksZeroAndOneHoldTheAllIdentifiersLock) {
+  VSATestLocks locks;
+  locks.setEnabled(true);
+  locks.acquireLock(0);
+  EXPECT_EQ(VSALockTableSnapshot().allReaderWriterState, -1);  // writing
+  // An identifier writer waits until the test lock goes.
+  auto writer = std::async(std::launch::async,
+                           [] { VSAIdentifierLockGuard guard(VSAValue("TESTLOCK-KEY"), true); });
+  EXPECT_EQ(writer.wait_for(200ms), std::future_status::timeout);
+  locks.releaseLock(0);
+  EXPECT_EQ(writer.wait_for(5s), std::future_status::ready);
+  locks.acquireLock(1);
+  EXPECT_EQ(VSALockTableSnapshot().allReaderWriterState, 1);  // reading
+  {
+    VSAIdentifierLockGuard reader(VSAValue("TESTLOCK-KEY"), false);  // readers pass
+  }
+  locks.releaseAllLocks();
+  EXPECT_EQ(VSALockTableSnapshot().allReaderWriterState, 0);
+}
+
+TEST(VSATestLocks, TheCommandAcquiresOncePerLockAndChecksNumbers) {
+  VSATestLocks locks;
+  EXPECT_EQ(locks.setLockFromCommand(7, true), VSAResult::kOutOfRange);
+  EXPECT_EQ(locks.setLockFromCommand(8, false), VSAResult::kOutOfRange);
+  EXPECT_EQ(locks.setLockFromCommand(UINT64_MAX, true), VSAResult::kOutOfRange);
+  EXPECT_FALSE(locks.enabled());
+  // Disabling what the command does not hold does nothing.
+  EXPECT_EQ(locks.setLockFromCommand(2, false), VSAResult::kSuccess);
+  EXPECT_FALSE(locks.enabled());
+
+  EXPECT_EQ(locks.setLockFromCommand(2, true), VSAResult::kSuccess);
+  EXPECT_EQ(locks.setLockFromCommand(2, true), VSAResult::kSuccess);
+  EXPECT_TRUE(locks.enabled());
+  EXPECT_EQ(locks.countForLock(2), 1);
+  EXPECT_EQ(locks.setLockFromCommand(6, true), VSAResult::kSuccess);
+  EXPECT_EQ(locks.setLockFromCommand(2, false), VSAResult::kSuccess);
+  EXPECT_EQ(locks.countForLock(2), 0);
+  EXPECT_TRUE(locks.enabled());  // lock 6 is still held
+  EXPECT_EQ(locks.setLockFromCommand(6, false), VSAResult::kSuccess);
+  EXPECT_FALSE(locks.enabled());  // the mask emptied
+
+  // Releasing lock 1 forgets lock 0 as well; 7 with enable false ends it all.
+  EXPECT_EQ(locks.setLockFromCommand(0, true), VSAResult::kSuccess);
+  locks.releaseLock(0);  // back to a lock the tests can take on one thread
+  EXPECT_EQ(locks.setLockFromCommand(3, true), VSAResult::kSuccess);
+  EXPECT_EQ(locks.setLockFromCommand(1, true), VSAResult::kSuccess);
+  EXPECT_EQ(locks.setLockFromCommand(1, false), VSAResult::kSuccess);
+  EXPECT_EQ(locks.countForLock(1), 0);
+  EXPECT_EQ(locks.setLockFromCommand(0, false), VSAResult::kSuccess);  // no longer in the mask
+  EXPECT_TRUE(locks.enabled());
+  EXPECT_EQ(locks.setLockFromCommand(7, false), VSAResult::kSuccess);
+  EXPECT_FALSE(locks.enabled());
+  EXPECT_EQ(locks.countForLock(3), 0);
+  EXPECT_EQ(VSALockTableSnapshot().allReaderWriterState, 0);
+}
+
+TEST(VSATestLocksDeathTest, AnUnbalancedReleaseEndsTheProcess) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_DEATH(
+      {
+        VSATestLocks locks;
+        locks.acquireLock(4);
+        locks.releaseLock(4);
+        locks.releaseLock(4);
+      },
+      "Unbalanced update to test lock: 4 by: -1 from: 0");
+}
+
+}  // namespace
