@@ -2,6 +2,9 @@
 
 #include <sys/stat.h>
 
+#include <cerrno>
+#include <cstring>
+
 #include "base/VSALocks.h"
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
@@ -140,11 +143,19 @@ bool VSAContainerContent::deleteUserManagedAssetWithContainerIdentity(
   if (!container) return false;
   std::string base = assetsDirectory(*container);
   auto& fm = *services_.fileManager;
-  if (fm.itemDoesNotExistAtURL(base)) return true;  // no assets, nothing to delete
-  auto asset = resolve(base, relativePath, origin, withError);
-  if (!asset) return false;
+  // The item named goes, a link itself rather than what it points to; the
+  // file system refuses a link on the way (ELOOP) or a file used as a
+  // directory (ENOTDIR).
+  auto asset = std::optional<std::string>(VSAPathJoin(base, relativePath));
+  struct stat st {};
+  int rc = fm.fileSystem().lstat(*asset, &st);
+  if (rc == ENOENT) return true;  // already gone, or no assets at all
+  if (rc != 0)
+    return fail(origin, VSAResult::kInvalidArgument, withError,
+                VSAFormat("Asset %@ cannot be reached: %s", VSAClientStringForLog(relativePath),
+                          std::strerror(rc)));
   VSAErrorRef error;
-  if (!services_.deathRow->_moveItemAtURLToDeathRow(*asset, true, true, &error))
+  if (!services_.deathRow->_moveItemAtURLToDeathRow(*asset, S_ISDIR(st.st_mode), true, &error))
     return fail(origin, codeOf(error, VSAResult::kDeathRowMoveFailed), withError,
                 VSAFormat("Failed to move asset %@ to death row: %@", *asset, error));
   VSALog(kVSALogNotice, origin, "Deleted user-managed asset %@", *asset);
@@ -226,12 +237,19 @@ bool VSAContainerContent::copyIntoPlace(const VSAMetadata& data, const std::stri
     return discard(codeOf(error, VSAResult::kWriteFailed),
                    VSAFormat("Failed to create %@: %@", parent, error));
   struct stat existing {};
-  if (fs.lstat(destination, &existing) == 0 && S_ISDIR(existing.st_mode) &&
-      !services_.deathRow->_moveItemAtURLToDeathRow(destination, true, true, &error))
-    return discard(codeOf(error, VSAResult::kDeathRowMoveFailed),
-                   VSAFormat("Failed to move %@ aside: %@", destination, error));
-  if (!fm.moveItemAtURL(staging, destination, &error))
+  if (fs.lstat(destination, &existing) != 0) {
+    if (!fm.moveItemAtURL(staging, destination, &error))
+      return discard(codeOf(error, VSAResult::kWriteFailed),
+                     VSAFormat("Failed to move %@ to %@: %@", staging, destination, error));
+    return true;
+  }
+  // The old content keeps its place until the new takes it in one step.
+  if (!fm.exchangeItemsAtURL(staging, destination, &error))
     return discard(codeOf(error, VSAResult::kWriteFailed),
-                   VSAFormat("Failed to move %@ to %@: %@", staging, destination, error));
+                   VSAFormat("Failed to exchange %@ and %@: %@", staging, destination, error));
+  // The old content is in staging now: death row takes it, or the next cleanup does.
+  if (!services_.deathRow->_moveItemAtURLToDeathRow(staging, S_ISDIR(existing.st_mode), true,
+                                                    &error))
+    VSALog(kVSALogError, origin, "Failed to move replaced %@ to death row: %@", staging, error);
   return true;
 }

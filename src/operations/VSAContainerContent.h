@@ -6,11 +6,11 @@
 // reach, 21 when there is none) and worked on under their identifier locks
 // (writing), re-checked once locked (21 if replaced meanwhile).
 //
-// Client paths are hostile: they must be relative, safe component by
-// component (no "..", ".", empty components or NUL; 11 otherwise) and,
-// resolved with the file manager's client-path rules, stay strictly inside
-// their base; the file system layer refuses any link met on the way when
-// the daemon then acts on the path.
+// Client paths are hostile: they must be relative and safe component by
+// component (no "..", ".", empty components or NUL; 11 otherwise). The file
+// system layer refuses any link met on the way (11); staging paths are
+// also resolved with the file manager's client-path rules and must stay
+// strictly inside their container.
 //
 // On disk:
 //  - the user-managed assets directory is "UserManagedAssets" at the top of
@@ -18,14 +18,15 @@
 //    been made), owned by the container's owner, mode 0755. It is made
 //    first and then recorded in the metadata file, so a crash between the
 //    two leaves a directory that the next request adopts.
-//  - deleting an asset moves it to death row (a missing asset is success);
-//    the assets directory itself cannot be named.
+//  - deleting an asset moves the item named (a link itself, not its target)
+//    to death row; a missing asset is success; the assets directory itself
+//    cannot be named.
 //  - staged shared content is copied (cloned where the file system can)
 //    from the bundle container (class 1) into the data container's staging
 //    directory, given to the data container's owner, then renamed into
-//    place: it lands whole or not at all. A directory already at the
-//    destination goes to death row just before the rename; a file is
-//    replaced by the rename itself. A regular source file that changes
+//    place: it lands whole or not at all. Content already at the
+//    destination is exchanged with the new in one step and then goes to
+//    death row, so the destination never goes missing. A regular source file that changes
 //    while it is copied fails the request (34) and nothing lands. Leftovers
 //    of a crash stay in staging, which keeper cleanup empties.
 #pragma once

@@ -84,6 +84,11 @@ int VSAFaultInjectingFileSystem::rename(const std::string& from, const std::stri
   return inner_->rename(from, to);
 }
 
+int VSAFaultInjectingFileSystem::exchange(const std::string& a, const std::string& b) {
+  if (int e = injected(Op::Rename)) return e;
+  return inner_->exchange(a, b);
+}
+
 int VSAFaultInjectingFileSystem::readlink(const std::string& path, std::string* target) {
   if (int e = injected(Op::Readlink)) return e;
   return inner_->readlink(path, target);

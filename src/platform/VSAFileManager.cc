@@ -211,6 +211,16 @@ int VSAFileManager::makePath(const std::string& path, mode_t mode, bool* created
 bool VSAFileManager::moveItemAtURL(const std::string& from, const std::string& to, VSAErrorRef* e) {
   return moveItem(from, to, true, e);
 }
+bool VSAFileManager::exchangeItemsAtURL(const std::string& a, const std::string& b,
+                                        VSAErrorRef* error) {
+  int rc = fs_->exchange(a, b);
+  if (rc == 0) return true;
+  VSASetError(error,
+              VSAFileManagerFail(rc, "exchangeItemsAtURL", "exchange of %@ and %@ failed: %s", a, b,
+                                 std::strerror(rc)));
+  return false;
+}
+
 bool VSAFileManager::moveItemIfExistsAtURL(const std::string& from, const std::string& to,
                                            VSAErrorRef* e) {
   return moveItem(from, to, false, e);

@@ -65,6 +65,8 @@ class VSAFileManager {
                             uid_t owner, uint32_t protectionClass, VSAErrorRef* error,
                             std::optional<gid_t> group = std::nullopt);
   bool moveItemAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
+  // Swaps two existing items atomically (each takes the other's place).
+  bool exchangeItemsAtURL(const std::string& a, const std::string& b, VSAErrorRef* error);
   bool moveItemIfExistsAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
   bool copyItemAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
   // Writes a whole file atomically and durably: a temporary file beside it

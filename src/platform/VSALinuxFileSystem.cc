@@ -86,6 +86,18 @@ int VSALinuxFileSystem::rename(const std::string& from, const std::string& to) {
   return 0;
 }
 
+int VSALinuxFileSystem::exchange(const std::string& a, const std::string& b) {
+  VSAUniqueFd aDir, bDir;
+  std::string aName, bName;
+  if (int rc = openParent(a, &aDir, &aName)) return rc;
+  if (int rc = openParent(b, &bDir, &bName)) return rc;
+  if (::renameat2(aDir.get(), aName.c_str(), bDir.get(), bName.c_str(), RENAME_EXCHANGE) != 0)
+    return errno;
+  syncDirectory(aDir.get());
+  syncDirectory(bDir.get());
+  return 0;
+}
+
 int VSALinuxFileSystem::readlink(const std::string& path, std::string* target) {
   return atParent(path, [&](int dir, const std::string& name) {
     char buf[1024];

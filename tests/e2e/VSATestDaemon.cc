@@ -144,6 +144,19 @@ void VSATestDaemon::crash() {
   pid_ = -1;
 }
 
+bool VSATestDaemon::waitForExit(std::chrono::seconds timeout, int* status) {
+  if (pid_ <= 0) return false;
+  auto deadline = std::chrono::steady_clock::now() + timeout;
+  while (std::chrono::steady_clock::now() < deadline) {
+    if (waitpid(pid_, status, WNOHANG) == pid_) {
+      pid_ = -1;
+      return true;
+    }
+    std::this_thread::sleep_for(10ms);
+  }
+  return false;
+}
+
 std::optional<VSAValue> VSATestDaemon::request(VSAValue body, std::chrono::milliseconds timeout) {
   VSAIPCClient client;
   if (!client.connect(socketPath(), nullptr)) return std::nullopt;

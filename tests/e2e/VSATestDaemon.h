@@ -70,6 +70,8 @@ class VSATestDaemon {
   int stop(std::chrono::seconds timeout = std::chrono::seconds(20));
   // SIGKILL and wait: the daemon dies wherever it is, as in a crash.
   void crash();
+  // Waits for the daemon to end by itself; true with its wait status.
+  bool waitForExit(std::chrono::seconds timeout, int* status);
   bool running() const { return pid_ > 0; }
   std::string socketPath() const { return root_ + "/run/vessad/com.tamsk.vessad"; }
 

@@ -1,0 +1,190 @@
+// End to end: test locks that freeze the real daemon (and the command that
+// releases them getting through while it is frozen), a daemon killed while
+// frozen inside a creation, the crash-retry test across real crashes, and
+// the commands that name content inside containers.
+#include <gtest/gtest.h>
+#include <sys/wait.h>
+
+#include <filesystem>
+#include <fstream>
+#include <future>
+
+#include "e2e/VSATestDaemon.h"
+
+namespace fs = std::filesystem;
+using namespace std::chrono_literals;
+
+namespace {
+
+const char* kAllowed = "com.tamsk.private.Vessa.allowed";
+const char* kTestability = "com.tamsk.private.Vessa.testability";
+
+VSAValue request(uint64_t command, const char* id, uint64_t containerClass = 2) {
+  return VSAValue::Dictionary{{"Command", VSAValue(command)},
+                              {"Identifier", VSAValue(id)},
+                              {"ContainerClass", VSAValue(containerClass)}};
+}
+VSAValue with(VSAValue body, const char* key, VSAValue value) {
+  body.set(key, std::move(value));
+  return body;
+}
+VSAValue testLock(uint64_t lock, bool enable) {
+  return VSAValue::Dictionary{{"Command", VSAValue(uint64_t{31})},
+                              {"TestLock", VSAValue(lock)},
+                              {"Enable", VSAValue(enable)}};
+}
+VSAValue create(const char* id, uint64_t containerClass = 2) {
+  return with(request(0, id, containerClass), "CreateIfNecessary", VSAValue(true));
+}
+void markInternal(VSATestDaemon& d) {
+  std::ofstream(d.path("/etc/vessad/device.plist"))
+      << "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict>"
+         "<key>HasInternalContent</key><true/></dict></plist>\n";
+}
+size_t entries(const std::string& dir) {
+  if (!fs::exists(dir)) return 0;
+  return static_cast<size_t>(std::distance(fs::directory_iterator(dir), {}));
+}
+template <typename Predicate>
+bool eventually(Predicate p, std::chrono::milliseconds limit = 10s) {
+  auto deadline = std::chrono::steady_clock::now() + limit;
+  while (!p()) {
+    if (std::chrono::steady_clock::now() > deadline) return false;
+    std::this_thread::sleep_for(10ms);
+  }
+  return true;
+}
+
+class Testability : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    markInternal(d);
+    d.registerSelf("com.example.tester", VSAValue::Dictionary{{kAllowed, VSAValue(true)},
+                                                              {kTestability, VSAValue(true)}});
+    ASSERT_TRUE(d.start());
+  }
+  std::future<std::optional<VSAValue>> later(VSAValue body) {
+    return std::async(std::launch::async, [this, body] { return d.request(body, 20s); });
+  }
+  std::string staging() { return d.path("/private/var/mobile/Containers/Staging"); }
+  VSATestDaemon d;
+};
+
+TEST_F(Testability, AFrozenDaemonStillTakesTheCommandThatReleasesIt) {
+  EXPECT_EQ(VSAReplyError(d.request(testLock(7, true))), 38u);
+  EXPECT_EQ(VSAReplyError(d.request(testLock(99, false))), 38u);
+  ASSERT_EQ(VSAReplyError(d.request(testLock(0, true))), 1u);
+  ASSERT_EQ(VSAReplyError(d.request(testLock(0, true))), 1u);  // held once
+  auto blocked = later(create("com.example.app"));
+  EXPECT_EQ(blocked.wait_for(500ms), std::future_status::timeout);
+  auto queued = later(request(23, "com.example.app"));  // behind it on the listener queue
+  EXPECT_EQ(queued.wait_for(200ms), std::future_status::timeout);
+  // One release suffices; the frozen creation then finishes, and the
+  // request after it sees the container.
+  ASSERT_EQ(VSAReplyError(d.request(testLock(0, false))), 1u);
+  EXPECT_EQ(VSAReplyError(blocked.get()), 1u);
+  EXPECT_EQ(VSAReplyError(queued.get()), 1u);
+
+  // Lock 6 stops a cache rebuild: a class not yet cached (plug-in data).
+  ASSERT_EQ(VSAReplyError(d.request(testLock(6, true))), 1u);
+  auto rebuild = later(create("com.example.plugin", 4));
+  EXPECT_EQ(rebuild.wait_for(500ms), std::future_status::timeout);
+  ASSERT_EQ(VSAReplyError(d.request(testLock(7, false))), 1u);  // everything off
+  EXPECT_EQ(VSAReplyError(rebuild.get()), 1u);
+  EXPECT_NE(d.daemonOutput().find("Waiting on lock: 6"), std::string::npos);
+  EXPECT_EQ(d.stop(), 0);
+}
+
+TEST_F(Testability, KilledWhileFrozenInsideACreationTheDaemonRestartsWithoutHalfAContainer) {
+  ASSERT_EQ(VSAReplyError(d.request(testLock(2, true))), 1u);
+  auto frozen = later(create("com.example.frozen"));
+  // Frozen between staging and the rename into place.
+  ASSERT_TRUE(eventually([&] { return entries(staging()) == 1; }));
+  EXPECT_EQ(frozen.wait_for(300ms), std::future_status::timeout);
+  d.crash();
+  EXPECT_EQ(VSAReplyError(frozen.get()), 0u);  // no reply ever came
+  ASSERT_TRUE(d.start());
+  EXPECT_EQ(VSAReplyError(d.request(request(0, "com.example.frozen"))), 21u);
+  EXPECT_TRUE(eventually([&] { return entries(staging()) == 0; }));
+  // The test locks did not survive the crash: creation runs straight through.
+  EXPECT_EQ(VSAReplyError(d.request(create("com.example.frozen"))), 1u);
+  EXPECT_EQ(d.stop(), 0);
+}
+
+TEST_F(Testability, TheRetryTestCrashesTheDaemonAsOftenAsAskedThenFinishes) {
+  auto retry = [&](uint64_t n) {
+    return d.request(VSAValue::Dictionary{{"Command", VSAValue(uint64_t{25})},
+                                          {"NumRetryCrashes", VSAValue(n)}});
+  };
+  EXPECT_EQ(VSAReplyError(retry(11)), 38u);
+  EXPECT_EQ(VSAReplyError(retry(0)), 1u);
+  EXPECT_EQ(VSAReplyError(retry(2)), 0u);  // the daemon died answering
+  int status = 0;
+  ASSERT_TRUE(d.waitForExit(20s, &status));
+  EXPECT_TRUE(WIFSIGNALED(status));
+  // The next start resumes the test and crashes once more; the one after finishes it.
+  ASSERT_TRUE(d.start(false));
+  ASSERT_TRUE(d.waitForExit(20s, &status));
+  ASSERT_TRUE(d.start());
+  EXPECT_TRUE(eventually([&] {
+    return d.daemonOutput().find("Retry test finished after 2 crashes") != std::string::npos;
+  }));
+  EXPECT_FALSE(fs::exists(d.path("/private/var/root/Library/Vessa/RetryTest.plist")));
+  EXPECT_EQ(d.stop(), 0);
+
+  // Not an internal build: command 31 does nothing and says success, 25 is refused.
+  fs::remove(d.path("/etc/vessad/device.plist"));
+  ASSERT_TRUE(d.start());
+  EXPECT_EQ(VSAReplyError(d.request(testLock(0, true))), 1u);
+  EXPECT_EQ(VSAReplyError(d.request(create("com.example.app"), 5s)), 1u);  // not frozen
+  EXPECT_EQ(VSAReplyError(retry(1)), 55u);
+  EXPECT_EQ(d.stop(), 0);
+}
+
+TEST(DaemonContent, AssetsAndSharedContentThroughTheSocket) {
+  VSATestDaemon d;
+  d.registerSelf("com.example.installer", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
+  ASSERT_TRUE(d.start());
+  ASSERT_EQ(VSAReplyError(d.request(create("com.example.app", 1))), 1u);
+  auto data = d.request(create("com.example.app"));
+  ASSERT_EQ(VSAReplyError(data), 1u);
+  std::string dataPath = VSAReplyString(data, "ReplyPath");
+
+  auto assets = [&](bool relative, bool createIt) {
+    return d.request(with(with(request(28, "com.example.app"), "IsRelative", VSAValue(relative)),
+                          "CreateIfNecessary", VSAValue(createIt)));
+  };
+  auto first = assets(false, true);
+  ASSERT_EQ(VSAReplyError(first), 1u);
+  EXPECT_EQ(VSAReplyString(first, "ReplyPath"), dataPath + "/UserManagedAssets");
+  EXPECT_FALSE(*first->get("ReplyExisted")->boolValue());
+  auto second = assets(true, true);
+  EXPECT_EQ(VSAReplyString(second, "ReplyPath"), "UserManagedAssets");
+  EXPECT_TRUE(*second->get("ReplyExisted")->boolValue());
+  std::ofstream(dataPath + "/UserManagedAssets/song") << "la";
+  auto remove = [&](VSAValue path) {
+    return VSAReplyError(d.request(with(request(29, "com.example.app"), "SourcePath", path)));
+  };
+  EXPECT_EQ(remove(VSAValue("../Documents")), 11u);
+  EXPECT_EQ(remove(VSAValue(uint64_t{3})), 11u);
+  EXPECT_EQ(remove(VSAValue("song")), 1u);
+  EXPECT_FALSE(fs::exists(dataPath + "/UserManagedAssets/song"));
+
+  auto bundle = d.request(request(0, "com.example.app", 1));
+  std::string bundlePath = VSAReplyString(bundle, "ReplyPath");
+  std::ofstream(bundlePath + "/shared.db") << "rows";
+  auto stage = [&](const char* src, const char* dst) {
+    VSAValue body = with(with(request(26, "com.example.app"), "SourcePath", VSAValue(src)),
+                         "DestPath", VSAValue(dst));
+    return d.request(body);
+  };
+  auto staged = stage("shared.db", "Library/shared.db");
+  ASSERT_EQ(VSAReplyError(staged), 1u);
+  EXPECT_EQ(VSAReplyString(staged, "ReplyPath"), dataPath + "/Library/shared.db");
+  std::ifstream in(dataPath + "/Library/shared.db");
+  EXPECT_EQ(std::string(std::istreambuf_iterator<char>(in), {}), "rows");
+  EXPECT_EQ(VSAReplyError(stage("shared.db", "/etc/shadow")), 11u);
+  EXPECT_EQ(d.stop(), 0);
+}
+
+}  // namespace
