@@ -108,6 +108,38 @@ echo "(a process that is not the kernel bridge is answered with return code 5:)"
 cp "$build/vessa-upcall" "$root/tmp/not-the-kernel"
 ctl "$root/tmp/not-the-kernel" --root "$root" --signing-id com.example.demo --uid 501 --persona 1000
 
+step "User-managed assets (command 28 twice: made, then found; 29 deletes one asset)"
+ctl "$installer" --root "$root" --json Command=28 Identifier=com.example.demo ContainerClass=2 \
+  CreateIfNecessary=true IsRelative=true
+assets=$("$installer" --root "$root" --json Command=28 Identifier=com.example.demo ContainerClass=2 \
+  CreateIfNecessary=true | sed -n 's/.*"ReplyPath": *"\([^"]*\)".*/\1/p')
+echo "  (asked again: the same directory, ReplyExisted true)"
+echo "la la" > "$assets/song.m4a"
+ctl "$installer" --root "$root" Command=29 Identifier=com.example.demo ContainerClass=2 SourcePath=../Documents
+ctl "$installer" --root "$root" Command=29 Identifier=com.example.demo ContainerClass=2 SourcePath=song.m4a
+echo "assets directory now holds $(ls -A "$assets" | wc -l) entries"
+
+step "Shared content from the app's bundle into its data container (command 26)"
+ctl "$installer" --root "$root" Command=0 Identifier=com.example.demo ContainerClass=1 CreateIfNecessary=true
+bundle=$("$installer" --root "$root" --json Command=0 Identifier=com.example.demo ContainerClass=1 |
+  sed -n 's/.*"ReplyPath": *"\([^"]*\)".*/\1/p')
+mkdir -p "$bundle/Shared"; echo "shared words" > "$bundle/Shared/dictionary.txt"
+ctl "$installer" --root "$root" --json Command=26 Identifier=com.example.demo \
+  SourcePath=Shared DestPath=Library/Shared
+echo "(a path that climbs out is refused with 11:)"
+ctl "$installer" --root "$root" Command=26 Identifier=com.example.demo SourcePath=Shared DestPath=../../x
+
+step "Test lock 0 freezes container operations until command 31 releases it (internal build)"
+ctl "$installer" --root "$root" Command=31 TestLock=0 Enable=true
+"$installer" --root "$root" Command=0 Identifier=com.example.frozen ContainerClass=2 \
+  CreateIfNecessary=true > "$root/tmp/frozen.out" &
+frozen=$!
+sleep 0.5
+echo "after 0.5 s the creation has $( [ -s "$root/tmp/frozen.out" ] && echo answered || echo "not answered (frozen)")"
+ctl "$installer" --root "$root" Command=31 TestLock=0 Enable=false
+wait $frozen || true
+echo "released; the creation answered:"; grep -o 'ReplyError[^,}]*' "$root/tmp/frozen.out" | head -1
+
 step "Locking the device, then asking for protection class 1 with retry (command 21)"
 ctl "$installer" --root "$root" --json Command=21 Identifier=com.example.demo ContainerClass=2 \
   DataProtectionClass:i64=3

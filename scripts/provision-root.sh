@@ -67,6 +67,7 @@ cat > "$root/etc/vessad/clients.d/demo-installer.plist" <<PL
     <key>com.tamsk.private.Vessa.allowed</key><true/>
     <key>com.tamsk.private.Vessa.userManagedAssets</key><true/>
     <key>com.tamsk.private.Vessa.deleteContainerContent</key><true/>
+    <key>com.tamsk.private.Vessa.testability</key><true/>
   </dict>
   <key>Sandboxed</key><false/>
 $user_key

@@ -47,13 +47,13 @@ const char* kCommandNames[kVSACommandCount] = {
     "recreate default structure",
     "disk usage of a container",
     "run the data migration",
-    "crash-retry test",
-    "stage shared content",
+    "crash-retry test (NumRetryCrashes; internal builds; the daemon crashes)",
+    "stage shared content (SourcePath in the bundle, DestPath in the data container)",
     "retired",
-    "user-managed assets path",
-    "delete a user-managed asset",
+    "user-managed assets path (IsRelative, CreateIfNecessary)",
+    "delete a user-managed asset (SourcePath)",
     "run the per-user data migration",
-    "set or clear a test lock",
+    "set or clear a test lock (TestLock 0-6, 7 = all; Enable; internal builds)",
     "persona unique strings"};
 
 void usage(FILE* out) {
