@@ -92,6 +92,17 @@ class VSACodeSigningMapping {
   void reconcileSystemContainersWithCommandQueue(VSACommandQueue* commandQueue);
   std::optional<VSAReferenceCounts> copyReferenceCountSetOfType(int groupType);
 
+  // Legacy migrations (VSACodeSigningMappingLegacy.cc). Moves the legacy
+  // entitlements file ("vsa_entitlements.plist") into the database: every
+  // identifier without a valid entry gets one; the file goes once every
+  // identifier is in the database, so a failed or interrupted run is redone.
+  // True when there was nothing to do or everything moved.
+  bool migrateDataFromLegacyEntitlementsFileToCodeSigningFile();
+  // Adds `entry` for `identifier` unless the database holds one that is
+  // valid (`*kept` set then). The caller logs; false on a database failure.
+  bool addLegacyEntryUnlessValid(const std::string& identifier, const VSACodeSigningEntry& entry,
+                                 bool* kept, VSAErrorRef* error);
+
   // Group identifiers from an entitlements dictionary (string or array of
   // strings; duplicates removed); nothing for other shapes (logged).
   static std::optional<std::vector<std::string>> copyApplicationGroupEntitlementForIdentifier(
@@ -107,6 +118,10 @@ class VSACodeSigningMapping {
 
  private:
   void _onQueue_migrateFromMappingFileToDBIfNecessary();
+  bool _onQueue_migrateDataFromLegacyEntitlementsFileToCodeSigningFile();
+  bool _onQueue_addLegacyEntryUnlessValid(const std::string& identifier,
+                                          const VSACodeSigningEntry& entry, bool* kept,
+                                          VSAErrorRef* error);
   VSAResultCode _onQueue_processCodeSigningInfo(const std::optional<VSAValue>& info,
                                                 const std::string& identifier,
                                                 const VSAValue& options,

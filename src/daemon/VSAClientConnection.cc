@@ -1,5 +1,6 @@
 #include "daemon/VSAClientConnection.h"
 
+#include "base/VSALog.h"
 #include "operations/VSABootKeeper.h"
 #include "operations/VSAContainerContent.h"
 #include "operations/VSAContainerDeletion.h"
@@ -129,7 +130,63 @@ VSAClientConnection::groupContainerIdentifiersForOwnerIdentifier(
       .groupContainerIdentifiersForOwnerIdentifier(owner, groupContainerClass, withError);
 }
 
-void VSAClientConnection::rebootKeeperSetup() { VSABootKeeper(services_).rebootKeeperSetup(); }
+void VSAClientConnection::rebootKeeperSetup() {
+  performBuildUpgradeStepIfNeeded();
+  VSABootKeeper(services_).rebootKeeperSetup();
+}
+
+void VSAClientConnection::performBuildUpgradeStepIfNeeded() {
+  auto status = VSAMigrationStatus::initForSystemMigration(
+      *context_.globalConfiguration,
+      context_.systemRoot.resolve("/etc/vessad/system-version.plist"));
+  if (!status || !status->isBuildUpgrade()) return;
+  VSABootKeeper(services_)._regenerateAllSystemContainerPaths(grants_);
+  VSAErrorRef error;
+  if (!context_.containerMigrator->performSynchronousBuildUpgradeMigration(*status, &error))
+    VSALogIn(VSALogCategory::Startup, kVSALogError, "rebootKeeperSetup",
+             "Failed to perform build upgrade migration : %@", error);
+  status->writeCurrentBuildInfoToDisk();
+}
+
+VSAMigrationClient VSAClientConnection::migrationClient() {
+  VSAMigrationClient client;
+  client.bundleIdentifier =
+      clientIdentity_ ? clientIdentity_->bundleIdentifier() : std::string("<unknown>");
+  client.recreateDefaultStructure = [this](const VSAContainerIdentityRef& identity,
+                                           VSAResultCode* code) {
+    return recreateDefaultStructureWithContainerIdentity(identity, code);
+  };
+  client.deleteContainer = [this](const VSAContainerIdentityRef& identity, VSAResultCode* code) {
+    deleteContainerWithContainerIdentity(identity, false, code);
+    return *code == VSAResult::kSuccess;
+  };
+  client.setDataProtection = [protection = context_.dataProtectionManager](
+                                 const VSAMetadata& container, int32_t protectionClass) {
+    if (VSADataProtectionManager::currentProtectionClassOfMetadata(container) == protectionClass)
+      return;
+    std::string name = container.identifier();
+    auto c = static_cast<unsigned long long>(container.containerClass());
+    protection->setDataProtectionOnDataContainerForContainerIdentity(
+        *container.containerIdentity(), protectionClass, true, true,
+        [protectionClass, name, c, url = container.url()](VSAResultCode code) {
+          if (code != VSAResult::kSuccess)
+            VSALogIn(VSALogCategory::Startup, kVSALogError, "_setDataProtectionIfNecessaryOnContainer",
+                     "Error setting protection class %d on %@:%llu (%@) : %llu", protectionClass,
+                     name, c, url, code);
+        });
+  };
+  return client;
+}
+
+bool VSAClientConnection::performDataMigratorMigrationForClientConnection(VSAResultCode* withError) {
+  return context_.containerMigrator->performDataMigratorMigrationForClientConnection(
+      migrationClient(), *commandQueue_, withError);
+}
+
+bool VSAClientConnection::performPerUserDataMigrationForClientConnection(VSAResultCode* withError) {
+  return context_.containerMigrator->performPerUserDataMigrationForClientConnection(
+      migrationClient(), withError);
+}
 
 void VSAClientConnection::keeperSetup() { VSABootKeeper(services_).keeperSetup(); }
 

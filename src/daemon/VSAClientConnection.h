@@ -123,6 +123,10 @@ class VSAClientConnection {
                                                              const std::string& sourceRelativePath,
                                                              const std::string& destRelativePath,
                                                              VSAResultCode* withError);
+  // Migrations (VSAContainerMigrator), on behalf of this client.
+  bool performDataMigratorMigrationForClientConnection(VSAResultCode* withError);
+  bool performPerUserDataMigrationForClientConnection(VSAResultCode* withError);
+
   // The crash-retry test (VSARetryTest); may end the process on purpose.
   bool retryTestWithNumCrashes(uint64_t numCrashes, VSAResultCode* withError);
 
@@ -142,4 +146,10 @@ class VSAClientConnection {
   VSAOperationGrants grants_;
   std::shared_ptr<VSACommandQueue> commandQueue_;
   VSAIPCMessageRef relayMessage_;
+
+  VSAMigrationClient migrationClient();
+  // The first step of reboot setup: after a build upgrade, new directory
+  // names for system containers, the build-upgrade migration, and the
+  // build recorded whether or not the migration succeeded.
+  void performBuildUpgradeStepIfNeeded();
 };

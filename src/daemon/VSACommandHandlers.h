@@ -27,6 +27,11 @@ void VSAHandleDeleteUserManagedAsset(const VSAValue& request, VSAValue& reply,
                                      VSAClientConnection& connection, VSAResultCode* result);
 void VSAHandleStageSharedContent(const VSAValue& request, VSAValue& reply,
                                  VSAClientConnection& connection, VSAResultCode* result);
+// Commands 24 and 30: the system-wide and the per-user data migration.
+void VSAHandleDataMigration(const VSAValue& request, VSAValue& reply,
+                            VSAClientConnection& connection, VSAResultCode* result);
+void VSAHandlePerUserDataMigration(const VSAValue& request, VSAValue& reply,
+                                   VSAClientConnection& connection, VSAResultCode* result);
 // Command 25: starts the crash-retry test ("NumRetryCrashes"); internal builds only.
 void VSAHandleRetryTest(const VSAValue& request, VSAValue& reply, VSAClientConnection& connection,
                         VSAResultCode* result);

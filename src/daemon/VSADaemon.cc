@@ -23,6 +23,7 @@ VSADaemon::VSADaemon(Options options)
                                                   VSADaemonContext::FileSystemWrapper{}, false)) {
   firstBootSemaphore_ =
       VSANamedSemaphore::nameForRoot(kVSAFirstBootSemaphore, context_->systemRoot);
+  if (options_.afterBoot) VSANamedSemaphore::remove(firstBootSemaphore_);
   VSALogger::shared().setLevel(options_.logLevel);
 }
 

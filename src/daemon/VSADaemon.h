@@ -31,6 +31,7 @@ class VSADaemon {
   struct Options {
     std::string root = "/";
     int logLevel = 5;
+    bool afterBoot = false;  // forget the first-boot marker: this start follows a boot
   };
 
   explicit VSADaemon(Options options);

@@ -14,10 +14,12 @@
 #include <memory>
 
 #include "base/VSAWorkQueue.h"
+#include "codesigning/VSACodeSigningMigration.h"
 #include "codesigning/VSACodeSigningMapping.h"
 #include "codesigning/VSAGroupManager.h"
 #include "codesigning/VSAWhitelist.h"
 #include "dataprotection/VSADataProtectionManager.h"
+#include "migration/VSAContainerMigrator.h"
 #include "model/VSAContainerCache.h"
 #include "model/VSAGlobalConfiguration.h"
 #include "model/VSAUserIdentitySharedCache.h"
@@ -122,6 +124,36 @@ struct VSADaemonContext {
         std::make_shared<VSAGroupManager>(userIdentityCache, codeSigningMapping, containerCache,
                                           globalConfiguration, stageEnvironment);
     buildOperationServices(mapping);
+    buildContainerMigrator();
+  }
+
+  // The migrator, with the code-signing pass, whitelist and data-protection
+  // answers it needs as functions over this context's objects.
+  void buildContainerMigrator() {
+    VSAMigrationHooks h;
+    h.configuration = globalConfiguration;
+    h.userIdentityCache = userIdentityCache;
+    h.containerCache = containerCache;
+    h.systemVersionPath = systemRoot.resolve("/etc/vessad/system-version.plist");
+    h.oldBundleLocation = systemRoot.resolve("/private/var/mobile/Containers/Bundle");
+    h.deprecatedContainersPath = systemRoot.resolve("/etc/vessad/deprecated-containers.plist");
+    h.wellknownContainerForId = operationServices->wellknownContainerForId;
+    h.intendedDataProtectionClass = operationServices->intendedDataProtectionClass;
+    std::weak_ptr<VSACodeSigningMapping> mapping = codeSigningMapping;
+    h.parentIdentifier = [mapping](const std::string& child) -> std::optional<std::string> {
+      auto m = mapping.lock();
+      return m ? m->parentIdentifierForChildIdentifier(child) : std::nullopt;
+    };
+    h.codeSigningMigration = [this](VSACommandQueue& queue, VSAMigrationStatus& status) {
+      VSAMigrationMarkers markers{
+          [&status](const std::string& t) { return status.hasMigrationOccurredForType(t); },
+          [&status](const std::string& t) { return status.setMigrationCompleteForType(t); }};
+      return VSACodeSigningMigration(codeSigningMapping, groupManager, containerCache,
+                                     globalConfiguration, userIdentityCache, deviceProperties,
+                                     std::move(markers))
+          .performAllCodeSigningMigrationAndReconciliationWithCommandQueue(queue);
+    };
+    containerMigrator = std::make_shared<VSAContainerMigrator>(std::move(h));
   }
 
   // What the container operations work with; the code-signing, whitelist and
@@ -197,6 +229,7 @@ struct VSADaemonContext {
   std::shared_ptr<VSAGroupManager> groupManager;  // the default group manager
   std::shared_ptr<VSAStageForDeleteEnvironment> stageEnvironment;
   std::shared_ptr<VSAOperationServices> operationServices;
+  std::shared_ptr<VSAContainerMigrator> containerMigrator;
 
   VSAWorkQueue::Ref listenerQueue;   // "com.tamsk.vessad.listener"
   VSAWorkQueue::Ref deathrowQueue;   // "com.tamsk.vessad.deathrow"

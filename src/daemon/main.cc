@@ -1,6 +1,6 @@
 // vessad: the container-keeping daemon.
 //
-//   vessad [--root DIR] [--log-level N] [--stderr]
+//   vessad [--root DIR] [--log-level N] [--stderr] [--after-boot]
 //
 // SIGTERM and SIGINT stop it cleanly once open transactions have ended.
 #include <signal.h>
@@ -19,10 +19,13 @@
 namespace {
 void usage(FILE* out) {
   std::fprintf(out,
-               "usage: vessad [--root DIR] [--log-level N] [--stderr]\n"
+               "usage: vessad [--root DIR] [--log-level N] [--stderr] [--after-boot]\n"
                "  --root DIR      system root standing for the device's \"/\" (default /)\n"
                "  --log-level N   writer level: 3 error, 5 notice (default), 6 info, 7 debug\n"
-               "  --stderr        send the unified log to stderr even when journald runs\n");
+               "  --stderr        send the unified log to stderr even when journald runs\n"
+               "  --after-boot    start as the first daemon after a device boot (runs the\n"
+               "                  first-boot setup and cleanup: upgrade migration, transient\n"
+               "                  directories); the device's own boot does this by itself\n");
 }
 }  // namespace
 
@@ -34,6 +37,8 @@ int main(int argc, char** argv) {
       options.root = argv[++i];
     } else if (a == "--log-level" && i + 1 < argc) {
       options.logLevel = std::atoi(argv[++i]);
+    } else if (a == "--after-boot") {
+      options.afterBoot = true;
     } else if (a == "--stderr") {
       VSALogger::shared().setUseStderr(true);
     } else if (a == "--help" || a == "-h") {

@@ -4,6 +4,7 @@
 
 #include "base/VSALog.h"
 #include "model/VSAPerUserConfiguration.h"
+#include "operations/VSAContainerMaintenance.h"
 #include "operations/VSAReplaceOperation.h"
 #include "operations/VSARetryTest.h"
 
@@ -12,8 +13,33 @@
 // complete so that start-up posts its notifications.
 void VSABootKeeper::rebootKeeperSetup() {
   VSALogIn(VSALogCategory::Startup, kVSALogNotice, __func__,
-           "First-boot setup: migration and system container restore are not available in this "
-           "build");
+           "First-boot setup: system container restore and group reconciliation are not "
+           "available in this build");
+}
+
+void VSABootKeeper::_regenerateAllSystemContainerPaths(const VSAOperationGrants& grants) {
+  const char* origin = "_regenerateAllSystemContainerPaths";
+  VSAContainerMaintenance maintenance(services_);
+  for (VSAContainerClass c : {12, 13}) {
+    VSAErrorRef error;
+    auto all = services_.containerCache->allContainersForUserIdentity(grants.clientUserIdentity, c,
+                                                                      false, false, &error);
+    if (!all) {
+      VSALogIn(VSALogCategory::Startup, kVSALogError, origin,
+               "Failed to get list of system containers for migration: %@", error);
+      continue;
+    }
+    for (const auto& m : *all) {
+      const std::string& id = m->identifier();
+      bool wellKnown = services_.wellknownContainerForId && services_.wellknownContainerForId(id, c);
+      if (id.empty() || wellKnown || id == kVSAAnalyticsSystemGroupIdentifier) continue;
+      VSAResultCode code = VSAResult::kSuccess;
+      if (!maintenance.regenerateDirectoryUUIDWithContainerIdentity(m->containerIdentity(), &code))
+        VSALogIn(VSALogCategory::Startup, kVSALogError, origin,
+                 "Failed to regenerate directory UUID for identifier: %@, class: %llu", id,
+                 static_cast<unsigned long long>(c));
+    }
+  }
 }
 
 void VSABootKeeper::keeperSetup() {

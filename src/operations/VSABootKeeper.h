@@ -8,7 +8,14 @@
 
 #include <functional>
 
+#include "operations/VSAOperationGrants.h"
 #include "operations/VSAOperationServices.h"
+
+// The system group whose container keeps its directory across upgrades,
+// like the well-known ones: analytics collected before the upgrade stay
+// where their readers look for them.
+inline constexpr const char* kVSAAnalyticsSystemGroupIdentifier =
+    "systemgroup.com.tamsk.osanalytics";
 
 class VSABootKeeper {
  public:
@@ -18,6 +25,10 @@ class VSABootKeeper {
   void keeperSetup();
   void rebootKeeperCleanupWithCompletion(std::function<void()> completion);
   void keeperCleanupWithCompletion(std::function<void()> completion);
+  // After a build upgrade: a new directory UUID for every system (group)
+  // container that is not well known (their names are fixed) and not the
+  // analytics system group (kVSAAnalyticsSystemGroupIdentifier).
+  void _regenerateAllSystemContainerPaths(const VSAOperationGrants& grants);
 
  private:
   const VSAOperationServices& services_;

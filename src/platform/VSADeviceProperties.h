@@ -21,6 +21,13 @@ class VSADeviceProperties {
   bool hasInternalContent() const { return flag(device_, "HasInternalContent", false); }
   bool usesEphemeralStorage() const { return flag(device_, "UsesEphemeralStorage", false); }
   bool isMultiUser() const { return flag(device_, "MultiUser", false); }
+  // The multi-user configuration flags' top bit (bit 31): the device runs
+  // in multi-user mode. False when the flags cannot be read.
+  bool multiUserFlagsTopBitSet() const {
+    const VSAValue* flags = device_.get("MultiUserFlags");
+    auto value = flags ? flags->uint64Value() : std::nullopt;
+    return value && (*value & 0x80000000u);
+  }
   bool isFeatureEnabled(const std::string& name, bool defaultValue = false) const {
     return flag(features_, name, defaultValue);
   }

@@ -1,0 +1,178 @@
+#include "codesigning/VSACodeSigningMigration.h"
+
+#include "base/VSALocks.h"
+#include "base/VSALog.h"
+
+namespace {
+constexpr const char* kGroupIdMigration = "GroupIdMigration";
+constexpr const char* kCodeSigningMigration = "CodeSigningMigration";
+
+template <typename... A>
+void logMigration(int level, const char* origin, const char* format, const A&... args) {
+  VSALogIn(VSALogCategory::CodeSignMapping, level, origin, format, args...);
+}
+
+// The data container class an app's entry records for its bundle class.
+VSAContainerClass dataClassForBundleClass(VSAContainerClass bundleClass) {
+  switch (bundleClass) {
+    case 1: return 2;
+    case 3: return 4;
+    case 5: return 6;
+    default: return 0;
+  }
+}
+}  // namespace
+
+VSACodeSigningMigration::VSACodeSigningMigration(
+    std::shared_ptr<VSACodeSigningMapping> mapping, std::shared_ptr<VSAGroupManager> groupManager,
+    std::shared_ptr<VSAContainerCache> containerCache,
+    std::shared_ptr<VSAGlobalConfiguration> configuration,
+    std::shared_ptr<VSAUserIdentityCache> userIdentityCache,
+    std::shared_ptr<const VSADeviceProperties> deviceProperties, VSAMigrationMarkers markers)
+    : mapping_(std::move(mapping)),
+      groupManager_(std::move(groupManager)),
+      containerCache_(std::move(containerCache)),
+      configuration_(std::move(configuration)),
+      userIdentityCache_(std::move(userIdentityCache)),
+      deviceProperties_(std::move(deviceProperties)),
+      markers_(std::move(markers)) {}
+
+bool VSACodeSigningMigration::performAllCodeSigningMigrationAndReconciliationWithCommandQueue(
+    VSACommandQueue& commandQueue) {
+  VSAAllIdentifiersLockGuard lock(true);
+  bool multiUser = deviceProperties_->multiUserFlagsTopBitSet();
+  bool ok = true;
+  if (!multiUser) ok = migrateAppGroupIdsFromDataContainersToFile() && ok;
+  ok = mapping_->migrateDataFromLegacyEntitlementsFileToCodeSigningFile() && ok;
+  ok = migrateCachedCodeSigningInfoFromBundleContainersToMapping() && ok;
+  if (!multiUser) groupManager_->reconcileGroupContainersOfType(kVSAGroupTypeApplication, commandQueue);
+  return ok;
+}
+
+std::optional<std::vector<VSAMetadataRef>> VSACodeSigningMigration::containers(
+    const VSAUserIdentityRef& user, VSAContainerClass c, VSAErrorRef* error) {
+  return containerCache_->allContainersForUserIdentity(user, c, false, false, error);
+}
+
+bool VSACodeSigningMigration::clearInfoValue(const VSAMetadata& container, const char* key) {
+  VSAErrorRef error;
+  auto fresh = VSAMetadata::readAndValidateMetadataAtUrl(container.url(), container.userIdentity(),
+                                                         false, *configuration_,
+                                                         *userIdentityCache_, &error);
+  if (!fresh) return false;
+  VSAValue info = fresh->info() && fresh->info()->isDictionary() ? *fresh->info()
+                                                                 : VSAValue::dictionary();
+  info.remove(key);
+  fresh->setInfo(std::move(info));
+  return fresh->writeMetadataToDiskWithError(*configuration_, &error) &&
+         containerCache_->addContainerMetadata(*fresh, fresh->url(), false, true, &error);
+}
+
+bool VSACodeSigningMigration::migrateAppGroupIdsFromDataContainersToFile() {
+  const char* origin = "migrateAppGroupIdsFromDataContainersToFile";
+  if (markers_.hasMigrationOccurredForType(kGroupIdMigration)) return true;
+  logMigration(kVSALogNotice, origin, "Performing group ID migration");
+  auto user = userIdentityCache_->userIdentityForLegacyMobileUser();
+  bool ok = true;
+  for (VSAContainerClass c : {2, 4, 6}) {
+    VSAErrorRef error;
+    auto list = containers(user, c, &error);
+    if (!list) {
+      logMigration(kVSALogError, origin,
+                   "Failed to fetch list of containers for userId: 501, class %ld : %@",
+                   static_cast<long>(c), error);
+      ok = false;
+      continue;
+    }
+    for (const auto& container : *list) {
+      const VSAValue* ids = container->info() ? container->info()->get(kVSAGroupContainerIDsKey)
+                                              : nullptr;
+      if (!ids) continue;
+      const std::string& id = container->identifier();
+      logMigration(kVSALogDebug, origin,
+                   "Data container for userId: 501, identifier %@ references container IDs: %@",
+                   id, *ids);
+      VSACodeSigningEntry entry(
+          VSAValue::Dictionary{
+              {kVSAEntitlementsKey, VSAValue::Dictionary{{kVSAEntitlementApplicationGroups, *ids}}}},
+          c);
+      entry.setInvalid(true);  // keeps the references alive, is no real signature
+      bool kept = false;
+      VSAErrorRef addError;
+      bool existed = mapping_->codeSigningEntryForIdentifier(id, nullptr).has_value();
+      if (existed) {
+        logMigration(kVSALogNotice, origin,
+                     "Deleting app group entitlements for %@ because we already have them in mapping",
+                     id);
+      } else if (!mapping_->addLegacyEntryUnlessValid(id, entry, &kept, &addError)) {
+        logMigration(kVSALogError, origin, "Failed to write migrated group id info to DB for %@ : %@",
+                     id, addError);
+        ok = false;
+        continue;  // the value stays for the next run
+      } else {
+        logMigration(kVSALogNotice, origin, "Migrating app group entitlements for %@", id);
+      }
+      if (!clearInfoValue(*container, kVSAGroupContainerIDsKey)) {
+        logMigration(kVSALogError, origin, "Failed to clear group id metadata for %@ : %llu", id,
+                     VSAResult::kWriteFailed);
+        ok = false;
+      }
+    }
+  }
+  return ok && markers_.setMigrationCompleteForType(kGroupIdMigration);
+}
+
+bool VSACodeSigningMigration::migrateCachedCodeSigningInfoFromBundleContainersToMapping() {
+  const char* origin = "migrateCachedCodeSigningInfoFromBundleContainersToMapping";
+  if (markers_.hasMigrationOccurredForType(kCodeSigningMigration)) return true;
+  logMigration(kVSALogNotice, origin, "Performing code signing migration");
+  auto user = userIdentityCache_->defaultUserIdentity();
+  bool ok = true;
+  for (VSAContainerClass c : {1, 3, 5, 8}) {
+    VSAErrorRef error;
+    auto list = containers(user, c, &error);
+    if (!list) {
+      logMigration(kVSALogError, origin, "Failed to fetch list of containers for class %llu : %@",
+                   static_cast<unsigned long long>(c), error);
+      ok = false;
+      continue;
+    }
+    for (const auto& container : *list) {
+      const VSAValue* cached = container->info()
+                                   ? container->info()->get(kVSACachedCodeSigningInfoKey)
+                                   : nullptr;
+      if (!cached || !cached->isDictionary()) continue;
+      const std::string& id = container->identifier();
+      VSAValue info = *cached;
+      if (const VSAValue* entitlements = cached->get("Entitlements")) {
+        info.set(kVSAEntitlementsKey, *entitlements);
+        info.remove("Entitlements");
+      }
+      bool kept = false;
+      VSAErrorRef addError;
+      if (!mapping_->addLegacyEntryUnlessValid(
+              id, VSACodeSigningEntry(std::move(info), dataClassForBundleClass(c)), &kept,
+              &addError)) {
+        logMigration(kVSALogError, origin,
+                     "Failed to write migrated cached cs info from bundle container to DB for %@ "
+                     ": %@",
+                     id, addError);
+        ok = false;
+        continue;
+      }
+      if (kept)
+        logMigration(kVSALogNotice, origin,
+                     "Deleting cached code signing info for %@ because we already have it in "
+                     "mapping",
+                     id);
+      else
+        logMigration(kVSALogNotice, origin, "Migrating code signing info for %@", id);
+      if (!clearInfoValue(*container, kVSACachedCodeSigningInfoKey)) {
+        logMigration(kVSALogError, origin, "Error setting info value for identity %@ : %llu",
+                     container->containerIdentity()->description(), VSAResult::kWriteFailed);
+        ok = false;
+      }
+    }
+  }
+  return ok && markers_.setMigrationCompleteForType(kCodeSigningMigration);
+}
