@@ -67,8 +67,8 @@ bool VSACodeSigningMapping::_onQueue_migrateDataFromLegacyEntitlementsFileToCode
   VSAErrorRef error;
   auto file = VSA_dictionaryWithContentsOfURL(path, 0, &error);
   if (!file) {
-    logLegacy(kVSALogError, origin, "Entitlement File exists at %@, but we unexpectedly cant read it",
-              path);
+    logLegacy(kVSALogError, origin,
+              "Entitlement File exists at %@, but we unexpectedly cant read it", path);
     return false;
   }
   VSAValue children = file->get(kChildren) ? *file->get(kChildren) : VSAValue();

@@ -15,10 +15,14 @@ void logMigration(int level, const char* origin, const char* format, const A&...
 // The data container class an app's entry records for its bundle class.
 VSAContainerClass dataClassForBundleClass(VSAContainerClass bundleClass) {
   switch (bundleClass) {
-    case 1: return 2;
-    case 3: return 4;
-    case 5: return 6;
-    default: return 0;
+    case 1:
+      return 2;
+    case 3:
+      return 4;
+    case 5:
+      return 6;
+    default:
+      return 0;
   }
 }
 }  // namespace
@@ -45,7 +49,8 @@ bool VSACodeSigningMigration::performAllCodeSigningMigrationAndReconciliationWit
   if (!multiUser) ok = migrateAppGroupIdsFromDataContainersToFile() && ok;
   ok = mapping_->migrateDataFromLegacyEntitlementsFileToCodeSigningFile() && ok;
   ok = migrateCachedCodeSigningInfoFromBundleContainersToMapping() && ok;
-  if (!multiUser) groupManager_->reconcileGroupContainersOfType(kVSAGroupTypeApplication, commandQueue);
+  if (!multiUser)
+    groupManager_->reconcileGroupContainersOfType(kVSAGroupTypeApplication, commandQueue);
   return ok;
 }
 
@@ -56,12 +61,12 @@ std::optional<std::vector<VSAMetadataRef>> VSACodeSigningMigration::containers(
 
 bool VSACodeSigningMigration::clearInfoValue(const VSAMetadata& container, const char* key) {
   VSAErrorRef error;
-  auto fresh = VSAMetadata::readAndValidateMetadataAtUrl(container.url(), container.userIdentity(),
-                                                         false, *configuration_,
-                                                         *userIdentityCache_, &error);
+  auto fresh =
+      VSAMetadata::readAndValidateMetadataAtUrl(container.url(), container.userIdentity(), false,
+                                                *configuration_, *userIdentityCache_, &error);
   if (!fresh) return false;
-  VSAValue info = fresh->info() && fresh->info()->isDictionary() ? *fresh->info()
-                                                                 : VSAValue::dictionary();
+  VSAValue info =
+      fresh->info() && fresh->info()->isDictionary() ? *fresh->info() : VSAValue::dictionary();
   info.remove(key);
   fresh->setInfo(std::move(info));
   return fresh->writeMetadataToDiskWithError(*configuration_, &error) &&
@@ -85,28 +90,28 @@ bool VSACodeSigningMigration::migrateAppGroupIdsFromDataContainersToFile() {
       continue;
     }
     for (const auto& container : *list) {
-      const VSAValue* ids = container->info() ? container->info()->get(kVSAGroupContainerIDsKey)
-                                              : nullptr;
+      const VSAValue* ids =
+          container->info() ? container->info()->get(kVSAGroupContainerIDsKey) : nullptr;
       if (!ids) continue;
       const std::string& id = container->identifier();
       logMigration(kVSALogDebug, origin,
-                   "Data container for userId: 501, identifier %@ references container IDs: %@",
-                   id, *ids);
+                   "Data container for userId: 501, identifier %@ references container IDs: %@", id,
+                   *ids);
       VSACodeSigningEntry entry(
-          VSAValue::Dictionary{
-              {kVSAEntitlementsKey, VSAValue::Dictionary{{kVSAEntitlementApplicationGroups, *ids}}}},
+          VSAValue::Dictionary{{kVSAEntitlementsKey,
+                                VSAValue::Dictionary{{kVSAEntitlementApplicationGroups, *ids}}}},
           c);
       entry.setInvalid(true);  // keeps the references alive, is no real signature
       bool kept = false;
       VSAErrorRef addError;
       bool existed = mapping_->codeSigningEntryForIdentifier(id, nullptr).has_value();
       if (existed) {
-        logMigration(kVSALogNotice, origin,
-                     "Deleting app group entitlements for %@ because we already have them in mapping",
-                     id);
+        logMigration(
+            kVSALogNotice, origin,
+            "Deleting app group entitlements for %@ because we already have them in mapping", id);
       } else if (!mapping_->addLegacyEntryUnlessValid(id, entry, &kept, &addError)) {
-        logMigration(kVSALogError, origin, "Failed to write migrated group id info to DB for %@ : %@",
-                     id, addError);
+        logMigration(kVSALogError, origin,
+                     "Failed to write migrated group id info to DB for %@ : %@", id, addError);
         ok = false;
         continue;  // the value stays for the next run
       } else {
@@ -138,9 +143,8 @@ bool VSACodeSigningMigration::migrateCachedCodeSigningInfoFromBundleContainersTo
       continue;
     }
     for (const auto& container : *list) {
-      const VSAValue* cached = container->info()
-                                   ? container->info()->get(kVSACachedCodeSigningInfoKey)
-                                   : nullptr;
+      const VSAValue* cached =
+          container->info() ? container->info()->get(kVSACachedCodeSigningInfoKey) : nullptr;
       if (!cached || !cached->isDictionary()) continue;
       const std::string& id = container->identifier();
       VSAValue info = *cached;

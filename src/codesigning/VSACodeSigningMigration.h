@@ -23,7 +23,8 @@
 #include "model/VSAContainerCache.h"
 #include "platform/VSADeviceProperties.h"
 
-inline constexpr const char* kVSACachedCodeSigningInfoKey = "com.tamsk.Ferrox.CachedCodeSigningInfo";
+inline constexpr const char* kVSACachedCodeSigningInfoKey =
+    "com.tamsk.Ferrox.CachedCodeSigningInfo";
 inline constexpr const char* kVSAGroupContainerIDsKey = "com.tamsk.Ferrox.GroupContainerIDs";
 
 // Where the pass records its markers (the system migration status).

@@ -170,7 +170,8 @@ VSAMigrationClient VSAClientConnection::migrationClient() {
         *container.containerIdentity(), protectionClass, true, true,
         [protectionClass, name, c, url = container.url()](VSAResultCode code) {
           if (code != VSAResult::kSuccess)
-            VSALogIn(VSALogCategory::Startup, kVSALogError, "_setDataProtectionIfNecessaryOnContainer",
+            VSALogIn(VSALogCategory::Startup, kVSALogError,
+                     "_setDataProtectionIfNecessaryOnContainer",
                      "Error setting protection class %d on %@:%llu (%@) : %llu", protectionClass,
                      name, c, url, code);
         });
@@ -178,7 +179,8 @@ VSAMigrationClient VSAClientConnection::migrationClient() {
   return client;
 }
 
-bool VSAClientConnection::performDataMigratorMigrationForClientConnection(VSAResultCode* withError) {
+bool VSAClientConnection::performDataMigratorMigrationForClientConnection(
+    VSAResultCode* withError) {
   return context_.containerMigrator->performDataMigratorMigrationForClientConnection(
       migrationClient(), *commandQueue_, withError);
 }

@@ -41,14 +41,14 @@ const std::array<VSACommandTableEntry, kVSACommandCount> kTable = {{
      _},                                         // recreate a container's default structure
     {23, VSAHandleDiskUsage, allowed, R, _, L},  // disk usage of a container
     {24, VSAHandleDataMigration, kVSAEntitlementDataMigration, R, _, _},  // data migration
-    {25, VSAHandleRetryTest, testability, R, _, _},        // crash-retry test
+    {25, VSAHandleRetryTest, testability, R, _, _},                       // crash-retry test
     {26, VSAHandleStageSharedContent, kVSAEntitlementStageSharedContent, R, _,
      _},                                                  // stage shared content
     {27, VSAHandleRetiredCommand, allowed, R, _, _},      // retired
     {28, VSAHandleUserManagedAssetsPath, uma, R, O, _},   // path of a user-managed assets directory
     {29, VSAHandleDeleteUserManagedAsset, uma, R, _, _},  // delete a user-managed asset
-    {30, VSAHandlePerUserDataMigration, allowed, R, _, _},                      // per-user data migration
-    {31, VSAHandleTestLock, testability, R, _, _},        // set or clear a test lock
+    {30, VSAHandlePerUserDataMigration, allowed, R, _, _},  // per-user data migration
+    {31, VSAHandleTestLock, testability, R, _, _},          // set or clear a test lock
     {32, VSAHandlePersonaUniqueStrings, allowed, R, O, L},  // persona unique strings
 }};
 }  // namespace

@@ -14,8 +14,8 @@
 #include <memory>
 
 #include "base/VSAWorkQueue.h"
-#include "codesigning/VSACodeSigningMigration.h"
 #include "codesigning/VSACodeSigningMapping.h"
+#include "codesigning/VSACodeSigningMigration.h"
 #include "codesigning/VSAGroupManager.h"
 #include "codesigning/VSAWhitelist.h"
 #include "dataprotection/VSADataProtectionManager.h"

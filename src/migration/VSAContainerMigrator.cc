@@ -77,8 +77,8 @@ void VSAContainerMigrator::migrateLogFiles(const std::string& build) {
   const char* origin = "performSynchronousBuildUpgradeMigration";
   auto& config = *hooks_.configuration;
   auto& fm = config.fileManager();
-  auto perUser =
-      config.getPerUserConfigurationForUserIdentity(hooks_.userIdentityCache->defaultUserIdentity());
+  auto perUser = config.getPerUserConfigurationForUserIdentity(
+      hooks_.userIdentityCache->defaultUserIdentity());
   if (!perUser) return;
   std::string old = perUser->oldLoggingPath();
   VSAErrorRef error;
@@ -194,8 +194,9 @@ bool VSAContainerMigrator::_performWhitelistMigrationWithError(VSAErrorRef* erro
       continue;
     }
     for (const auto& m : *all) {
-      auto name = hooks_.wellknownContainerForId ? hooks_.wellknownContainerForId(m->identifier(), c)
-                                                 : std::nullopt;
+      auto name = hooks_.wellknownContainerForId
+                      ? hooks_.wellknownContainerForId(m->identifier(), c)
+                      : std::nullopt;
       if (!name) continue;
       std::string target = VSAPathJoin(*dir, *name);
       if (m->url() == target) continue;
@@ -257,8 +258,8 @@ bool VSAContainerMigrator::performDataMigratorMigrationForClientConnection(
     if (hooks_.codeSigningMigration && !hooks_.codeSigningMigration(commandQueue, *status))
       ok = false;
     if (!ok)
-      VSASetCode(withError, error ? error->resultCode(VSAResult::kWriteFailed)
-                                  : VSAResult::kWriteFailed);
+      VSASetCode(withError,
+                 error ? error->resultCode(VSAResult::kWriteFailed) : VSAResult::kWriteFailed);
     return ok;
   });
 }
@@ -281,7 +282,9 @@ bool VSAContainerMigrator::performPerUserDataMigrationForClientConnection(
     if (!status->hasMigrationOccurredForType(kSubdirectoryMigration)) {
       bool all = true;
       hooks_.userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
-          [&](const VSAUserIdentityRef& user) { all = subdirectoryMigration(user, client) && all; });
+          [&](const VSAUserIdentityRef& user) {
+            all = subdirectoryMigration(user, client) && all;
+          });
       ok = all && status->setMigrationCompleteForType(kSubdirectoryMigration);
     }
     hooks_.userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
@@ -353,8 +356,9 @@ VSAMetadataRef VSAContainerMigrator::_bundleContainerForDataContainer(const VSAM
                                                                       VSAErrorRef* error) {
   VSAContainerClass bundleClass = bundleClassForDataClass(data.containerClass());
   if (!bundleClass) {
-    VSASetError(error, VSA_ERROR(VSAResult::kInvalidArgument, "Passed an unexpected container type: %llu",
-                                    static_cast<unsigned long long>(data.containerClass())));
+    VSASetError(error,
+                VSA_ERROR(VSAResult::kInvalidArgument, "Passed an unexpected container type: %llu",
+                          static_cast<unsigned long long>(data.containerClass())));
     return nullptr;
   }
   std::string app = data.identifier();
@@ -372,7 +376,8 @@ VSAMetadataRef VSAContainerMigrator::_bundleContainerForDataContainer(const VSAM
   }
   auto bundle = hooks_.containerCache->containerForContainerIdentity(*identity);
   if (!bundle)
-    VSASetError(error, VSA_ERROR(VSAResult::kContainerNotFound, "Parent Container for: \"%@\" Not Found", app));
+    VSASetError(error, VSA_ERROR(VSAResult::kContainerNotFound,
+                                 "Parent Container for: \"%@\" Not Found", app));
   return bundle;
 }
 
@@ -385,9 +390,9 @@ void VSAContainerMigrator::_setDataProtectionIfNecessaryOnContainer(
                 "Error looking up bundle container for %@ : %@", container.identifier(), error);
     return;
   }
-  int32_t wanted =
-      hooks_.intendedDataProtectionClass ? hooks_.intendedDataProtectionClass(bundle->identifier())
-                                         : 0;
+  int32_t wanted = hooks_.intendedDataProtectionClass
+                       ? hooks_.intendedDataProtectionClass(bundle->identifier())
+                       : 0;
   if (wanted != 0 && client.setDataProtection) client.setDataProtection(container, wanted);
 }
 

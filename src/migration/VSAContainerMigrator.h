@@ -43,8 +43,8 @@ struct VSAMigrationHooks {
   std::shared_ptr<VSAUserIdentityCache> userIdentityCache;
   std::shared_ptr<VSAContainerCache> containerCache;
   std::string systemVersionPath;
-  std::string oldBundleLocation;          // the root's "/private/var/mobile/Containers/Bundle"
-  std::string deprecatedContainersPath;   // the root's etc/vessad/deprecated-containers.plist
+  std::string oldBundleLocation;         // the root's "/private/var/mobile/Containers/Bundle"
+  std::string deprecatedContainersPath;  // the root's etc/vessad/deprecated-containers.plist
   // Whitelist: the directory name of a well-known system (group) container.
   std::function<std::optional<std::string>(const std::string& identifier, VSAContainerClass)>
       wellknownContainerForId;

@@ -54,7 +54,7 @@ std::string stringEntry(const VSAValue* dict, const char* key) {
 // The date's textual description, in UTC.
 std::string dateText(const VSADate& date) {
   time_t seconds = static_cast<time_t>(date.secondsSince1970());
-  struct tm parts{};
+  struct tm parts {};
   gmtime_r(&seconds, &parts);
   char text[64];
   std::strftime(text, sizeof text, "%Y-%m-%d %H:%M:%S +0000", &parts);
@@ -66,8 +66,8 @@ std::optional<VSAValue> readSystemVersion(VSAFileSystem& fs, const std::string& 
   std::string error;
   auto version = readDictionary(fs, path, kSystemVersionMaxSize, &missing, &error);
   if (!version && !missing)
-    logStatus(kVSALogError, "currentBuildVersion", "Failed to read system version at %@ : %@",
-              path, error);
+    logStatus(kVSALogError, "currentBuildVersion", "Failed to read system version at %@ : %@", path,
+              error);
   return version;
 }
 }  // namespace
@@ -135,7 +135,8 @@ bool VSAMigrationStatus::isBuildUpgrade() const {
     return true;
   }
   if (!systemVersion_) {
-    logStatus(kVSALogNotice, origin, "Could not get current build info; assuming this is an upgrade");
+    logStatus(kVSALogNotice, origin,
+              "Could not get current build info; assuming this is an upgrade");
     return true;
   }
   std::string build = stringEntry(&*systemVersion_, kBuildVersionKey);
@@ -176,8 +177,9 @@ bool VSAMigrationStatus::hasMigrationOccurredForType(const std::string& type) co
 
 bool VSAMigrationStatus::setMigrationCompleteForType(const std::string& type) {
   VSAValue previous = migrationInfo_;
-  migrationInfo_.set(type, VSAValue::Dictionary{{kVersionNumberKey, VSAValue(currentBuildVersion())},
-                                                {kTimeKey, VSAValue(dateText(VSADate::now()))}});
+  migrationInfo_.set(type,
+                     VSAValue::Dictionary{{kVersionNumberKey, VSAValue(currentBuildVersion())},
+                                          {kTimeKey, VSAValue(dateText(VSADate::now()))}});
   if (!_writeMigrationStatusToDisk()) {
     migrationInfo_ = std::move(previous);
     return false;
@@ -205,8 +207,8 @@ bool VSAMigrationStatus::_readMigrationStatusFromDisk() {
 bool VSAMigrationStatus::_writeMigrationStatusToDisk() {
   VSAErrorRef error;
   auto bytes = VSAPlist::serialize(migrationInfo_, VSAPlist::Format::Binary, &error);
-  if (bytes && configuration_.fileManager().writeFileAtomicallyAtURL(
-                   migrationFileURL_, *bytes, 0644, std::nullopt, &error))
+  if (bytes && configuration_.fileManager().writeFileAtomicallyAtURL(migrationFileURL_, *bytes,
+                                                                     0644, std::nullopt, &error))
     return true;
   logStatus(kVSALogError, "_writeMigrationStatusToDisk",
             "Failed to write migration status on %@ for %@ : %@", currentBuildVersion(),

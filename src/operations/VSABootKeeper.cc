@@ -31,7 +31,8 @@ void VSABootKeeper::_regenerateAllSystemContainerPaths(const VSAOperationGrants&
     }
     for (const auto& m : *all) {
       const std::string& id = m->identifier();
-      bool wellKnown = services_.wellknownContainerForId && services_.wellknownContainerForId(id, c);
+      bool wellKnown =
+          services_.wellknownContainerForId && services_.wellknownContainerForId(id, c);
       if (id.empty() || wellKnown || id == kVSAAnalyticsSystemGroupIdentifier) continue;
       VSAResultCode code = VSAResult::kSuccess;
       if (!maintenance.regenerateDirectoryUUIDWithContainerIdentity(m->containerIdentity(), &code))

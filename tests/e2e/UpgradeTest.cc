@@ -1,0 +1,85 @@
+// End to end: a device left by an earlier release is upgraded by the real
+// daemon at its first start after a boot, then the client-requested
+// migrations (24, 30) finish the work; later starts find nothing to do.
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <fstream>
+
+#include "base/VSAPlist.h"
+#include "e2e/VSATestDaemon.h"
+
+namespace fs = std::filesystem;
+
+namespace {
+
+VSAValue body(uint64_t command) { return VSAValue::Dictionary{{"Command", VSAValue(command)}}; }
+
+VSAValue withContainer(uint64_t command, const char* id, uint64_t containerClass) {
+  VSAValue v = body(command);
+  v.set("Identifier", VSAValue(id));
+  v.set("ContainerClass", VSAValue(containerClass));
+  return v;
+}
+
+void writeVersion(VSATestDaemon& d, const char* build) {
+  VSA_writeToURL(VSAValue::Dictionary{{"ProductBuildVersion", VSAValue(build)},
+                                      {"ReleaseType", VSAValue("User")}},
+                 d.path("/etc/vessad/system-version.plist"), 0, nullptr);
+}
+
+size_t count(const std::string& text, const std::string& needle) {
+  size_t n = 0;
+  for (size_t at = text.find(needle); at != std::string::npos; at = text.find(needle, at + 1)) ++n;
+  return n;
+}
+
+TEST(DaemonUpgrade, AnOldDeviceIsUpgradedAtBootAndByTheMigrationCommands) {
+  VSATestDaemon d;
+  d.registerSelf("com.example.installer",
+                 VSAValue::Dictionary{{"com.tamsk.private.Vessa.allowed", VSAValue(true)},
+                                      {"com.tamsk.private.Vessa.dataMigration", VSAValue(true)}});
+  writeVersion(d, "OLD1");
+  ASSERT_TRUE(d.start());
+  // The old release kept code-signing info in the bundle's metadata.
+  VSAValue create = withContainer(0, "com.example.old", 1);
+  create.set("CreateIfNecessary", VSAValue(true));
+  ASSERT_EQ(VSAReplyError(d.request(create)), 1u);
+  VSAValue setInfo = withContainer(5, "com.example.old", 1);
+  setInfo.set("Key", VSAValue("com.tamsk.Ferrox.CachedCodeSigningInfo"));
+  setInfo.set("Value", VSAValue(VSAValue::Dictionary{
+                           {"Entitlements", VSAValue::Dictionary{{"old", VSAValue(true)}}}}));
+  ASSERT_EQ(VSAReplyError(d.request(setInfo)), 1u);
+  EXPECT_EQ(d.stop(), 0);
+  std::string library = d.path("/private/var/root/Library/Vessa");
+  VSA_writeToURL(VSAValue::Dictionary{{"com.example.legacy",
+                                       VSAValue::Dictionary{{"legacy", VSAValue(true)}}}},
+                 library + "/vsa_entitlements.plist", 0, nullptr);
+  fs::create_directories(d.path("/private/var/mobile/Library/Logs/Vessa"));
+  std::ofstream(d.path("/private/var/mobile/Library/Logs/Vessa/vessad.log")) << "old";
+
+  writeVersion(d, "NEW2");
+  ASSERT_TRUE(d.start(true, {"--after-boot"}));
+  EXPECT_NE(d.daemonOutput().find("Detected upgrade from OLD1 (User) to NEW2 (User)"),
+            std::string::npos);
+  EXPECT_TRUE(fs::exists(d.path("/private/var/root/Library/Logs/Vessa/vessad.0")));
+  EXPECT_EQ(VSAReplyError(d.request(body(24))), 1u);
+  EXPECT_FALSE(fs::exists(library + "/vsa_entitlements.plist"));
+  VSAValue read = body(19);
+  read.set("Identifier", VSAValue("com.example.old"));
+  auto info = d.request(read);
+  ASSERT_EQ(VSAReplyError(info), 1u);
+  ASSERT_TRUE(info->get("ReplyInfoDictionary"));
+  EXPECT_TRUE(info->get("ReplyInfoDictionary")->get("com.tamsk.Vessa.Entitlements"));
+  EXPECT_EQ(VSAReplyError(d.request(body(30))), 1u);
+  EXPECT_EQ(d.stop(), 0);
+
+  // Same build at the next boot: no upgrade, and 24 finds every type recorded.
+  ASSERT_TRUE(d.start(true, {"--after-boot"}));
+  EXPECT_EQ(count(d.daemonOutput(), "skipping upgrade"), 1u);
+  EXPECT_EQ(VSAReplyError(d.request(body(24))), 1u);
+  EXPECT_EQ(count(d.daemonOutput(), "Performing code signing migration"), 1u);
+  EXPECT_EQ(d.stop(), 0);
+}
+
+}  // namespace

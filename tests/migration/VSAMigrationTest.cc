@@ -1,0 +1,288 @@
+// Upgrades: the migration status file, the legacy code-signing pass (also
+// interrupted after each of its file-system steps), and the container
+// migrator's build-upgrade and client-requested migrations.
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <fstream>
+
+#include "VSAContainerTestRoot.h"
+#include "VSAOldDevice.h"
+#include "codesigning/VSACodeSigningMigration.h"
+#include "migration/VSAContainerMigrator.h"
+#include "migration/VSAMigrationStatus.h"
+
+namespace fs = std::filesystem;
+
+namespace {
+
+class Migration : public VSAContainerTestRoot {
+ protected:
+  std::string versionPath() { return root_ + "/etc/vessad/system-version.plist"; }
+  std::string library() { return context_->globalConfiguration->libraryDirectory(); }
+  std::unique_ptr<VSAMigrationStatus> status() {
+    return VSAMigrationStatus::initForSystemMigration(*context_->globalConfiguration,
+                                                      versionPath());
+  }
+  bool codeSigningPass() {
+    VSACommandQueue queue;
+    bool ok = context_->containerMigrator->performDataMigratorMigrationForClientConnection(
+        VSAMigrationClient{}, queue, nullptr);
+    VSAResultCode code = VSAResult::kSuccess;
+    queue.executeAllUntilExhaustedOrError(&code);
+    return ok;
+  }
+  std::optional<VSACodeSigningEntry> entry(const std::string& id) {
+    return context_->codeSigningMapping->codeSigningEntryForIdentifier(id, nullptr);
+  }
+  std::optional<VSAValue> info(const std::string& id, VSAContainerClass c, const char* key) {
+    VSAResultCode code = VSAResult::kSuccess;
+    VSAValue k(key);
+    return installer()->infoValueForKey(&k, identity(id, c), true, &code);
+  }
+  void registerKept() {
+    VSACommandQueue queue;
+    std::string id = VSAOldDevice::kKept;
+    VSAValue info = VSAValue::Dictionary{
+        {kVSAEntitlementsKey, VSAValue::Dictionary{{"current", VSAValue(true)}}}};
+    ASSERT_EQ(context_->codeSigningMapping->processCodeSigningInfo(info, &id,
+                                                                   VSAValue::dictionary(), &queue),
+              VSAResult::kSuccess);
+  }
+  // What an uninterrupted upgrade leaves: every legacy identifier in the
+  // database as described, legacy values and files gone, markers set.
+  void expectMigrated() {
+    auto cached = entry(VSAOldDevice::kCached);
+    ASSERT_TRUE(cached);
+    EXPECT_FALSE(cached->isInvalid());
+    EXPECT_EQ(cached->dataContainerClass(), 2u);
+    EXPECT_TRUE(cached->codeSigningInfo().get(kVSAEntitlementsKey));
+    EXPECT_FALSE(cached->codeSigningInfo().get("Entitlements"));
+    auto grouped = entry(VSAOldDevice::kGrouped);
+    ASSERT_TRUE(grouped);
+    EXPECT_TRUE(grouped->isInvalid());
+    auto legacy = entry(VSAOldDevice::kLegacy);
+    ASSERT_TRUE(legacy);
+    ASSERT_TRUE(legacy->childBundleIdentifiers());
+    EXPECT_EQ(legacy->childBundleIdentifiers()->front(), "com.example.legacy.widget");
+    auto placeholder = entry(VSAOldDevice::kPlaceholder);
+    ASSERT_TRUE(placeholder);
+    EXPECT_TRUE(placeholder->isPlaceholder());
+    auto kept = entry(VSAOldDevice::kKept);
+    ASSERT_TRUE(kept);
+    EXPECT_TRUE(kept->codeSigningInfo().get(kVSAEntitlementsKey)->get("current"));
+    EXPECT_FALSE(info(VSAOldDevice::kCached, 1, kVSACachedCodeSigningInfoKey));
+    EXPECT_FALSE(info(VSAOldDevice::kGrouped, 2, kVSAGroupContainerIDsKey));
+    EXPECT_FALSE(fs::exists(library() + "/vsa_entitlements.plist"));
+    auto s = status();
+    ASSERT_TRUE(s);
+    for (const char* type :
+         {"CodeSigningMigration", "GroupIdMigration", "BundleMigration", "ACLMigration"})
+      EXPECT_TRUE(s->hasMigrationOccurredForType(type)) << type;
+    // Every container keeps its files; the group stays referenced.
+    for (auto [id, c] : std::vector<std::pair<const char*, VSAContainerClass>>{
+             {VSAOldDevice::kCached, 1}, {VSAOldDevice::kGrouped, 2}, {VSAOldDevice::kGroup, 7}}) {
+      VSAResultCode code = VSAResult::kSuccess;
+      auto m = installer()->createOrLookupContainerWithContainerIdentity(identity(id, c), false,
+                                                                         false, true, &code);
+      ASSERT_TRUE(m) << id;
+      EXPECT_TRUE(fs::exists(m->url() + "/keep.txt")) << id;
+    }
+  }
+};
+
+TEST_F(Migration, TheStatusFileRecordsBuildsAndTypesAndConvertsMarkersOnce) {
+  // Fresh install: empty status written at once, every doubt is an upgrade.
+  auto fresh = status();
+  ASSERT_TRUE(fresh);
+  EXPECT_TRUE(fresh->isBuildUpgrade());
+  EXPECT_EQ(fresh->currentBuildVersion(), "Unknown");
+  EXPECT_TRUE(fs::exists(library() + "/vsa_migration_status.plist"));
+  ASSERT_TRUE(fresh->writeCurrentBuildInfoToDisk());
+  EXPECT_TRUE(status()->isBuildUpgrade());  // still no build to compare
+
+  VSAOldDevice::writeSystemVersion(root_, "B100", "User");
+  ASSERT_TRUE(status()->writeCurrentBuildInfoToDisk());
+  VSAOldDevice::writeSystemVersion(root_, "B100", "Internal");
+  EXPECT_FALSE(status()->isBuildUpgrade());  // same build, other release type
+  VSAOldDevice::writeSystemVersion(root_, "B200", "User");
+  auto upgraded = status();
+  EXPECT_TRUE(upgraded->isBuildUpgrade());
+  EXPECT_FALSE(upgraded->hasMigrationOccurredForType("ACLMigration"));
+  ASSERT_TRUE(upgraded->setMigrationCompleteForType("ACLMigration"));
+  EXPECT_TRUE(status()->hasMigrationOccurredForType("ACLMigration"));
+
+  // A corrupt file fails creation; nothing runs on it.
+  std::ofstream(library() + "/vsa_migration_status.plist") << "not a plist";
+  EXPECT_FALSE(status());
+  // Markers become types, and go only once the combined file was written.
+  fs::remove(library() + "/vsa_migration_status.plist");
+  std::string marker = library() + "/vsa_acl2_migration_complete.plist";
+  VSA_writeToURL(VSAValue::Dictionary{{"VSAMigrationVersionNumber", VSAValue("A1")}}, marker, 0,
+                 nullptr);
+  faults_->failAll(VSAFileSystem::Op::Rename, EIO);
+  auto unsaved = status();
+  ASSERT_TRUE(unsaved);
+  EXPECT_TRUE(fs::exists(marker));
+  faults_->reset();
+  auto converted = status();
+  ASSERT_TRUE(converted);
+  EXPECT_TRUE(converted->hasMigrationOccurredForType("ACLMigration"));
+  EXPECT_FALSE(converted->hasMigrationOccurredForType("BundleMigration"));
+  EXPECT_FALSE(fs::exists(marker));
+  auto user = VSAMigrationStatus::initForMobileUserMigration(
+      *context_->globalConfiguration, *context_->userIdentityCache, versionPath());
+  ASSERT_TRUE(user);
+  EXPECT_NE(user->migrationFileURL(), converted->migrationFileURL());
+}
+
+TEST_F(Migration, TheCodeSigningPassMovesEveryLegacySourceOnceAndKeepsValidEntries) {
+  VSAOldDevice::build(*context_, *installer(), user_);
+  registerKept();
+  ASSERT_TRUE(codeSigningPass());
+  expectMigrated();
+  // A second run finds nothing to do and changes nothing.
+  auto before = entry(VSAOldDevice::kGrouped);
+  ASSERT_TRUE(codeSigningPass());
+  EXPECT_TRUE(entry(VSAOldDevice::kGrouped)->isEqual(*before));
+  expectMigrated();
+}
+
+TEST_F(Migration, MultiUserModeSkipsTheGroupIdMigrationAndReconciliation) {
+  fs::create_directories(root_ + "/etc/vessad");
+  VSA_writeToURL(VSAValue::Dictionary{{"MultiUserFlags", VSAValue(uint64_t{0x80000000u})}},
+                 root_ + "/etc/vessad/device.plist", 0, nullptr);
+  startContext();
+  VSAOldDevice::build(*context_, *installer(), user_);
+  ASSERT_TRUE(codeSigningPass());
+  EXPECT_FALSE(entry(VSAOldDevice::kGrouped));
+  EXPECT_TRUE(info(VSAOldDevice::kGrouped, 2, kVSAGroupContainerIDsKey));
+  EXPECT_FALSE(status()->hasMigrationOccurredForType("GroupIdMigration"));
+  EXPECT_TRUE(status()->hasMigrationOccurredForType("CodeSigningMigration"));
+  EXPECT_TRUE(entry(VSAOldDevice::kLegacy));
+}
+
+TEST_F(Migration, AnInterruptedPassEndsLikeAnUninterruptedOneWhenRunAgain) {
+  VSAOldDevice::build(*context_, *installer(), user_);
+  registerKept();
+  fs::path snapshot =
+      fs::path(root_).parent_path() / (fs::path(root_).filename().string() + ".old");
+  fs::copy(root_, snapshot, fs::copy_options::recursive | fs::copy_options::copy_symlinks);
+  startContext();
+  faults_->reset();
+  ASSERT_TRUE(codeSigningPass());
+  int total = faults_->totalCalls();
+  ASSERT_GT(total, 10);
+  int interrupted = 0;
+  for (int n = 1; n <= total; ++n) {
+    SCOPED_TRACE("crash after call " + std::to_string(n));
+    context_.reset();
+    fs::remove_all(root_);
+    fs::copy(snapshot, root_, fs::copy_options::recursive | fs::copy_options::copy_symlinks);
+    startContext();
+    faults_->crashAfter(n);
+    codeSigningPass();
+    restart();
+    auto after = status();
+    if (!after || !after->hasMigrationOccurredForType("CodeSigningMigration") ||
+        fs::exists(library() + "/vsa_entitlements.plist"))
+      ++interrupted;
+    ASSERT_TRUE(codeSigningPass());
+    expectMigrated();
+    if (HasFailure()) break;
+  }
+  std::printf(
+      "code-signing migration crash sweep: %d crash points (%d left it half done), all "
+      "clean after the next run\n",
+      total, interrupted);
+  EXPECT_GT(interrupted, total / 2);
+  fs::remove_all(snapshot);
+}
+
+TEST_F(Migration, TheBuildUpgradeMovesLogsBundlesAndWellKnownSystemContainers) {
+  VSAOldDevice::build(*context_, *installer(), user_);
+  // A well-known system group container that an old release kept under a UUID name.
+  VSAResultCode code;
+  auto wellKnown = create(*installer(), "systemgroup.com.tamsk.launcher", &code, false, 13);
+  ASSERT_TRUE(wellKnown) << code;
+  std::string uuidPath = fs::path(wellKnown->url()).parent_path() / VSAUUID::random().string();
+  fs::rename(wellKnown->url(), uuidPath);
+  startContext();
+  VSAOldDevice::writeSystemVersion(root_, "NEW2");
+  auto s = status();
+  ASSERT_TRUE(s && s->isBuildUpgrade());
+  VSAErrorRef error;
+  ASSERT_TRUE(context_->containerMigrator->performSynchronousBuildUpgradeMigration(*s, &error))
+      << error;
+  std::string logs = context_->globalConfiguration->logDirectory();
+  EXPECT_TRUE(fs::exists(logs + "/vessad.0"));
+  EXPECT_TRUE(fs::exists(logs + "/vessad.1"));
+  EXPECT_FALSE(fs::exists(logs + "/vessad.7"));  // beyond the writer's three files
+  EXPECT_FALSE(fs::exists(root_ + "/private/var/mobile/Library/Logs/Vessa"));
+  std::string bundles = context_->globalConfiguration->bundleDirectory();
+  EXPECT_TRUE(fs::exists(bundles + "/Application/OLD-APP/Info.plist"));
+  EXPECT_FALSE(fs::exists(root_ + "/private/var/mobile/Containers/Bundle"));
+  // No system container directories existed: ACLs need nothing.
+  EXPECT_FALSE(s->hasMigrationOccurredForType("ACLMigration"));  // a system group exists
+  EXPECT_TRUE(fs::is_directory(wellKnown->url()));
+  EXPECT_FALSE(fs::exists(uuidPath));
+  auto found = installer()->createOrLookupContainerWithContainerIdentity(
+      identity("systemgroup.com.tamsk.launcher", 13), false, false, true, &code);
+  ASSERT_TRUE(found);
+  EXPECT_EQ(found->url(), wellKnown->url());
+  EXPECT_EQ(found->uuid(), wellKnown->uuid());
+  ASSERT_TRUE(s->writeCurrentBuildInfoToDisk());
+  EXPECT_FALSE(status()->isBuildUpgrade());
+  // A second run with nothing left to move succeeds quietly.
+  EXPECT_TRUE(context_->containerMigrator->performSynchronousBuildUpgradeMigration(*s, &error));
+  // Without any system container directory the ACL migration is recorded untouched.
+  for (VSAContainerClass c : {12, 13})
+    fs::remove_all(
+        *context_->globalConfiguration->globalContainerBaseURLWithContentClass(c, false));
+  startContext();
+  auto bare = status();
+  ASSERT_TRUE(context_->containerMigrator->performSynchronousBuildUpgradeMigration(*bare, &error));
+  EXPECT_TRUE(bare->hasMigrationOccurredForType("ACLMigration"));
+}
+
+}  // namespace
+
+namespace {
+
+TEST_F(Migration, PerUserMigrationRestoresStructureOnceAndRemovesDeprecatedContainers) {
+  VSAResultCode code;
+  auto app = create(*installer(), "com.example.app", &code);
+  ASSERT_TRUE(app) << code;
+  auto retired = create(*installer(), "com.example.retired", &code);
+  ASSERT_TRUE(retired) << code;
+  fs::create_directories(root_ + "/etc/vessad");
+  VSA_writeToURL(VSAValue::Dictionary{{"unused", VSAValue(true)}},
+                 root_ + "/etc/vessad/deprecated-containers.plist", 0, nullptr);  // not a list
+  VSAValue list = VSAValue::Array{
+      VSAValue(VSAValue::Dictionary{{"Identifier", VSAValue("com.example.retired")},
+                                    {"ContainerClass", VSAValue(uint64_t{2})}}),
+      VSAValue(VSAValue::Dictionary{{"Identifier", VSAValue(uint64_t{7})}})};  // logged, skipped
+  fs::remove_all(app->url() + "/Documents");
+  auto run = [&] {
+    auto c = installer();
+    VSAResultCode result = VSAResult::kSuccess;
+    c->performPerUserDataMigrationForClientConnection(&result);
+    c->completeWithError(&result);
+    return result;
+  };
+  EXPECT_EQ(run(), VSAResult::kSuccess);  // the bad list removes nothing
+  EXPECT_TRUE(fs::is_directory(app->url() + "/Documents"));
+  EXPECT_TRUE(fs::exists(retired->url()));
+  auto mobile = VSAMigrationStatus::initForMobileUserMigration(
+      *context_->globalConfiguration, *context_->userIdentityCache, versionPath());
+  EXPECT_TRUE(mobile->hasMigrationOccurredForType("SubdirectoryMigration"));
+
+  ASSERT_TRUE(VSA_writeToURL(list, root_ + "/etc/vessad/deprecated-containers.plist", 0, nullptr));
+  fs::remove_all(app->url() + "/Documents");
+  EXPECT_EQ(run(), VSAResult::kSuccess);
+  EXPECT_FALSE(fs::exists(app->url() + "/Documents"));  // recorded: not again
+  EXPECT_FALSE(fs::exists(retired->url()));
+  EXPECT_EQ(run(), VSAResult::kSuccess);  // already gone: nothing to do
+}
+
+}  // namespace
