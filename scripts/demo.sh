@@ -176,3 +176,6 @@ step "The daemon's rotating log: $root/private/var/root/Library/Logs/Vessa/vessa
 grep -v '<Debug>' "$root/private/var/root/Library/Logs/Vessa/vessad.log" | tail -n 12
 echo "(debug lines, signposts included, are in the same file on this internal build)"
 : "$root/private/var/root/Library/Logs/Vessa/vessad.log"
+
+echo
+echo "(upgrades: scripts/upgrade-demo.sh shows a device of an earlier release upgraded)"

@@ -46,13 +46,13 @@ const char* kCommandNames[kVSACommandCount] = {
     "change data protection class",
     "recreate default structure",
     "disk usage of a container",
-    "run the data migration",
+    "run the data migration (ACLs, bundle owners, legacy code signing)",
     "crash-retry test (NumRetryCrashes; internal builds; the daemon crashes)",
     "stage shared content (SourcePath in the bundle, DestPath in the data container)",
     "retired",
     "user-managed assets path (IsRelative, CreateIfNecessary)",
     "delete a user-managed asset (SourcePath)",
-    "run the per-user data migration",
+    "run the per-user data migration (sub-directories, protection classes)",
     "set or clear a test lock (TestLock 0-6, 7 = all; Enable; internal builds)",
     "persona unique strings"};
 

@@ -98,7 +98,10 @@ void VSAUpcallListener::stop() {
   }
   if (thread_.joinable()) thread_.join();
   peers_.clear();
-  if (listenFd_ >= 0) ::close(listenFd_);
+  if (listenFd_ >= 0) {
+    ::unlink(path_.c_str());  // no stale socket for the next start's waiters
+    ::close(listenFd_);
+  }
   if (wakeFd_ >= 0) ::close(wakeFd_);
   listenFd_ = wakeFd_ = -1;
 }
