@@ -30,7 +30,12 @@ VSATestLocks::VSATestLocks()
   }
 }
 
-VSATestLocks::~VSATestLocks() { releaseAllLocks(); }
+VSATestLocks::~VSATestLocks() {
+  releaseAllLocks();
+  // A released barrier may still be returning from its semaphore: wait for
+  // it before the semaphore goes.
+  for (uint64_t lock = 2; lock < kVSATestLockCount; ++lock) gates_[lock].queue->barrierSync([] {});
+}
 
 void VSATestLocks::setEnabled(bool enabled) {
   if (enabled_.exchange(enabled) == enabled) return;

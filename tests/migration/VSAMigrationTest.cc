@@ -286,3 +286,60 @@ TEST_F(Migration, PerUserMigrationRestoresStructureOnceAndRemovesDeprecatedConta
 }
 
 }  // namespace
+
+namespace {
+
+TEST_F(Migration, AnInterruptedBuildUpgradeEndsLikeAnUninterruptedOneWhenRunAgain) {
+  VSAOldDevice::build(*context_, *installer(), user_);
+  VSAResultCode code;
+  auto wellKnown = create(*installer(), "systemgroup.com.tamsk.launcher", &code, false, 13);
+  ASSERT_TRUE(wellKnown) << code;
+  std::string uuidPath = fs::path(wellKnown->url()).parent_path() / VSAUUID::random().string();
+  fs::rename(wellKnown->url(), uuidPath);
+  VSAOldDevice::writeSystemVersion(root_, "NEW2");
+  fs::path snapshot = fs::path(root_).parent_path() / (fs::path(root_).filename().string() + ".up");
+  fs::copy(root_, snapshot, fs::copy_options::recursive | fs::copy_options::copy_symlinks);
+  auto upgrade = [&] {
+    auto s = status();
+    VSAErrorRef error;
+    return s && context_->containerMigrator->performSynchronousBuildUpgradeMigration(*s, &error);
+  };
+  startContext();
+  faults_->reset();
+  ASSERT_TRUE(upgrade());
+  int total = faults_->totalCalls();
+  ASSERT_GT(total, 5);
+  std::string logs = context_->globalConfiguration->logDirectory();
+  std::string bundles = context_->globalConfiguration->bundleDirectory();
+  int interrupted = 0;
+  for (int n = 1; n <= total; ++n) {
+    SCOPED_TRACE("crash after call " + std::to_string(n));
+    context_.reset();
+    fs::remove_all(root_);
+    fs::copy(snapshot, root_, fs::copy_options::recursive | fs::copy_options::copy_symlinks);
+    startContext();
+    faults_->crashAfter(n);
+    upgrade();
+    restart();
+    if (fs::exists(root_ + "/private/var/mobile/Containers/Bundle") || fs::exists(uuidPath))
+      ++interrupted;
+    ASSERT_TRUE(upgrade());
+    EXPECT_TRUE(fs::exists(logs + "/vessad.0"));
+    EXPECT_TRUE(fs::exists(logs + "/vessad.1"));
+    EXPECT_EQ(std::ifstream(bundles + "/Application/OLD-APP/Info.plist").good(), true);
+    EXPECT_FALSE(fs::exists(root_ + "/private/var/mobile/Containers/Bundle"));
+    EXPECT_TRUE(fs::is_directory(wellKnown->url()));
+    EXPECT_FALSE(fs::exists(uuidPath));
+    auto found = installer()->createOrLookupContainerWithContainerIdentity(
+        identity("systemgroup.com.tamsk.launcher", 13), false, false, true, &code);
+    ASSERT_TRUE(found);
+    EXPECT_EQ(found->uuid(), wellKnown->uuid());
+    if (HasFailure()) break;
+  }
+  std::printf("build-upgrade crash sweep: %d crash points (%d interrupted a move), all clean\n",
+              total, interrupted);
+  EXPECT_GT(interrupted, 0);
+  fs::remove_all(snapshot);
+}
+
+}  // namespace

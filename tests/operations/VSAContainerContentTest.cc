@@ -88,6 +88,7 @@ TEST_F(ContainerContent, TheAssetsDirectoryIsMadeOnceRecordedAndOwnedByTheContai
   EXPECT_EQ(*second.path, "UserManagedAssets");
   // The metadata file names it, so it survives a restart.
   restart();
+  app = connection("com.example.app", false, false);  // the old one served the old context
   VSAErrorRef error;
   auto onDisk = VSAMetadata::readAndValidateMetadataAtUrl(data->url(), user_, false,
                                                           *context_->globalConfiguration,
