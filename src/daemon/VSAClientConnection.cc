@@ -132,7 +132,7 @@ VSAClientConnection::groupContainerIdentifiersForOwnerIdentifier(
 
 void VSAClientConnection::rebootKeeperSetup() {
   performBuildUpgradeStepIfNeeded();
-  VSABootKeeper(services_).rebootKeeperSetup();
+  VSABootKeeper(services_).rebootKeeperSetup(grants_);
 }
 
 void VSAClientConnection::performBuildUpgradeStepIfNeeded() {

@@ -186,6 +186,13 @@ struct VSADaemonContext {
       return m && m->invalidateCodeSigningInfoForIdentifierAndItsChildren(id, error);
     };
     std::weak_ptr<VSAGroupManager> groups = groupManager;
+    s->reconcileApplicationGroups = [groups](VSACommandQueue& queue) {
+      if (auto g = groups.lock()) g->reconcileGroupContainersOfType(kVSAGroupTypeApplication, queue);
+    };
+    s->removeAllAdvanceCopies = [mapping](VSAErrorRef* error) {
+      auto m = mapping.lock();
+      return m && m->removeAllAdvanceCopiesWithError(error);
+    };
     s->groupContainerIdentifiersForOwner =
         [groups](const std::string& owner, VSAContainerClass c,
                  VSAResultCode* error) -> std::optional<std::vector<std::string>> {

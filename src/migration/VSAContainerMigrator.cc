@@ -81,6 +81,7 @@ void VSAContainerMigrator::migrateLogFiles(const std::string& build) {
       hooks_.userIdentityCache->defaultUserIdentity());
   if (!perUser) return;
   std::string old = perUser->oldLoggingPath();
+  if (fm.itemDoesNotExistAtURL(old)) return;  // nothing of an old release: silent
   VSAErrorRef error;
   auto items = fm.urlsForItemsInDirectoryAtURL(old, &error);
   if (!items) {

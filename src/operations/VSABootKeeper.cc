@@ -1,20 +1,28 @@
 #include "operations/VSABootKeeper.h"
 
+#include <cerrno>
 #include <set>
 
 #include "base/VSALog.h"
+#include "base/VSAPathString.h"
 #include "model/VSAPerUserConfiguration.h"
 #include "operations/VSAContainerMaintenance.h"
 #include "operations/VSAReplaceOperation.h"
 #include "operations/VSARetryTest.h"
+#include "operations/VSASystemContainerRestore.h"
 
 // Steps not built yet (build-upgrade migration, system container restore,
 // group reconciliation, orphan scans) say so in the log; the cleanups always
 // complete so that start-up posts its notifications.
-void VSABootKeeper::rebootKeeperSetup() {
-  VSALogIn(VSALogCategory::Startup, kVSALogNotice, __func__,
-           "First-boot setup: system container restore and group reconciliation are not "
-           "available in this build");
+void VSABootKeeper::rebootKeeperSetup(const VSAOperationGrants& grants) {
+  VSASystemContainerRestore(services_, grants).moveSystemContainersIntoPlace();
+  if (!services_.deviceProperties->multiUserFlagsTopBitSet() ||
+      !services_.reconcileApplicationGroups)
+    return;
+  VSACommandQueue queue;
+  services_.reconcileApplicationGroups(queue);
+  VSAResultCode ignored = VSAResult::kSuccess;
+  queue.executeAllUntilExhaustedOrError(&ignored);
 }
 
 void VSABootKeeper::_regenerateAllSystemContainerPaths(const VSAOperationGrants& grants) {
@@ -91,10 +99,83 @@ void VSABootKeeper::rebootKeeperCleanupWithCompletion(std::function<void()> comp
           VSALogIn(VSALogCategory::Startup, kVSALogError, "rebootKeeperCleanupWithCompletion",
                    "Failed to delete per-user transient URL %@ : %@", userTransient, userError);
       });
-  VSALogIn(VSALogCategory::Startup, kVSALogNotice, __func__,
-           "First-boot cleanup: orphaned-data scans are not available in this build");
-  VSADeathRow::_sharedBackgroundQueue()->async(
-      [token, completion = std::move(completion)] { completion(); });
+  // One serial queue carries the scans, the advance-copy removal and the
+  // completion, in this order; requests are served meanwhile.
+  auto queue = VSAWorkQueue::create("com.tamsk.vessad.bootcleanup", VSAWorkQueue::Kind::Serial,
+                                    VSAWorkQueue::global(VSAWorkQueue::Priority::Background));
+  auto scan = [&](const VSAUserIdentityRef& user, VSAContainerClass c) {
+    auto directory = config.containerDirectoryURLForUserIdentity(user, c, false);
+    if (!directory) return;
+    VSAErrorRef listError;
+    auto items = services_.fileManager->urlsForItemsInDirectoryAtURL(*directory, &listError);
+    if (!items) {
+      if (!(listError && listError->domain() == kVSAPOSIXErrorDomain && listError->code() == ENOENT))
+        VSALogIn(VSALogCategory::Startup, kVSALogError, "rebootKeeperCleanupWithCompletion",
+                 "Failed to get items : %@", listError);
+      return;
+    }
+    std::vector<std::string> entries;
+    for (const auto& item : *items) entries.push_back(item.path);
+    // The services outlive the daemon's queues; this keeper object does not.
+    queue->async([services = &services_, keep = queue, entries = std::move(entries), c] {
+      VSABootKeeper(*services)._cleanupOrphanedDataForDirectories(entries, c);
+    });
+  };
+  services_.userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
+      [&](const VSAUserIdentityRef& user) {
+        auto perUser = config.getPerUserConfigurationForUserIdentity(user);
+        if (!perUser || !perUser->existsUserBaseDirectory()) return;
+        for (VSAContainerClass c : {2, 4, 6, 7, 9, 10, 11}) scan(user, c);
+      });
+  auto defaultUser = services_.userIdentityCache->defaultUserIdentity();
+  for (VSAContainerClass c : {1, 3, 5, 8, 12, 13}) scan(defaultUser, c);
+  queue->async([services = &services_, keep = queue] {
+    VSABootKeeper(*services)._cleanupOprhanedCodeSigningMappingData();
+  });
+  queue->async([token, keep = queue, completion = std::move(completion)] {
+    if (completion) completion();
+  });
+}
+
+void VSABootKeeper::_cleanupOrphanedDataForDirectories(const std::vector<std::string>& entries,
+                                                       VSAContainerClass c) {
+  const char* origin = "_cleanupOrphanedDataForDirectories";
+  auto& fm = *services_.fileManager;
+  auto isWellknown = [&](const std::string& name, VSAContainerClass cls) {
+    return services_.wellknownContainerForId &&
+           services_.wellknownContainerForId(name, cls).has_value();
+  };
+  for (const auto& url : entries) {
+    if (fm.itemDoesNotExistAtURL(url)) {
+      VSALogIn(VSALogCategory::Startup, kVSALogDebug, origin,
+               "Ignoring deleted container path during cleanup: [%@]", url);
+      continue;
+    }
+    if (VSAContainerCache::containerURLIsValidForContainerClass(url, c, isWellknown)) {
+      if (fm.itemExistsAtURL(VSAPathJoin(url, kVSAMetadataFileName))) continue;  // live
+      VSALogIn(VSALogCategory::Startup, kVSALogError, origin,
+               "Deleting orphaned data missing a metadata file at: %@", url);
+    }
+    if (services_.configuration->isInternalImage()) {
+      VSALogIn(VSALogCategory::Startup, kVSALogError, origin,
+               "***INTERNAL BUILD REQUEST: please file a problem report with the data below");
+      VSALogIn(VSALogCategory::Startup, kVSALogError, origin,
+               "\tSomeone is writing invalid data to a container, which has now been orphaned. "
+               "Here are the invalid files:");
+      fm.printDirectoryStructureAtURL(url);
+      VSALogIn(VSALogCategory::Startup, kVSALogError, origin, "***END INTERNAL BUILD REQUEST");
+    }
+    VSAErrorRef error;
+    if (!services_.deathRow->_moveItemAtURLToDeathRow(url, true, false, &error))
+      VSALogIn(VSALogCategory::Startup, kVSALogError, origin, "%@", error);
+  }
+}
+
+void VSABootKeeper::_cleanupOprhanedCodeSigningMappingData() {
+  VSAErrorRef error;
+  if (services_.removeAllAdvanceCopies && !services_.removeAllAdvanceCopies(&error))
+    VSALogIn(VSALogCategory::Startup, kVSALogError, __func__,
+             "Could not remove advance copies of code sign data: %@", error);
 }
 
 void VSABootKeeper::keeperCleanupWithCompletion(std::function<void()> completion) {

@@ -7,6 +7,8 @@
 #pragma once
 
 #include <functional>
+#include <string>
+#include <vector>
 
 #include "operations/VSAOperationGrants.h"
 #include "operations/VSAOperationServices.h"
@@ -21,7 +23,10 @@ class VSABootKeeper {
  public:
   explicit VSABootKeeper(const VSAOperationServices& services) : services_(services) {}
 
-  void rebootKeeperSetup();
+  // Reinstalls backed-up system containers, then reconciles application
+  // groups when the device runs in multi-user mode. (The build-upgrade step
+  // before it needs the migrator and is run by the client connection.)
+  void rebootKeeperSetup(const VSAOperationGrants& grants);
   void keeperSetup();
   void rebootKeeperCleanupWithCompletion(std::function<void()> completion);
   void keeperCleanupWithCompletion(std::function<void()> completion);
@@ -29,6 +34,11 @@ class VSABootKeeper {
   // container that is not well known (their names are fixed) and not the
   // analytics system group (kVSAAnalyticsSystemGroupIdentifier).
   void _regenerateAllSystemContainerPaths(const VSAOperationGrants& grants);
+  // Sends every entry that is not a live container of `containerClass` (a
+  // name that is not valid for the class, or no metadata file) to death row.
+  void _cleanupOrphanedDataForDirectories(const std::vector<std::string>& entries,
+                                          VSAContainerClass containerClass);
+  void _cleanupOprhanedCodeSigningMappingData();
 
  private:
   const VSAOperationServices& services_;

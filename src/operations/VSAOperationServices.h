@@ -17,6 +17,7 @@
 #include "model/VSAContainerCache.h"
 #include "model/VSAGlobalConfiguration.h"
 #include "model/VSAUserIdentityCache.h"
+#include "operations/VSACommandQueue.h"
 #include "operations/VSADeathRow.h"
 #include "operations/VSAStageForDeleteEnvironment.h"
 #include "platform/VSAContainerSubdirectories.h"
@@ -53,6 +54,10 @@ struct VSAOperationServices {
       groupContainerIdentifiersForOwner;
   // Data protection: the class an identifier's entitlements ask for.
   std::function<int32_t(const std::string& identifier)> intendedDataProtectionClass;
+  // Groups: queue the deletion of application group containers no identifier references.
+  std::function<void(VSACommandQueue& queue)> reconcileApplicationGroups;
+  // Code signing: drop the advance copies of code-signing entries.
+  std::function<bool(VSAErrorRef* error)> removeAllAdvanceCopies;
   // Data protection: restart the changes persisted before the last stop.
   std::function<bool(VSAErrorRef* error)> restartPendingDataProtectionOperations;
 };

@@ -221,6 +221,24 @@ bool VSAFileManager::exchangeItemsAtURL(const std::string& a, const std::string&
   return false;
 }
 
+void VSAFileManager::printDirectoryStructureAtURL(const std::string& path) {
+  VSAErrorRef error;
+  bool walked = traverseDirectory(path, &error, [](const VSAWalkItem& item, WalkPhase phase) {
+    if (phase == WalkPhase::DirectoryEnd) return true;
+    const char* kind = S_ISDIR(item.st.st_mode)   ? "dir "
+                       : S_ISLNK(item.st.st_mode) ? "link"
+                       : S_ISREG(item.st.st_mode) ? "file"
+                                                  : "other";
+    VSALogIn(VSALogCategory::FS, kVSALogError, "printDirectoryStructureAtURL",
+             "\t%s %o %u:%u %lld %s", kind, static_cast<unsigned>(item.st.st_mode & 07777),
+             item.st.st_uid, item.st.st_gid, static_cast<long long>(item.st.st_size), item.path);
+    return true;
+  });
+  if (!walked)
+    VSALogIn(VSALogCategory::FS, kVSALogError, "printDirectoryStructureAtURL",
+             "Failed to walk %@ : %@", path, error);
+}
+
 bool VSAFileManager::moveItemIfExistsAtURL(const std::string& from, const std::string& to,
                                            VSAErrorRef* e) {
   return moveItem(from, to, false, e);

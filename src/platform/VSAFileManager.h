@@ -123,6 +123,9 @@ class VSAFileManager {
       const std::string& directory, VSAErrorRef* error,
       const std::string& withNamePrefix = "temp.");
 
+  // Logs a tree, one line per item (path, type, mode, owner, size): a
+  // debugging aid for data that should not be there.
+  void printDirectoryStructureAtURL(const std::string& path);
   // Total apparent size of a tree in bytes (a full walk).
   uint64_t diskUsageForURL(const std::string& path);
   // The file system's statistics for the tree; on first use it asks the

@@ -1,0 +1,146 @@
+#include "operations/VSASystemContainerRestore.h"
+
+#include <sys/stat.h>
+
+#include <cstring>
+
+#include "base/VSALog.h"
+#include "base/VSAPathString.h"
+#include "model/VSAPerUserConfiguration.h"
+#include "operations/VSAContainerLookup.h"
+#include "operations/VSAContainerMaintenance.h"
+
+namespace {
+constexpr const char* kOrigin = "VSAMoveSystemContainersIntoPlace";
+
+template <typename... A>
+void logRestore(int level, const char* origin, const char* format, const A&... args) {
+  VSALogIn(VSALogCategory::Startup, level, origin, format, args...);
+}
+}  // namespace
+
+void VSASystemContainerRestore::moveSystemContainersIntoPlace() {
+  auto perUser =
+      services_.configuration->getPerUserConfigurationForUserIdentity(grants_.clientUserIdentity);
+  if (!perUser) return;
+  std::string system = perUser->systemContainerBackupDirectory();
+  std::string group = perUser->systemGroupContainerBackupDirectory();
+  bool systemMoved = moveToInProgress(system, "Failed to move system containers to inprogress: %@");
+  bool groupMoved =
+      moveToInProgress(group, "Failed to move shared system containers to inprogress: %@");
+  if (systemMoved) {
+    logRestore(kVSALogNotice, kOrigin, "Installing system containers");
+    installAll(system + ".inprogress", 12, "Couldn't find any system containers at %@: %@");
+  }
+  if (groupMoved) {
+    logRestore(kVSALogNotice, kOrigin, "Installing system group containers");
+    installAll(group + ".inprogress", 13, "Couldn't find any system shared containers at %@: %@");
+  }
+  if (services_.configuration->isInternalImage()) return;  // kept for inspection
+  std::string base = perUser->systemContainerBackupBaseDirectory();
+  VSAErrorRef error;
+  if (!services_.fileManager->removeItemAtURL(base, &error))
+    logRestore(kVSALogError, kOrigin, "Failed to remove system container base dir %@: %@", base,
+               error);
+}
+
+bool VSASystemContainerRestore::moveToInProgress(const std::string& backup,
+                                                 const char* moveFailure) {
+  auto& fm = *services_.fileManager;
+  struct stat st {};
+  if (fm.fileSystem().lstat(backup, &st) != 0) return false;
+  // Only what root backed up goes into system containers: a backup that
+  // anyone else could have written is not restored.
+  if (!S_ISDIR(st.st_mode) || st.st_uid != 0 || (st.st_mode & 022)) {
+    logRestore(kVSALogError, kOrigin,
+               "Not restoring %@: not a directory owned by root and writable by root only",
+               backup);
+    return false;
+  }
+  std::string inProgress = backup + ".inprogress";
+  VSAErrorRef error;
+  if (!fm.removeItemAtURL(inProgress, &error))
+    logRestore(kVSALogError, kOrigin, "Failed to remove existing inprogress system containers: %@",
+               error);
+  if (fm.moveItemAtURL(backup, inProgress, &error)) return true;
+  logRestore(kVSALogError, kOrigin, moveFailure, error);
+  return false;
+}
+
+void VSASystemContainerRestore::installAll(const std::string& inProgress, VSAContainerClass c,
+                                           const char* listFailure) {
+  VSAErrorRef error;
+  auto entries = services_.fileManager->urlsForItemsInDirectoryAtURL(inProgress, &error);
+  if (!entries) {
+    logRestore(kVSALogError, kOrigin, listFailure, inProgress, error);
+    return;
+  }
+  for (const auto& entry : *entries) _moveSystemContainerIntoPlace(entry.path, c);
+}
+
+void VSASystemContainerRestore::_moveSystemContainerIntoPlace(const std::string& entry,
+                                                             VSAContainerClass c) {
+  const char* origin = "_moveSystemContainerIntoPlace";
+  auto& fm = *services_.fileManager;
+  std::string identifier = VSALastPathComponent(entry);
+  std::string failed = VSADirectoryName(entry) + ".failed";
+  VSAResultCode code = VSAResult::kSuccess;
+  auto identity = VSAContainerIdentity::containerIdentityWithIdentifier(
+      identifier, c, *services_.userIdentityCache, &code);
+  if (!identity) {
+    logRestore(kVSALogError, origin, "Failed to create container identity %@: %llu", identifier,
+               code);
+    return;
+  }
+  auto live = VSAContainerLookup(services_, grants_)
+                  .createOrLookupContainerWithContainerIdentity(identity, true, false, true, &code);
+  if (!live) {
+    logRestore(kVSALogError, origin, "Failed to create system container %@: %llu", identifier,
+               code);
+    return;
+  }
+  logRestore(kVSALogNotice, origin, "Restoring container for %@ at %@ to %@", identifier, entry,
+             live->url());
+  std::vector<VSADirectoryEntry> items;
+  if (int rc = fm.fileSystem().readDirectory(entry, &items)) {
+    logRestore(kVSALogError, origin,
+               "Failed to enumerate contents of restored system container %@ at %@: %@",
+               identifier, entry, std::string(std::strerror(rc)));
+    return _moveFailedPathAside(entry, failed);
+  }
+  for (const auto& item : items) {
+    // The live container keeps its own identity.
+    if (item.name == kVSAMetadataFileName) continue;
+    std::string from = VSAPathJoin(entry, item.name), to = VSAPathJoin(live->url(), item.name);
+    VSAErrorRef error;
+    if (!fm.removeItemAtURL(to, &error)) {
+      logRestore(kVSALogError, origin, "Failed to remove destination %@:%@: %@", identifier, to,
+                 error);
+      _moveFailedPathAside(from, failed);
+    } else if (!fm.moveItemAtURL(from, to, &error)) {
+      logRestore(kVSALogError, origin,
+                 "Failed to move file in restored system container %@:%@ to destination %@: %@",
+                 identifier, from, to, error);
+      _moveFailedPathAside(from, failed);
+    }
+  }
+  code = VSAResult::kSuccess;
+  if (!VSAContainerMaintenance(services_).recreateDefaultStructureWithContainerIdentity(
+          live->containerIdentity(), &code))
+    logRestore(kVSALogError, origin, "Error processing restored system container %@: %llu",
+               identifier, code);
+}
+
+void VSASystemContainerRestore::_moveFailedPathAside(const std::string& item,
+                                                     const std::string& failureDirectory) {
+  const char* origin = "_moveFailedPathAside";
+  auto& fm = *services_.fileManager;
+  VSAErrorRef error;
+  if (!fm.createDirectoryAtURL(failureDirectory, true, 0700, 0, kVSANoProtectionClass, &error)) {
+    logRestore(kVSALogError, origin, "Failed to create %@: %@", failureDirectory, error);
+    return;
+  }
+  std::string to = VSAPathJoin(failureDirectory, VSALastPathComponent(item));
+  if (!fm.moveItemAtURL(item, to, &error))
+    logRestore(kVSALogError, origin, "Failed to move %@ to %@: %@", item, to, error);
+}
