@@ -187,7 +187,8 @@ struct VSADaemonContext {
     };
     std::weak_ptr<VSAGroupManager> groups = groupManager;
     s->reconcileApplicationGroups = [groups](VSACommandQueue& queue) {
-      if (auto g = groups.lock()) g->reconcileGroupContainersOfType(kVSAGroupTypeApplication, queue);
+      if (auto g = groups.lock())
+        g->reconcileGroupContainersOfType(kVSAGroupTypeApplication, queue);
     };
     s->removeAllAdvanceCopies = [mapping](VSAErrorRef* error) {
       auto m = mapping.lock();

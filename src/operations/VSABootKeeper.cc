@@ -109,7 +109,8 @@ void VSABootKeeper::rebootKeeperCleanupWithCompletion(std::function<void()> comp
     VSAErrorRef listError;
     auto items = services_.fileManager->urlsForItemsInDirectoryAtURL(*directory, &listError);
     if (!items) {
-      if (!(listError && listError->domain() == kVSAPOSIXErrorDomain && listError->code() == ENOENT))
+      if (!(listError && listError->domain() == kVSAPOSIXErrorDomain &&
+            listError->code() == ENOENT))
         VSALogIn(VSALogCategory::Startup, kVSALogError, "rebootKeeperCleanupWithCompletion",
                  "Failed to get items : %@", listError);
       return;

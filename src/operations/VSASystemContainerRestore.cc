@@ -53,8 +53,7 @@ bool VSASystemContainerRestore::moveToInProgress(const std::string& backup,
   // anyone else could have written is not restored.
   if (!S_ISDIR(st.st_mode) || st.st_uid != 0 || (st.st_mode & 022)) {
     logRestore(kVSALogError, kOrigin,
-               "Not restoring %@: not a directory owned by root and writable by root only",
-               backup);
+               "Not restoring %@: not a directory owned by root and writable by root only", backup);
     return false;
   }
   std::string inProgress = backup + ".inprogress";
@@ -79,7 +78,7 @@ void VSASystemContainerRestore::installAll(const std::string& inProgress, VSACon
 }
 
 void VSASystemContainerRestore::_moveSystemContainerIntoPlace(const std::string& entry,
-                                                             VSAContainerClass c) {
+                                                              VSAContainerClass c) {
   const char* origin = "_moveSystemContainerIntoPlace";
   auto& fm = *services_.fileManager;
   std::string identifier = VSALastPathComponent(entry);
@@ -104,8 +103,8 @@ void VSASystemContainerRestore::_moveSystemContainerIntoPlace(const std::string&
   std::vector<VSADirectoryEntry> items;
   if (int rc = fm.fileSystem().readDirectory(entry, &items)) {
     logRestore(kVSALogError, origin,
-               "Failed to enumerate contents of restored system container %@ at %@: %@",
-               identifier, entry, std::string(std::strerror(rc)));
+               "Failed to enumerate contents of restored system container %@ at %@: %@", identifier,
+               entry, std::string(std::strerror(rc)));
     return _moveFailedPathAside(entry, failed);
   }
   for (const auto& item : items) {

@@ -1,0 +1,169 @@
+// Boot-time setup and cleanup: system containers restored from backups,
+// orphaned class entries removed (and only they), system container
+// directories renamed after an upgrade, group reconciliation in multi-user
+// mode only. Log lines are read from a rotating log file the test opens.
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <fstream>
+
+#include "VSAContainerTestRoot.h"
+#include "VSAOldDevice.h"
+#include "base/VSALog.h"
+#include "model/VSAPerUserConfiguration.h"
+#include "operations/VSABootKeeper.h"
+#include "operations/VSADeathRow.h"
+
+namespace fs = std::filesystem;
+
+namespace {
+
+class Boot : public VSAContainerTestRoot {
+ protected:
+  void SetUp() override {
+    VSAContainerTestRoot::SetUp();
+    log_ = root_ + "/test.log";
+    ASSERT_TRUE(VSALogger::shared().openRotatingLog(log_, 7));
+    VSALogger::shared().enableDiskLogging(7, 64u << 20);
+  }
+  void TearDown() override { VSALogger::shared().closeRotatingLog(); }
+  std::string logText() {
+    VSALogger::shared().flush();
+    std::ifstream in(log_);
+    return std::string(std::istreambuf_iterator<char>(in), {});
+  }
+  bool logged(const std::string& text) { return logText().find(text) != std::string::npos; }
+  static void put(const std::string& path, const std::string& text) { std::ofstream(path) << text; }
+  static std::string read(const std::string& path) {
+    std::ifstream in(path);
+    return std::string(std::istreambuf_iterator<char>(in), {});
+  }
+  VSABootKeeper keeper() { return VSABootKeeper(*context_->operationServices); }
+  void rebootSetup() { keeper().rebootKeeperSetup(installer()->grants()); }
+  void rebootCleanup() {
+    std::promise<void> done;
+    installer()->rebootKeeperCleanupWithCompletion([&] { done.set_value(); });
+    done.get_future().wait();
+    VSADeathRow::_sharedBackgroundQueue()->sync([] {});
+  }
+  std::shared_ptr<VSAPerUserConfiguration> perUser() {
+    return context_->globalConfiguration->getPerUserConfigurationForUserIdentity(
+        installer()->grants().clientUserIdentity);
+  }
+  void deviceFlags(const VSAValue& device) {
+    fs::create_directories(root_ + "/etc/vessad");
+    VSA_writeToURL(device, root_ + "/etc/vessad/device.plist", 0, nullptr);
+    startContext();
+  }
+  std::string log_;
+};
+
+TEST_F(Boot, BackedUpSystemContainersReplaceLiveItemsAndTheBackupGoes) {
+  VSAResultCode code;
+  auto live = create(*installer(), "com.example.sys", &code, false, 12);
+  ASSERT_TRUE(live) << code;
+  put(live->url() + "/kept.txt", "live");
+  put(live->url() + "/shared.txt", "live");
+  std::string backup = perUser()->systemContainerBackupDirectory();
+  fs::create_directories(backup + "/com.example.sys");
+  fs::create_directories(backup + "/com.example.fresh/Library");
+  put(backup + "/com.example.sys/shared.txt", "backup");
+  put(backup + "/com.example.sys/" + kVSAMetadataFileName, "not the live identity");
+  put(backup + "/com.example.fresh/Library/prefs", "fresh");
+
+  rebootSetup();
+  EXPECT_EQ(read(live->url() + "/shared.txt"), "backup");  // the backup wins
+  EXPECT_EQ(read(live->url() + "/kept.txt"), "live");
+  VSAErrorRef error;
+  auto metadata = VSAMetadata::readAndValidateMetadataAtUrl(live->url(), user_, false,
+                                                            *context_->globalConfiguration,
+                                                            *context_->userIdentityCache, &error);
+  ASSERT_TRUE(metadata) << error;
+  EXPECT_EQ(metadata->uuid(), live->uuid());
+  auto fresh = installer()->createOrLookupContainerWithContainerIdentity(
+      identity("com.example.fresh", 12), false, false, true, &code);
+  ASSERT_TRUE(fresh);
+  EXPECT_EQ(read(fresh->url() + "/Library/prefs"), "fresh");
+  EXPECT_TRUE(logged("Installing system containers"));
+  EXPECT_FALSE(logged("Installing system group containers"));
+  EXPECT_FALSE(fs::exists(perUser()->systemContainerBackupBaseDirectory()));
+
+  // A backup that a user could have written is not restored.
+  fs::create_directories(backup + "/com.example.sys");
+  put(backup + "/com.example.sys/shared.txt", "planted");
+  ASSERT_EQ(::chown(backup.c_str(), 501, 501), 0);
+  rebootSetup();
+  EXPECT_EQ(read(live->url() + "/shared.txt"), "backup");
+  EXPECT_TRUE(logged("Not restoring"));
+}
+
+TEST_F(Boot, OnlyEntriesThatAreNotLiveContainersAreCleanedAway) {
+  VSAResultCode code;
+  auto live = create(*installer(), "com.example.app", &code);
+  ASSERT_TRUE(live) << code;
+  std::string dir = classDirectory(2);
+  std::string noMetadata = dir + "/" + VSAUUID::random().string();
+  fs::create_directories(noMetadata + "/Documents");
+  put(noMetadata + "/Documents/left", "x");
+  fs::create_directories(dir + "/not-a-container");
+  put(dir + "/not-a-container/file", "x");
+  fs::remove_all(classDirectory(4));  // a class directory that is not there says nothing
+
+  rebootCleanup();
+  EXPECT_TRUE(fs::is_directory(live->url()));
+  EXPECT_FALSE(fs::exists(noMetadata));
+  EXPECT_FALSE(fs::exists(dir + "/not-a-container"));
+  EXPECT_TRUE(logged("Deleting orphaned data missing a metadata file at: " + noMetadata));
+  EXPECT_FALSE(logged("metadata file at: " + dir + "/not-a-container"));
+  EXPECT_FALSE(logged("Failed to get items"));
+  EXPECT_FALSE(logged("INTERNAL BUILD REQUEST"));
+
+  // Internal builds describe what they remove.
+  deviceFlags(VSAValue::Dictionary{{"HasInternalContent", VSAValue(true)}});
+  fs::create_directories(dir + "/stray/deep");
+  rebootCleanup();
+  EXPECT_FALSE(fs::exists(dir + "/stray"));
+  EXPECT_TRUE(logged("***INTERNAL BUILD REQUEST"));
+  EXPECT_TRUE(logged("Someone is writing invalid data to a container"));
+  EXPECT_TRUE(logged("***END INTERNAL BUILD REQUEST"));
+}
+
+TEST_F(Boot, AnUpgradeRenamesSystemContainersExceptWellKnownAndAnalytics) {
+  VSAResultCode code;
+  auto plain = create(*installer(), "com.example.sys", &code, false, 12);
+  auto wellKnown = create(*installer(), "systemgroup.com.tamsk.launcher", &code, false, 13);
+  auto analytics = create(*installer(), kVSAAnalyticsSystemGroupIdentifier, &code, false, 13);
+  ASSERT_TRUE(plain && wellKnown && analytics) << code;
+  VSAOldDevice::writeSystemVersion(root_, "B1");
+  installer()->rebootKeeperSetup();  // records B1
+  VSAOldDevice::writeSystemVersion(root_, "B2");
+  installer()->rebootKeeperSetup();
+  auto find = [&](const char* id, VSAContainerClass c) {
+    return installer()->createOrLookupContainerWithContainerIdentity(identity(id, c), false, false,
+                                                                     true, &code);
+  };
+  auto moved = find("com.example.sys", 12);
+  ASSERT_TRUE(moved);
+  EXPECT_NE(moved->url(), plain->url());
+  EXPECT_EQ(moved->uuid(), plain->uuid());
+  EXPECT_EQ(find("systemgroup.com.tamsk.launcher", 13)->url(), wellKnown->url());
+  EXPECT_EQ(find(kVSAAnalyticsSystemGroupIdentifier, 13)->url(), analytics->url());
+  installer()->rebootKeeperSetup();  // same build: nothing moves
+  EXPECT_EQ(find("com.example.sys", 12)->url(), moved->url());
+}
+
+TEST_F(Boot, GroupsAreReconciledAtBootOnlyInMultiUserMode) {
+  VSAResultCode code;
+  auto group = create(*installer(), "group.com.example.nobody", &code, false, 7);
+  ASSERT_TRUE(group) << code;
+  rebootSetup();
+  EXPECT_TRUE(fs::is_directory(group->url()));  // no flags: left alone
+  deviceFlags(VSAValue::Dictionary{{"MultiUserFlags", VSAValue(uint64_t{0x7fffffff})}});
+  rebootSetup();
+  EXPECT_TRUE(fs::is_directory(group->url()));  // top bit clear
+  deviceFlags(VSAValue::Dictionary{{"MultiUserFlags", VSAValue(uint64_t{0x80000000u})}});
+  rebootSetup();
+  EXPECT_FALSE(fs::exists(group->url()));  // no identifier references it
+}
+
+}  // namespace
