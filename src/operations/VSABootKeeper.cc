@@ -166,8 +166,9 @@ void VSABootKeeper::_cleanupOrphanedDataForDirectories(const std::vector<std::st
       fm.printDirectoryStructureAtURL(url);
       VSALogIn(VSALogCategory::Startup, kVSALogError, origin, "***END INTERNAL BUILD REQUEST");
     }
+    // An orphan whose move a crash undoes is found again at the next boot.
     VSAErrorRef error;
-    if (!services_.deathRow->_moveItemAtURLToDeathRow(url, true, false, &error))
+    if (!services_.deathRow->_moveItemAtURLToDeathRow(url, true, false, &error, false))
       VSALogIn(VSALogCategory::Startup, kVSALogError, origin, "%@", error);
   }
 }

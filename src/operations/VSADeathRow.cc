@@ -25,7 +25,8 @@ VSAWorkQueue::Ref VSADeathRow::_sharedBackgroundQueue() {
 }
 
 bool VSADeathRow::_moveItemAtURLToDeathRow(const std::string& url, bool isDir,
-                                           bool startDeletionThread, VSAErrorRef* error) {
+                                           bool startDeletionThread, VSAErrorRef* error,
+                                           bool durable) {
   const char* fn = "_moveItemAtURLToDeathRow";
   VSAFileManager& fm = configuration_->fileManager();
   std::string deathrow = configuration_->deathrowDirectory();
@@ -40,7 +41,7 @@ bool VSADeathRow::_moveItemAtURLToDeathRow(const std::string& url, bool isDir,
   }
   std::string destination = VSAPathJoin(*unique, VSALastPathComponent(url));
   (void)isDir;  // a directory and a file move alike here
-  if (!fm.moveItemAtURL(url, destination, &underlying)) {
+  if (!fm.moveItemAtURL(url, destination, &underlying, durable)) {
     fm.fileSystem().rmdir(*unique);
     if (isMissing(underlying)) return true;
     auto e = VSA_ERROR_UNDERLYING(VSAResult::kDeathRowMoveFailed, underlying,

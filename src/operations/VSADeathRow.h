@@ -29,8 +29,10 @@ class VSADeathRow : public std::enable_shared_from_this<VSADeathRow> {
   static VSAWorkQueue::Ref _sharedBackgroundQueue();
 
   // A missing item is success and starts nothing; other failures are 41.
+  // `durable` false leaves the rename unsynced: for items whose move is
+  // redone if a crash undoes it (orphans found at boot).
   bool _moveItemAtURLToDeathRow(const std::string& url, bool isDir, bool startDeletionThread,
-                                VSAErrorRef* error);
+                                VSAErrorRef* error, bool durable = true);
   // Returns at once; the completion gets the code of the last failure (1 when none).
   // The queued work keeps this object alive until it has run.
   void deleteContainersOnDeathRowWithCompletion(Completion completion);

@@ -84,6 +84,11 @@ int VSAFaultInjectingFileSystem::rename(const std::string& from, const std::stri
   return inner_->rename(from, to);
 }
 
+int VSAFaultInjectingFileSystem::renameWithoutSync(const std::string& from, const std::string& to) {
+  if (int e = injected(Op::Rename)) return e;
+  return inner_->renameWithoutSync(from, to);
+}
+
 int VSAFaultInjectingFileSystem::exchange(const std::string& a, const std::string& b) {
   if (int e = injected(Op::Rename)) return e;
   return inner_->exchange(a, b);

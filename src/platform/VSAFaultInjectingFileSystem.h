@@ -37,6 +37,7 @@ class VSAFaultInjectingFileSystem : public VSAFileSystem {
   int chmod(const std::string& path, mode_t mode) override;
   int rename(const std::string& from, const std::string& to) override;
   int exchange(const std::string& a, const std::string& b) override;  // counted as a rename
+  int renameWithoutSync(const std::string& from, const std::string& to) override;  // likewise
   int readlink(const std::string& path, std::string* target) override;
   int realpath(const std::string& path, std::string* resolved) override;
   int unlink(const std::string& path) override;

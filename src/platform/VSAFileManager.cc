@@ -208,8 +208,9 @@ int VSAFileManager::makePath(const std::string& path, mode_t mode, bool* created
   return rc;
 }
 
-bool VSAFileManager::moveItemAtURL(const std::string& from, const std::string& to, VSAErrorRef* e) {
-  return moveItem(from, to, true, e);
+bool VSAFileManager::moveItemAtURL(const std::string& from, const std::string& to, VSAErrorRef* e,
+                                   bool durable) {
+  return moveItem(from, to, true, e, durable);
 }
 bool VSAFileManager::exchangeItemsAtURL(const std::string& a, const std::string& b,
                                         VSAErrorRef* error) {
@@ -290,12 +291,12 @@ bool VSAFileManager::checkSource(const std::string& from, const char* fn, bool* 
 }
 
 bool VSAFileManager::moveItem(const std::string& from, const std::string& to, bool failIfSrcMissing,
-                              VSAErrorRef* error) {
+                              VSAErrorRef* error, bool durable) {
   const char* fn = "moveItemAtURL";
   bool missing = false;
   if (!failIfSrcMissing && !checkSource(from, fn, &missing, error)) return false;
   if (missing) return true;
-  int rc = fs_->rename(from, to);
+  int rc = durable ? fs_->rename(from, to) : fs_->renameWithoutSync(from, to);
   if (rc == 0) return true;
   if (rc == EXDEV) {
     if (!copyItem(from, to, true, error)) return false;

@@ -64,7 +64,10 @@ class VSAFileManager {
   bool createDirectoryAtURL(const std::string& path, bool withIntermediateDirectories, mode_t mode,
                             uid_t owner, uint32_t protectionClass, VSAErrorRef* error,
                             std::optional<gid_t> group = std::nullopt);
-  bool moveItemAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
+  // `durable` false: the rename is not synced (for moves a crash may undo
+  // because they are redone, such as orphans sent to death row at boot).
+  bool moveItemAtURL(const std::string& from, const std::string& to, VSAErrorRef* error,
+                     bool durable = true);
   // Swaps two existing items atomically (each takes the other's place).
   bool exchangeItemsAtURL(const std::string& a, const std::string& b, VSAErrorRef* error);
   bool moveItemIfExistsAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
@@ -136,7 +139,7 @@ class VSAFileManager {
  private:
   bool checkSource(const std::string& from, const char* fn, bool* missing, VSAErrorRef* error);
   bool moveItem(const std::string& from, const std::string& to, bool failIfSrcMissing,
-                VSAErrorRef* error);
+                VSAErrorRef* error, bool durable = true);
   bool copyItem(const std::string& from, const std::string& to, bool failIfSrcMissing,
                 VSAErrorRef* error);
   int copyTree(const std::string& from, const std::string& to, std::string* failedPath);

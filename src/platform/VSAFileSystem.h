@@ -82,6 +82,8 @@ class VSAFileSystem {
   // A commit: renames, then syncs the destination's directory (the journal
   // carries the source directory's change in the same commit).
   virtual int rename(const std::string& from, const std::string& to) = 0;
+  // A rename whose loss in a crash is harmless (it is redone): no sync.
+  virtual int renameWithoutSync(const std::string& from, const std::string& to) = 0;
   // Swaps two existing items in one step, then syncs both directories.
   virtual int exchange(const std::string& a, const std::string& b) = 0;
   virtual int readlink(const std::string& path, std::string* target) = 0;

@@ -86,6 +86,14 @@ int VSALinuxFileSystem::rename(const std::string& from, const std::string& to) {
   return 0;
 }
 
+int VSALinuxFileSystem::renameWithoutSync(const std::string& from, const std::string& to) {
+  VSAUniqueFd fromDir, toDir;
+  std::string fromName, toName;
+  if (int rc = openParent(from, &fromDir, &fromName)) return rc;
+  if (int rc = openParent(to, &toDir, &toName)) return rc;
+  return ::renameat(fromDir.get(), fromName.c_str(), toDir.get(), toName.c_str()) != 0 ? errno : 0;
+}
+
 int VSALinuxFileSystem::exchange(const std::string& a, const std::string& b) {
   VSAUniqueFd aDir, bDir;
   std::string aName, bName;

@@ -29,6 +29,7 @@ class VSALinuxFileSystem : public VSAFileSystem {
   int lchown(const std::string& path, uid_t uid, gid_t gid) override;
   int chmod(const std::string& path, mode_t mode) override;
   int rename(const std::string& from, const std::string& to) override;
+  int renameWithoutSync(const std::string& from, const std::string& to) override;
   int exchange(const std::string& a, const std::string& b) override;
   int readlink(const std::string& path, std::string* target) override;
   int realpath(const std::string& path, std::string* resolved) override;
