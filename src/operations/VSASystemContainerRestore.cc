@@ -47,8 +47,17 @@ void VSASystemContainerRestore::moveSystemContainersIntoPlace() {
 bool VSASystemContainerRestore::moveToInProgress(const std::string& backup,
                                                  const char* moveFailure) {
   auto& fm = *services_.fileManager;
+  std::string inProgress = backup + ".inprogress";
   struct stat st {};
-  if (fm.fileSystem().lstat(backup, &st) != 0) return false;
+  if (fm.fileSystem().lstat(backup, &st) != 0) {
+    // A restore a crash interrupted: its in-progress directory is all that
+    // is left of the backup, so it is restored rather than thrown away.
+    if (fm.fileSystem().lstat(inProgress, &st) != 0 || !S_ISDIR(st.st_mode) || st.st_uid != 0 ||
+        (st.st_mode & 022))
+      return false;
+    logRestore(kVSALogNotice, kOrigin, "Resuming the interrupted restore of %@", inProgress);
+    return true;
+  }
   // Only what root backed up goes into system containers: a backup that
   // anyone else could have written is not restored.
   if (!S_ISDIR(st.st_mode) || st.st_uid != 0 || (st.st_mode & 022)) {
@@ -56,7 +65,6 @@ bool VSASystemContainerRestore::moveToInProgress(const std::string& backup,
                "Not restoring %@: not a directory owned by root and writable by root only", backup);
     return false;
   }
-  std::string inProgress = backup + ".inprogress";
   VSAErrorRef error;
   if (!fm.removeItemAtURL(inProgress, &error))
     logRestore(kVSALogError, kOrigin, "Failed to remove existing inprogress system containers: %@",

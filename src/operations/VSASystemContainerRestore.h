@@ -3,7 +3,8 @@
 // "Library/Backup/SystemContainers" (system containers) and its system-group
 // sibling, one directory per identifier. Each backup directory is first
 // renamed to "<dir>.inprogress" (an older in-progress copy, left by a crash,
-// is removed first), then every entry is restored: the live container is
+// is removed first; without a new backup, an in-progress directory left by a
+// crash is restored instead of being lost), then every entry is restored: the live container is
 // created or looked up, each item of the backup replaces the live item of
 // the same name, and the default structure is made again. What cannot be
 // restored goes to "<inprogress>.failed". Unless the build is internal the

@@ -88,12 +88,20 @@ TEST_F(Boot, BackedUpSystemContainersReplaceLiveItemsAndTheBackupGoes) {
   EXPECT_FALSE(logged("Installing system group containers"));
   EXPECT_FALSE(fs::exists(perUser()->systemContainerBackupBaseDirectory()));
 
+  // A restore a crash interrupted after the rename to .inprogress is resumed.
+  fs::create_directories(backup + ".inprogress/com.example.sys");
+  put(backup + ".inprogress/com.example.sys/shared.txt", "resumed");
+  rebootSetup();
+  EXPECT_EQ(read(live->url() + "/shared.txt"), "resumed");
+  EXPECT_TRUE(logged("Resuming the interrupted restore"));
+  EXPECT_FALSE(fs::exists(perUser()->systemContainerBackupBaseDirectory()));
+
   // A backup that a user could have written is not restored.
   fs::create_directories(backup + "/com.example.sys");
   put(backup + "/com.example.sys/shared.txt", "planted");
   ASSERT_EQ(::chown(backup.c_str(), 501, 501), 0);
   rebootSetup();
-  EXPECT_EQ(read(live->url() + "/shared.txt"), "backup");
+  EXPECT_EQ(read(live->url() + "/shared.txt"), "resumed");
   EXPECT_TRUE(logged("Not restoring"));
 }
 
