@@ -23,8 +23,10 @@
 #include <vector>
 
 #include "base/VSALog.h"
+#include "base/VSAPlist.h"
 #include "base/VSAUUID.h"
 #include "daemon/VSAClientConnection.h"
+#include "migration/VSAMigrationStatus.h"
 #include "platform/VSAIPCClient.h"
 #include "platform/VSANotificationCenter.h"
 
@@ -43,7 +45,15 @@ std::vector<std::string> populate(const std::string& root, int containers, int o
   fs::create_directories(root + "/private/var/mobile");
   std::ofstream(root + "/etc/passwd") << "mobile:x:501:501::/private/var/mobile:/bin/sh\n";
   std::ofstream(root + "/etc/group") << "mobile:x:501:\n";
+  // A device booting the build it last ran: a plain boot, not an upgrade.
+  fs::create_directories(root + "/etc/vessad");
+  VSA_writeToURL(VSAValue::Dictionary{{"ProductBuildVersion", VSAValue("BENCH1")},
+                                      {"ReleaseType", VSAValue("User")}},
+                 root + "/etc/vessad/system-version.plist", 0, nullptr);
   VSADaemonContext context{VSASystemRoot(root)};
+  VSAMigrationStatus::initForSystemMigration(*context.globalConfiguration,
+                                             root + "/etc/vessad/system-version.plist")
+      ->writeCurrentBuildInfoToDisk();
   auto connection = VSAClientConnection::sharedClientConnection(context);
   auto user = context.userIdentityCache->defaultUserIdentity();
   const VSAContainerClass classes[] = {2, 2, 2, 4, 4, 7, 1, 1, 6, 10};
@@ -125,7 +135,7 @@ DaemonBoot daemonBoot(const std::string& vessad, const std::string& root) {
     }
     for (const auto& name : notifications.postedNames())
       if (name == CONTAINER_NOTIFY_REBOOT_CLEANUP_COMPLETE) boot.cleanupComplete = seconds(start);
-    std::this_thread::sleep_for(std::chrono::microseconds(200));
+    std::this_thread::sleep_for(std::chrono::milliseconds(1));  // leave the cores to the daemon
   }
   kill(pid, SIGTERM);
   waitpid(pid, nullptr, 0);

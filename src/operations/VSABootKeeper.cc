@@ -146,6 +146,7 @@ void VSABootKeeper::_cleanupOrphanedDataForDirectories(const std::vector<std::st
     return services_.wellknownContainerForId &&
            services_.wellknownContainerForId(name, cls).has_value();
   };
+  std::vector<std::string> orphans;
   for (const auto& url : entries) {
     if (fm.itemDoesNotExistAtURL(url)) {
       VSALogIn(VSALogCategory::Startup, kVSALogDebug, origin,
@@ -166,11 +167,12 @@ void VSABootKeeper::_cleanupOrphanedDataForDirectories(const std::vector<std::st
       fm.printDirectoryStructureAtURL(url);
       VSALogIn(VSALogCategory::Startup, kVSALogError, origin, "***END INTERNAL BUILD REQUEST");
     }
-    // An orphan whose move a crash undoes is found again at the next boot.
-    VSAErrorRef error;
-    if (!services_.deathRow->_moveItemAtURLToDeathRow(url, true, false, &error, false))
-      VSALogIn(VSALogCategory::Startup, kVSALogError, origin, "%@", error);
+    orphans.push_back(url);
   }
+  // One directory on death row for this batch (entries of one class
+  // directory have distinct names); an orphan whose move a crash undoes is
+  // found again at the next boot, so the moves are not synced.
+  services_.deathRow->_moveEntriesToDeathRowWithoutSync(orphans);
 }
 
 void VSABootKeeper::_cleanupOprhanedCodeSigningMappingData() {

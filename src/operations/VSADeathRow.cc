@@ -59,6 +59,35 @@ bool VSADeathRow::_moveItemAtURLToDeathRow(const std::string& url, bool isDir,
   return true;
 }
 
+bool VSADeathRow::_moveEntriesToDeathRowWithoutSync(const std::vector<std::string>& urls) {
+  const char* fn = "_moveEntriesToDeathRowWithoutSync";
+  if (urls.empty()) return true;
+  VSAFileManager& fm = configuration_->fileManager();
+  VSAErrorRef error;
+  auto unique =
+      fm.createTemporaryDirectoryInDirectoryURL(configuration_->deathrowDirectory(), &error);
+  if (!unique) {
+    VSALog(kVSALogError, fn, "Failed to create unique directory on death row: %@", error);
+    return false;
+  }
+  bool all = true;
+  for (const auto& url : urls) {
+    std::string destination = VSAPathJoin(*unique, VSALastPathComponent(url));
+    VSAErrorRef moveError;
+    if (!fm.moveItemAtURL(url, destination, &moveError, false)) {
+      if (isMissing(moveError)) continue;
+      VSALog(kVSALogError, fn, "Failed to move item at: %@ to: %@: %@", url, destination,
+             moveError);
+      all = false;
+      continue;
+    }
+    VSAErrorRef restrictError;
+    if (!fm.restrictItemToRootAtURL(destination, &restrictError))
+      VSALog(kVSALogError, fn, "%@", restrictError);
+  }
+  return all;
+}
+
 void VSADeathRow::deleteContainersOnDeathRowWithCompletion(Completion completion) {
   auto token = transactions_ ? transactions_->open() : nullptr;
   // The background queue is process-wide and may run this after the daemon

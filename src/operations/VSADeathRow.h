@@ -13,6 +13,7 @@
 #include <functional>
 #include <memory>
 #include <string>
+#include <vector>
 
 #include "base/VSAError.h"
 #include "base/VSAWorkQueue.h"
@@ -33,6 +34,11 @@ class VSADeathRow : public std::enable_shared_from_this<VSADeathRow> {
   // redone if a crash undoes it (orphans found at boot).
   bool _moveItemAtURLToDeathRow(const std::string& url, bool isDir, bool startDeletionThread,
                                 VSAErrorRef* error, bool durable = true);
+  // Moves the entries of one directory (so their names differ) into one
+  // fresh directory, without syncs: for orphans found at boot, whose moves
+  // are redone if a crash undoes them. Each failure is logged and the others
+  // go on; false when any failed.
+  bool _moveEntriesToDeathRowWithoutSync(const std::vector<std::string>& urls);
   // Returns at once; the completion gets the code of the last failure (1 when none).
   // The queued work keeps this object alive until it has run.
   void deleteContainersOnDeathRowWithCompletion(Completion completion);
