@@ -5,10 +5,12 @@
 #include <gtest/gtest.h>
 #include <sys/wait.h>
 
+#include <algorithm>
 #include <filesystem>
 #include <fstream>
 #include <future>
 
+#include "base/VSAUUID.h"
 #include "e2e/VSATestDaemon.h"
 
 namespace fs = std::filesystem;
@@ -184,6 +186,34 @@ TEST(DaemonContent, AssetsAndSharedContentThroughTheSocket) {
   std::ifstream in(dataPath + "/Library/shared.db");
   EXPECT_EQ(std::string(std::istreambuf_iterator<char>(in), {}), "rows");
   EXPECT_EQ(VSAReplyError(stage("shared.db", "/etc/shadow")), 11u);
+  EXPECT_EQ(d.stop(), 0);
+}
+
+}  // namespace
+
+namespace {
+
+// A staging leftover of 10,000 files keeps the start's cleanup busy well
+// after the daemon serves: a request sent at once is answered before the
+// cleanup-complete notification.
+TEST(DaemonBoot, RequestsAreServedWhileTheCleanupsRun) {
+  VSATestDaemon d;
+  d.registerSelf("com.example.installer", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
+  std::string leftover =
+      d.path("/private/var/mobile/Containers/Staging/" + VSAUUID::random().string() + "/Documents");
+  fs::create_directories(leftover);
+  for (int i = 0; i < 100; ++i) {
+    std::string dir = leftover + "/" + std::to_string(i);
+    fs::create_directory(dir);
+    for (int j = 0; j < 100; ++j) std::ofstream(dir + "/" + std::to_string(j));
+  }
+  ASSERT_TRUE(d.start());
+  auto reply = d.request(create("com.example.app"));
+  auto posted = d.notifications();
+  EXPECT_EQ(VSAReplyError(reply), 1u);
+  EXPECT_EQ(std::count(posted.begin(), posted.end(), "com.tamsk.vessad.cleanup-complete"), 0);
+  ASSERT_TRUE(d.waitForNotifications(2, 60s));
+  EXPECT_FALSE(fs::exists(leftover));
   EXPECT_EQ(d.stop(), 0);
 }
 
