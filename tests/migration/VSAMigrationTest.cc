@@ -49,6 +49,35 @@ class Migration : public VSAContainerTestRoot {
                                                                    VSAValue::dictionary(), &queue),
               VSAResult::kSuccess);
   }
+  // Runs `migrate` on the root as it is now, then again for every crash
+  // point on a fresh copy of it: stopped after the n-th file-system call, a
+  // restart, `wasInterrupted` asked, and `migrate` once more, which must
+  // succeed and leave what `expectDone` checks. Returns (points, interrupted).
+  template <typename Migrate, typename Interrupted, typename Done>
+  std::pair<int, int> crashSweep(Migrate migrate, Interrupted wasInterrupted, Done expectDone) {
+    fs::path snapshot = fs::path(root_ + ".snapshot");
+    fs::copy(root_, snapshot, fs::copy_options::recursive | fs::copy_options::copy_symlinks);
+    startContext();
+    faults_->reset();
+    EXPECT_TRUE(migrate());
+    int total = faults_->totalCalls(), interrupted = 0;
+    for (int n = 1; n <= total; ++n) {
+      SCOPED_TRACE("crash after call " + std::to_string(n));
+      context_.reset();
+      fs::remove_all(root_);
+      fs::copy(snapshot, root_, fs::copy_options::recursive | fs::copy_options::copy_symlinks);
+      startContext();
+      faults_->crashAfter(n);
+      migrate();
+      restart();
+      if (wasInterrupted()) ++interrupted;
+      EXPECT_TRUE(migrate());
+      expectDone();
+      if (HasFailure()) break;
+    }
+    fs::remove_all(snapshot);
+    return {total, interrupted};
+  }
   // What an uninterrupted upgrade leaves: every legacy identifier in the
   // database as described, legacy values and files gone, markers set.
   void expectMigrated() {
@@ -165,38 +194,20 @@ TEST_F(Migration, MultiUserModeSkipsTheGroupIdMigrationAndReconciliation) {
 TEST_F(Migration, AnInterruptedPassEndsLikeAnUninterruptedOneWhenRunAgain) {
   VSAOldDevice::build(*context_, *installer(), user_);
   registerKept();
-  fs::path snapshot =
-      fs::path(root_).parent_path() / (fs::path(root_).filename().string() + ".old");
-  fs::copy(root_, snapshot, fs::copy_options::recursive | fs::copy_options::copy_symlinks);
-  startContext();
-  faults_->reset();
-  ASSERT_TRUE(codeSigningPass());
-  int total = faults_->totalCalls();
+  auto [total, interrupted] =
+      crashSweep([&] { return codeSigningPass(); },
+                 [&] {
+                   auto after = status();
+                   return !after || !after->hasMigrationOccurredForType("CodeSigningMigration") ||
+                          fs::exists(library() + "/vsa_entitlements.plist");
+                 },
+                 [&] { expectMigrated(); });
   ASSERT_GT(total, 10);
-  int interrupted = 0;
-  for (int n = 1; n <= total; ++n) {
-    SCOPED_TRACE("crash after call " + std::to_string(n));
-    context_.reset();
-    fs::remove_all(root_);
-    fs::copy(snapshot, root_, fs::copy_options::recursive | fs::copy_options::copy_symlinks);
-    startContext();
-    faults_->crashAfter(n);
-    codeSigningPass();
-    restart();
-    auto after = status();
-    if (!after || !after->hasMigrationOccurredForType("CodeSigningMigration") ||
-        fs::exists(library() + "/vsa_entitlements.plist"))
-      ++interrupted;
-    ASSERT_TRUE(codeSigningPass());
-    expectMigrated();
-    if (HasFailure()) break;
-  }
   std::printf(
       "code-signing migration crash sweep: %d crash points (%d left it half done), all "
       "clean after the next run\n",
       total, interrupted);
   EXPECT_GT(interrupted, total / 2);
-  fs::remove_all(snapshot);
 }
 
 TEST_F(Migration, TheBuildUpgradeMovesLogsBundlesAndWellKnownSystemContainers) {
@@ -297,49 +308,34 @@ TEST_F(Migration, AnInterruptedBuildUpgradeEndsLikeAnUninterruptedOneWhenRunAgai
   std::string uuidPath = fs::path(wellKnown->url()).parent_path() / VSAUUID::random().string();
   fs::rename(wellKnown->url(), uuidPath);
   VSAOldDevice::writeSystemVersion(root_, "NEW2");
-  fs::path snapshot = fs::path(root_).parent_path() / (fs::path(root_).filename().string() + ".up");
-  fs::copy(root_, snapshot, fs::copy_options::recursive | fs::copy_options::copy_symlinks);
   auto upgrade = [&] {
     auto s = status();
     VSAErrorRef error;
     return s && context_->containerMigrator->performSynchronousBuildUpgradeMigration(*s, &error);
   };
-  startContext();
-  faults_->reset();
-  ASSERT_TRUE(upgrade());
-  int total = faults_->totalCalls();
+  std::string logs = root_ + "/private/var/root/Library/Logs/Vessa";
+  std::string bundles = root_ + "/private/var/containers/Bundle";
+  auto [total, interrupted] = crashSweep(
+      upgrade,
+      [&] {
+        return fs::exists(root_ + "/private/var/mobile/Containers/Bundle") || fs::exists(uuidPath);
+      },
+      [&] {
+        EXPECT_TRUE(fs::exists(logs + "/vessad.0"));
+        EXPECT_TRUE(fs::exists(logs + "/vessad.1"));
+        EXPECT_TRUE(std::ifstream(bundles + "/Application/OLD-APP/Info.plist").good());
+        EXPECT_FALSE(fs::exists(root_ + "/private/var/mobile/Containers/Bundle"));
+        EXPECT_TRUE(fs::is_directory(wellKnown->url()));
+        EXPECT_FALSE(fs::exists(uuidPath));
+        auto found = installer()->createOrLookupContainerWithContainerIdentity(
+            identity("systemgroup.com.tamsk.launcher", 13), false, false, true, &code);
+        ASSERT_TRUE(found);
+        EXPECT_EQ(found->uuid(), wellKnown->uuid());
+      });
   ASSERT_GT(total, 5);
-  std::string logs = context_->globalConfiguration->logDirectory();
-  std::string bundles = context_->globalConfiguration->bundleDirectory();
-  int interrupted = 0;
-  for (int n = 1; n <= total; ++n) {
-    SCOPED_TRACE("crash after call " + std::to_string(n));
-    context_.reset();
-    fs::remove_all(root_);
-    fs::copy(snapshot, root_, fs::copy_options::recursive | fs::copy_options::copy_symlinks);
-    startContext();
-    faults_->crashAfter(n);
-    upgrade();
-    restart();
-    if (fs::exists(root_ + "/private/var/mobile/Containers/Bundle") || fs::exists(uuidPath))
-      ++interrupted;
-    ASSERT_TRUE(upgrade());
-    EXPECT_TRUE(fs::exists(logs + "/vessad.0"));
-    EXPECT_TRUE(fs::exists(logs + "/vessad.1"));
-    EXPECT_EQ(std::ifstream(bundles + "/Application/OLD-APP/Info.plist").good(), true);
-    EXPECT_FALSE(fs::exists(root_ + "/private/var/mobile/Containers/Bundle"));
-    EXPECT_TRUE(fs::is_directory(wellKnown->url()));
-    EXPECT_FALSE(fs::exists(uuidPath));
-    auto found = installer()->createOrLookupContainerWithContainerIdentity(
-        identity("systemgroup.com.tamsk.launcher", 13), false, false, true, &code);
-    ASSERT_TRUE(found);
-    EXPECT_EQ(found->uuid(), wellKnown->uuid());
-    if (HasFailure()) break;
-  }
   std::printf("build-upgrade crash sweep: %d crash points (%d interrupted a move), all clean\n",
               total, interrupted);
   EXPECT_GT(interrupted, 0);
-  fs::remove_all(snapshot);
 }
 
 }  // namespace
