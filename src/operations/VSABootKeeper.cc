@@ -148,16 +148,18 @@ void VSABootKeeper::_cleanupOrphanedDataForDirectories(const std::vector<std::st
   };
   std::vector<std::string> orphans;
   for (const auto& url : entries) {
+    // A live container (most entries) costs one status call: its metadata
+    // file exists, so the entry does too.
+    bool valid = VSAContainerCache::containerURLIsValidForContainerClass(url, c, isWellknown);
+    if (valid && fm.itemExistsAtURL(VSAPathJoin(url, kVSAMetadataFileName))) continue;
     if (fm.itemDoesNotExistAtURL(url)) {
       VSALogIn(VSALogCategory::Startup, kVSALogDebug, origin,
                "Ignoring deleted container path during cleanup: [%@]", url);
       continue;
     }
-    if (VSAContainerCache::containerURLIsValidForContainerClass(url, c, isWellknown)) {
-      if (fm.itemExistsAtURL(VSAPathJoin(url, kVSAMetadataFileName))) continue;  // live
+    if (valid)
       VSALogIn(VSALogCategory::Startup, kVSALogError, origin,
                "Deleting orphaned data missing a metadata file at: %@", url);
-    }
     if (services_.configuration->isInternalImage()) {
       VSALogIn(VSALogCategory::Startup, kVSALogError, origin,
                "***INTERNAL BUILD REQUEST: please file a problem report with the data below");
