@@ -284,12 +284,14 @@ bool VSAContainerMigrator::performPerUserDataMigrationForClientConnection(
       bool all = true;
       hooks_.userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
           [&](const VSAUserIdentityRef& user) {
-            all = subdirectoryMigration(user, client) && all;
+            all = subdirectoryMigration(user, client, status->currentBuildVersion()) && all;
           });
       ok = all && status->setMigrationCompleteForType(kSubdirectoryMigration);
     }
     hooks_.userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
-        [&](const VSAUserIdentityRef& user) { ok = dataProtectionMigration(user, client) && ok; });
+        [&](const VSAUserIdentityRef& user) {
+          ok = dataProtectionMigration(user, client, status->currentBuildVersion()) && ok;
+        });
     removeDeprecatedContainers(client);
     if (!ok) VSASetCode(withError, VSAResult::kWriteFailed);
     return ok;
@@ -297,9 +299,9 @@ bool VSAContainerMigrator::performPerUserDataMigrationForClientConnection(
 }
 
 bool VSAContainerMigrator::subdirectoryMigration(const VSAUserIdentityRef& user,
-                                                 const VSAMigrationClient& client) {
+                                                 const VSAMigrationClient& client,
+                                                 const std::string& build) {
   const char* origin = "performPerUserDataMigrationForClientConnection";
-  std::string build = systemStatus() ? systemStatus()->currentBuildVersion() : "Unknown";
   logMigrator(kVSALogNotice, origin, "Performing Per User Subdirectory Migration for %@ on %@",
               user->shortDescription(), build);
   bool ok = true;
@@ -329,9 +331,9 @@ bool VSAContainerMigrator::subdirectoryMigration(const VSAUserIdentityRef& user,
 }
 
 bool VSAContainerMigrator::dataProtectionMigration(const VSAUserIdentityRef& user,
-                                                   const VSAMigrationClient& client) {
+                                                   const VSAMigrationClient& client,
+                                                   const std::string& build) {
   const char* origin = "performPerUserDataMigrationForClientConnection";
-  std::string build = systemStatus() ? systemStatus()->currentBuildVersion() : "Unknown";
   logMigrator(kVSALogNotice, origin, "Performing User Data Protection Migration for %@ on %@",
               user->shortDescription(), build);
   bool ok = true;

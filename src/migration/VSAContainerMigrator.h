@@ -89,8 +89,11 @@ class VSAContainerMigrator {
   bool migrateOldBundleLocation(VSAErrorRef* error);
   void _setDataProtectionIfNecessaryOnContainer(const VSAMetadata& container,
                                                 const VSAMigrationClient& client);
-  bool subdirectoryMigration(const VSAUserIdentityRef& user, const VSAMigrationClient& client);
-  bool dataProtectionMigration(const VSAUserIdentityRef& user, const VSAMigrationClient& client);
+  // `build`: the current build, for the log lines.
+  bool subdirectoryMigration(const VSAUserIdentityRef& user, const VSAMigrationClient& client,
+                             const std::string& build);
+  bool dataProtectionMigration(const VSAUserIdentityRef& user, const VSAMigrationClient& client,
+                               const std::string& build);
   void removeDeprecatedContainers(const VSAMigrationClient& client);
   std::unique_ptr<VSAMigrationStatus> systemStatus();
 

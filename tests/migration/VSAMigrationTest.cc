@@ -78,6 +78,16 @@ class Migration : public VSAContainerTestRoot {
     fs::remove_all(snapshot);
     return {total, interrupted};
   }
+  // A well-known system group container that an old release kept under a
+  // UUID name: the container and the name it has now.
+  std::pair<VSAMetadataRef, std::string> hideWellKnownUnderUUID() {
+    VSAResultCode code;
+    auto wellKnown = create(*installer(), "systemgroup.com.tamsk.launcher", &code, false, 13);
+    if (!wellKnown) return {nullptr, ""};
+    std::string uuidPath = fs::path(wellKnown->url()).parent_path() / VSAUUID::random().string();
+    fs::rename(wellKnown->url(), uuidPath);
+    return {wellKnown, uuidPath};
+  }
   // What an uninterrupted upgrade leaves: every legacy identifier in the
   // database as described, legacy values and files gone, markers set.
   void expectMigrated() {
@@ -212,12 +222,11 @@ TEST_F(Migration, AnInterruptedPassEndsLikeAnUninterruptedOneWhenRunAgain) {
 
 TEST_F(Migration, TheBuildUpgradeMovesLogsBundlesAndWellKnownSystemContainers) {
   VSAOldDevice::build(*context_, *installer(), user_);
-  // A well-known system group container that an old release kept under a UUID name.
   VSAResultCode code;
-  auto wellKnown = create(*installer(), "systemgroup.com.tamsk.launcher", &code, false, 13);
-  ASSERT_TRUE(wellKnown) << code;
-  std::string uuidPath = fs::path(wellKnown->url()).parent_path() / VSAUUID::random().string();
-  fs::rename(wellKnown->url(), uuidPath);
+  auto hidden = hideWellKnownUnderUUID();
+  VSAMetadataRef wellKnown = hidden.first;
+  std::string uuidPath = hidden.second;
+  ASSERT_TRUE(wellKnown);
   startContext();
   VSAOldDevice::writeSystemVersion(root_, "NEW2");
   auto s = status();
@@ -256,10 +265,6 @@ TEST_F(Migration, TheBuildUpgradeMovesLogsBundlesAndWellKnownSystemContainers) {
   EXPECT_TRUE(bare->hasMigrationOccurredForType("ACLMigration"));
 }
 
-}  // namespace
-
-namespace {
-
 TEST_F(Migration, PerUserMigrationRestoresStructureOnceAndRemovesDeprecatedContainers) {
   VSAResultCode code;
   auto app = create(*installer(), "com.example.app", &code);
@@ -296,17 +301,13 @@ TEST_F(Migration, PerUserMigrationRestoresStructureOnceAndRemovesDeprecatedConta
   EXPECT_EQ(run(), VSAResult::kSuccess);  // already gone: nothing to do
 }
 
-}  // namespace
-
-namespace {
-
 TEST_F(Migration, AnInterruptedBuildUpgradeEndsLikeAnUninterruptedOneWhenRunAgain) {
   VSAOldDevice::build(*context_, *installer(), user_);
   VSAResultCode code;
-  auto wellKnown = create(*installer(), "systemgroup.com.tamsk.launcher", &code, false, 13);
-  ASSERT_TRUE(wellKnown) << code;
-  std::string uuidPath = fs::path(wellKnown->url()).parent_path() / VSAUUID::random().string();
-  fs::rename(wellKnown->url(), uuidPath);
+  auto hidden = hideWellKnownUnderUUID();
+  VSAMetadataRef wellKnown = hidden.first;
+  std::string uuidPath = hidden.second;
+  ASSERT_TRUE(wellKnown);
   VSAOldDevice::writeSystemVersion(root_, "NEW2");
   auto upgrade = [&] {
     auto s = status();
