@@ -2,8 +2,11 @@
 
 #include <sqlite3.h>
 
+#include <cerrno>
+#include <cstdlib>
 #include <cstring>
 #include <exception>
+#include <filesystem>
 
 #include "base/VSACrash.h"
 #include "base/VSALog.h"
@@ -159,7 +162,11 @@ void VSASQLiteDB::finalizeCachedStatements() {
 VSASQLiteDB::VSASQLiteDB(const std::string& parentDirectory)
     : url_(VSAPathJoin(parentDirectory, "containers.sqlite3")), db_(openDBWithURL(url_)) {}
 
-VSASQLiteDB::~VSASQLiteDB() { closeDB(); }
+VSASQLiteDB::~VSASQLiteDB() {
+  closeDB();
+  std::error_code ignored;
+  if (!scratchDirectory_.empty()) std::filesystem::remove_all(scratchDirectory_, ignored);
+}
 
 sqlite3* VSASQLiteDB::openDBWithURL(const std::string& path) {
   // The database holds every app's entitlements: root's alone. SQLite gives
@@ -189,6 +196,54 @@ sqlite3* VSASQLiteDB::openDBWithURL(const std::string& path) {
   }
   VSALogIn(VSALogCategory::Database, kVSALogDebug, kOrigin, "opening %@", path);
   return db;
+}
+
+std::unique_ptr<VSASQLiteDB> VSASQLiteDB::openReadOnly(const std::string& parentDirectory,
+                                                       VSAErrorRef* error) {
+  namespace fs = std::filesystem;
+  std::string path = VSAPathJoin(parentDirectory, "containers.sqlite3");
+  std::string scratch = (fs::temp_directory_path() / "vessa-db-XXXXXX").string();
+  if (!::mkdtemp(scratch.data())) {
+    VSASetError(error, dbError(VSAResult::kDatabaseFailed, "openReadOnly",
+                               "no scratch directory for a copy of %@: %s", path,
+                               std::strerror(errno)));
+    return nullptr;
+  }
+  std::string copy = VSAPathJoin(scratch, "containers.sqlite3");
+  std::error_code ec;
+  fs::copy_file(path, copy, ec);
+  if (!ec && fs::exists(path + "-wal")) fs::copy_file(path + "-wal", copy + "-wal", ec);
+  sqlite3* db = nullptr;
+  int rc = ec ? SQLITE_CANTOPEN
+              : sqlite3_open_v2(copy.c_str(), &db, SQLITE_OPEN_READWRITE, nullptr);
+  if (rc == SQLITE_OK)
+    rc = sqlite3_exec(db, "SELECT count(*) FROM sqlite_master;", nullptr, nullptr, nullptr);
+  if (rc != SQLITE_OK) {
+    VSASetError(error, dbError(VSAResult::kDatabaseFailed, "openReadOnly", "opening %@ failed: %s",
+                               path,
+                               ec ? ec.message().c_str()
+                               : db ? sqlite3_errmsg(db)
+                                    : sqlite3_errstr(rc)));
+    sqlite3_close(db);
+    fs::remove_all(scratch, ec);
+    return nullptr;
+  }
+  std::unique_ptr<VSASQLiteDB> opened(new VSASQLiteDB(path, db));
+  opened->scratchDirectory_ = scratch;
+  return opened;
+}
+
+std::optional<std::string> VSASQLiteDB::integrityCheck(VSAErrorRef* error) {
+  Statement s(*this, "PRAGMA integrity_check;", "integrity check", error);
+  if (!s) return std::nullopt;
+  std::string result;
+  int rc;
+  while ((rc = s.step(error)) == SQLITE_ROW) {
+    auto line = s.text(0);
+    result += (result.empty() ? "" : "\n") + line.value_or("");
+  }
+  if (rc != SQLITE_DONE) return std::nullopt;
+  return result;
 }
 
 void VSASQLiteDB::closeDB() {

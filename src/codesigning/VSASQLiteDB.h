@@ -13,6 +13,7 @@
 
 #include <functional>
 #include <map>
+#include <memory>
 #include <optional>
 #include <string>
 #include <vector>
@@ -30,6 +31,16 @@ class VSASQLiteDB {
   ~VSASQLiteDB();
   VSASQLiteDB(const VSASQLiteDB&) = delete;
   VSASQLiteDB& operator=(const VSASQLiteDB&) = delete;
+
+  // For a reader that must change nothing (the root checker): opens a
+  // private copy of the file and of its write-ahead log, so that SQLite may
+  // recover the log as the daemon's next start would, without touching the
+  // original; runs no schema. The copy goes with the object. Nothing, with
+  // `error`, when it cannot (no file, not a database).
+  static std::unique_ptr<VSASQLiteDB> openReadOnly(const std::string& parentDirectory,
+                                                   VSAErrorRef* error);
+  // SQLite's own consistency check: "ok", or the problems it lists, one a line.
+  std::optional<std::string> integrityCheck(VSAErrorRef* error);
 
   // Opens and initialises the file; ends the process when it cannot.
   static sqlite3* openDBWithURL(const std::string& path);
@@ -56,6 +67,8 @@ class VSASQLiteDB {
 
  private:
   class Statement;
+  VSASQLiteDB(std::string url, sqlite3* db) : url_(std::move(url)), db_(db) {}
+  std::string scratchDirectory_;  // the private copy of openReadOnly, removed with the object
   bool _sqliteExec(const char* sql, VSAErrorRef* error);
   bool _insertCodeSigningInfo(const VSACodeSigningEntry& entry, const std::string& identifier,
                               VSAErrorRef* error);

@@ -64,13 +64,24 @@ struct VSADaemonContext {
     if (buildSubsystemsNow) buildSubsystems();
   }
 
-  void buildSubsystems() {
+  // The container model alone: layout, users and personas, well-known
+  // names. What reads a root without serving it (the root checker) stops here.
+  void buildModel() {
     const VSASystemRoot& root = systemRoot;
     globalConfiguration =
         std::make_shared<VSAGlobalConfiguration>(root, deviceProperties, userDatabase, fileManager);
-    deathRow = std::make_shared<VSADeathRow>(globalConfiguration, transactions);
     whitelist = VSAWhitelist::load(root.resolve("/etc/vessad/whitelist.plist"),
                                    globalConfiguration->isInternalImage());
+    userIdentityCache = VSAUserIdentitySharedCache::create(
+        {personaService, userDatabase, globalConfiguration->currentMobileUserId(),
+         globalConfiguration->currentMobileGroupId(),
+         VSAUserIdentityCache::personasAreSupported(*deviceProperties), transactions});
+  }
+
+  void buildSubsystems() {
+    const VSASystemRoot& root = systemRoot;
+    buildModel();
+    deathRow = std::make_shared<VSADeathRow>(globalConfiguration, transactions);
     // A device may come without a termination service ("HasTerminationService" NO).
     if (deviceProperties->deviceDictionary().get("HasTerminationService") == nullptr ||
         deviceProperties->deviceDictionary()
@@ -79,10 +90,6 @@ struct VSADaemonContext {
             .value_or(true))
       terminationService =
           std::make_shared<VSAApplicationTerminationService>(root, clientRegistry, fileSystem);
-    userIdentityCache = VSAUserIdentitySharedCache::create(
-        {personaService, userDatabase, globalConfiguration->currentMobileUserId(),
-         globalConfiguration->currentMobileGroupId(),
-         VSAUserIdentityCache::personasAreSupported(*deviceProperties), transactions});
     // Opening the database stops the process when another daemon holds it.
     codeSigningMapping = std::make_shared<VSACodeSigningMapping>(
         userIdentityCache, globalConfiguration,

@@ -362,6 +362,10 @@ bool VSADataProtectionManager::restartPendingDataProtectionOperationsWithError(V
   std::string directory = env_->configuration->pendingUpdatesDirectory();
   VSAFileManager& fm = env_->configuration->fileManager();
   if (fm.itemDoesNotExistAtURL(directory)) return true;
+  // A crash inside an update file's atomic write leaves its temporary file;
+  // the update it would have carried was never started, so it simply goes.
+  if (int removed = fm.removeUnfinishedWritesInDirectoryAtURL(directory))
+    VSALog(kVSALogNotice, __func__, "Removed %d unfinished update files in %@", removed, directory);
   VSAErrorRef listError;
   auto items = fm.urlsForItemsInDirectoryAtURL(directory, &listError);
   if (!items) {

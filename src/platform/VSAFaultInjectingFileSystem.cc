@@ -3,6 +3,16 @@
 VSAFaultInjectingFileSystem::VSAFaultInjectingFileSystem(std::shared_ptr<VSAFileSystem> inner)
     : inner_(std::move(inner)) {}
 
+std::shared_ptr<VSAFaultInjectingFileSystem> VSAFaultInjectingFileSystem::readOnly(
+    std::shared_ptr<VSAFileSystem> inner) {
+  auto fs = std::make_shared<VSAFaultInjectingFileSystem>(std::move(inner));
+  for (Op op : {Op::Mkdir, Op::Chown, Op::Chmod, Op::Rename, Op::Unlink, Op::Rmdir, Op::SetXattr,
+                Op::SetFlags, Op::CopyData, Op::Symlink, Op::WriteFile, Op::Mkdtemp, Op::SetACL,
+                Op::SetClass, Op::MaintainStatistics})
+    fs->failAll(op, EROFS);
+  return fs;
+}
+
 void VSAFaultInjectingFileSystem::failNth(Op op, int n, int error) {
   std::lock_guard lock(mutex_);
   rules_.push_back({op, n - 1, error});

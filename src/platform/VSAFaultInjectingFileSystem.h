@@ -6,7 +6,9 @@
 // the steps of an operation and fail each in turn. A descriptor-relative call
 // counts as the operation of its path form (statAt as Lstat, unlinkAt as
 // Unlink or Rmdir, ...). crashAfter(n) stops every call after the n-th, for
-// crash-point sweeps. Thread-safe.
+// crash-point sweeps. readOnly() makes a layer that refuses every call that
+// would change the disk (EROFS), for code that must only look, such as the
+// root checker. Thread-safe.
 #pragma once
 
 #include <array>
@@ -19,6 +21,7 @@
 class VSAFaultInjectingFileSystem : public VSAFileSystem {
  public:
   explicit VSAFaultInjectingFileSystem(std::shared_ptr<VSAFileSystem> inner);
+  static std::shared_ptr<VSAFaultInjectingFileSystem> readOnly(std::shared_ptr<VSAFileSystem> inner);
 
   void failNth(Op op, int n, int error);
   void failAll(Op op, int error);
