@@ -51,6 +51,13 @@ VSARootChecker::Status VSARootChecker::check() {
     unreadable_ = "a daemon is serving " + rootPath_ + "; stop it first";
     return kUnreadable;
   }
+  // Directories the layout would make are refused by the read-only layer,
+  // and every refusal would be logged: the report says what matters.
+  struct Quiet {
+    int saved = VSALogger::shared().level();
+    Quiet() { VSALogger::shared().setLevel(kVSALogFault - 1); }
+    ~Quiet() { VSALogger::shared().setLevel(saved); }
+  } quiet;
   context_ = std::make_unique<VSADaemonContext>(
       VSASystemRoot(rootPath_),
       [](std::shared_ptr<VSAFileSystem> real) {
