@@ -67,6 +67,7 @@ VSARootChecker::Status VSARootChecker::check() {
   context_->buildModel();
   auto& config = *context_->globalConfiguration;
   auto& users = *context_->userIdentityCache;
+  std::set<std::string> stagingDirectories{config.stagingDirectory()};
   users.forEachAccessibleUserIdentitySynchronouslyExecuteBlock([&](const VSAUserIdentityRef& u) {
     auto perUser = config.getPerUserConfigurationForUserIdentity(u);
     if (!perUser->existsUserBaseDirectory()) return;
@@ -74,15 +75,15 @@ VSARootChecker::Status VSARootChecker::check() {
     for (VSAContainerClass c : kPerUserClasses) {
       checkClassDirectory(u, c, false);
       checkClassDirectory(u, c, true);
-      checkLeftovers(config.stagingDirectoryURLForUserIdentity(u, c), "staging-leftover",
-                     kNextStart);
+      stagingDirectories.insert(config.stagingDirectoryURLForUserIdentity(u, c));
     }
   });
   for (VSAContainerClass c : kGlobalClasses) {
     checkClassDirectory(users.defaultUserIdentity(), c, false);
     checkClassDirectory(users.defaultUserIdentity(), c, true);
   }
-  checkLeftovers(config.stagingDirectory(), "staging-leftover", kNextStart);
+  for (const auto& directory : stagingDirectories)
+    checkLeftovers(directory, "staging-leftover", kNextStart);
   checkLeftovers(config.replaceDirectory(), "replace-journal", kNextStart);
   checkPendingUpdates();
   std::vector<VSADirectoryEntry> dead;
