@@ -35,7 +35,7 @@ VSARootChecker::~VSARootChecker() = default;
 
 void VSARootChecker::add(const char* kind, const std::string& path, std::string detail,
                          const char* repair) {
-  findings_.push_back({kind, path, std::move(detail), repair});
+  findings_.push_back({kind, path, std::move(detail), repair, repair == kNextStart});
 }
 
 VSARootChecker::Status VSARootChecker::check() {
@@ -254,7 +254,7 @@ void VSARootChecker::checkDatabase() {
       for (const auto& path : paths)
         notes_.push_back({"unreferenced-group", path,
                           "no identifier's entitlements name " + group,
-                          "removed when application groups are next reconciled"});
+                          "removed when application groups are next reconciled", false});
 }
 
 std::string VSARootChecker::text() const {

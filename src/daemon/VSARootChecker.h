@@ -41,6 +41,7 @@ struct VSARootFinding {
   std::string path;    // what it is about
   std::string detail;  // what is wrong
   std::string repair;  // what brings it into order
+  bool repairedAtStart = false;  // the daemon's next start (not only a boot) repairs it
 };
 
 class VSARootChecker {

@@ -83,8 +83,16 @@ VSAContainerCache::ClassMap* VSAContainerCache::_lock_getCache(const VSAUserIden
   ClassMap map;
   for (const auto& item : *items) {
     if (!containerURLIsValidForContainerClass(item.path, c, deps_.isWellknown)) continue;
+    VSAErrorRef readError;
     auto m = VSAMetadata::readAndValidateMetadataAtUrl(item.path, user, true, config,
-                                                       *deps_.userIdentityCache, nullptr);
+                                                       *deps_.userIdentityCache, &readError);
+    // A map without a container that is there would let the next creation
+    // make it a second time: a read the system failed fails the rebuild.
+    if (!m && VSAMetadata::isTransientReadFailure(readError)) {
+      VSASetError(error, cacheError(43, "Cache: %@%@: could not read %@: %@", key,
+                                    transientTag(transient), item.path, readError));
+      return nullptr;
+    }
     if (!m) continue;
     m->setTransient(transient);
     if (populateSandbox && !transient &&
@@ -141,8 +149,17 @@ bool VSAContainerCache::checkFound(const VSAMetadataRef& m, const std::string& k
                 cacheError(47, "Cache: %@%@: nil URL from %@", key, transientTag(transient), *m));
     return false;
   }
-  if (!deps_.configuration->fileManager().itemExistsAtURL(
-          VSAPathJoin(m->url(), kVSAMetadataFileName))) {
+  std::string metadataFile = VSAPathJoin(m->url(), kVSAMetadataFileName);
+  VSAFileManager& fm = deps_.configuration->fileManager();
+  if (fm.itemExistsAtURL(metadataFile)) return true;
+  if (!fm.itemDoesNotExistAtURL(metadataFile)) {
+    // The disk could not say (an I/O error): dropping the entry would let the
+    // next creation make a second container, so it stays and this look-up fails.
+    VSASetError(error, cacheError(44, "Cache: %@%@: cannot check the metadata at: %@ for id: %@",
+                                  key, transientTag(transient), m->url(), m->identifier()));
+    return false;
+  }
+  {
     VSASetError(
         error,
         cacheError(44, "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu", key,

@@ -1,5 +1,7 @@
 #include "model/VSAMetadata.h"
 
+#include <cerrno>
+
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
 #include "base/VSAPlist.h"
@@ -107,6 +109,17 @@ bool VSAMetadata::writeMetadataToFileURL(const std::string& fileURL,
   return true;
 }
 
+bool VSAMetadata::isTransientReadFailure(int rc) {
+  return rc == EIO || rc == ENOSPC || rc == ENOMEM || rc == EAGAIN || rc == EINTR ||
+         rc == EMFILE || rc == ENFILE;
+}
+
+bool VSAMetadata::isTransientReadFailure(const VSAErrorRef& error) {
+  const VSAErrorRef& under = error ? error->underlyingError() : error;
+  return under && under->domain() == kVSAPOSIXErrorDomain &&
+         isTransientReadFailure(static_cast<int>(under->code()));
+}
+
 VSAMetadataRef VSAMetadata::readAndValidateMetadataAtUrl(
     const std::string& containerURL, const VSAUserIdentityRef& forUserIdentity, bool checkClassPath,
     VSAGlobalConfiguration& configuration, VSAUserIdentityCache& cache, VSAErrorRef* error) {
@@ -121,11 +134,19 @@ VSAMetadataRef VSAMetadata::readAndValidateMetadataAtFileUrl(
   const VSAResultCode bad = VSAResult::kInvalidUpdateFile;  // 29
   std::vector<uint8_t> bytes;
   std::optional<VSAValue> dict;
-  if (configuration.fileManager().fileSystem().readFile(file, &bytes, kVSAMetadataFileMaxSize) == 0)
-    dict = VSAPlist::parse(bytes, nullptr, VSAPlist::Accept::BinaryOnly);
-  if (!dict || !dict->isDictionary())
-    return invalid(error, VSAResult::kMetadataUnreadable, "Failed to read metadata at URL %@",
-                   file);
+  int rc = configuration.fileManager().fileSystem().readFile(file, &bytes, kVSAMetadataFileMaxSize);
+  if (rc == 0) dict = VSAPlist::parse(bytes, nullptr, VSAPlist::Accept::BinaryOnly);
+  if (!dict || !dict->isDictionary()) {
+    invalid(error, VSAResult::kMetadataUnreadable, "Failed to read metadata at URL %@", file);
+    // The system's own trouble, not the file's: the caller must not take
+    // the container for a broken one.
+    if (error && *error && isTransientReadFailure(rc))
+      *error = VSAError::make(VSAResult::kMetadataUnreadable,
+                              VSAError::posix(rc, "readFile", __LINE__),
+                              "readAndValidateMetadataAtFileUrl", __LINE__, "%@",
+                              (*error)->message());
+    return nullptr;
+  }
   const VSAValue* identifier = dict->get(kIdentifierKey);
   if (!identifier || !identifier->isString())
     return invalid(error, bad, "Invalid metadata Identifier: %@ at %@", shown(identifier), file);

@@ -79,6 +79,12 @@ class VSAMetadata {
       const std::string& fileURL, const VSAUserIdentityRef& forUserIdentity, bool checkClassPath,
       VSAGlobalConfiguration& configuration, VSAUserIdentityCache& cache, VSAErrorRef* error);
 
+  // Whether a read failed for the system's own reasons (I/O error, no
+  // memory or descriptors) rather than because of the file: the container
+  // may be whole, so nothing may be decided from the failure.
+  static bool isTransientReadFailure(int rc);
+  static bool isTransientReadFailure(const VSAErrorRef& error);
+
   std::string description() const;
 
  private:

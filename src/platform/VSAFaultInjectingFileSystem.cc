@@ -28,6 +28,12 @@ void VSAFaultInjectingFileSystem::crashAfter(int calls) {
   crashRemaining_ = calls;
 }
 
+void VSAFaultInjectingFileSystem::failCall(int n, int error) {
+  std::lock_guard lock(mutex_);
+  failCallRemaining_ = n - 1;
+  failCallError_ = error;
+}
+
 bool VSAFaultInjectingFileSystem::crashed() const {
   std::lock_guard lock(mutex_);
   return crashRemaining_ == 0;
@@ -37,6 +43,7 @@ void VSAFaultInjectingFileSystem::reset() {
   std::lock_guard lock(mutex_);
   rules_.clear();
   crashRemaining_ = -1;
+  failCallRemaining_ = -1;
   counts_.fill(0);
 }
 
@@ -57,6 +64,7 @@ int VSAFaultInjectingFileSystem::injected(Op op) {
   ++counts_[static_cast<size_t>(op)];
   if (crashRemaining_ == 0) return EIO;
   if (crashRemaining_ > 0) --crashRemaining_;
+  if (failCallRemaining_ >= 0 && failCallRemaining_-- == 0) return failCallError_;
   for (auto it = rules_.begin(); it != rules_.end(); ++it) {
     if (it->op != op) continue;
     if (it->remaining < 0) return it->error;

@@ -29,6 +29,9 @@ class VSAFaultInjectingFileSystem : public VSAFileSystem {
   // later one fails with EIO and changes nothing, as if the process had died
   // after its `calls`-th file-system call. reset() ends it.
   void crashAfter(int calls);
+  // The n-th call from now, whatever its kind, fails with `error` (ENOSPC,
+  // EIO, ...) and changes nothing; the calls after it go through.
+  void failCall(int n, int error);
   bool crashed() const;
   void reset();
   int callCount(Op op) const;
@@ -92,4 +95,6 @@ class VSAFaultInjectingFileSystem : public VSAFileSystem {
   std::array<int, static_cast<size_t>(Op::Count)> counts_{};
   std::vector<Rule> rules_;
   int crashRemaining_ = -1;  // -1: no crash planned
+  int failCallRemaining_ = -1;  // -1: no single failure planned
+  int failCallError_ = 0;
 };

@@ -15,7 +15,9 @@
 #include <gtest/gtest.h>
 
 #include <cstdio>
+#include <cerrno>
 #include <cstdlib>
+#include <set>
 #include <filesystem>
 #include <fstream>
 
@@ -32,6 +34,7 @@ namespace {
 struct SweepRow {
   std::string operation;
   int points = 0, run = 0, clean = 0;
+  std::string codes;  // result codes answered under injected failures
 };
 
 std::vector<SweepRow>& sweepTable() {
@@ -43,9 +46,11 @@ class SweepTablePrinter : public ::testing::Environment {
  public:
   void TearDown() override {
     if (sweepTable().empty()) return;
-    std::printf("\n%-42s %12s %8s %8s\n", "operation", "crash points", "run", "clean");
+    std::printf("\n%-46s %12s %8s %8s  %s\n", "operation", "crash points", "run", "clean",
+                "codes");
     for (const auto& r : sweepTable())
-      std::printf("%-42s %12d %8d %8d\n", r.operation.c_str(), r.points, r.run, r.clean);
+      std::printf("%-46s %12d %8d %8d  %s\n", r.operation.c_str(), r.points, r.run, r.clean,
+                  r.codes.c_str());
   }
 };
 const auto* const kPrinter = ::testing::AddGlobalTestEnvironment(new SweepTablePrinter);
@@ -99,9 +104,23 @@ class CrashSweep : public VSAContainerTestRoot {
   }
 
   // The root checker's verdict, with every finding in the failure message.
-  void expectCheckerClean() {
+  // A daemon that is still running may have left what its next start
+  // finishes (`startWillRepair`); nothing else.
+  void expectCheckerClean(bool startWillRepair = false) {
     VSARootChecker checker(root_);
-    EXPECT_EQ(checker.check(), VSARootChecker::kClean) << checker.text();
+    auto status = checker.check();
+    if (startWillRepair && status == VSARootChecker::kFindings) {
+      for (const auto& f : checker.findings())
+        EXPECT_TRUE(f.repairedAtStart) << checker.text();
+    } else {
+      EXPECT_EQ(status, VSARootChecker::kClean) << checker.text();
+    }
+  }
+  // The start after a crash of the daemon alone (no device boot).
+  void restart() {
+    drainBackground();
+    VSAContainerTestRoot::restart();
+    drainBackground();
   }
   void expectNothingLost() {
     for (const auto& [id, k] : known_) {
@@ -127,12 +146,8 @@ class CrashSweep : public VSAContainerTestRoot {
     restartAfterBoot();
     after(0);
     ASSERT_GT(total, 0);
-    const int stride = fullSweep() ? 1 : std::max(1, total / 12);
-    SweepRow row{name, total, 0, 0};
-    std::vector<int> points;
-    for (int n = 1; n <= total; n += stride) points.push_back(n);
-    if (points.back() != total) points.push_back(total);
-    for (int n : points) {
+    SweepRow row{name, total, 0, 0, ""};
+    for (int n : crashPoints(total)) {
       SCOPED_TRACE(name + ": crash after call " + std::to_string(n) + " of " +
                    std::to_string(total));
       prepare(n);
@@ -150,6 +165,52 @@ class CrashSweep : public VSAContainerTestRoot {
     }
     sweepTable().push_back(row);
     std::printf("%s: %d crash points, %d run, %d clean\n", name.c_str(), total, row.run, row.clean);
+  }
+
+  // Every call of the run, or a dozen spread over it (always the last).
+  static std::vector<int> crashPoints(int total) {
+    const int stride = fullSweep() ? 1 : std::max(1, total / 12);
+    std::vector<int> points;
+    for (int n = 1; n <= total; n += stride) points.push_back(n);
+    if (points.back() != total) points.push_back(total);
+    return points;
+  }
+
+  // Fails the n-th file-system call of `operation` with `error` (the disk
+  // full, a bad sector) for each n. The daemon goes on: the operation
+  // answers a failure code (or copes), every container is still found, and
+  // the root checker finds nothing but what the next start finishes; after
+  // that start it finds nothing at all.
+  void failureSweep(const std::string& name, int error, const std::function<void(int)>& prepare,
+                    const std::function<VSAResultCode(int)>& operation) {
+    prepare(0);
+    faults_->reset();
+    ASSERT_EQ(operation(0), VSAResult::kSuccess) << name << " does not succeed uninterrupted";
+    int total = faults_->totalCalls();
+    drainBackground();
+    SweepRow row{name + (error == ENOSPC ? " (ENOSPC)" : " (EIO)"), total, 0, 0, ""};
+    std::set<VSAResultCode> codes;
+    for (int n : crashPoints(total)) {
+      SCOPED_TRACE(row.operation + ": call " + std::to_string(n) + " of " + std::to_string(total));
+      prepare(n);
+      faults_->reset();
+      faults_->failCall(n, error);
+      codes.insert(operation(n));
+      faults_->reset();
+      drainBackground();
+      ++row.run;
+      expectCheckerClean(true);
+      expectNothingLost();
+      restart();
+      expectCheckerClean();
+      expectNothingLost();
+      if (HasFailure()) break;
+      ++row.clean;
+    }
+    for (VSAResultCode c : codes) row.codes += (row.codes.empty() ? "" : ",") + std::to_string(c);
+    sweepTable().push_back(row);
+    std::printf("%s: %d calls, %d run, %d clean, codes %s\n", row.operation.c_str(), total,
+                row.run, row.clean, row.codes.c_str());
   }
 
   static std::string at(const char* prefix, int n) { return prefix + std::to_string(n); }
@@ -373,6 +434,60 @@ TEST_F(CrashSweep, BootCleanupOfOrphansStagingAndTransientContainers) {
         return VSAResult::kSuccess;  // it reports nothing; the checker judges it
       },
       [&](int) { EXPECT_EQ(entries(classDirectory(2, true)), 0u); });
+}
+
+}  // namespace
+
+namespace {
+
+TEST_F(CrashSweep, FullDiskAndIOErrorsAtEachStepLeaveTheRootInOrder) {
+  VSAMetadataRef oldM, newM, target;
+  for (int error : {ENOSPC, EIO}) {
+    if (HasFailure()) return;
+    failureSweep(
+        "create data container", error, [](int) {},
+        [&](int n) {
+          VSAResultCode code;
+          std::string id = at(error == EIO ? "com.example.eio." : "com.example.full.", n);
+          if (auto m = create(*installer(), id, &code)) known_[id] = {2, m->uuid()};
+          return code;
+        });
+    failureSweep(
+        "replace", error,
+        [&](int n) {
+          oldM = made(at(error == EIO ? "com.example.eio.old." : "com.example.full.old.", n));
+          newM = made(at(error == EIO ? "com.example.eio.new." : "com.example.full.new.", n));
+        },
+        [&](int) {
+          VSAResultCode code = VSAResult::kSuccess;
+          installer()->replaceContainerIdentity(oldM->containerIdentity(),
+                                                newM->containerIdentity(), false, false, &code);
+          // Once the new container has moved into its place the old one may
+          // go, even if tidying up after the swap failed.
+          auto now = lookup(newM->identifier());
+          if (code == VSAResult::kSuccess || (now && now->url() != newM->url()))
+            known_.erase(oldM->identifier());
+          return code;
+        });
+    failureSweep(
+        "protection change", error,
+        [&](int n) {
+          target = made(at(error == EIO ? "com.example.eio.p." : "com.example.full.p.", n));
+          put(target->url() + "/Library/file", "data");
+        },
+        [&](int) {
+          auto done = std::make_shared<std::promise<VSAResultCode>>();
+          context_->dataProtectionManager->setDataProtectionOnDataContainerForContainerIdentity(
+              *target->containerIdentity(), 3, false, true,
+              [done](VSAResultCode code) { done->set_value(code); });
+          auto reply = done->get_future();
+          if (reply.wait_for(std::chrono::seconds(20)) != std::future_status::ready) {
+            ADD_FAILURE() << "no reply";
+            return VSAResult::kInvalidArgument;
+          }
+          return reply.get();
+        });
+  }
 }
 
 }  // namespace
