@@ -204,9 +204,9 @@ std::unique_ptr<VSASQLiteDB> VSASQLiteDB::openReadOnly(const std::string& parent
   std::string path = VSAPathJoin(parentDirectory, "containers.sqlite3");
   std::string scratch = (fs::temp_directory_path() / "vessa-db-XXXXXX").string();
   if (!::mkdtemp(scratch.data())) {
-    VSASetError(error, dbError(VSAResult::kDatabaseFailed, "openReadOnly",
-                               "no scratch directory for a copy of %@: %s", path,
-                               std::strerror(errno)));
+    VSASetError(error,
+                dbError(VSAResult::kDatabaseFailed, "openReadOnly",
+                        "no scratch directory for a copy of %@: %s", path, std::strerror(errno)));
     return nullptr;
   }
   std::string copy = VSAPathJoin(scratch, "containers.sqlite3");
@@ -214,16 +214,16 @@ std::unique_ptr<VSASQLiteDB> VSASQLiteDB::openReadOnly(const std::string& parent
   fs::copy_file(path, copy, ec);
   if (!ec && fs::exists(path + "-wal")) fs::copy_file(path + "-wal", copy + "-wal", ec);
   sqlite3* db = nullptr;
-  int rc = ec ? SQLITE_CANTOPEN
-              : sqlite3_open_v2(copy.c_str(), &db, SQLITE_OPEN_READWRITE, nullptr);
+  int rc =
+      ec ? SQLITE_CANTOPEN : sqlite3_open_v2(copy.c_str(), &db, SQLITE_OPEN_READWRITE, nullptr);
   if (rc == SQLITE_OK)
     rc = sqlite3_exec(db, "SELECT count(*) FROM sqlite_master;", nullptr, nullptr, nullptr);
   if (rc != SQLITE_OK) {
-    VSASetError(error, dbError(VSAResult::kDatabaseFailed, "openReadOnly", "opening %@ failed: %s",
-                               path,
-                               ec ? ec.message().c_str()
-                               : db ? sqlite3_errmsg(db)
-                                    : sqlite3_errstr(rc)));
+    VSASetError(error,
+                dbError(VSAResult::kDatabaseFailed, "openReadOnly", "opening %@ failed: %s", path,
+                        ec   ? ec.message().c_str()
+                        : db ? sqlite3_errmsg(db)
+                             : sqlite3_errstr(rc)));
     sqlite3_close(db);
     fs::remove_all(scratch, ec);
     return nullptr;

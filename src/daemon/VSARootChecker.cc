@@ -109,9 +109,8 @@ void VSARootChecker::checkClassDirectory(const VSAUserIdentityRef& user, VSACont
   for (const auto& entry : entries) checkEntry(user, c, transient, *directory, entry.name);
 }
 
-void VSARootChecker::checkEntry(const VSAUserIdentityRef& user, VSAContainerClass c,
-                                bool transient, const std::string& directory,
-                                const std::string& name) {
+void VSARootChecker::checkEntry(const VSAUserIdentityRef& user, VSAContainerClass c, bool transient,
+                                const std::string& directory, const std::string& name) {
   std::string path = VSAPathJoin(directory, name);
   auto& fs = *context_->fileSystem;
   auto whitelist = context_->whitelist;
@@ -147,8 +146,11 @@ void VSARootChecker::checkEntry(const VSAUserIdentityRef& user, VSAContainerClas
     add("duplicate-identity", path,
         "a second container of " + metadata->identifier() + " (the other: " + at->second + ")",
         kAttention);
-  auto [uat, uinserted] = uuids_.emplace(uuid, path);
-  if (!uinserted) add("duplicate-uuid", path, "UUID " + uuid + " also at " + uat->second, kAttention);
+  // A wipe works on a transient copy with the live container's UUID; a crash
+  // can leave that copy until the next boot, so UUIDs are unique per tree.
+  auto [uat, uinserted] = uuids_.emplace((transient ? "transient|" : "live|") + uuid, path);
+  if (!uinserted)
+    add("duplicate-uuid", path, "UUID " + uuid + " also at " + uat->second, kAttention);
   if (c == 7 && !transient) appGroups_[metadata->identifier()].push_back(path);
   checkOwnership(path, user, c);
 }
@@ -208,8 +210,8 @@ void VSARootChecker::checkPendingUpdates() {
     VSAUserIdentityRef user = update->userIdentity
                                   ? update->userIdentity
                                   : context_->userIdentityCache->defaultUserIdentity();
-    std::string key = user->identifier() + "|" + std::to_string(update->containerClass) +
-                      "|live|" + update->identifier;
+    std::string key = user->identifier() + "|" + std::to_string(update->containerClass) + "|live|" +
+                      update->identifier;
     if (!identities_.count(key))
       add("pending-update-without-container", path,
           "names " + update->identifier + ", which has no live container", kAttention);
@@ -232,8 +234,7 @@ void VSARootChecker::checkDatabase() {
     unreadable_ = "cannot check the code-signing database: " + error->message();
     return;
   }
-  if (*integrity != "ok")
-    add("database", db->url(), "integrity check: " + *integrity, kAttention);
+  if (*integrity != "ok") add("database", db->url(), "integrity check: " + *integrity, kAttention);
   std::set<std::string> referenced;
   uint64_t identifiers = 0;
   VSAErrorRef walk = db->enumerateIdentifiersAndCodeSigningInfoUsingBlock(
@@ -252,8 +253,7 @@ void VSARootChecker::checkDatabase() {
   for (const auto& [group, paths] : appGroups_)
     if (!referenced.count(group))
       for (const auto& path : paths)
-        notes_.push_back({"unreferenced-group", path,
-                          "no identifier's entitlements name " + group,
+        notes_.push_back({"unreferenced-group", path, "no identifier's entitlements name " + group,
                           "removed when application groups are next reconciled", false});
 }
 
@@ -285,6 +285,7 @@ std::string VSARootChecker::json() const {
       item.set("path", f.path);
       item.set("detail", f.detail);
       item.set("repair", f.repair);
+      item.set("repairedAtStart", f.repairedAtStart);
       array.append(std::move(item));
     }
     return array;

@@ -12,7 +12,8 @@
 //     containers: their ACL); an entry without a metadata file, or with a
 //     name no container has, is an orphan the next boot's cleanup removes;
 //   - identities are unique: one container per (user, class, identifier,
-//     live or transient), and no UUID twice;
+//     live or transient), and no UUID twice among the live containers (nor
+//     among the transient ones: a wipe's transient copy shares its UUID);
 //   - nothing is left in staging or in the replace journals (each start
 //     finishes or undoes them), and no half-written state file;
 //   - every pending protection update reads back and names a live container;
@@ -37,10 +38,10 @@
 struct VSADaemonContext;
 
 struct VSARootFinding {
-  std::string kind;    // "orphan", "invalid-metadata", "duplicate-identity", ...
-  std::string path;    // what it is about
-  std::string detail;  // what is wrong
-  std::string repair;  // what brings it into order
+  std::string kind;              // "orphan", "invalid-metadata", "duplicate-identity", ...
+  std::string path;              // what it is about
+  std::string detail;            // what is wrong
+  std::string repair;            // what brings it into order
   bool repairedAtStart = false;  // the daemon's next start (not only a boot) repairs it
 };
 
@@ -77,7 +78,8 @@ class VSARootChecker {
   std::vector<VSARootFinding> notes_;
   std::map<std::string, uint64_t> counts_;
   std::string unreadable_;
-  // (user identifier, class, transient, identifier) -> path, and UUID -> path.
+  // (user identifier, class, transient, identifier) -> path, and
+  // (transient, UUID) -> path.
   std::map<std::string, std::string> identities_;
   std::map<std::string, std::string> uuids_;
   // Application-group containers seen: identifier -> paths.

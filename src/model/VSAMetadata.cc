@@ -110,8 +110,8 @@ bool VSAMetadata::writeMetadataToFileURL(const std::string& fileURL,
 }
 
 bool VSAMetadata::isTransientReadFailure(int rc) {
-  return rc == EIO || rc == ENOSPC || rc == ENOMEM || rc == EAGAIN || rc == EINTR ||
-         rc == EMFILE || rc == ENFILE;
+  return rc == EIO || rc == ENOSPC || rc == ENOMEM || rc == EAGAIN || rc == EINTR || rc == EMFILE ||
+         rc == ENFILE;
 }
 
 bool VSAMetadata::isTransientReadFailure(const VSAErrorRef& error) {
@@ -141,10 +141,9 @@ VSAMetadataRef VSAMetadata::readAndValidateMetadataAtFileUrl(
     // The system's own trouble, not the file's: the caller must not take
     // the container for a broken one.
     if (error && *error && isTransientReadFailure(rc))
-      *error = VSAError::make(VSAResult::kMetadataUnreadable,
-                              VSAError::posix(rc, "readFile", __LINE__),
-                              "readAndValidateMetadataAtFileUrl", __LINE__, "%@",
-                              (*error)->message());
+      *error =
+          VSAError::make(VSAResult::kMetadataUnreadable, VSAError::posix(rc, "readFile", __LINE__),
+                         "readAndValidateMetadataAtFileUrl", __LINE__, "%@", (*error)->message());
     return nullptr;
   }
   const VSAValue* identifier = dict->get(kIdentifierKey);

@@ -21,7 +21,8 @@
 class VSAFaultInjectingFileSystem : public VSAFileSystem {
  public:
   explicit VSAFaultInjectingFileSystem(std::shared_ptr<VSAFileSystem> inner);
-  static std::shared_ptr<VSAFaultInjectingFileSystem> readOnly(std::shared_ptr<VSAFileSystem> inner);
+  static std::shared_ptr<VSAFaultInjectingFileSystem> readOnly(
+      std::shared_ptr<VSAFileSystem> inner);
 
   void failNth(Op op, int n, int error);
   void failAll(Op op, int error);
@@ -94,7 +95,7 @@ class VSAFaultInjectingFileSystem : public VSAFileSystem {
   mutable std::mutex mutex_;
   std::array<int, static_cast<size_t>(Op::Count)> counts_{};
   std::vector<Rule> rules_;
-  int crashRemaining_ = -1;  // -1: no crash planned
+  int crashRemaining_ = -1;     // -1: no crash planned
   int failCallRemaining_ = -1;  // -1: no single failure planned
   int failCallError_ = 0;
 };

@@ -14,12 +14,12 @@
 //   VESSA_SWEEP=full build/tests/test_reliability --gtest_filter='CrashSweep.*'
 #include <gtest/gtest.h>
 
-#include <cstdio>
 #include <cerrno>
+#include <cstdio>
 #include <cstdlib>
-#include <set>
 #include <filesystem>
 #include <fstream>
+#include <set>
 
 #include "VSAContainerTestRoot.h"
 #include "base/VSAPlist.h"
@@ -46,8 +46,7 @@ class SweepTablePrinter : public ::testing::Environment {
  public:
   void TearDown() override {
     if (sweepTable().empty()) return;
-    std::printf("\n%-46s %12s %8s %8s  %s\n", "operation", "crash points", "run", "clean",
-                "codes");
+    std::printf("\n%-46s %12s %8s %8s  %s\n", "operation", "crash points", "run", "clean", "codes");
     for (const auto& r : sweepTable())
       std::printf("%-46s %12d %8d %8d  %s\n", r.operation.c_str(), r.points, r.run, r.clean,
                   r.codes.c_str());
@@ -85,7 +84,9 @@ class CrashSweep : public VSAContainerTestRoot {
     if (m) known_[id] = {c, m->uuid()};
     return m;
   }
-  static void drainBackground() { VSADeathRow::_sharedBackgroundQueue()->sync([] {}); }
+  static void drainBackground() {
+    VSADeathRow::_sharedBackgroundQueue()->sync([] {});
+  }
 
   // The first start after a device boot, on a new context.
   void restartAfterBoot() {
@@ -110,8 +111,7 @@ class CrashSweep : public VSAContainerTestRoot {
     VSARootChecker checker(root_);
     auto status = checker.check();
     if (startWillRepair && status == VSARootChecker::kFindings) {
-      for (const auto& f : checker.findings())
-        EXPECT_TRUE(f.repairedAtStart) << checker.text();
+      for (const auto& f : checker.findings()) EXPECT_TRUE(f.repairedAtStart) << checker.text();
     } else {
       EXPECT_EQ(status, VSARootChecker::kClean) << checker.text();
     }
@@ -209,8 +209,8 @@ class CrashSweep : public VSAContainerTestRoot {
     }
     for (VSAResultCode c : codes) row.codes += (row.codes.empty() ? "" : ",") + std::to_string(c);
     sweepTable().push_back(row);
-    std::printf("%s: %d calls, %d run, %d clean, codes %s\n", row.operation.c_str(), total,
-                row.run, row.clean, row.codes.c_str());
+    std::printf("%s: %d calls, %d run, %d clean, codes %s\n", row.operation.c_str(), total, row.run,
+                row.clean, row.codes.c_str());
   }
 
   static std::string at(const char* prefix, int n) { return prefix + std::to_string(n); }
@@ -329,8 +329,8 @@ TEST_F(CrashSweep, MaintenanceOperations) {
       [&](int n) {
         VSAResultCode code = VSAResult::kSuccess;
         VSAValue key("Flavour");
-        auto v = installer()->infoValueForKey(&key, identity(at("com.example.info.", n)), true,
-                                              &code);
+        auto v =
+            installer()->infoValueForKey(&key, identity(at("com.example.info.", n)), true, &code);
         if (v) {
           ASSERT_TRUE(v->stringValue());
           EXPECT_EQ(*v->stringValue(), "mint");

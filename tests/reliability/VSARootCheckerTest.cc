@@ -33,10 +33,9 @@ class RootChecker : public VSAContainerTestRoot {
     for (const auto& e : fs::recursive_directory_iterator(root_)) {
       struct stat st;
       if (::lstat(e.path().c_str(), &st) != 0) continue;
-      out[e.path().string()] = std::to_string(st.st_size) + "@" +
-                               std::to_string(st.st_mtim.tv_sec) + "." +
-                               std::to_string(st.st_mtim.tv_nsec) + " " +
-                               std::to_string(st.st_mode);
+      out[e.path().string()] =
+          std::to_string(st.st_size) + "@" + std::to_string(st.st_mtim.tv_sec) + "." +
+          std::to_string(st.st_mtim.tv_nsec) + " " + std::to_string(st.st_mode);
     }
     return out;
   }
@@ -126,7 +125,8 @@ TEST_F(RootChecker, ARootItCannotReadIsStatusTwo) {
   std::string library = context_->globalConfiguration->libraryDirectory();
   context_.reset();
   // A database that is not one.
-  for (const char* suffix : {"", "-wal", "-shm"}) fs::remove(library + "/containers.sqlite3" + suffix);
+  for (const char* suffix : {"", "-wal", "-shm"})
+    fs::remove(library + "/containers.sqlite3" + suffix);
   put(library + "/containers.sqlite3", std::string(8192, 'x'));
   VSARootChecker damaged(root_);
   EXPECT_EQ(damaged.check(), VSARootChecker::kUnreadable);
