@@ -3,6 +3,8 @@
 #   scripts/test.sh              the normal build
 #   scripts/test.sh address      an ASan+UBSan build in build-address/
 #   scripts/test.sh thread       a TSan build in build-thread/
+# The normal run first gives every fuzz target a few seconds (its own clang
+# build in build-fuzz/); VESSA_FUZZ_SMOKE=0 leaves that out.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 scripts/setup.sh
@@ -12,6 +14,9 @@ if [[ -n "$flavour" ]]; then
   scripts/build.sh -DVESSA_SANITIZE="$flavour"
 else
   scripts/build.sh
+fi
+if [[ -z "$flavour" && "${VESSA_FUZZ_SMOKE:-1}" != 0 ]]; then
+  (unset BUILD_DIR CC CXX && scripts/fuzz.sh --smoke 3)
 fi
 cd "${BUILD_DIR:-build}"
 ctest --output-on-failure --timeout 300 -j"$(nproc)"

@@ -7,6 +7,9 @@
 
 namespace {
 constexpr VSAResultCode kDeleteFailed = 28;
+// Tries to move one item into a fresh death-row directory that a concurrent
+// emptying may remove first.
+constexpr int kMoveAttempts = 5;
 
 bool isMissing(const VSAErrorRef& e) {
   return e && e->domain() == kVSAPOSIXErrorDomain && e->code() == ENOENT;
@@ -30,20 +33,25 @@ bool VSADeathRow::_moveItemAtURLToDeathRow(const std::string& url, bool isDir,
   const char* fn = "_moveItemAtURLToDeathRow";
   VSAFileManager& fm = configuration_->fileManager();
   std::string deathrow = configuration_->deathrowDirectory();
-  VSAErrorRef underlying;
-  auto unique = fm.createTemporaryDirectoryInDirectoryURL(deathrow, &underlying);
-  if (!unique) {
-    auto e = VSA_ERROR_UNDERLYING(VSAResult::kDeathRowMoveFailed, underlying,
-                                  "Failed to create unique directory at: %@", deathrow);
-    VSALog(kVSALogError, fn, "%@", e->message());
-    VSASetError(error, e);
-    return false;
-  }
-  std::string destination = VSAPathJoin(*unique, VSALastPathComponent(url));
   (void)isDir;  // a directory and a file move alike here
-  if (!fm.moveItemAtURL(url, destination, &underlying, durable)) {
+  std::string destination;
+  for (int attempt = 1;; ++attempt) {
+    VSAErrorRef underlying;
+    auto unique = fm.createTemporaryDirectoryInDirectoryURL(deathrow, &underlying);
+    if (!unique) {
+      auto e = VSA_ERROR_UNDERLYING(VSAResult::kDeathRowMoveFailed, underlying,
+                                    "Failed to create unique directory at: %@", deathrow);
+      VSALog(kVSALogError, fn, "%@", e->message());
+      VSASetError(error, e);
+      return false;
+    }
+    destination = VSAPathJoin(*unique, VSALastPathComponent(url));
+    if (fm.moveItemAtURL(url, destination, &underlying, durable)) break;
     fm.fileSystem().rmdir(*unique);
-    if (isMissing(underlying)) return true;
+    // ENOENT: the item is gone (nothing to do), or an emptying of death row
+    // took the fresh directory before the item reached it (take another).
+    if (isMissing(underlying) && fm.itemDoesNotExistAtURL(url)) return true;
+    if (isMissing(underlying) && attempt < kMoveAttempts) continue;
     auto e = VSA_ERROR_UNDERLYING(VSAResult::kDeathRowMoveFailed, underlying,
                                   "Failed to move item at: %@ to: %@", url, destination);
     VSALog(kVSALogError, fn, "%@", e->message());
@@ -52,8 +60,10 @@ bool VSADeathRow::_moveItemAtURLToDeathRow(const std::string& url, bool isDir,
   }
   // Its former owner must not race the removal: the item becomes root's
   // (the directory above it already is, with mode 0700).
+  // (An emptying of death row may already have removed it.)
   VSAErrorRef restrictError;
-  if (!fm.restrictItemToRootAtURL(destination, &restrictError))
+  if (!fm.restrictItemToRootAtURL(destination, &restrictError) &&
+      !fm.itemDoesNotExistAtURL(destination))
     VSALog(kVSALogError, fn, "%@", restrictError ? restrictError->message() : std::string());
   if (startDeletionThread) deleteContainersOnDeathRowWithCompletion(nullptr);
   return true;
@@ -75,14 +85,22 @@ bool VSADeathRow::_moveEntriesToDeathRowWithoutSync(const std::vector<std::strin
     std::string destination = VSAPathJoin(*unique, VSALastPathComponent(url));
     VSAErrorRef moveError;
     if (!fm.moveItemAtURL(url, destination, &moveError, false)) {
-      if (isMissing(moveError)) continue;
+      if (isMissing(moveError) && fm.itemDoesNotExistAtURL(url)) continue;
+      // The shared directory went with an emptying of death row: this item
+      // (and the ones after it) take fresh directories of their own.
+      if (isMissing(moveError)) {
+        VSAErrorRef single;
+        if (!_moveItemAtURLToDeathRow(url, true, false, &single, false)) all = false;
+        continue;
+      }
       VSALog(kVSALogError, fn, "Failed to move item at: %@ to: %@: %@", url, destination,
              moveError);
       all = false;
       continue;
     }
     VSAErrorRef restrictError;
-    if (!fm.restrictItemToRootAtURL(destination, &restrictError))
+    if (!fm.restrictItemToRootAtURL(destination, &restrictError) &&
+        !fm.itemDoesNotExistAtURL(destination))
       VSALog(kVSALogError, fn, "%@", restrictError);
   }
   return all;

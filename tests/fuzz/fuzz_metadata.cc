@@ -3,54 +3,19 @@
 // The bounded read and the binary-only decoder take it, then every
 // validation step; whatever validates must write back and read again to the
 // same identity.
-#include <unistd.h>
-
-#include <cstdlib>
-#include <filesystem>
-#include <fstream>
-#include <string>
-
-#include "base/VSALog.h"
+#include "VSAFuzzDevice.h"
 #include "base/VSAPlist.h"
-#include "model/FakePersonaService.h"
-#include "model/VSAGlobalConfiguration.h"
 #include "model/VSAMetadata.h"
-#include "model/VSAUserIdentityCache.h"
-#include "platform/VSALinuxFileSystem.h"
 
 namespace {
-struct Device {
-  std::string root, container, file;
-  std::shared_ptr<VSAGlobalConfiguration> config;
-  std::shared_ptr<VSAUserIdentityCache> identities;
-  VSAUserIdentityRef personal;
-
-  Device() {
-    VSALogger::shared().setLevel(0);  // every refusal is logged; that only slows the run
-    char tmpl[] = "/tmp/vessa-fuzz-metadata-XXXXXX";
-    root = mkdtemp(tmpl);
-    std::filesystem::create_directories(root + "/etc");
-    std::filesystem::create_directories(root + "/private/var/mobile");
-    std::ofstream(root + "/etc/passwd") << "mobile:x:501:501::/private/var/mobile:/bin/sh\n";
-    VSASystemRoot systemRoot(root);
-    auto users = std::make_shared<VSAUserDatabase>(systemRoot);
-    config = std::make_shared<VSAGlobalConfiguration>(
-        systemRoot, std::make_shared<VSADeviceProperties>(systemRoot), users,
-        std::make_shared<VSAFileManager>(std::make_shared<VSALinuxFileSystem>(), users));
-    auto personas = std::make_shared<FakePersonaService>();
-    personas->personas = std::vector<VSAPersonaAttributes>{
-        FakePersonaService::persona(VSAPersonaAttributes::Kind::Personal, 1000, "P", {})};
-    identities = VSAUserIdentityCache::create({personas, users, 501, 501, true, nullptr});
-    personal = identities->userIdentityForPersonalPersona();
-    // A data container of the personal user, named by a UUID as on a device.
+// A data container of the personal user, named by a UUID as on a device.
+struct Device : VSAFuzzDevice {
+  std::string container, file;
+  Device() : VSAFuzzDevice("metadata") {
     container = *config->containerDirectoryURLForUserIdentity(personal, 2, false) +
                 "/0A1B2C3D-0000-4000-8000-00000000F00D";
     std::filesystem::create_directories(container);
     file = container + "/" + kVSAMetadataFileName;
-  }
-  ~Device() {
-    std::error_code ec;
-    std::filesystem::remove_all(root, ec);
   }
 };
 }  // namespace

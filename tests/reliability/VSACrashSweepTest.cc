@@ -491,3 +491,29 @@ TEST_F(CrashSweep, FullDiskAndIOErrorsAtEachStepLeaveTheRootInOrder) {
 }
 
 }  // namespace
+
+namespace {
+
+// Death row is emptied while other work moves items onto it: an emptying
+// can remove the fresh directory an item is about to be moved into. The item
+// must then still reach death row (a deletion told "done" must be done),
+// not stay where it was.
+TEST_F(CrashSweep, AnItemStillReachesDeathRowWhenAnEmptyingTookItsDirectoryFirst) {
+  auto m = made("com.example.doomed");
+  known_.clear();
+  faults_->reset();
+  faults_->failNth(VSAFileSystem::Op::Rename, 1, ENOENT);  // the directory vanished
+  VSAErrorRef error;
+  ASSERT_TRUE(context_->deathRow->_moveItemAtURLToDeathRow(m->url(), true, false, &error)) << error;
+  EXPECT_FALSE(fs::exists(m->url()));
+  EXPECT_EQ(entries(context_->globalConfiguration->deathrowDirectory()), 1u);
+  // The batch move of the boot's orphans does the same.
+  std::string orphan = classDirectory() + "/" + VSAUUID::random().string();
+  fs::create_directories(orphan);
+  faults_->reset();
+  faults_->failNth(VSAFileSystem::Op::Rename, 1, ENOENT);
+  EXPECT_TRUE(context_->deathRow->_moveEntriesToDeathRowWithoutSync({orphan}));
+  EXPECT_FALSE(fs::exists(orphan));
+}
+
+}  // namespace
