@@ -24,14 +24,16 @@ export BUILD_DIR=build-fuzz CC=clang-14 CXX=clang++-14
 cmake -S . -B "$BUILD_DIR" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo -DVESSA_FUZZ=ON >/dev/null
 cmake --build "$BUILD_DIR" --parallel "$(nproc)" --target "${targets[@]/#/fuzz_}"
 
-# run TARGET ARGS...: the target over a scratch copy of its seeds.
+# run TARGET ARGS...: the target over a scratch copy of its seeds; an input
+# that finds a fault is kept in build-fuzz/fuzz-findings/.
 run() {
   local target=$1
   shift
   local corpus
   corpus=$(mktemp -d)
   cp tests/fuzz/corpus/"$target"/* "$corpus"/ 2>/dev/null || true
-  "$BUILD_DIR"/tests/fuzz/fuzz_"$target" -max_len=65536 "$@" "$corpus"
+  mkdir -p "$BUILD_DIR/fuzz-findings"
+  "$BUILD_DIR"/tests/fuzz/fuzz_"$target" -max_len=65536 -artifact_prefix="$BUILD_DIR/fuzz-findings/$target-" "$@" "$corpus"
   rm -rf "$corpus"
 }
 

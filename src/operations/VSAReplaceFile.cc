@@ -60,7 +60,10 @@ std::optional<VSAReplaceFileInfo> VSAReplaceFile::_readAndValidateReplaceFileAtU
   VSAErrorRef underlying;
   int rc = fm.fileSystem().readFile(url, &bytes, kVSAReplaceFileMaxSize);
   std::optional<VSAValue> value;
-  if (rc == 0) value = VSAPlist::parse(bytes, &underlying);
+  // Only the daemon writes replace files, always as binary lists; the binary
+  // decoder also guarantees UTF-8 strings, which a journal must be able to
+  // hold again.
+  if (rc == 0) value = VSAPlist::parse(bytes, &underlying, VSAPlist::Accept::BinaryOnly);
   if (!value) {
     if (rc != 0) underlying = VSAError::posix(rc, fn, __LINE__, url);
     VSASetError(error, fail(VSAResult::kInvalidReplaceFile, fn, __LINE__,

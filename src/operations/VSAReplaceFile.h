@@ -6,7 +6,7 @@
 // the first rename and moved to death row when the operation ends.
 //
 // Reading validates everything (code 35 for any bad form): a file that
-// cannot be read or parsed, one that is not a dictionary, a value that is
+// cannot be read or parsed as a binary list, one that is not a dictionary, a value that is
 // missing or not a string, and a path that is not absolute, is empty, holds
 // a NUL or a ".." component. Reads at most kVSAReplaceFileMaxSize bytes.
 // Stateless; thread-safe.
