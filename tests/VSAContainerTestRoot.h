@@ -75,6 +75,17 @@ class VSAContainerTestRoot : public ::testing::Test {
     return c.createOrLookupContainerWithContainerIdentity(identity(id, cls), true, transient, true,
                                                           code);
   }
+  static void put(const std::string& path, const std::string& text) { std::ofstream(path) << text; }
+  static std::string read(const std::string& path) {
+    std::ifstream in(path);
+    return std::string(std::istreambuf_iterator<char>(in), {});
+  }
+  // The live container of `id`, never created.
+  VSAMetadataRef lookup(const std::string& id, VSAContainerClass c = 2) {
+    VSAResultCode code = VSAResult::kSuccess;
+    return installer()->createOrLookupContainerWithContainerIdentity(identity(id, c), false, false,
+                                                                     true, &code);
+  }
   static size_t entries(const std::string& dir) {
     if (!std::filesystem::exists(dir)) return 0;
     return static_cast<size_t>(std::distance(std::filesystem::directory_iterator(dir), {}));

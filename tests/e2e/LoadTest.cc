@@ -138,13 +138,18 @@ bool startAndSettle(VSATestDaemon& d) {
   return cleanups(d) > before;
 }
 
-TEST(DaemonCrash, KilledAtRandomUnderSixteenClientsLosesNothing) {
-  VSATestDaemon d;
+// This process as an installer that may wipe; the daemon started and settled.
+bool startAsInstaller(VSATestDaemon& d) {
   d.registerSelf(
       "com.example.installer",
       VSAValue::Dictionary{{"com.tamsk.private.Vessa.allowed", VSAValue(true)},
                            {"com.tamsk.private.Vessa.deleteContainerContent", VSAValue(true)}});
-  ASSERT_TRUE(startAndSettle(d));
+  return startAndSettle(d);
+}
+
+TEST(DaemonCrash, KilledAtRandomUnderSixteenClientsLosesNothing) {
+  VSATestDaemon d;
+  ASSERT_TRUE(startAsInstaller(d));
   Promises promises;
   std::mt19937 random(7);
   int answered = 0, clean = 0, leftForTheStart = 0;
@@ -249,11 +254,7 @@ TEST(DaemonSoak, MixedRequestsWhileTheDeviceLocksAndUnlocksAreAllAnswered) {
   const char* configured = std::getenv("VESSA_SOAK_REQUESTS");
   const int requests = configured ? std::atoi(configured) : 200;
   VSATestDaemon d;
-  d.registerSelf(
-      "com.example.installer",
-      VSAValue::Dictionary{{"com.tamsk.private.Vessa.allowed", VSAValue(true)},
-                           {"com.tamsk.private.Vessa.deleteContainerContent", VSAValue(true)}});
-  ASSERT_TRUE(startAndSettle(d));
+  ASSERT_TRUE(startAsInstaller(d));
   std::atomic<bool> done{false};
   int toggles = 0;
   std::thread locker([&] {

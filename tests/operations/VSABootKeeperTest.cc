@@ -33,11 +33,6 @@ class Boot : public VSAContainerTestRoot {
     return std::string(std::istreambuf_iterator<char>(in), {});
   }
   bool logged(const std::string& text) { return logText().find(text) != std::string::npos; }
-  static void put(const std::string& path, const std::string& text) { std::ofstream(path) << text; }
-  static std::string read(const std::string& path) {
-    std::ifstream in(path);
-    return std::string(std::istreambuf_iterator<char>(in), {});
-  }
   VSABootKeeper keeper() { return VSABootKeeper(*context_->operationServices); }
   void rebootSetup() { keeper().rebootKeeperSetup(installer()->grants()); }
   void rebootCleanup() {

@@ -19,11 +19,6 @@ namespace {
 
 class ContainerContent : public VSAContainerTestRoot {
  protected:
-  static void put(const std::string& path, const std::string& text) { std::ofstream(path) << text; }
-  static std::string read(const std::string& path) {
-    std::ifstream in(path);
-    return std::string(std::istreambuf_iterator<char>(in), {});
-  }
   struct Assets {
     std::optional<std::string> path;
     bool existed = false;

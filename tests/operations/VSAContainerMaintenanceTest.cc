@@ -14,11 +14,6 @@ namespace {
 
 class Maintenance : public VSAContainerTestRoot {
  protected:
-  VSAMetadataRef lookup(const std::string& id, VSAContainerClass c = 2) {
-    VSAResultCode code = VSAResult::kSuccess;
-    return installer()->createOrLookupContainerWithContainerIdentity(identity(id, c), false, false,
-                                                                     true, &code);
-  }
   VSAResultCode regenerate(const VSAContainerIdentityRef& identity) {
     VSAResultCode code = VSAResult::kSuccess;
     installer()->regenerateDirectoryUUIDWithContainerIdentity(identity, &code);

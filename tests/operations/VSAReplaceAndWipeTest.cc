@@ -18,16 +18,6 @@ namespace {
 class ReplaceAndWipe : public VSAContainerTestRoot {
  protected:
   std::string replaceDirectory() { return context_->globalConfiguration->replaceDirectory(); }
-  static void put(const std::string& path, const std::string& text) { std::ofstream(path) << text; }
-  static std::string read(const std::string& path) {
-    std::ifstream in(path);
-    return std::string(std::istreambuf_iterator<char>(in), {});
-  }
-  VSAMetadataRef lookup(const std::string& id, VSAContainerClass c = 2) {
-    VSAResultCode code = VSAResult::kSuccess;
-    return installer()->createOrLookupContainerWithContainerIdentity(identity(id, c), false, false,
-                                                                     true, &code);
-  }
   // The UUID recorded in a container's metadata file.
   std::string uuidOnDisk(const std::string& url) {
     VSAErrorRef error;

@@ -66,16 +66,6 @@ class CrashSweep : public VSAContainerTestRoot {
     std::optional<VSAUUID> uuid;  // none: it must exist, whatever its UUID
   };
 
-  static void put(const std::string& path, const std::string& text) { std::ofstream(path) << text; }
-  static std::string read(const std::string& path) {
-    std::ifstream in(path);
-    return std::string(std::istreambuf_iterator<char>(in), {});
-  }
-  VSAMetadataRef lookup(const std::string& id, VSAContainerClass c = 2) {
-    VSAResultCode code = VSAResult::kSuccess;
-    return installer()->createOrLookupContainerWithContainerIdentity(identity(id, c), false, false,
-                                                                     true, &code);
-  }
   // A container the sweep must never lose.
   VSAMetadataRef made(const std::string& id, VSAContainerClass c = 2) {
     VSAResultCode code;
@@ -213,6 +203,20 @@ class CrashSweep : public VSAContainerTestRoot {
                 row.clean, row.codes.c_str());
   }
 
+  // Protection class 3 for `m`'s container, through the manager; its code.
+  VSAResultCode protect(const VSAMetadataRef& m) {
+    auto done = std::make_shared<std::promise<VSAResultCode>>();
+    context_->dataProtectionManager->setDataProtectionOnDataContainerForContainerIdentity(
+        *m->containerIdentity(), 3, false, true,
+        [done](VSAResultCode code) { done->set_value(code); });
+    auto reply = done->get_future();
+    if (reply.wait_for(std::chrono::seconds(20)) != std::future_status::ready) {
+      ADD_FAILURE() << "no reply";
+      return VSAResult::kInvalidArgument;
+    }
+    return reply.get();
+  }
+
   static std::string at(const char* prefix, int n) { return prefix + std::to_string(n); }
   std::map<std::string, Known> known_;
 };
@@ -346,18 +350,7 @@ TEST_F(CrashSweep, ProtectionChangeWhileUnlocked) {
         target = made(at("com.example.protected.", n));
         put(target->url() + "/Library/file", "data");
       },
-      [&](int) {
-        auto done = std::make_shared<std::promise<VSAResultCode>>();
-        context_->dataProtectionManager->setDataProtectionOnDataContainerForContainerIdentity(
-            *target->containerIdentity(), 3, false, true,
-            [done](VSAResultCode code) { done->set_value(code); });
-        auto reply = done->get_future();
-        if (reply.wait_for(std::chrono::seconds(20)) != std::future_status::ready) {
-          ADD_FAILURE() << "no reply";
-          return VSAResult::kInvalidArgument;
-        }
-        return reply.get();
-      },
+      [&](int) { return protect(target); },
       [&](int) {
         // A change that was written down is finished by the start.
         EXPECT_EQ(entries(context_->globalConfiguration->pendingUpdatesDirectory()), 0u);
@@ -475,18 +468,7 @@ TEST_F(CrashSweep, FullDiskAndIOErrorsAtEachStepLeaveTheRootInOrder) {
           target = made(at(error == EIO ? "com.example.eio.p." : "com.example.full.p.", n));
           put(target->url() + "/Library/file", "data");
         },
-        [&](int) {
-          auto done = std::make_shared<std::promise<VSAResultCode>>();
-          context_->dataProtectionManager->setDataProtectionOnDataContainerForContainerIdentity(
-              *target->containerIdentity(), 3, false, true,
-              [done](VSAResultCode code) { done->set_value(code); });
-          auto reply = done->get_future();
-          if (reply.wait_for(std::chrono::seconds(20)) != std::future_status::ready) {
-            ADD_FAILURE() << "no reply";
-            return VSAResult::kInvalidArgument;
-          }
-          return reply.get();
-        });
+        [&](int) { return protect(target); });
   }
 }
 

@@ -20,7 +20,6 @@ namespace {
 
 class RootChecker : public VSAContainerTestRoot {
  protected:
-  static void put(const std::string& path, const std::string& text) { std::ofstream(path) << text; }
   VSAMetadataRef made(const std::string& id, VSAContainerClass c = 2) {
     VSAResultCode code;
     auto m = create(*installer(), id, &code, false, c);
