@@ -172,6 +172,19 @@ step "Notifications posted by the daemon"
 step "Stopping vessad (SIGTERM)"
 device_stop_daemon && echo "vessad exited with status 0"
 
+step "Checking the stopped device's root (vessad --verify: exit 0 clean, 1 findings, 2 unreadable)"
+verify() {
+  echo "\$ vessad --verify --root \$ROOT $*"
+  local status=0
+  "$build/vessad" --verify --root "$root" "$@" | sed "s|$root|\$ROOT|g" || status=$?
+  echo "exit status $status"
+}
+verify
+step "A stray directory in the data class directory: an orphan the next boot removes (exit 1)"
+mkdir -p "$root/private/var/mobile/Containers/Data/Application/not-a-container"
+verify --json
+rmdir "$root/private/var/mobile/Containers/Data/Application/not-a-container"
+
 step "The daemon's rotating log: $root/private/var/root/Library/Logs/Vessa/vessad.log"
 grep -v '<Debug>' "$root/private/var/root/Library/Logs/Vessa/vessad.log" | tail -n 12
 echo "(debug lines, signposts included, are in the same file on this internal build)"
