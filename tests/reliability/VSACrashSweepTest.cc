@@ -78,9 +78,17 @@ class CrashSweep : public VSAContainerTestRoot {
     VSADeathRow::_sharedBackgroundQueue()->sync([] {});
   }
 
-  // The first start after a device boot, on a new context.
+  // The first start after a device boot, on a new context (unlocked).
   void restartAfterBoot() {
     drainBackground();
+    // A change still waiting for the unlock dies with the process: it runs
+    // against a file system that changes nothing any more.
+    if (context_->lockStateQueue->suspendCount() > 0) {
+      faults_->crashAfter(0);
+      context_->lockStateQueue->resume();
+      context_->lockStateQueue->sync([] {});
+    }
+    context_->lockState->setLockState(0);
     context_.reset();
     startContext();
     auto c = installer();
@@ -353,6 +361,38 @@ TEST_F(CrashSweep, ProtectionChangeWhileUnlocked) {
       [&](int) { return protect(target); },
       [&](int) {
         // A change that was written down is finished by the start.
+        EXPECT_EQ(entries(context_->globalConfiguration->pendingUpdatesDirectory()), 0u);
+      });
+}
+
+// While the device is locked a change is written down and waits for the
+// unlock; the device reboots instead (the crash), and the first start after
+// it, unlocked, finishes what was written down.
+TEST_F(CrashSweep, ProtectionChangeWhileLocked) {
+  VSAMetadataRef target;
+  sweep(
+      "protection change (locked, then reboot)",
+      [&](int n) {
+        context_->lockState->setLockState(0);
+        target = made(at("com.example.locked.", n));
+        put(target->url() + "/Library/file", "data");
+        context_->lockState->setLockState(1);
+        context_->lockStateQueue->suspend();  // as the daemon does while locked
+      },
+      [&](int) {
+        auto done = std::make_shared<std::promise<VSAResultCode>>();
+        context_->dataProtectionManager->setDataProtectionOnDataContainerForContainerIdentity(
+            *target->containerIdentity(), 1, false, true,
+            [done](VSAResultCode code) { done->set_value(code); });
+        // Written down and waiting (success), or refused at once.
+        auto reply = done->get_future();
+        if (reply.wait_for(std::chrono::milliseconds(200)) == std::future_status::ready)
+          return reply.get();
+        return entries(context_->globalConfiguration->pendingUpdatesDirectory()) == 1
+                   ? VSAResult::kSuccess
+                   : VSAResult::kInvalidArgument;
+      },
+      [&](int) {
         EXPECT_EQ(entries(context_->globalConfiguration->pendingUpdatesDirectory()), 0u);
       });
 }
