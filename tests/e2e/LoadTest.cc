@@ -30,7 +30,19 @@ using namespace std::chrono_literals;
 namespace {
 
 constexpr int kClients = 16;
+#if defined(__has_feature)
+#if __has_feature(thread_sanitizer) || __has_feature(address_sanitizer)
+#define VESSA_SANITIZED 1
+#endif
+#endif
+#if defined(__SANITIZE_THREAD__) || defined(__SANITIZE_ADDRESS__)
+#define VESSA_SANITIZED 1
+#endif
+#ifdef VESSA_SANITIZED
+constexpr int kKills = 12;  // a sanitizer build starts the daemon several times slower
+#else
 constexpr int kKills = 50;
+#endif
 constexpr int kIdsPerClient = 6;
 
 VSAValue request(uint64_t command, const std::string& id) {
