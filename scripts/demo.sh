@@ -41,17 +41,17 @@ JSON
 ctl "$installer" --root "$root" --file "$root/tmp/csinfo.json"
 ctl "$installer" --root "$root" --json Command=19 Identifier=com.example.demo
 
-step "Creating the app's data container (command 0, class 2)"
-ctl "$installer" --root "$root" --json Command=0 Identifier=com.example.demo ContainerClass=2 \
-  CreateIfNecessary=true
+step "Creating the app's data container (verb create = command 0, class data = 2)"
+ctl "$installer" --root "$root" create com.example.demo --class data
 path=$("$installer" --root "$root" --json Command=0 Identifier=com.example.demo ContainerClass=2 |
   sed -n 's/.*"ReplyPath": *"\([^"]*\)".*/\1/p')
 echo "(asked again, the same container answers with ReplyExisted true)"
+step "A container that does not exist: lookup never creates; the code is named (exit 1)"
+ctl "$installer" --root "$root" lookup com.example.missing
 step "Its directory tree (mode, owner, path)"
 find "$path" -printf '%M %u %p\n' | sed -e "s|$root|\$ROOT|g" | sort -k3
-step "Its metadata (command 7)"
-ctl "$installer" --root "$root" --json Command=7 Identifier=com.example.demo ContainerClass=2 \
-  InfoDictRequested=true
+step "Its metadata (verb show = command 7; the same request as raw keys: Command=7 ...)"
+ctl "$installer" --root "$root" show com.example.demo
 
 step "An info value in its metadata (commands 5 and 6); an unset key answers 24"
 ctl "$installer" --root "$root" Command=5 Identifier=com.example.demo ContainerClass=2 \

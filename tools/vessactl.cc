@@ -1,8 +1,10 @@
 // vessactl: the command-line client of vessad.
 //
-// Sends one request to the daemon of a system root and prints the reply.
-// Exit status: 0 when "ReplyError" is 1, 1 when it is another code, 2 for
-// usage, file or connection errors.
+// Sends one request to the daemon of a system root and prints the reply:
+// either a verb people type ("vessactl create com.example.app --class data")
+// or the raw keys scripts use ("Command=0 Identifier=..."). Exit status: 0
+// when "ReplyError" is 1, 1 when it is another code (named with its meaning
+// on stderr), 2 for usage, file or connection errors.
 #include <unistd.h>
 
 #include <chrono>
@@ -11,6 +13,7 @@
 #include <cstring>
 #include <string>
 
+#include "VSACtlVerbs.h"
 #include "base/VSAJSON.h"
 #include "base/VSAPlist.h"
 #include "daemon/VSACommandTable.h"
@@ -58,10 +61,18 @@ const char* kCommandNames[kVSACommandCount] = {
 
 void usage(FILE* out) {
   std::fprintf(out,
-               "usage: vessactl [options] KEY[:TYPE]=VALUE ...\n"
+               "usage: vessactl [options] VERB ARGUMENTS...\n"
+               "       vessactl [options] KEY[:TYPE]=VALUE ...\n"
                "       vessactl [--root DIR] notifications\n"
                "\n"
                "Sends one request to vessad and prints the reply.\n"
+               "\n"
+               "verbs (vessactl VERB --help for one):\n");
+  for (const auto& verb : VSACtlVerbs::all())
+    std::fprintf(out, "  %-12s %-42s %s\n", verb.name, verb.arguments, verb.summary);
+  std::fprintf(out,
+               "  container classes by name: data, bundle, plugin, plugin-data, group, system,\n"
+               "  system-group, ... or by number (1-13); data when not given\n"
                "\n"
                "options:\n"
                "  --root DIR       system root of the daemon (default /); the socket is\n"
@@ -77,8 +88,8 @@ void usage(FILE* out) {
                "-> uuid, anything else -> str) or given as KEY:TYPE=VALUE with TYPE one of\n"
                "u64 i64 bool str uuid real json (a JSON value, for arrays and dictionaries).\n"
                "\n"
-               "Exit status: 0 when ReplyError is 1, 1 for any other result code,\n"
-               "2 for usage, file or connection errors.\n"
+               "Exit status: 0 when ReplyError is 1, 1 for any other result code (printed\n"
+               "on stderr as CODE: MEANING), 2 for usage, file or connection errors.\n"
                "\n"
                "Commands (key Command):\n");
   for (size_t i = 0; i < kVSACommandCount; ++i)
@@ -88,7 +99,8 @@ void usage(FILE* out) {
                "\nnotifications    print the notifications the daemon posted, oldest first\n"
                "\nA container is named by Identifier, ContainerClass and, optionally,\n"
                "PersonaUniqueString and UUID (that very container; without it the live one).\n"
-               "\nexamples: vessactl --root /tmp/demo Command=0 Identifier=com.example.app "
+               "\nexamples: vessactl --root /tmp/demo create com.example.app --class data\n"
+               "          vessactl --root /tmp/demo Command=0 Identifier=com.example.app "
                "ContainerClass=2\n"
                "          vessactl --root /tmp/demo Command=12 Identifier=com.example.app "
                "ContainerClass=2\n");
@@ -174,6 +186,22 @@ std::optional<VSAValue> readRequestFile(const std::string& path) {
   return value;
 }
 
+// A reply for people: one "key: value" line per reply key, the UUID as text.
+void printForPeople(const VSAValue& reply) {
+  for (const auto& [key, value] : *reply.dictionaryValue()) {
+    if (key == "ReplyError") continue;
+    std::string name = key.rfind("Reply", 0) == 0 ? key.substr(5) : key;
+    std::string text;
+    if (key == "ReplyUUID" && value.uuidValue())
+      text = value.uuidValue()->string();
+    else if (value.isString())
+      text = *value.stringValue();
+    else
+      text = VSAJSON::print(value, false);
+    std::printf("%-22s %s\n", (name + ":").c_str(), text.c_str());
+  }
+}
+
 int printNotifications(const std::string& root) {
   VSANotificationCenter center{VSASystemRoot(root)};
   for (const std::string& name : center.postedNames()) std::printf("%s\n", name.c_str());
@@ -184,7 +212,7 @@ int printNotifications(const std::string& root) {
 
 int main(int argc, char** argv) {
   std::string root = "/", socketPath, file;
-  bool json = false;
+  bool json = false, people = false;
   int timeout = 30;
   VSAValue request = VSAValue::dictionary();
   std::vector<std::string> pairs;
@@ -211,7 +239,22 @@ int main(int argc, char** argv) {
       return usage(stdout), 0;
     else if (a == "notifications")
       return printNotifications(root);
-    else if (a.find('=') != std::string::npos)
+    else if (const VSACtlVerb* verb = VSACtlVerbs::find(a)) {
+      std::vector<std::string> rest(argv + i + 1, argv + argc);
+      for (const auto& r : rest)
+        if (r == "--help" || r == "-h")
+          return std::printf("%s", VSACtlVerbs::help(*verb).c_str()), 0;
+      std::string why;
+      auto built = VSACtlVerbs::request(a, rest, &why);
+      if (!built) {
+        std::fprintf(stderr, "vessactl %s: %s\n%s", a.c_str(), why.c_str(),
+                     VSACtlVerbs::help(*verb).c_str());
+        return 2;
+      }
+      request = *built;
+      people = !json;
+      break;
+    } else if (a.find('=') != std::string::npos)
       pairs.push_back(a);
     else
       return usage(stderr), 2;
@@ -253,8 +296,16 @@ int main(int argc, char** argv) {
     return 2;
   }
   reply->remove(kVSAMessageIDKey);
-  std::string text = json ? VSAJSON::print(*reply) : reply->description();
-  std::printf("%s\n", text.c_str());
-  const VSAValue* code = reply->get("ReplyError");
-  return code && code->uint64Value() == 1u ? 0 : 1;
+  const VSAValue* codeValue = reply->get("ReplyError");
+  uint64_t code = codeValue ? codeValue->uint64Value().value_or(0) : 0;
+  if (people) {
+    printForPeople(*reply);
+  } else {
+    std::string text = json ? VSAJSON::print(*reply) : reply->description();
+    std::printf("%s\n", text.c_str());
+  }
+  if (code == 1) return 0;
+  std::fprintf(stderr, "vessactl: %llu: %s\n", static_cast<unsigned long long>(code),
+               VSACtlVerbs::meaningOfCode(code));
+  return 1;
 }

@@ -11,6 +11,7 @@
 #include "base/VSATestLocks.h"
 #include "daemon/VSACommandTable.h"
 #include "platform/VSANamedSemaphore.h"
+#include "platform/VSAServiceManager.h"
 
 #ifndef VESSA_BUILD_DATE
 #define VESSA_BUILD_DATE __DATE__
@@ -37,6 +38,7 @@ int VSADaemon::run() {
   testLockQueue_->suspend();
   context_->listenerQueue->async([this, initTransaction = std::move(initTransaction)]() mutable {
     initialize();
+    VSAServiceManager::notifyReady(cleanupsDone_ ? "Serving" : "Serving; boot cleanup running");
     testLockQueue_->resume();
     initTransaction.reset();  // step 15: start-up is over
   });
@@ -76,6 +78,7 @@ int VSADaemon::run() {
 
 void VSADaemon::requestStop() {
   if (stopping_.exchange(true)) return;
+  VSAServiceManager::notifyStopping();
   // Drained on the caller's thread: the main loop must keep running
   // meanwhile, because start-up (which may still be under way) calls into it.
   drainForShutdown();
@@ -148,10 +151,12 @@ void VSADaemon::initialize() {
 
   bool firstBoot = isFirstBoot();
   if (firstBoot) {
+    VSAServiceManager::notifyStatus("First start after boot: upgrade migration, restores");
     VSASignpostInterval interval(VSALogCategory::Startup, "FirstBootSetup");
     sharedConnection_->rebootKeeperSetup();
   }
   {
+    VSAServiceManager::notifyStatus("Boot setup: replace recovery, pending protection changes");
     VSASignpostInterval interval(VSALogCategory::Startup, "BootSetup");
     sharedConnection_->keeperSetup();
   }
@@ -191,7 +196,9 @@ void VSADaemon::startCleanups(bool firstBoot) {
     });
   }
   uint64_t signpost = VSASignpostBegin(VSALogCategory::Startup, "BootCleanup");
-  sharedConnection_->keeperCleanupWithCompletion([notifications, signpost] {
+  sharedConnection_->keeperCleanupWithCompletion([this, notifications, signpost] {
+    cleanupsDone_ = true;
+    VSAServiceManager::notifyStatus("Serving; boot cleanup complete");
     if (uint32_t s = notifications->post(CONTAINER_NOTIFY_CLEANUP_COMPLETE))
       VSALogIn(VSALogCategory::Startup, kVSALogError, "vessad_init",
                "Failed to post cleanup-complete: %u", s);

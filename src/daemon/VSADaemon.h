@@ -61,6 +61,7 @@ class VSADaemon {
   std::unique_ptr<VSAKernelUpcall> upcall_;
   std::string firstBootSemaphore_;
   std::atomic<bool> stopping_{false};
+  std::atomic<bool> cleanupsDone_{false};  // the every-start cleanup has finished
   // Guards listener_: a signal may ask for a stop while run() sets it up.
   std::mutex listenerMutex_;
 };
