@@ -1,14 +1,19 @@
-// The daemon under a service manager that waits for readiness: READY=1 comes
-// only once initialisation has finished, STATUS lines tell the boot work,
-// and STOPPING=1 comes when SIGTERM begins the stop.
+// The daemon under a service manager: READY=1 comes only once
+// initialisation has finished, STATUS lines tell the boot work, STOPPING=1
+// comes when SIGTERM begins the stop; a socket the manager holds is taken
+// over (socket activation); the unit files pass systemd's own check.
 #include <gtest/gtest.h>
 #include <sys/socket.h>
 #include <sys/un.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <chrono>
 #include <cstdlib>
+#include <filesystem>
+#include <fstream>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "e2e/VSATestDaemon.h"
@@ -76,6 +81,57 @@ TEST(DaemonServiceManager, ReadyOnlyAfterInitialisationThenStatusAndStopping) {
     if (manager.messages()[i].find("READY=1") != std::string::npos) ready = i + 1;
   }
   EXPECT_LT(setup, ready);
+}
+
+bool haveTool(const char* path) { return ::access(path, X_OK) == 0; }
+
+TEST(DaemonServiceManager, ASocketTheManagerHoldsIsTakenOver) {
+  if (!haveTool("/usr/bin/systemd-socket-activate")) GTEST_SKIP() << "no systemd-socket-activate";
+  VSATestDaemon d;
+  d.registerSelf("com.example.installer",
+                 VSAValue::Dictionary{{"com.tamsk.private.Vessa.allowed", VSAValue(true)}});
+  std::filesystem::create_directories(d.root() + "/run/vessad");
+  pid_t pid = ::fork();
+  if (pid == 0) {
+    // The manager binds the socket and starts vessad at the first connection.
+    ::execl("/usr/bin/systemd-socket-activate", "systemd-socket-activate", "-l",
+            d.socketPath().c_str(), VESSAD_PATH, "--root", d.root().c_str(), nullptr);
+    ::_exit(127);
+  }
+  for (int i = 0; i < 200 && !std::filesystem::exists(d.socketPath()); ++i)
+    std::this_thread::sleep_for(20ms);
+  auto reply = d.request(VSAValue::Dictionary{{"Command", VSAValue(0u)},
+                                              {"Identifier", VSAValue("com.example.app")},
+                                              {"ContainerClass", VSAValue(2u)},
+                                              {"CreateIfNecessary", VSAValue(true)}});
+  EXPECT_EQ(VSAReplyError(reply), 1u);
+  ::kill(pid, SIGTERM);
+  int status = 0;
+  ::waitpid(pid, &status, 0);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+}
+
+TEST(DaemonServiceManager, TheUnitFilesPassSystemdsCheck) {
+  if (!haveTool("/usr/bin/systemd-analyze")) GTEST_SKIP() << "no systemd-analyze";
+  VSATestDaemon d;  // only for a scratch directory
+  std::string dir = d.root() + "/units";
+  std::filesystem::create_directories(dir);
+  // The service names the installed binary; the check wants one that exists.
+  std::ifstream in(std::string(VESSA_SOURCE_DIR) + "/packaging/systemd/vessad.service");
+  std::string unit((std::istreambuf_iterator<char>(in)), {});
+  unit.replace(unit.find("/usr/sbin/vessad"), 16, VESSAD_PATH);
+  std::ofstream(dir + "/vessad.service") << unit;
+  std::filesystem::copy_file(std::string(VESSA_SOURCE_DIR) + "/packaging/systemd/vessad.socket",
+                             dir + "/vessad.socket");
+  std::string command =
+      "cd " + dir + " && systemd-analyze verify ./vessad.service ./vessad.socket 2>&1";
+  FILE* pipe = ::popen(command.c_str(), "r");
+  std::string output;
+  char buffer[1024];
+  while (size_t n = std::fread(buffer, 1, sizeof(buffer), pipe)) output.append(buffer, n);
+  int status = ::pclose(pipe);
+  EXPECT_EQ(status, 0) << output;
+  EXPECT_EQ(output, "");
 }
 
 }  // namespace
