@@ -4,7 +4,8 @@
 #   scripts/test.sh address      an ASan+UBSan build in build-address/
 #   scripts/test.sh thread       a TSan build in build-thread/
 # The normal run first gives every fuzz target a few seconds (its own clang
-# build in build-fuzz/); VESSA_FUZZ_SMOKE=0 leaves that out.
+# build in build-fuzz/; VESSA_FUZZ_SMOKE=0 leaves that out) and builds and
+# checks the Debian package (scripts/package.sh).
 set -euo pipefail
 cd "$(dirname "$0")/.."
 scripts/setup.sh
@@ -18,5 +19,6 @@ fi
 if [[ -z "$flavour" && "${VESSA_FUZZ_SMOKE:-1}" != 0 ]]; then
   (unset BUILD_DIR CC CXX && scripts/fuzz.sh --smoke 3)
 fi
+[[ -n "$flavour" ]] || scripts/package.sh
 cd "${BUILD_DIR:-build}"
 ctest --output-on-failure --timeout 300 -j"$(nproc)"
