@@ -89,7 +89,8 @@ void usage(FILE* out) {
                "u64 i64 bool str uuid real json (a JSON value, for arrays and dictionaries).\n"
                "\n"
                "Exit status: 0 when ReplyError is 1, 1 for any other result code (printed\n"
-               "on stderr as CODE: MEANING), 2 for usage, file or connection errors.\n"
+               "on stderr as CODE: MEANING, except with --json), 2 for usage, file or\n"
+               "connection errors.\n"
                "\n"
                "Commands (key Command):\n");
   for (size_t i = 0; i < kVSACommandCount; ++i)
@@ -305,7 +306,9 @@ int main(int argc, char** argv) {
     std::printf("%s\n", text.c_str());
   }
   if (code == 1) return 0;
-  std::fprintf(stderr, "vessactl: %llu: %s\n", static_cast<unsigned long long>(code),
-               VSACtlVerbs::meaningOfCode(code));
+  // --json output is for programs, which read the code from the reply.
+  if (!json)
+    std::fprintf(stderr, "vessactl: %llu: %s\n", static_cast<unsigned long long>(code),
+                 VSACtlVerbs::meaningOfCode(code));
   return 1;
 }
