@@ -33,6 +33,12 @@ VSARootChecker::VSARootChecker(const std::string& rootPath) : rootPath_(rootPath
 
 VSARootChecker::~VSARootChecker() = default;
 
+std::string VSARootChecker::identityKey(const VSAUserIdentityRef& user, VSAContainerClass c,
+                                        bool transient, const std::string& identifier) {
+  return user->identifier() + "|" + std::to_string(c) + (transient ? "|transient|" : "|live|") +
+         identifier;
+}
+
 void VSARootChecker::add(const char* kind, const std::string& path, std::string detail,
                          const char* repair) {
   findings_.push_back({kind, path, std::move(detail), repair, repair == kNextStart});
@@ -139,9 +145,8 @@ void VSARootChecker::checkEntry(const VSAUserIdentityRef& user, VSAContainerClas
   }
   ++counts_["containers"];
   std::string uuid = metadata->uuid().string();
-  std::string key = user->identifier() + "|" + std::to_string(c) + "|" +
-                    (transient ? "transient" : "live") + "|" + metadata->identifier();
-  auto [at, inserted] = identities_.emplace(key, path);
+  auto [at, inserted] =
+      identities_.emplace(identityKey(user, c, transient, metadata->identifier()), path);
   if (!inserted)
     add("duplicate-identity", path,
         "a second container of " + metadata->identifier() + " (the other: " + at->second + ")",
@@ -152,16 +157,14 @@ void VSARootChecker::checkEntry(const VSAUserIdentityRef& user, VSAContainerClas
   if (!uinserted)
     add("duplicate-uuid", path, "UUID " + uuid + " also at " + uat->second, kAttention);
   if (c == 7 && !transient) appGroups_[metadata->identifier()].push_back(path);
-  checkOwnership(path, user, c);
+  checkOwnership(path, st, user, c);
 }
 
 // The top-level directory as creation makes it: bundle containers belong to
 // the installer, system containers to root with their ACL, the others to
 // their user; all but system containers with mode 0755.
-void VSARootChecker::checkOwnership(const std::string& path, const VSAUserIdentityRef& user,
-                                    VSAContainerClass c) {
-  struct stat st;
-  if (context_->fileSystem->lstat(path, &st) != 0) return;
+void VSARootChecker::checkOwnership(const std::string& path, const struct stat& st,
+                                    const VSAUserIdentityRef& user, VSAContainerClass c) {
   uid_t owner = VSAContainerClassIsBundle(c)   ? CONTAINER_INSTALLATION_UID
                 : VSAContainerClassIsSystem(c) ? CONTAINER_SYSTEM_UID
                                                : user->posixUIDForContainerClass(c);
@@ -210,9 +213,7 @@ void VSARootChecker::checkPendingUpdates() {
     VSAUserIdentityRef user = update->userIdentity
                                   ? update->userIdentity
                                   : context_->userIdentityCache->defaultUserIdentity();
-    std::string key = user->identifier() + "|" + std::to_string(update->containerClass) + "|live|" +
-                      update->identifier;
-    if (!identities_.count(key))
+    if (!identities_.count(identityKey(user, update->containerClass, false, update->identifier)))
       add("pending-update-without-container", path,
           "names " + update->identifier + ", which has no live container", kAttention);
   }

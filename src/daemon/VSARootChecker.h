@@ -25,6 +25,8 @@
 // removes them). Not thread-safe; one check per object.
 #pragma once
 
+#include <sys/stat.h>
+
 #include <cstdint>
 #include <map>
 #include <memory>
@@ -66,7 +68,11 @@ class VSARootChecker {
   void checkClassDirectory(const VSAUserIdentityRef& user, VSAContainerClass c, bool transient);
   void checkEntry(const VSAUserIdentityRef& user, VSAContainerClass c, bool transient,
                   const std::string& directory, const std::string& name);
-  void checkOwnership(const std::string& path, const VSAUserIdentityRef& user, VSAContainerClass c);
+  // `st`: the container directory's own status, already taken by checkEntry.
+  void checkOwnership(const std::string& path, const struct stat& st,
+                      const VSAUserIdentityRef& user, VSAContainerClass c);
+  static std::string identityKey(const VSAUserIdentityRef& user, VSAContainerClass c,
+                                 bool transient, const std::string& identifier);
   void checkLeftovers(const std::string& directory, const char* kind, const char* repair);
   void checkPendingUpdates();
   void checkDatabase();
