@@ -6,6 +6,7 @@
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
 #include "base/VSAPlist.h"
+#include "base/VSAProgressLog.h"
 #include "model/VSAPerUserConfiguration.h"
 
 namespace {
@@ -315,9 +316,15 @@ bool VSAContainerMigrator::subdirectoryMigration(const VSAUserIdentityRef& user,
       ok = false;
       continue;
     }
+    VSAProgressLog progress(VSALogCategory::Startup, origin,
+                            VSAFormat("Subdirectory migration of %@, class %ld",
+                                      user->shortDescription(), static_cast<long>(c)),
+                            all->size(), "containers");
     for (const auto& m : *all) {
       VSAResultCode code = VSAResult::kSuccess;
-      if (client.recreateDefaultStructure(m->containerIdentity(), &code)) continue;
+      bool done = client.recreateDefaultStructure(m->containerIdentity(), &code);
+      progress.advance();
+      if (done) continue;
       logMigrator(kVSALogError, origin,
                   "Failed to recreate container directory structure for %@:%ld:%@ : %llu",
                   user->shortDescription(), static_cast<long>(c), m->identifier(), code);
@@ -347,7 +354,14 @@ bool VSAContainerMigrator::dataProtectionMigration(const VSAUserIdentityRef& use
       ok = false;
       continue;
     }
-    for (const auto& m : *all) _setDataProtectionIfNecessaryOnContainer(*m, client);
+    VSAProgressLog progress(VSALogCategory::Startup, origin,
+                            VSAFormat("Data protection migration of %@, class %ld",
+                                      user->shortDescription(), static_cast<long>(c)),
+                            all->size(), "containers");
+    for (const auto& m : *all) {
+      _setDataProtectionIfNecessaryOnContainer(*m, client);
+      progress.advance();
+    }
   }
   logMigrator(kVSALogNotice, origin,
               "Completed User Data Protection Migration for %@ on %@ : Success: %c",

@@ -5,6 +5,7 @@
 
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
+#include "base/VSAProgressLog.h"
 #include "model/VSAPerUserConfiguration.h"
 #include "operations/VSAContainerMaintenance.h"
 #include "operations/VSAReplaceOperation.h"
@@ -103,6 +104,10 @@ void VSABootKeeper::rebootKeeperCleanupWithCompletion(std::function<void()> comp
   // completion, in this order; requests are served meanwhile.
   auto queue = VSAWorkQueue::create("com.tamsk.vessad.bootcleanup", VSAWorkQueue::Kind::Serial,
                                     VSAWorkQueue::global(VSAWorkQueue::Priority::Background));
+  auto progress = std::make_shared<VSAProgressLog>(
+      VSALogCategory::Startup, "rebootKeeperCleanupWithCompletion",
+      "Boot cleanup: checking container directories", 0, "entries");
+  uint64_t total = 0;
   auto scan = [&](const VSAUserIdentityRef& user, VSAContainerClass c) {
     auto directory = config.containerDirectoryURLForUserIdentity(user, c, false);
     if (!directory) return;
@@ -117,9 +122,10 @@ void VSABootKeeper::rebootKeeperCleanupWithCompletion(std::function<void()> comp
     }
     std::vector<std::string> entries;
     for (const auto& item : *items) entries.push_back(item.path);
+    progress->setTotal(total += entries.size());
     // The services outlive the daemon's queues; this keeper object does not.
-    queue->async([services = &services_, keep = queue, entries = std::move(entries), c] {
-      VSABootKeeper(*services)._cleanupOrphanedDataForDirectories(entries, c);
+    queue->async([services = &services_, keep = queue, entries = std::move(entries), c, progress] {
+      VSABootKeeper(*services)._cleanupOrphanedDataForDirectories(entries, c, progress.get());
     });
   };
   services_.userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
@@ -133,13 +139,16 @@ void VSABootKeeper::rebootKeeperCleanupWithCompletion(std::function<void()> comp
   queue->async([services = &services_, keep = queue] {
     VSABootKeeper(*services)._cleanupOprhanedCodeSigningMappingData();
   });
-  queue->async([token, keep = queue, completion = std::move(completion)] {
+  queue->async([token, keep = queue, progress = std::move(progress),
+                completion = std::move(completion)]() mutable {
+    progress.reset();  // its closing line comes before the completion's
     if (completion) completion();
   });
 }
 
 void VSABootKeeper::_cleanupOrphanedDataForDirectories(const std::vector<std::string>& entries,
-                                                       VSAContainerClass c) {
+                                                       VSAContainerClass c,
+                                                       VSAProgressLog* progress) {
   const char* origin = "_cleanupOrphanedDataForDirectories";
   auto& fm = *services_.fileManager;
   auto isWellknown = [&](const std::string& name, VSAContainerClass cls) {
@@ -148,6 +157,7 @@ void VSABootKeeper::_cleanupOrphanedDataForDirectories(const std::vector<std::st
   };
   std::vector<std::string> orphans;
   for (const auto& url : entries) {
+    if (progress) progress->advance();
     // A live container (most entries) costs one status call: its metadata
     // file exists, so the entry does too.
     bool valid = VSAContainerCache::containerURLIsValidForContainerClass(url, c, isWellknown);

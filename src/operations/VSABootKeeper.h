@@ -13,6 +13,8 @@
 #include "operations/VSAOperationGrants.h"
 #include "operations/VSAOperationServices.h"
 
+class VSAProgressLog;
+
 // The system group whose container keeps its directory across upgrades,
 // like the well-known ones: analytics collected before the upgrade stay
 // where their readers look for them.
@@ -36,8 +38,10 @@ class VSABootKeeper {
   void _regenerateAllSystemContainerPaths(const VSAOperationGrants& grants);
   // Sends every entry that is not a live container of `containerClass` (a
   // name that is not valid for the class, or no metadata file) to death row.
+  // `progress` (may be null) advances by one per entry.
   void _cleanupOrphanedDataForDirectories(const std::vector<std::string>& entries,
-                                          VSAContainerClass containerClass);
+                                          VSAContainerClass containerClass,
+                                          VSAProgressLog* progress = nullptr);
   void _cleanupOprhanedCodeSigningMappingData();
 
  private:

@@ -4,6 +4,7 @@
 
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
+#include "base/VSAProgressLog.h"
 
 namespace {
 constexpr VSAResultCode kDeleteFailed = 28;
@@ -129,20 +130,25 @@ VSAResultCode VSADeathRow::emptyDeathRow() {
     return kDeleteFailed;
   }
   VSAResultCode code = VSAResult::kSuccess;
+  VSAProgressLog progress(VSALogCategory::Unspecified, fn, "Emptying death row", items->size(),
+                          "entries");
+  auto freed = [&progress](uint64_t bytes) { progress.addBytes(bytes); };
   for (const auto& item : *items) {
-    if (!_removeItemOrMoveToTempAtURL(item.path, &error)) {
+    if (!_removeItemOrMoveToTempAtURL(item.path, &error, freed)) {
       VSALog(kVSALogError, fn, "Failed to destroy item at: %@", item.path);
       code = kDeleteFailed;
     }
+    progress.advance();
   }
   return code;
 }
 
-bool VSADeathRow::_removeItemOrMoveToTempAtURL(const std::string& url, VSAErrorRef* error) {
+bool VSADeathRow::_removeItemOrMoveToTempAtURL(const std::string& url, VSAErrorRef* error,
+                                               const VSAFileManager::RemovalObserver& observer) {
   const char* fn = "_removeItemOrMoveToTempAtURL";
   VSAFileManager& fm = configuration_->fileManager();
   VSAErrorRef removeError;
-  if (fm.removeItemAtURL(url, &removeError)) return true;
+  if (fm.removeItemAtURL(url, &removeError, observer)) return true;
   VSALog(kVSALogDebug, fn, "Couldn't remove, so moving item to /tmp: %@ : %@", url, removeError);
   std::string tmp = configuration_->systemRoot().resolve("/tmp");
   if (fm.itemDoesNotExistAtURL(tmp))

@@ -43,7 +43,8 @@ class VSADeathRow : public std::enable_shared_from_this<VSADeathRow> {
   // The queued work keeps this object alive until it has run.
   void deleteContainersOnDeathRowWithCompletion(Completion completion);
   // Removes a tree or, failing that, moves it to /tmp.
-  bool _removeItemOrMoveToTempAtURL(const std::string& url, VSAErrorRef* error);
+  bool _removeItemOrMoveToTempAtURL(const std::string& url, VSAErrorRef* error,
+                                    const VSAFileManager::RemovalObserver& observer = {});
 
  private:
   VSAResultCode emptyDeathRow();

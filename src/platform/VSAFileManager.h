@@ -83,9 +83,13 @@ class VSAFileManager {
   // `directory`; returns how many went.
   int removeUnfinishedWritesInDirectoryAtURL(const std::string& directory);
   bool copyItemIfExistsAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
+  // Told of each file a removal unlinks, with its size (progress of long removals).
+  using RemovalObserver = std::function<void(uint64_t bytes)>;
   // Recursive, through directory descriptors and on one device; a missing
-  // item is success; immutable items are unlocked and removed.
-  bool removeItemAtURL(const std::string& path, VSAErrorRef* error);
+  // item is success; immutable items are unlocked and removed. An observer
+  // costs one status call per file.
+  bool removeItemAtURL(const std::string& path, VSAErrorRef* error,
+                       const RemovalObserver& observer = {});
   // One file or link, never a tree (a directory is EISDIR); missing is success.
   bool removeFileAtURL(const std::string& path, VSAErrorRef* error);
   // Gives an item (a container sent to death row) to root with mode 0700, so

@@ -100,6 +100,7 @@ bool VSAFileManager::traverseDirectory(const std::string& path, VSAErrorRef* err
 struct VSAFileManager::Removal {
   dev_t device;
   int firstError = 0;
+  const RemovalObserver* observer = nullptr;
   void record(const std::string& path, int rc) {
     if (rc == 0 || rc == ENOENT) return;
     VSALogIn(VSALogCategory::FS, kVSALogError, "_removefile_error_callback",
@@ -153,7 +154,10 @@ void VSAFileManager::removeDirectoryContents(Removal& r, int directory, const st
 void VSAFileManager::removeEntry(Removal& r, int directory, const std::string& name,
                                  const std::string& path, bool isDirectory, int depth) {
   if (!isDirectory) {
+    struct stat st;
+    bool observed = r.observer && *r.observer && fs_->statAt(directory, name, &st) == 0;
     int rc = unlinkUnlocking(directory, name, path, false);
+    if (rc == 0 && observed) (*r.observer)(static_cast<uint64_t>(st.st_size));
     if (rc != EISDIR) return r.record(path, rc);
   }
   if (depth >= kVSAMaxWalkDepth) return r.record(path, ELOOP);
@@ -174,7 +178,8 @@ void VSAFileManager::removeEntry(Removal& r, int directory, const std::string& n
   r.record(path, rc);
 }
 
-bool VSAFileManager::removeItemAtURL(const std::string& path, VSAErrorRef* error) {
+bool VSAFileManager::removeItemAtURL(const std::string& path, VSAErrorRef* error,
+                                     const RemovalObserver& observer) {
   if (path.empty()) {
     VSASetError(error, VSAFileManagerFail(EFAULT, "removeItemAtURL",
                                           "nil url passed to -removeItemAtURL:error:"));
@@ -192,7 +197,7 @@ bool VSAFileManager::removeItemAtURL(const std::string& path, VSAErrorRef* error
                                           path, std::strerror(rc)));
     return false;
   }
-  Removal r{st.st_dev, 0};
+  Removal r{st.st_dev, 0, &observer};
   removeEntry(r, parent.get(), name, path, S_ISDIR(st.st_mode), 0);
   if (r.firstError != 0) {
     VSASetError(error,

@@ -181,6 +181,21 @@ TEST_F(FileManager, RemovalGoesOnPastErrorsAndReportsTheFirst) {
   EXPECT_TRUE(fm_->removeItemAtURL(base_, &error)) << "a missing item is success";
 }
 
+TEST_F(FileManager, RemovalTellsItsObserverEachFileAndItsSize) {
+  file(base_ + "/Documents/a", std::string(1000, 'a'));
+  file(base_ + "/Library/deep/b", std::string(24, 'b'));
+  file(base_ + "/c", "");
+  faults_->failNth(Op::Unlink, 3, EIO);  // what that leaves is not counted
+  uint64_t files = 0, bytes = 0;
+  VSAErrorRef error;
+  EXPECT_FALSE(fm_->removeItemAtURL(base_, &error, [&](uint64_t size) { ++files, bytes += size; }));
+  uint64_t left = 0, leftFiles = 0;
+  for (auto& e : fs::recursive_directory_iterator(base_))
+    if (e.is_regular_file()) left += e.file_size(), ++leftFiles;
+  EXPECT_EQ(files + leftFiles, 3u) << "every file is either reported removed or still there";
+  EXPECT_EQ(bytes + left, 1024u);
+}
+
 TEST_F(FileManager, RemovalClearsTheImmutableFlag) {
   file(base_ + "/Documents/locked");
   auto linux = std::make_shared<VSALinuxFileSystem>();
