@@ -255,6 +255,11 @@ int VSAWorkQueue::suspendCount() const {
   return suspendCount_;
 }
 
+size_t VSAWorkQueue::depth() const {
+  std::lock_guard lock(mutex_);
+  return items_.size();
+}
+
 void VSAWorkQueue::enqueue(Item item) {
   {
     std::lock_guard lock(mutex_);

@@ -59,6 +59,8 @@ class VSAWorkQueue : public std::enable_shared_from_this<VSAWorkQueue> {
   void suspend();
   void resume();
   int suspendCount() const;
+  // Blocks submitted and not yet started (a running block is not counted).
+  size_t depth() const;
 
   // Changes the target; only meaningful before the first block is submitted.
   void setTarget(Ref target);

@@ -160,7 +160,8 @@ void VSASQLiteDB::finalizeCachedStatements() {
 }
 
 VSASQLiteDB::VSASQLiteDB(const std::string& parentDirectory)
-    : url_(VSAPathJoin(parentDirectory, "containers.sqlite3")), db_(openDBWithURL(url_)) {}
+    : url_(VSAPathJoin(parentDirectory, kVSACodeSigningDatabaseFileName)),
+      db_(openDBWithURL(url_)) {}
 
 VSASQLiteDB::~VSASQLiteDB() {
   closeDB();
@@ -201,7 +202,7 @@ sqlite3* VSASQLiteDB::openDBWithURL(const std::string& path) {
 std::unique_ptr<VSASQLiteDB> VSASQLiteDB::openReadOnly(const std::string& parentDirectory,
                                                        VSAErrorRef* error) {
   namespace fs = std::filesystem;
-  std::string path = VSAPathJoin(parentDirectory, "containers.sqlite3");
+  std::string path = VSAPathJoin(parentDirectory, kVSACodeSigningDatabaseFileName);
   std::string scratch = (fs::temp_directory_path() / "vessa-db-XXXXXX").string();
   if (!::mkdtemp(scratch.data())) {
     VSASetError(error,
@@ -209,7 +210,7 @@ std::unique_ptr<VSASQLiteDB> VSASQLiteDB::openReadOnly(const std::string& parent
                         "no scratch directory for a copy of %@: %s", path, std::strerror(errno)));
     return nullptr;
   }
-  std::string copy = VSAPathJoin(scratch, "containers.sqlite3");
+  std::string copy = VSAPathJoin(scratch, kVSACodeSigningDatabaseFileName);
   std::error_code ec;
   fs::copy_file(path, copy, ec);
   if (!ec && fs::exists(path + "-wal")) fs::copy_file(path + "-wal", copy + "-wal", ec);

@@ -24,6 +24,8 @@
 struct sqlite3;
 struct sqlite3_stmt;
 
+inline constexpr const char* kVSACodeSigningDatabaseFileName = "containers.sqlite3";
+
 class VSASQLiteDB {
  public:
   // initWithParentDirectoryURL: opens (and creates) <directory>/containers.sqlite3.

@@ -1,6 +1,7 @@
 #include "daemon/VSADaemon.h"
 
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <cstring>
 
@@ -10,6 +11,7 @@
 #include "base/VSAPlist.h"
 #include "base/VSATestLocks.h"
 #include "daemon/VSACommandTable.h"
+#include "daemon/VSAStateDump.h"
 #include "platform/VSANamedSemaphore.h"
 #include "platform/VSAServiceManager.h"
 
@@ -21,23 +23,30 @@
 VSADaemon::VSADaemon(Options options)
     : options_(std::move(options)),
       context_(std::make_unique<VSADaemonContext>(VSASystemRoot(options_.root),
-                                                  VSADaemonContext::FileSystemWrapper{}, false)) {
+                                                  VSADaemonContext::FileSystemWrapper{}, false)),
+      stateQueue_(VSAWorkQueue::create("com.tamsk.vessad.state")) {
   firstBootSemaphore_ =
       VSANamedSemaphore::nameForRoot(kVSAFirstBootSemaphore, context_->systemRoot);
   if (options_.afterBoot) VSANamedSemaphore::remove(firstBootSemaphore_);
   VSALogger::shared().setLevel(options_.logLevel);
 }
 
-VSADaemon::~VSADaemon() = default;
+// A dump under way reads this daemon's objects: it ends first.
+VSADaemon::~VSADaemon() {
+  stopping_ = true;
+  stateQueue_->sync([] {});
+}
 
 int VSADaemon::run() {
   VSAMakeDirectories(context_->systemRoot.runDirectory());
+  writePidFile();
   context_->listenerQueue = VSAWorkQueue::create("com.tamsk.vessad.listener");
   auto initTransaction = context_->transactions->open();
   testLockQueue_ = VSAWorkQueue::create("com.tamsk.vessad.testlocks");
   testLockQueue_->suspend();
   context_->listenerQueue->async([this, initTransaction = std::move(initTransaction)]() mutable {
     initialize();
+    initialized_ = true;
     VSAServiceManager::notifyReady(cleanupsDone_ ? "Serving" : "Serving; boot cleanup running");
     testLockQueue_->resume();
     initTransaction.reset();  // step 15: start-up is over
@@ -71,6 +80,8 @@ int VSADaemon::run() {
     std::lock_guard lock(listenerMutex_);
     if (listener_) listener_->stop();
   }
+  context_->fileManager->removeFileAtURL(
+      VSAPathJoin(context_->systemRoot.runDirectory(), kVSAPidFileName), nullptr);
   VSALogIn(VSALogCategory::Daemon, kVSALogNotice, "main", "vessad stopped");
   VSALogger::shared().closeRotatingLog();
   return 0;
@@ -83,6 +94,31 @@ void VSADaemon::requestStop() {
   // meanwhile, because start-up (which may still be under way) calls into it.
   drainForShutdown();
   VSAWorkQueue::stopMain();
+}
+
+void VSADaemon::requestStateDump() {
+  if (stopping_) return;
+  uint64_t generation = ++dumpGeneration_;
+  stateQueue_->async([this, generation] {
+    // Before start-up has set the subsystems, the state is only that.
+    if (!initialized_) {
+      VSAStateDump(*context_, {}).publish(VSAStateDump::startingUp(generation));
+      return;
+    }
+    VSAStateDump dump(*context_, {testLockQueue_, stateQueue_});
+    dump.publish(dump.collect(generation));
+  });
+}
+
+// The daemon's pid, for `vessactl status` (which signals it); written
+// atomically, so a reader never sees half a number.
+void VSADaemon::writePidFile() {
+  std::string text = std::to_string(::getpid()) + "\n";
+  std::string path = VSAPathJoin(context_->systemRoot.runDirectory(), kVSAPidFileName);
+  VSAErrorRef error;
+  if (!context_->fileManager->writeFileAtomicallyAtURL(
+          path, std::vector<uint8_t>(text.begin(), text.end()), 0644, std::nullopt, &error))
+    VSALogIn(VSALogCategory::Daemon, kVSALogError, "main", "Failed to write %@: %@", path, error);
 }
 
 void VSADaemon::drainForShutdown() {

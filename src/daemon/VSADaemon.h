@@ -8,7 +8,9 @@
 // (only when the first-boot semaphore is absent) and boot setup, subscribes
 // to lock-state changes and starts the two cleanups. requestStop() (from the
 // signal thread) stops accepting requests, waits for open transactions and
-// returns from run().
+// returns from run(). requestStateDump() (SIGUSR1) writes the daemon's state
+// to the log and to the run directory's "state.json"; the run directory
+// also holds "vessad.pid" while the daemon runs, for whoever sends the signal.
 #pragma once
 
 #include <atomic>
@@ -41,6 +43,8 @@ class VSADaemon {
   // Stops accepting requests, waits for open transactions, then makes run()
   // return. Blocks; call it from any thread but the main one.
   void requestStop();
+  // Queues a state dump; returns at once. Any thread.
+  void requestStateDump();
   VSADaemonContext& context() { return *context_; }
 
  private:
@@ -49,6 +53,7 @@ class VSADaemon {
   bool isFirstBoot();
   void startCleanups(bool firstBoot);
   void drainForShutdown();
+  void writePidFile();
 
   Options options_;
   std::unique_ptr<VSADaemonContext> context_;
@@ -62,6 +67,9 @@ class VSADaemon {
   std::string firstBootSemaphore_;
   std::atomic<bool> stopping_{false};
   std::atomic<bool> cleanupsDone_{false};  // the every-start cleanup has finished
+  std::atomic<bool> initialized_{false};   // the subsystems are set; a dump may read them
+  VSAWorkQueue::Ref stateQueue_;           // runs state dumps, one at a time
+  std::atomic<uint64_t> dumpGeneration_{0};
   // Guards listener_: a signal may ask for a stop while run() sets it up.
   std::mutex listenerMutex_;
 };

@@ -222,7 +222,9 @@ void VSARootChecker::checkPendingUpdates() {
 void VSARootChecker::checkDatabase() {
   std::string directory = context_->globalConfiguration->libraryDirectory();
   struct stat st;
-  if (context_->fileSystem->lstat(VSAPathJoin(directory, "containers.sqlite3"), &st) != 0) return;
+  if (context_->fileSystem->lstat(VSAPathJoin(directory, kVSACodeSigningDatabaseFileName), &st) !=
+      0)
+    return;
   VSAErrorRef error;
   auto db = VSASQLiteDB::openReadOnly(directory, &error);
   if (!db) {

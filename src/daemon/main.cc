@@ -3,7 +3,8 @@
 //   vessad [--root DIR] [--log-level N] [--stderr] [--after-boot]
 //   vessad --verify [--root DIR] [--json]     check a root offline (exit 0/1/2)
 //
-// SIGTERM and SIGINT stop it cleanly once open transactions have ended.
+// SIGTERM and SIGINT stop it cleanly once open transactions have ended;
+// SIGUSR1 writes its state to the log and to run/vessad/state.json.
 #include <signal.h>
 #include <sys/stat.h>
 
@@ -80,6 +81,7 @@ int main(int argc, char** argv) {
   sigemptyset(&set);
   sigaddset(&set, SIGTERM);
   sigaddset(&set, SIGINT);
+  sigaddset(&set, SIGUSR1);
   pthread_sigmask(SIG_BLOCK, &set, nullptr);
   signal(SIGPIPE, SIG_IGN);
   // Whatever started the daemon, what it creates gets the modes it asks for
@@ -89,7 +91,7 @@ int main(int argc, char** argv) {
   VSADaemon daemon(options);
   std::thread([&daemon, set] {
     int sig = 0;
-    sigwait(&set, &sig);
+    while (sigwait(&set, &sig) == 0 && sig == SIGUSR1) daemon.requestStateDump();
     VSALogIn(VSALogCategory::Daemon, kVSALogNotice, "main", "Received signal %d", sig);
     daemon.requestStop();
   }).detach();

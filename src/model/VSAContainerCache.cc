@@ -59,6 +59,15 @@ bool VSAContainerCache::hasClassMap(const VSAUserIdentityRef& user, VSAContainer
   return (transient ? transient_ : live_).count(cacheKeyForUserIdentity(user, c)) > 0;
 }
 
+std::vector<VSAContainerCache::ClassMapSize> VSAContainerCache::classMapSizes() {
+  std::lock_guard lock(cacheLock_);
+  std::vector<ClassMapSize> sizes;
+  for (bool transient : {false, true})
+    for (const auto& [key, map] : transient ? transient_ : live_)
+      sizes.push_back({key, transient, map.size()});
+  return sizes;
+}
+
 VSAContainerCache::ClassMap* VSAContainerCache::_lock_getCache(const VSAUserIdentityRef& user,
                                                                VSAContainerClass c, bool transient,
                                                                bool populateSandbox, bool build,

@@ -77,6 +77,13 @@ class VSAContainerCache : public VSAUserIdentityCacheObserver,
                                              VSAContainerClass containerClass);
   // Whether the class map has been built (tests and diagnostics).
   bool hasClassMap(const VSAUserIdentityRef& user, VSAContainerClass c, bool transient);
+  // How many containers each built class map holds, by cache key (the state dump).
+  struct ClassMapSize {
+    std::string key;  // "[user]-class" or the class alone
+    bool transient;
+    size_t containers;
+  };
+  std::vector<ClassMapSize> classMapSizes();
 
  private:
   using ClassMap = std::map<std::string, VSAMetadataRef>;

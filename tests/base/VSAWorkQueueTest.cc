@@ -112,10 +112,12 @@ TEST(VSAWorkQueue, SuspendIsCountedAndHoldsBackNewBlocks) {
   std::this_thread::sleep_for(20ms);
   EXPECT_EQ(ran.load(), 0) << "one resume must not undo two suspends";
   EXPECT_EQ(q->suspendCount(), 1);
+  EXPECT_EQ(q->depth(), 1u) << "the held block is waiting";
   q->resume();
   q->sync([] {});
   EXPECT_EQ(ran.load(), 1);
   EXPECT_EQ(q->suspendCount(), 0);
+  EXPECT_EQ(q->depth(), 0u);
 }
 
 TEST(VSAWorkQueue, SuspendingATargetHoldsItsChildren) {

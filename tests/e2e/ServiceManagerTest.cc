@@ -100,11 +100,19 @@ TEST(DaemonServiceManager, ASocketTheManagerHoldsIsTakenOver) {
   }
   for (int i = 0; i < 200 && !std::filesystem::exists(d.socketPath()); ++i)
     std::this_thread::sleep_for(20ms);
+  // vessactl status starts the daemon (a connection) and gets its state.
+  auto state = d.vessactl("", {"status", "--json"});
+  EXPECT_EQ(state.status, 0) << state.output;
+  EXPECT_NE(state.output.find("\"generation\": 1"), std::string::npos) << state.output;
   auto reply = d.request(VSAValue::Dictionary{{"Command", VSAValue(0u)},
                                               {"Identifier", VSAValue("com.example.app")},
                                               {"ContainerClass", VSAValue(2u)},
                                               {"CreateIfNecessary", VSAValue(true)}});
   EXPECT_EQ(VSAReplyError(reply), 1u);
+  d.registerVessactl("installer", "com.example.installer",
+                     VSAValue::Dictionary{{"com.tamsk.private.Vessa.allowed", VSAValue(true)}});
+  auto found = d.vessactl("installer", {"lookup", "com.example.app"});
+  EXPECT_EQ(found.status, 0) << found.output;
   ::kill(pid, SIGTERM);
   int status = 0;
   ::waitpid(pid, &status, 0);
