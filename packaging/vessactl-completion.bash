@@ -5,7 +5,7 @@ _vessactl() {
   cur=${COMP_WORDS[COMP_CWORD]}
   prev=${COMP_WORDS[COMP_CWORD-1]}
   verbs="create lookup ls show rm wipe replace regen-uuid restructure info groups cs protect
-         usage assets deathrow personas test-lock notifications"
+         usage assets deathrow personas test-lock status notifications"
   classes="bundle data plugin plugin-data vpn-plugin vpn-plugin-data group framework
            relay-service daemon-data temp system system-group"
   case "$prev" in

@@ -28,22 +28,17 @@ step "An identifier that would leave its directory is refused at the door: 11"
 ctl "$installer" --root "$root" Command=0 Identifier=../../../etc ContainerClass=2 CreateIfNecessary=true
 
 step "Personas the installer may use (it is listed by the universal persona, so all of them)"
-ctl "$installer" --root "$root" --json Command=32
+ctl "$installer" --root "$root" personas
 
-step "Recording code-signing information for an app (command 18) and reading it back (19)"
-cat > "$root/tmp/csinfo.json" <<'JSON'
-{"Command": 18, "Identifier": "com.example.demo",
- "CodeSigningInfo": {"com.tamsk.Vessa.Entitlements":
-                       {"com.tamsk.security.application-groups": ["group.com.example.shared"]},
-                     "TeamIdentifier": "DEMOTEAM"},
- "OptionsDictionary": {"com.tamsk.Vessa.DataContainerClass": 2}}
-JSON
-ctl "$installer" --root "$root" --file "$root/tmp/csinfo.json"
-ctl "$installer" --root "$root" --json Command=19 Identifier=com.example.demo
+step "Recording code-signing information for an app (cs set = command 18) and reading it back (cs get = 19)"
+ctl "$installer" --root "$root" cs set com.example.demo '{"com.tamsk.Vessa.Entitlements":
+  {"com.tamsk.security.application-groups": ["group.com.example.shared"]},
+  "TeamIdentifier": "DEMOTEAM"}'
+ctl "$installer" --root "$root" --json cs get com.example.demo
 
 step "Creating the app's data container (verb create = command 0, class data = 2)"
 ctl "$installer" --root "$root" create com.example.demo --class data
-path=$("$installer" --root "$root" --json Command=0 Identifier=com.example.demo ContainerClass=2 |
+path=$("$installer" --root "$root" --json lookup com.example.demo --class data |
   sed -n 's/.*"ReplyPath": *"\([^"]*\)".*/\1/p')
 echo "(asked again, the same container answers with ReplyExisted true)"
 step "A container that does not exist: lookup never creates; the code is named (exit 1)"
@@ -53,20 +48,20 @@ find "$path" -printf '%M %u %p\n' | sed -e "s|$root|\$ROOT|g" | sort -k3
 step "Its metadata (verb show = command 7; the same request as raw keys: Command=7 ...)"
 ctl "$installer" --root "$root" show com.example.demo
 
-step "An info value in its metadata (commands 5 and 6); an unset key answers 24"
-ctl "$installer" --root "$root" Command=5 Identifier=com.example.demo ContainerClass=2 \
-  Key=com.example.note Value=hello
-ctl "$installer" --root "$root" --json Command=6 Identifier=com.example.demo ContainerClass=2 \
-  Key=com.example.note
-ctl "$installer" --root "$root" Command=6 Identifier=com.example.demo ContainerClass=2 Key=unset
+step "An info value in its metadata (info set/get = commands 5 and 6); an unset key answers 24"
+ctl "$installer" --root "$root" info set com.example.demo com.example.note hello
+ctl "$installer" --root "$root" info get com.example.demo com.example.note
+ctl "$installer" --root "$root" info get com.example.demo unset
+step "The data containers (ls = command 1) and this one's size (usage = command 23)"
+ctl "$installer" --root "$root" ls --class data
+ctl "$installer" --root "$root" usage com.example.demo
 
-step "Wiping its content (command 12): same path, same UUID, the files are gone"
+step "Wiping its content (wipe = command 12): same path, same UUID, the files are gone"
 echo "secret" > "$path/Documents/diary.txt"
-uuid_of() { "$installer" --root "$root" --json Command=0 Identifier=com.example.demo \
-  ContainerClass=2 | sed -n 's/.*"ReplyUUID": *{"\$data": *"\([^"]*\)".*/\1/p'; }
+uuid_of() { "$installer" --root "$root" lookup com.example.demo | sed -n 's/^UUID: *//p'; }
 before=$(uuid_of)
 echo "before: $(ls "$path/Documents")  UUID $before"
-ctl "$installer" --root "$root" Command=12 Identifier=com.example.demo ContainerClass=2
+ctl "$installer" --root "$root" wipe com.example.demo
 after=$(uuid_of)
 echo "after:  Documents holds $(ls -A "$path/Documents" | wc -l) entries  UUID $after"
 if [ -n "$before" ] && [ "$before" = "$after" ]; then
@@ -75,24 +70,19 @@ else
   echo "(the UUID changed: $before -> $after)"
 fi
 
-step "Two apps share a group container (commands 18 and 16)"
-cat > "$root/tmp/shared.json" <<'JSON'
-{"Command": 18, "OptionsDictionary": {},
- "CodeSigningInfo": {"com.tamsk.Vessa.Entitlements":
-                       {"com.tamsk.security.application-groups": ["group.com.example.shared"]}}}
-JSON
-cat > "$root/tmp/alone.json" <<'JSON'
-{"Command": 18, "OptionsDictionary": {}, "CodeSigningInfo": {"com.tamsk.Vessa.Entitlements": {}}}
-JSON
-ctl "$installer" --root "$root" --file "$root/tmp/shared.json" Identifier=com.example.second
+step "Two apps share a group container (cs set = command 18; group paths: command 16, raw keys)"
+shared='{"com.tamsk.Vessa.Entitlements":
+  {"com.tamsk.security.application-groups": ["group.com.example.shared"]}}'
+alone='{"com.tamsk.Vessa.Entitlements": {}}'
+ctl "$installer" --root "$root" cs set com.example.second "$shared"
 ctl "$installer" --root "$root" --json Command=16 Identifier=com.example.demo ContainerClass=7
 group=$("$installer" --root "$root" --json Command=16 Identifier=com.example.second \
   ContainerClass=7 | sed -n 's/.*"group.com.example.shared": *"\([^"]*\)".*/\1/p')
 step "The first app drops the group: one reference is left, the container stays"
-ctl "$installer" --root "$root" --file "$root/tmp/alone.json" Identifier=com.example.demo
+ctl "$installer" --root "$root" cs set com.example.demo "$alone"
 [ -d "$group" ] && echo "group container still at $(echo "$group" | sed "s|$root|\$ROOT|")"
 step "The second app drops it too: the last reference went, the container is staged for deletion"
-ctl "$installer" --root "$root" --file "$root/tmp/alone.json" Identifier=com.example.second
+ctl "$installer" --root "$root" cs set com.example.second "$alone"
 if [ -d "$group" ]; then echo "group container still there (unexpected)"; else
   echo "group container gone from its place; death row:"
   ls -A "$root/private/var/root/Library/Caches/com.tamsk.vessad/Dead" | sed 's/^/  /'
@@ -108,11 +98,9 @@ echo "(a process that is not the kernel bridge is answered with return code 5:)"
 cp "$build/vessa-upcall" "$root/tmp/not-the-kernel"
 ctl "$root/tmp/not-the-kernel" --root "$root" --signing-id com.example.demo --uid 501 --persona 1000
 
-step "User-managed assets (command 28 twice: made, then found; 29 deletes one asset)"
-ctl "$installer" --root "$root" --json Command=28 Identifier=com.example.demo ContainerClass=2 \
-  CreateIfNecessary=true IsRelative=true
-assets=$("$installer" --root "$root" --json Command=28 Identifier=com.example.demo ContainerClass=2 \
-  CreateIfNecessary=true | sed -n 's/.*"ReplyPath": *"\([^"]*\)".*/\1/p')
+step "User-managed assets (assets = command 28, twice: made, then found; 29 deletes one asset)"
+ctl "$installer" --root "$root" assets com.example.demo --create
+assets=$("$installer" --root "$root" assets com.example.demo --create | sed -n 's/^Path: *//p')
 echo "  (asked again: the same directory, ReplyExisted true)"
 echo "la la" > "$assets/song.m4a"
 ctl "$installer" --root "$root" Command=29 Identifier=com.example.demo ContainerClass=2 SourcePath=../Documents
@@ -120,32 +108,30 @@ ctl "$installer" --root "$root" Command=29 Identifier=com.example.demo Container
 echo "assets directory now holds $(ls -A "$assets" | wc -l) entries"
 
 step "Shared content from the app's bundle into its data container (command 26)"
-ctl "$installer" --root "$root" Command=0 Identifier=com.example.demo ContainerClass=1 CreateIfNecessary=true
-bundle=$("$installer" --root "$root" --json Command=0 Identifier=com.example.demo ContainerClass=1 |
-  sed -n 's/.*"ReplyPath": *"\([^"]*\)".*/\1/p')
+ctl "$installer" --root "$root" create com.example.demo --class bundle
+bundle=$("$installer" --root "$root" lookup com.example.demo --class bundle | sed -n 's/^Path: *//p')
 mkdir -p "$bundle/Shared"; echo "shared words" > "$bundle/Shared/dictionary.txt"
 ctl "$installer" --root "$root" --json Command=26 Identifier=com.example.demo \
   SourcePath=Shared DestPath=Library/Shared
 echo "(a path that climbs out is refused with 11:)"
 ctl "$installer" --root "$root" Command=26 Identifier=com.example.demo SourcePath=Shared DestPath=../../x
 
-step "Test lock 0 freezes container operations until command 31 releases it (internal build)"
-ctl "$installer" --root "$root" Command=31 TestLock=0 Enable=true
-"$installer" --root "$root" Command=0 Identifier=com.example.frozen ContainerClass=2 \
-  CreateIfNecessary=true > "$root/tmp/frozen.out" &
+step "Test lock 0 freezes container operations until test-lock (command 31) releases it (internal build)"
+ctl "$installer" --root "$root" test-lock 0 on
+"$installer" --root "$root" create com.example.frozen > "$root/tmp/frozen.out" &
 frozen=$!
 sleep 0.5
 echo "after 0.5 s the creation has $( [ -s "$root/tmp/frozen.out" ] && echo answered || echo "not answered (frozen)")"
-ctl "$installer" --root "$root" Command=31 TestLock=0 Enable=false
+step "While it is frozen, the daemon's state (vessactl status: SIGUSR1, then run/vessad/state.json)"
+ctl "$build/vessactl" --root "$root" status
+ctl "$installer" --root "$root" test-lock 0 off
 wait $frozen || true
-echo "released; the creation answered:"; grep -o 'ReplyError[^,}]*' "$root/tmp/frozen.out" | head -1
+echo "released; the creation answered:"; sed 's/^/  /' "$root/tmp/frozen.out"
 
-step "Locking the device, then asking for protection class 1 with retry (command 21)"
-ctl "$installer" --root "$root" --json Command=21 Identifier=com.example.demo ContainerClass=2 \
-  DataProtectionClass:i64=3
+step "Locking the device, then asking for protection class 1 with retry (protect = command 21)"
+ctl "$installer" --root "$root" protect com.example.demo 3
 echo 1 > "$root/run/vessad/lockstate"; sleep 0.3
-"$installer" --root "$root" --json Command=21 Identifier=com.example.demo ContainerClass=2 \
-  DataProtectionClass:i64=1 RetryIfLocked=true > "$root/tmp/protect.out" &
+"$installer" --root "$root" --json protect com.example.demo 1 --retry > "$root/tmp/protect.out" &
 pending=$!
 sleep 0.5
 echo "pending update files while locked:"
@@ -157,14 +143,14 @@ echo "the reply, sent when the change finished after the unlock:"
 cat "$root/tmp/protect.out"
 grep -o 'lock_state_changed: LockState=[0-9]*' "$root/vessad.out"
 
-step "Deleting the container (command 10): it is staged on death row"
-ctl "$installer" --root "$root" Command=10 Identifier=com.example.demo ContainerClass=2
+step "Deleting the container (rm = command 10): it is staged on death row"
+ctl "$installer" --root "$root" rm com.example.demo
 deathrow="$root/private/var/root/Library/Caches/com.tamsk.vessad/Dead"
 ls -A "$deathrow" | sed 's/^/  death row: /'
-step "Emptying death row (command 4)"
-ctl "$installer" --root "$root" Command=4
+step "Emptying death row (deathrow empty = command 4)"
+ctl "$installer" --root "$root" deathrow empty
 echo "death row now holds $(ls -A "$deathrow" | wc -l) entries"
-ctl "$installer" --root "$root" Command=0 Identifier=com.example.demo ContainerClass=2
+ctl "$installer" --root "$root" lookup com.example.demo
 
 step "Notifications posted by the daemon"
 "$build/vessactl" --root "$root" notifications

@@ -11,9 +11,13 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <optional>
 #include <string>
 
+#include "VSACtlOutput.h"
+#include "VSACtlStatus.h"
 #include "VSACtlVerbs.h"
+#include "VSACtlWaitIndicator.h"
 #include "base/VSAJSON.h"
 #include "base/VSAPlist.h"
 #include "daemon/VSACommandTable.h"
@@ -59,6 +63,13 @@ const char* kCommandNames[kVSACommandCount] = {
     "set or clear a test lock (TestLock 0-6, 7 = all; Enable; internal builds)",
     "persona unique strings"};
 
+const char* kStatusHelp =
+    "usage: vessactl [--root DIR] [--timeout SEC] status [--json]\n"
+    "  the daemon's state: queues, open transactions, cache sizes, death row,\n"
+    "  pending protection changes, replace files, test locks, migration status,\n"
+    "  work under way, database size. Signals the daemon (SIGUSR1; run as root),\n"
+    "  which writes DIR/run/vessad/state.json and its log; --json prints that file\n";
+
 void usage(FILE* out) {
   std::fprintf(out,
                "usage: vessactl [options] VERB ARGUMENTS...\n"
@@ -70,6 +81,8 @@ void usage(FILE* out) {
                "verbs (vessactl VERB --help for one):\n");
   for (const auto& verb : VSACtlVerbs::all())
     std::fprintf(out, "  %-12s %-42s %s\n", verb.name, verb.arguments, verb.summary);
+  std::fprintf(out, "  %-12s %-42s %s\n", "status", "[--json]",
+               "the daemon's state (queues, cache, death row, ...)");
   std::fprintf(out,
                "  container classes by name: data, bundle, plugin, plugin-data, group, system,\n"
                "  system-group, ... or by number (1-13); data when not given\n"
@@ -187,22 +200,6 @@ std::optional<VSAValue> readRequestFile(const std::string& path) {
   return value;
 }
 
-// A reply for people: one "key: value" line per reply key, the UUID as text.
-void printForPeople(const VSAValue& reply) {
-  for (const auto& [key, value] : *reply.dictionaryValue()) {
-    if (key == "ReplyError") continue;
-    std::string name = key.rfind("Reply", 0) == 0 ? key.substr(5) : key;
-    std::string text;
-    if (key == "ReplyUUID" && value.uuidValue())
-      text = value.uuidValue()->string();
-    else if (value.isString())
-      text = *value.stringValue();
-    else
-      text = VSAJSON::print(value, false);
-    std::printf("%-22s %s\n", (name + ":").c_str(), text.c_str());
-  }
-}
-
 int printNotifications(const std::string& root) {
   VSANotificationCenter center{VSASystemRoot(root)};
   for (const std::string& name : center.postedNames()) std::printf("%s\n", name.c_str());
@@ -240,7 +237,18 @@ int main(int argc, char** argv) {
       return usage(stdout), 0;
     else if (a == "notifications")
       return printNotifications(root);
-    else if (const VSACtlVerb* verb = VSACtlVerbs::find(a)) {
+    else if (a == "status") {
+      if (i + 1 < argc &&
+          (std::string(argv[i + 1]) == "--help" || std::string(argv[i + 1]) == "-h"))
+        return std::printf("%s", kStatusHelp), 0;
+      if (i + 1 < argc && std::string(argv[i + 1]) == "--json")
+        json = true;
+      else if (i + 1 < argc)
+        return std::fprintf(stderr, "%s", kStatusHelp), 2;
+      return VSACtlStatus(root, socketPath.empty() ? VSASystemRoot(root).socketPath() : socketPath,
+                          timeout)
+          .run(json);
+    } else if (const VSACtlVerb* verb = VSACtlVerbs::find(a)) {
       std::vector<std::string> rest(argv + i + 1, argv + argc);
       for (const auto& r : rest)
         if (r == "--help" || r == "-h")
@@ -291,7 +299,16 @@ int main(int argc, char** argv) {
     std::fprintf(stderr, "vessactl: %s\n", error->localizedDescription().c_str());
     return 2;
   }
-  auto reply = client.sendRequest(request, std::chrono::seconds(timeout), &error);
+  std::optional<VSAValue> reply;
+  {
+    // Emptying death row and changing a protection class answer when done.
+    const VSAValue* command = request.get("Command");
+    uint64_t number = command ? command->uint64Value().value_or(0) : 0;
+    std::optional<VSACtlWaitIndicator> waiting;
+    if (number == 4 || number == 21)
+      waiting.emplace(number == 4 ? "emptying death row" : "changing the protection class");
+    reply = client.sendRequest(request, std::chrono::seconds(timeout), &error);
+  }
   if (!reply) {
     std::fprintf(stderr, "vessactl: %s\n", error->localizedDescription().c_str());
     return 2;
@@ -300,7 +317,7 @@ int main(int argc, char** argv) {
   const VSAValue* codeValue = reply->get("ReplyError");
   uint64_t code = codeValue ? codeValue->uint64Value().value_or(0) : 0;
   if (people) {
-    printForPeople(*reply);
+    std::fputs(VSACtlOutput::forPeople(*reply).c_str(), stdout);
   } else {
     std::string text = json ? VSAJSON::print(*reply) : reply->description();
     std::printf("%s\n", text.c_str());
