@@ -6,10 +6,10 @@
 #include "operations/VSAReplaceFile.h"
 
 namespace {
+// Absolute, more than "/", no NUL, no ".." component ("/p" is fine).
 bool clean(const std::string& path) {
-  if (path.empty() || path[0] != '/' || path.find('\0') != std::string::npos) return false;
-  return path.find("/../") == std::string::npos && path.size() >= 3 &&
-         path.compare(path.size() - 3, 3, "/..") != 0;
+  if (path.size() < 2 || path[0] != '/' || path.find('\0') != std::string::npos) return false;
+  return path.find("/../") == std::string::npos && path != "/.." && !path.ends_with("/..");
 }
 }  // namespace
 
