@@ -71,9 +71,13 @@ void VSARelayDispatcher::processRelayEvent(const VSAIPCMessageRef& message) {
   const VSAValue& request = message->body();
   uint64_t command = 0;
   bool haveCommand = readCommand(request, command);
-  uint64_t signpost = VSASignpostBegin(
-      VSALogCategory::Relay, "RelayEventProcessing",
-      VSAFormat(" command=%{public, signpost.description:attribute}llu ", command));
+  // Signposts are debug lines: their texts are not even formatted below that level.
+  bool signposts = VSALogger::enabled(kVSALogDebug);
+  uint64_t signpost =
+      signposts ? VSASignpostBegin(
+                      VSALogCategory::Relay, "RelayEventProcessing",
+                      VSAFormat(" command=%{public, signpost.description:attribute}llu ", command))
+                : 0;
   const VSACommandTableEntry* entry = haveCommand ? checkCommand(command) : nullptr;
   VSAClientIdentityRef identity;
   if (!entry) {
@@ -112,10 +116,11 @@ void VSARelayDispatcher::processRelayEvent(const VSAIPCMessageRef& message) {
     }
   }
   std::string client = identity ? identity->bundleIdentifier() : std::string("<unknown>");
-  VSASignpostEnd(VSALogCategory::Relay, "RelayEventProcessing", signpost,
-                 VSAFormat(" command=%{public, signpost.description:attribute}llu  "
-                           "clientIdentifier=%{private, signpost.description:attribute}@ ",
-                           command, client));
+  if (signposts)
+    VSASignpostEnd(VSALogCategory::Relay, "RelayEventProcessing", signpost,
+                   VSAFormat(" command=%{public, signpost.description:attribute}llu  "
+                             "clientIdentifier=%{private, signpost.description:attribute}@ ",
+                             command, client));
   VSALogIn(VSALogCategory::Relay, kVSALogNotice, kOrigin, "command=%llu, client=%@, error=%llu",
            command, client, result);
   if (result == VSAResult::kSuccess && (command == 4 || command == 21)) return;

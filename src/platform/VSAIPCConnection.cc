@@ -16,6 +16,7 @@ VSAIPCConnection::VSAIPCConnection(int fd, uint64_t identifier, VSAAuditToken au
       identifier_(identifier),
       auditToken_(auditToken),
       executable_(VSAPeerExecutable::ofProcess(auditToken)),
+      processDirectory_(VSAPeerExecutable::openProcessDirectory(auditToken)),
       maxPendingOutput_(maxPendingOutput) {
   // The entry is looked up once, for the file the peer ran when it connected.
   if (registry && executable_ && !executable_->path.empty())
@@ -25,7 +26,9 @@ VSAIPCConnection::VSAIPCConnection(int fd, uint64_t identifier, VSAAuditToken au
 VSAIPCConnection::~VSAIPCConnection() { ::close(fd_); }
 
 bool VSAIPCConnection::peerIsUnchanged() const {
-  return executable_ && executable_->isRunBy(auditToken_);
+  if (!executable_) return false;
+  return processDirectory_.get() >= 0 ? executable_->isRunByProcessAt(processDirectory_.get())
+                                      : executable_->isRunBy(auditToken_);
 }
 
 bool VSAIPCConnection::send(const VSAValue& message, VSAErrorRef* error) {

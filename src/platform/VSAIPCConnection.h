@@ -37,6 +37,7 @@
 #include "platform/VSAAuditToken.h"
 #include "platform/VSAClientRegistry.h"
 #include "platform/VSAPeerExecutable.h"
+#include "platform/VSAUniqueFd.h"
 
 // Bytes of replies a connection may have waiting for its peer to read them.
 inline constexpr size_t kVSADefaultMaxPendingOutput = 8u << 20;  // 8 MiB
@@ -97,6 +98,8 @@ class VSAIPCConnection {
   uint64_t identifier_;
   VSAAuditToken auditToken_;
   std::optional<VSAPeerExecutable> executable_;
+  // The peer process's /proc directory, opened at accept (-1 when it could not be).
+  VSAUniqueFd processDirectory_;
   std::optional<VSAClientRegistryEntry> registryEntry_;
   size_t maxPendingOutput_;
 

@@ -1,5 +1,6 @@
 #include "platform/VSAPeerExecutable.h"
 
+#include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -50,6 +51,25 @@ bool VSAPeerExecutable::isRunBy(const VSAAuditToken& token) const {
   if (st.st_dev != device || st.st_ino != inode) return false;
   // Checked after the stat, so the file examined surely belonged to this process.
   return token.isCurrent();
+}
+
+int VSAPeerExecutable::openProcessDirectory(const VSAAuditToken& token) {
+  if (token.pid <= 0) return -1;
+  char path[64];
+  std::snprintf(path, sizeof path, "/proc/%d", token.pid);
+  int fd = ::open(path, O_PATH | O_DIRECTORY | O_CLOEXEC);
+  // Checked after the open: the directory opened is surely the token's process.
+  if (fd >= 0 && !token.isCurrent()) {
+    ::close(fd);
+    return -1;
+  }
+  return fd;
+}
+
+bool VSAPeerExecutable::isRunByProcessAt(int processDirectory) const {
+  struct stat st;
+  return processDirectory >= 0 && ::fstatat(processDirectory, "exe", &st, 0) == 0 &&
+         st.st_dev == device && st.st_ino == inode;
 }
 
 std::string VSAPeerExecutable::description() const {

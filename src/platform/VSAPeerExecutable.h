@@ -28,5 +28,12 @@ struct VSAPeerExecutable {
   static std::optional<VSAPeerExecutable> ofProcess(const VSAAuditToken& token);
   // The process named by `token` is still alive and still runs this file.
   bool isRunBy(const VSAAuditToken& token) const;
+  // An open /proc/<pid> directory (O_PATH) of the process `token` names, or
+  // -1. It stands for that very process: once the process is gone, lookups
+  // through it fail even if its pid has been given to another.
+  static int openProcessDirectory(const VSAAuditToken& token);
+  // Like isRunBy(), for the process `processDirectory` stands for: one
+  // status call instead of re-reading the start time on every check.
+  bool isRunByProcessAt(int processDirectory) const;
   std::string description() const;
 };

@@ -1,5 +1,6 @@
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -16,7 +17,9 @@
 #include "platform/VSALockStateService.h"
 #include "platform/VSANamedSemaphore.h"
 #include "platform/VSANotificationCenter.h"
+#include "platform/VSAPeerExecutable.h"
 #include "platform/VSASystemRoot.h"
+#include "platform/VSAUniqueFd.h"
 
 namespace {
 
@@ -153,3 +156,39 @@ TEST_F(VSAPlatformRoot, NotificationsAndDeviceProperties) {
 }
 
 }  // namespace
+
+// The /proc directory opened at accept stands for the peer process: it says
+// "still runs the pinned file" while the process lives, and nothing after it
+// has been reaped (when its pid may already belong to another process).
+TEST(PeerExecutable, ProcessDirectorySeesThePeerOnlyWhileItLives) {
+  int ready[2];
+  ASSERT_EQ(::pipe(ready), 0);
+  pid_t child = ::fork();
+  if (child == 0) {
+    char c;
+    ::close(ready[1]);
+    ::read(ready[0], &c, 1);  // lives until the parent closes its end
+    ::_exit(0);
+  }
+  ::close(ready[0]);
+  VSAAuditToken token;
+  token.pid = child;
+  token.startTime = VSAAuditToken::processStartTime(child);
+  auto pinned = VSAPeerExecutable::ofProcess(token);
+  ASSERT_TRUE(pinned);
+  VSAUniqueFd directory(VSAPeerExecutable::openProcessDirectory(token));
+  ASSERT_GE(directory.get(), 0);
+  EXPECT_TRUE(pinned->isRunByProcessAt(directory.get()));
+  VSAPeerExecutable other = *pinned;
+  other.inode += 1;
+  EXPECT_FALSE(other.isRunByProcessAt(directory.get())) << "another file is not the pinned one";
+  ::close(ready[1]);
+  int status = 0;
+  ::waitpid(child, &status, 0);
+  EXPECT_FALSE(pinned->isRunByProcessAt(directory.get())) << "a reaped process runs nothing";
+  // A token whose start time is not its pid's names another process: no directory.
+  VSAAuditToken stale;
+  stale.pid = ::getpid();
+  stale.startTime = VSAAuditToken::processStartTime(stale.pid) + 1;
+  EXPECT_EQ(VSAPeerExecutable::openProcessDirectory(stale), -1);
+}
