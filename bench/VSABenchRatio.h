@@ -11,6 +11,8 @@
 #include <utility>
 #include <vector>
 
+#include "VSABenchTable.h"
+
 class VSARatioReporter : public benchmark::ConsoleReporter {
  public:
   void ReportRuns(const std::vector<Run>& runs) override {
@@ -31,6 +33,7 @@ struct VSARatio {
   const char* candidate;
   const char* baseline;
   double target;
+  const char* measure = nullptr;  // its name in bench/run-all's table (the candidate's if null)
 };
 
 inline int VSARunWithRatios(int argc, char** argv, const std::vector<VSARatio>& ratios) {
@@ -44,6 +47,7 @@ inline int VSARunWithRatios(int argc, char** argv, const std::vector<VSARatio>& 
     double ratio = b / c;
     std::printf("%-44s %-36s %7.2fx %7.2fx %s\n", r.candidate, r.baseline, ratio, r.target,
                 ratio >= r.target ? "ok" : "BELOW TARGET");
+    VSABenchRecord(r.measure ? r.measure : r.candidate, r.baseline, ratio, r.target);
   }
   return 0;
 }

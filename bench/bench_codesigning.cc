@@ -18,6 +18,7 @@
 #include <fstream>
 #include <map>
 
+#include "VSABenchTable.h"
 #include "base/VSALog.h"
 #include "base/VSAPlist.h"
 #include "codesigning/VSACodeSigningMapping.h"
@@ -185,8 +186,10 @@ int main(int argc, char** argv) {
       count, rawInsert, reg, rawSelect, look, found, seconds(t2, tPrepared));
   (void)rawFound;
   std::printf("\n%-34s %8s %8s\n", "measure", "ratio", "target");
-  std::printf("%-34s %7.2fx %7.2fx %s\n", "registration vs raw insert", rawInsert / reg, 0.3,
-              rawInsert / reg >= 0.3 ? "ok" : "BELOW TARGET");
+  std::printf("%-34s %7.2fx %7.2fx %s\n", "registration vs raw insert", rawInsert / reg, 0.8,
+              rawInsert / reg >= 0.8 ? "ok" : "BELOW TARGET");
+  VSABenchRecord("code-signing registration", "raw sqlite3 inserts", rawInsert / reg, 0.8);
+  VSABenchRecord("code-signing lookup", "raw sqlite3 selects", rawSelect / look, 0.3);
   std::printf("%-34s %7.2fx %7.2fx %s\n", "lookup vs raw select", rawSelect / look, 0.3,
               rawSelect / look >= 0.3 ? "ok" : "BELOW TARGET");
   std::printf("%-34s %7.2fx %7.2fx %s\n", "group-dropping reg. vs raw scan", rawScan / dropping,

@@ -12,6 +12,7 @@
 #include <fstream>
 #include <string>
 
+#include "VSABenchTable.h"
 #include "platform/VSAFileManager.h"
 #include "platform/VSALinuxFileSystem.h"
 
@@ -81,8 +82,10 @@ int main(int argc, char** argv) {
   std::printf("\n%-28s %8s %8s\n", "measure", "ratio", "target");
   std::printf("%-28s %7.2fx %7.2fx %s\n", "disk usage vs du -sb", du / ours, 0.8,
               du / ours >= 0.8 ? "ok" : "BELOW TARGET");
-  std::printf("%-28s %7.2fx %7.2fx %s\n", "removal vs rm -rf", rm / ourRemove, 0.9,
-              rm / ourRemove >= 0.9 ? "ok" : "BELOW TARGET");
+  std::printf("%-28s %7.2fx %7.2fx %s\n", "removal vs rm -rf", rm / ourRemove, 1.0,
+              rm / ourRemove >= 1.0 ? "ok" : "BELOW TARGET");
+  VSABenchRecord("disk usage of a tree", "du -sb", du / ours, 0.8);
+  VSABenchRecord("death-row removal of a tree", "rm -rf", rm / ourRemove, 1.0);
   run("rm -rf '" + base + "'");
   return 0;
 }

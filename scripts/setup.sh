@@ -6,7 +6,7 @@ set -euo pipefail
 packages=(
   build-essential cmake ninja-build pkg-config clang-14 libclang-rt-14-dev
   libsqlite3-dev libplist-dev libacl1-dev libspdlog-dev libfmt-dev libsystemd-dev
-  uuid-dev libssl-dev libgtest-dev libgmock-dev libbenchmark-dev acl e2fsprogs
+  uuid-dev libssl-dev libgtest-dev libgmock-dev libbenchmark-dev acl e2fsprogs time
 )
 
 missing=()

@@ -4,8 +4,10 @@
 #   scripts/test.sh address      an ASan+UBSan build in build-address/
 #   scripts/test.sh thread       a TSan build in build-thread/
 # The normal run first gives every fuzz target a few seconds (its own clang
-# build in build-fuzz/; VESSA_FUZZ_SMOKE=0 leaves that out) and builds and
-# checks the Debian package (scripts/package.sh).
+# build in build-fuzz/; VESSA_FUZZ_SMOKE=0 leaves that out), builds and
+# checks the Debian package (scripts/package.sh) and runs the benchmarks
+# once with small counts (bench/run-all --quick, which prints its table and
+# judges nothing; VESSA_BENCH_SMOKE=0 leaves it out).
 set -euo pipefail
 cd "$(dirname "$0")/.."
 scripts/setup.sh
@@ -20,5 +22,8 @@ if [[ -z "$flavour" && "${VESSA_FUZZ_SMOKE:-1}" != 0 ]]; then
   (unset BUILD_DIR CC CXX && scripts/fuzz.sh --smoke 3)
 fi
 [[ -n "$flavour" ]] || scripts/package.sh
+if [[ -z "$flavour" && "${VESSA_BENCH_SMOKE:-1}" != 0 ]]; then
+  bench/run-all --quick
+fi
 cd "${BUILD_DIR:-build}"
 ctest --output-on-failure --timeout 300 -j"$(nproc)"

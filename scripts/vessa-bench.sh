@@ -1,7 +1,7 @@
 #!/usr/bin/env bash
 # Runs vessa-bench against a fresh demo device: provisions a system root,
 # registers vessa-bench as a full client and as the kernel bridge, starts
-# vessad, runs the four scenarios and stops the daemon.
+# vessad, runs the five scenarios and stops the daemon.
 #   scripts/vessa-bench.sh [DIR]
 set -euo pipefail
 cd "$(dirname "$0")/.."
@@ -23,6 +23,9 @@ bench="$root/usr/bin/vessa-bench"
 echo "== Look-up of an existing container, one client"
 "$bench" --root "$root" --mode lookup --clients 1 --requests "${LOOKUPS:-20000}"
 echo
+echo "== Look-ups of an existing container, 16 clients"
+"$bench" --root "$root" --mode lookup --clients 16 --requests "$(( ${LOOKUPS:-20000} / 16 ))"
+echo
 echo "== Creation, one client"
 "$bench" --root "$root" --mode create --clients 1 --requests "${CREATES:-2000}"
 echo
@@ -31,4 +34,10 @@ echo "== Mixed requests, 16 clients"
 echo
 echo "== Kernel upcall: an app with a data and two group containers, one client"
 "$bench" --root "$root" --mode upcall --clients 1 --requests "${UPCALLS:-20000}"
+# The daemon's peak memory over the whole run (for bench/run-all's table).
+peak=$(sed -n 's/^VmHWM:[[:space:]]*\([0-9]*\) kB/\1/p' "/proc/$daemon/status")
+echo
+echo "vessad peak RSS over these runs: ${peak:-?} KiB"
+[[ -n "${VSA_BENCH_TABLE:-}" && -n "$peak" ]] &&
+  printf 'RSS\tvessad over the vessa-bench scenarios\t%s\n' "$peak" >>"$VSA_BENCH_TABLE"
 device_stop_daemon
