@@ -71,7 +71,7 @@ std::vector<VSAContainerCache::ClassMapSize> VSAContainerCache::classMapSizes() 
 VSAContainerCache::ClassMap* VSAContainerCache::_lock_getCache(const VSAUserIdentityRef& user,
                                                                VSAContainerClass c, bool transient,
                                                                bool populateSandbox, bool build,
-                                                               VSAErrorRef* error) {
+                                                               VSAErrorRef* error, bool* built) {
   std::string key = cacheKeyForUserIdentity(user, c);
   auto& maps = transient ? transient_ : live_;
   if (auto it = maps.find(key); it != maps.end()) return &it->second;
@@ -112,6 +112,7 @@ VSAContainerCache::ClassMap* VSAContainerCache::_lock_getCache(const VSAUserIden
                m->identifier(), c);
     map[m->identifier()] = std::move(m);
   }
+  if (built) *built = true;
   return &(maps[key] = std::move(map));
 }
 
@@ -191,12 +192,13 @@ VSAMetadataRef VSAContainerCache::containerForContainerIdentity(
   VSAContainerClass c = identity.containerClass();
   std::string key = cacheKeyForUserIdentity(user, c);
   VSAMetadataRef found;
+  bool built = false;  // read from disk by this very call: no need to look again
   {
     std::lock_guard lock(cacheLock_);
     ClassMap* map = _lock_getCache(user, c, transient, updateSandbox, false, nullptr);
     if (!map && allowKernelLookup && !transient) found = _lock_metadataFromSandbox(identity);
     if (!found) {
-      if (!map) map = _lock_getCache(user, c, transient, updateSandbox, true, nullptr);
+      if (!map) map = _lock_getCache(user, c, transient, updateSandbox, true, nullptr, &built);
       if (!map) {
         VSASetError(error, rebuildError(user, c, transient));
         return nullptr;
@@ -214,7 +216,7 @@ VSAMetadataRef VSAContainerCache::containerForContainerIdentity(
     }
   }
   auto copy = std::make_shared<VSAMetadata>(*found);
-  if (!checkFound(copy, key, transient, error)) return nullptr;
+  if (!built && !checkFound(copy, key, transient, error)) return nullptr;
   VSALogIn(VSALogCategory::Cache, kVSALogDebug, kOrigin, "Cache: %@%@: Found Identifier: %@", key,
            transientTag(transient), identity.identifier());
   return copy;
@@ -230,15 +232,18 @@ std::optional<std::vector<VSAMetadataRef>> VSAContainerCache::allContainersForUs
   }
   std::vector<VSAMetadataRef> entries;
   std::string key = cacheKeyForUserIdentity(user, c);
+  bool built = false;  // every entry was read from disk by this very call
   {
     std::lock_guard lock(cacheLock_);
-    ClassMap* map = _lock_getCache(user, c, transient, populateSandbox, true, error);
+    ClassMap* map = _lock_getCache(user, c, transient, populateSandbox, true, error, &built);
     if (!map) return std::nullopt;
+    entries.reserve(map->size());
     for (const auto& [id, m] : *map) entries.push_back(std::make_shared<VSAMetadata>(*m));
   }
   std::vector<VSAMetadataRef> out;
+  out.reserve(entries.size());
   for (auto& m : entries) {
-    if (!checkFound(m, key, transient, nullptr)) continue;
+    if (!built && !checkFound(m, key, transient, nullptr)) continue;
     VSALogIn(VSALogCategory::Cache, kVSALogDebug, kOrigin, "Cache: %@%@: ALL Found Identifier: %@",
              key, transientTag(transient), m->identifier());
     out.push_back(std::move(m));

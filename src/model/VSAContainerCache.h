@@ -88,8 +88,10 @@ class VSAContainerCache : public VSAUserIdentityCacheObserver,
  private:
   using ClassMap = std::map<std::string, VSAMetadataRef>;
   explicit VSAContainerCache(Dependencies deps) : deps_(std::move(deps)) {}
+  // `built` (if given) is set when the map was read from disk by this call.
   ClassMap* _lock_getCache(const VSAUserIdentityRef& user, VSAContainerClass c, bool transient,
-                           bool populateSandbox, bool build, VSAErrorRef* error);
+                           bool populateSandbox, bool build, VSAErrorRef* error,
+                           bool* built = nullptr);
   VSAMetadataRef _lock_metadataFromSandbox(const VSAContainerIdentity& identity);
   // The on-disk checks done outside the lock; false (and the entry dropped) when stale.
   bool checkFound(const VSAMetadataRef& m, const std::string& key, bool transient,
