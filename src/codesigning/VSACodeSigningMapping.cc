@@ -237,23 +237,47 @@ VSAResultCode VSACodeSigningMapping::_onQueue_setCodeSigningDictionaryValues(
   return VSAResult::kSuccess;
 }
 
+namespace {
+// Distinct callers remembered before the memory of recorded entitlements starts over.
+constexpr size_t kRecordedEntitlementsLimit = 4096;
+}  // namespace
+
 VSAResultCode VSACodeSigningMapping::processCallerRegisteredEntitlements(
     const VSAValue& entitlements, const std::string& identifier, VSACommandQueue* commandQueue) {
   return sync([&]() -> VSAResultCode {
-    VSAErrorRef error;
-    auto stored = _onQueue_entry(identifier, &error);
-    if (error) return error->resultCode(VSAResult::kDatabaseFailed);
-    if (stored) {
-      if (!stored->isRegisteredByCaller()) return VSAResult::kSuccess;  // a signature wins
-      const VSAValue* old = stored->codeSigningInfo().get(kVSAEntitlementsKey);
-      if (old && *old == entitlements) return VSAResult::kSuccess;
-      logMapping(kVSALogNotice, "%@ has changed entitlements. Re-registering.", identifier);
+    // Every request records its caller's entitlements; while the database
+    // has not changed since they were last found (or made) so, the answer
+    // is the same without reading the entry again.
+    auto known = recordedEntitlements_.find(identifier);
+    if (known != recordedEntitlements_.end() &&
+        known->second.changeCount == codeSigningMappingDB_->changeCount() &&
+        known->second.entitlements == entitlements)
+      return VSAResult::kSuccess;
+    VSAResultCode result =
+        _onQueue_recordCallerEntitlements(entitlements, identifier, commandQueue);
+    if (result == VSAResult::kSuccess) {
+      if (recordedEntitlements_.size() >= kRecordedEntitlementsLimit) recordedEntitlements_.clear();
+      recordedEntitlements_[identifier] = {codeSigningMappingDB_->changeCount(), entitlements};
     }
-    VSAValue info = VSAValue::Dictionary{{kVSAEntitlementsKey, entitlements}};
-    VSAValue options = VSAValue::Dictionary{{kVSAOptionRegByCaller, VSAValue(true)}};
-    return _onQueue_processCodeSigningInfo(
-        info, identifier, options, _onQueue_entitlementsForIdentifier(identifier), commandQueue);
+    return result;
   });
+}
+
+VSAResultCode VSACodeSigningMapping::_onQueue_recordCallerEntitlements(
+    const VSAValue& entitlements, const std::string& identifier, VSACommandQueue* commandQueue) {
+  VSAErrorRef error;
+  auto stored = _onQueue_entry(identifier, &error);
+  if (error) return error->resultCode(VSAResult::kDatabaseFailed);
+  if (stored) {
+    if (!stored->isRegisteredByCaller()) return VSAResult::kSuccess;  // a signature wins
+    const VSAValue* old = stored->codeSigningInfo().get(kVSAEntitlementsKey);
+    if (old && *old == entitlements) return VSAResult::kSuccess;
+    logMapping(kVSALogNotice, "%@ has changed entitlements. Re-registering.", identifier);
+  }
+  VSAValue info = VSAValue::Dictionary{{kVSAEntitlementsKey, entitlements}};
+  VSAValue options = VSAValue::Dictionary{{kVSAOptionRegByCaller, VSAValue(true)}};
+  return _onQueue_processCodeSigningInfo(
+      info, identifier, options, _onQueue_entitlementsForIdentifier(identifier), commandQueue);
 }
 
 std::optional<VSAValue> VSACodeSigningMapping::getCodeSigningInfoForIdentifier(

@@ -14,6 +14,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <unordered_map>
 #include <vector>
 
 #include "base/VSAValue.h"
@@ -131,6 +132,9 @@ class VSACodeSigningMapping {
       const std::vector<std::optional<VSACodeSigningEntry>>& values,
       const std::vector<std::string>& identifiers);
   // Reads an entry; "not found" is no entry and no error.
+  VSAResultCode _onQueue_recordCallerEntitlements(const VSAValue& entitlements,
+                                                  const std::string& identifier,
+                                                  VSACommandQueue* commandQueue);
   std::optional<VSACodeSigningEntry> _onQueue_entry(const std::string& identifier,
                                                     VSAErrorRef* error);
   std::optional<VSAValue> _onQueue_entitlementsForIdentifier(const std::string& identifier);
@@ -166,6 +170,14 @@ class VSACodeSigningMapping {
   VSAWorkQueue::Ref queue_;
   std::unique_ptr<VSASQLiteDB> codeSigningMappingDB_;
   std::shared_ptr<const VSAStageForDeleteEnvironment> stageEnvironment_;
+  // Callers' entitlements found recorded (or just recorded), with the
+  // database's change count at that moment: while nothing has been written
+  // since, the same entitlements need no second look. On the queue.
+  struct RecordedEntitlements {
+    uint64_t changeCount;
+    VSAValue entitlements;
+  };
+  std::unordered_map<std::string, RecordedEntitlements> recordedEntitlements_;
 };
 
 template <typename F>

@@ -247,8 +247,14 @@ std::optional<std::string> VSASQLiteDB::integrityCheck(VSAErrorRef* error) {
   return result;
 }
 
+uint64_t VSASQLiteDB::changeCount() const {
+  return changesOfClosedConnections_ +
+         (db_ ? static_cast<uint64_t>(sqlite3_total_changes64(db_)) : 0);
+}
+
 void VSASQLiteDB::closeDB() {
   if (!db_) return;
+  changesOfClosedConnections_ += static_cast<uint64_t>(sqlite3_total_changes64(db_)) + 1;
   VSALogIn(VSALogCategory::Database, kVSALogDebug, kOrigin, "closing %@", url_);
   finalizeCachedStatements();
   if (int rc = sqlite3_close(db_))

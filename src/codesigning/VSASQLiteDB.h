@@ -48,6 +48,10 @@ class VSASQLiteDB {
   static sqlite3* openDBWithURL(const std::string& path);
   void closeDB();
   const std::string& url() const { return url_; }
+  // Grows with every row this object's connections insert, update or
+  // delete (and when the database is closed): equal values mean nothing
+  // was written in between.
+  uint64_t changeCount() const;
 
   bool addCodeSigningEntry(const VSACodeSigningEntry* entry, const std::string* identifier,
                            VSAErrorRef* error);
@@ -96,5 +100,6 @@ class VSASQLiteDB {
 
   std::string url_;
   sqlite3* db_ = nullptr;
+  uint64_t changesOfClosedConnections_ = 0;
   std::map<std::string, sqlite3_stmt*, std::less<>> statements_;  // by SQL text
 };

@@ -227,6 +227,13 @@ TEST_F(Mapping, CallerRegisteredEntitlementsNeverOverwriteASignature) {
   ASSERT_EQ(reg("com.signed", info(e1), q), 1u);
   ASSERT_EQ(mapping_->processCallerRegisteredEntitlements(e2, "com.signed", &q), 1u);
   EXPECT_EQ(*mapping_->entitlementsForIdentifier("com.signed"), e1);
+  // The same entitlements again are not read again, but only while nothing
+  // was written: an entry removed meanwhile is recorded anew.
+  mapping_->removeCodeSigningDictionariesForIdentifierAndItsChildren("com.caller", &q);
+  ASSERT_FALSE(mapping_->identifierHasCallerRegisteredEntitlements("com.caller"));
+  ASSERT_EQ(mapping_->processCallerRegisteredEntitlements(e2, "com.caller", &q), 1u);
+  EXPECT_TRUE(mapping_->identifierHasCallerRegisteredEntitlements("com.caller"))
+      << "a change to the database ends the memory of what was recorded";
 }
 
 TEST_F(Mapping, LegacyMappingFileMovesIntoTheDatabaseOnce) {
