@@ -15,3 +15,13 @@ inline void VSABenchRecord(const char* measure, const char* baseline, double rat
     std::fclose(f);
   }
 }
+
+// A peak or current memory figure of the table's memory section, in KiB.
+inline void VSABenchRecordRSS(const char* what, long kib) {
+  const char* path = std::getenv("VSA_BENCH_TABLE");
+  if (!path || !*path) return;
+  if (FILE* f = std::fopen(path, "a")) {
+    std::fprintf(f, "RSS\t%s\t%ld\n", what, kib);
+    std::fclose(f);
+  }
+}

@@ -1,7 +1,7 @@
 #!/usr/bin/env bash
 # Runs vessa-bench against a fresh demo device: provisions a system root,
 # registers vessa-bench as a full client and as the kernel bridge, starts
-# vessad, runs the five scenarios and stops the daemon.
+# vessad, runs the six scenarios and stops the daemon.
 #   scripts/vessa-bench.sh [DIR]
 set -euo pipefail
 cd "$(dirname "$0")/.."
@@ -30,10 +30,15 @@ echo "== Creation, one client"
 "$bench" --root "$root" --mode create --clients 1 --requests "${CREATES:-2000}"
 echo
 echo "== Mixed requests, 16 clients"
-"$bench" --root "$root" --mode mixed --clients 16 --requests "${MIXED:-10000}"
+"$bench" --root "$root" --mode mixed --clients 16 --requests "${MIXED:-1000}"
 echo
 echo "== Kernel upcall: an app with a data and two group containers, one client"
 "$bench" --root "$root" --mode upcall --clients 1 --requests "${UPCALLS:-20000}"
+echo
+echo "== Memory: ${CONTAINERS:-10000} containers cached, 100 idle connections, look-up soak"
+"$bench" --root "$root" --mode memory --containers "${CONTAINERS:-10000}" --idle 100 \
+  --clients 16 --requests "$(( ${SOAK:-100000} / 16 ))" ||
+  echo "vessa-bench: the memory scenario had errors (see above)"
 # The daemon's peak memory over the whole run (for bench/run-all's table).
 peak=$(sed -n 's/^VmHWM:[[:space:]]*\([0-9]*\) kB/\1/p' "/proc/$daemon/status")
 echo

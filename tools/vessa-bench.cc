@@ -1,12 +1,16 @@
 // vessa-bench: a load generator for a running vessad.
 //
 // Every figure is printed beside a baseline measured in the same run:
-//  - request modes (lookup, mixed) first run the same clients against an echo
-//    server built from the daemon's own listener, socket and framing, then
-//    against the daemon, and print requests/s and p50/p99 latency as ratios;
+//  - the lookup mode first runs the same clients against an echo server built
+//    from the daemon's own listener, socket and framing, then against the
+//    daemon, and prints requests/s and p50/p99 latency as ratios;
 //  - the create mode compares container creation through the daemon with a
 //    raw loop doing the same directory work (staging directory,
-//    sub-directories, metadata file, rename) in the same root;
+//    sub-directories, metadata file with its fsync, rename) in the same root;
+//  - the mixed mode compares its clients' create, look-up, metadata, list and
+//    delete requests with one serial loop doing the same file work by hand;
+//  - the memory mode reports the daemon's RSS with many containers cached
+//    and idle connections open, and before and after a soak of look-ups;
 //  - the upcall mode launches one app (data container and two group
 //    containers, made by the first launch) over the upcall's seqpacket
 //    socket, against an echo server on the daemon's own upcall transport
@@ -14,6 +18,9 @@
 // The client must be registered in the root's client registry with the
 // "com.tamsk.private.Vessa.allowed" entitlement, and as the kernel bridge for
 // the upcall mode (scripts/vessa-bench.sh does both).
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -22,6 +29,7 @@
 #include <cstdio>
 #include <cstring>
 #include <filesystem>
+#include <fstream>
 #include <functional>
 #include <string>
 #include <thread>
@@ -48,6 +56,8 @@ struct Options {
   std::string mode = "lookup";
   int clients = 1;
   int requests = 10000;
+  int containers = 10000;  // memory mode: containers made and cached
+  int idle = 100;          // memory mode: connections left idle
 };
 
 struct Result {
@@ -235,51 +245,228 @@ VSAValue request(uint64_t command, const std::string& id, bool create = false) {
                               {"CreateIfNecessary", VSAValue(create)}};
 }
 
-// One container's directory work done by hand, as creation does it.
-double rawCreateLoop(const std::string& root, int count) {
-  VSALinuxFileSystem fs;
-  std::string base = root + "/private/var/mobile/bench-raw";
-  std::string staging = base + "/Staging", live = base + "/Live";
-  std::filesystem::create_directories(staging);
-  std::filesystem::create_directories(live);
-  const char* subdirs[] = {"Documents",           "Library",    "Library/Caches",
-                           "Library/Preferences", "SystemData", "tmp"};
-  auto start = Clock::now();
-  for (int i = 0; i < count; ++i) {
-    std::string name = VSAUUID::random().string();
-    std::string dir = staging + "/" + name;
-    fs.mkdir(dir, 0755);
-    fs.lchown(dir, 501, 501);
-    VSAValue metadata = VSAValue::Dictionary{{"VSAMetadataIdentifier", VSAValue("com.raw")},
+// Container directory work done by hand, in a scratch directory of the root:
+// what the daemon does on disk for each request, without its cache, IPC or
+// checks. It is the baseline of the create and mixed modes.
+class RawContainers {
+ public:
+  explicit RawContainers(const std::string& root)
+      : base_(root + "/private/var/mobile/bench-raw"),
+        staging_(base_ + "/Staging"),
+        live_(base_ + "/Live"),
+        trash_(base_ + "/Trash") {
+    for (const auto& d : {staging_, live_, trash_}) std::filesystem::create_directories(d);
+  }
+  ~RawContainers() { std::filesystem::remove_all(base_); }
+
+  // A new container as creation makes it: staging directory, metadata file
+  // (written, fsynced, renamed), sub-directories with owner, mode and class,
+  // and the rename into place.
+  void create(const std::string& name) {
+    std::string dir = staging_ + "/" + name;
+    fs_.mkdir(dir, 0755);
+    fs_.lchown(dir, 501, 501);
+    VSAValue metadata = VSAValue::Dictionary{{"VSAMetadataIdentifier", VSAValue(name)},
                                              {"VSAMetadataUUID", VSAValue(name)}};
     auto bytes = VSAPlist::serialize(metadata, VSAPlist::Format::Binary, nullptr);
-    fs.writeFile(dir + "/.tmp-metadata", *bytes, 0644);
-    fs.rename(dir + "/.tmp-metadata", dir + "/.metadata.plist");
-    for (const char* s : subdirs) {
+    fs_.writeFile(dir + "/.tmp-metadata", *bytes, 0644);
+    fs_.rename(dir + "/.tmp-metadata", dir + "/.metadata.plist");
+    for (const char* s :
+         {"Documents", "Library", "Library/Caches", "Library/Preferences", "SystemData", "tmp"}) {
       std::string sub = dir + "/" + s;
-      fs.mkdir(sub, 0755);
-      fs.lchown(sub, 501, 501);
-      fs.chmod(sub, 0755);
-      fs.setProtectionClass(sub, 0);
+      fs_.mkdir(sub, 0755);
+      fs_.lchown(sub, 501, 501);
+      fs_.chmod(sub, 0755);
+      fs_.setProtectionClass(sub, 0);
     }
-    fs.rename(dir, live + "/" + name);
+    fs_.rename(dir, live_ + "/" + name);
   }
-  double seconds = std::chrono::duration<double>(Clock::now() - start).count();
-  std::filesystem::remove_all(base);
-  return count / seconds;
+  // A look-up finds the container and checks that its metadata file is there.
+  bool exists(const std::string& name) {
+    struct stat st;
+    return fs_.lstat(live_ + "/" + name + "/.metadata.plist", &st) == 0;
+  }
+  // Reading a container's metadata: the file, parsed.
+  bool readMetadata(const std::string& name) {
+    return VSA_dictionaryWithContentsOfURL(live_ + "/" + name + "/.metadata.plist", 0, nullptr)
+        .has_value();
+  }
+  // Listing a class: every container's metadata, read and parsed.
+  size_t list() {
+    size_t n = 0;
+    for (const auto& e : std::filesystem::directory_iterator(live_))
+      n += readMetadata(e.path().filename().string());
+    return n;
+  }
+  // Deleting: the rename out of the class directory, then the removal of the
+  // tree (which the daemon does later, off the request).
+  void remove(const std::string& name) {
+    fs_.rename(live_ + "/" + name, trash_ + "/" + name);
+    std::filesystem::remove_all(trash_ + "/" + name);
+  }
+
+ private:
+  VSALinuxFileSystem fs_;
+  std::string base_, staging_, live_, trash_;
+};
+
+double rawCreateLoop(const std::string& root, int count) {
+  RawContainers raw(root);
+  auto start = Clock::now();
+  for (int i = 0; i < count; ++i) raw.create(VSAUUID::random().string());
+  return count / std::chrono::duration<double>(Clock::now() - start).count();
+}
+
+// The mixed mode's requests, all clients' in turn, done by hand on one thread.
+double rawMixedLoop(const std::string& root, const Options& o) {
+  RawContainers raw(root);
+  long done = 0;
+  auto start = Clock::now();
+  for (int i = 0; i < o.requests; ++i) {
+    for (int c = 0; c < o.clients; ++c, ++done) {
+      std::string name = "raw." + std::to_string(c) + "." + std::to_string(i / 5);
+      switch (i % 5) {
+        case 0:
+          raw.create(name);
+          break;
+        case 1:
+          raw.exists(name);
+          break;
+        case 2:
+          raw.readMetadata(name);
+          break;
+        case 3:
+          raw.list();
+          break;
+        default:
+          raw.remove(name);
+      }
+    }
+  }
+  return done / std::chrono::duration<double>(Clock::now() - start).count();
+}
+
+// The daemon's memory, in KiB: `field` of /proc/<pid>/status (VmRSS, VmHWM),
+// the pid taken from the root's pid file; -1 when either cannot be read.
+long daemonMemoryKiB(const std::string& root, const char* field = "VmRSS") {
+  std::ifstream pidFile(root + "/run/vessad/vessad.pid");
+  long pid = 0;
+  if (!(pidFile >> pid) || pid <= 0) return -1;
+  std::ifstream status("/proc/" + std::to_string(pid) + "/status");
+  std::string line, prefix = std::string(field) + ":";
+  while (std::getline(status, line))
+    if (line.rfind(prefix, 0) == 0) return std::atol(line.c_str() + prefix.size());
+  return -1;
+}
+
+// Idle connections from another user (the daemon admits a bounded number per
+// user): a child process that switches to `uid`, connects `count` times and
+// holds the sockets until the returned descriptor is closed. -1 on failure.
+int holdConnectionsAs(uid_t uid, const std::string& socket, int count) {
+  int ready[2], release[2];
+  if (pipe(ready) != 0 || pipe(release) != 0) return -1;
+  pid_t child = fork();
+  if (child == 0) {
+    close(ready[0]);
+    close(release[1]);
+    if (setresgid(uid, uid, uid) != 0 || setresuid(uid, uid, uid) != 0) _exit(1);
+    sockaddr_un addr{};
+    addr.sun_family = AF_UNIX;
+    std::snprintf(addr.sun_path, sizeof addr.sun_path, "%s", socket.c_str());
+    for (int i = 0; i < count; ++i) {
+      int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+      if (fd < 0 || ::connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) _exit(1);
+    }
+    char c = 1;
+    (void)!write(ready[1], &c, 1);
+    (void)!read(release[0], &c, 1);  // returns when the parent closes its end
+    _exit(0);
+  }
+  close(ready[1]);
+  close(release[0]);
+  char c = 0;
+  bool ok = child > 0 && read(ready[0], &c, 1) == 1;
+  close(ready[0]);
+  if (!ok) {
+    close(release[1]);
+    return -1;
+  }
+  return release[1];
+}
+
+// Memory with `o.containers` containers cached and `o.idle` idle connections,
+// then a soak of look-ups (o.clients x o.requests): the daemon's RSS before
+// and after it must not grow.
+int runMemory(const std::string& socket, const Options& o) {
+  Options make = o;
+  make.clients = 16;
+  make.requests = (o.containers + 15) / 16;
+  auto id = [](int n) { return "com.bench.memory." + std::to_string(n); };
+  Result made = runClients(
+      socket, make, [&](int c, int i) { return request(0, id(c * make.requests + i), true); },
+      true);
+  // A root client may hold only so many connections: the rest come from another user.
+  const int own = std::min(o.idle, 48);
+  std::vector<std::shared_ptr<VSAIPCClient>> idle;
+  for (int i = 0; i < own; ++i) {
+    auto client = std::make_shared<VSAIPCClient>();
+    VSAErrorRef error;
+    // One request each, as a client that looked something up and then went quiet.
+    if (client->connect(socket, &error) &&
+        client->sendRequest(request(0, id(i)), std::chrono::seconds(60), &error))
+      idle.push_back(client);
+  }
+  int held = o.idle > own ? holdConnectionsAs(501, socket, o.idle - own) : -1;
+  std::this_thread::sleep_for(std::chrono::milliseconds(500));  // let the daemon accept them
+  long cached = daemonMemoryKiB(o.root);
+  RequestMaker lookup = [&](int c, int i) { return request(0, id((c * 7919 + i) % o.containers)); };
+  Options warm = o;
+  warm.requests = std::max(1, o.requests / 10);
+  runClients(socket, warm, lookup, true);
+  long before = daemonMemoryKiB(o.root);
+  Result soak = runClients(socket, o, lookup, true);
+  long after = daemonMemoryKiB(o.root);
+  if (held >= 0) close(held);
+  std::printf(
+      "memory     %d containers made (%ld errors, %ld lost), %zu + %d idle connections\n"
+      "           vessad RSS with them cached: %ld KiB\n"
+      "soak       %zu look-ups at %.0f requests/s (%ld errors, %ld lost)\n"
+      "           vessad RSS before %ld KiB, after %ld KiB (%+.1f%%)\n",
+      o.containers, made.errors, made.lost, idle.size(), held >= 0 ? o.idle - own : 0, cached,
+      soak.latenciesUs.size(), soak.perSecond(), soak.errors, soak.lost, before, after,
+      before > 0 ? 100.0 * (after - before) / before : 0.0);
+  std::string what = "vessad, " + std::to_string(o.containers) + " containers cached, " +
+                     std::to_string(o.idle) + " idle connections";
+  VSABenchRecordRSS(what.c_str(), cached);
+  std::string soakWhat = "vessad after a soak of " + std::to_string(soak.latenciesUs.size()) +
+                         " look-ups (before: " + std::to_string(before) + " KiB)";
+  VSABenchRecordRSS(soakWhat.c_str(), after);
+  // Judged as before/after: 1.0 is no growth; the target allows 5%.
+  VSABenchRecord("RSS before / after the look-up soak", "no growth",
+                 after > 0 ? static_cast<double>(before) / after : 0, 0.95);
+  bool failed = made.lost || soak.errors || soak.lost || (held < 0 && o.idle > own);
+  if (failed) VSABenchRecord("memory scenario: errors or lost replies", "none", 0, 1);
+  return failed ? 1 : 0;
 }
 
 int usage() {
-  std::fprintf(stderr,
-               "usage: vessa-bench --root DIR [--mode lookup|create|mixed|upcall] [--clients N] "
-               "[--requests N]\n"
-               "  lookup: command 0 on one existing container (baseline: echo server)\n"
-               "  create: command 0 creating a new container per request (baseline: raw\n"
-               "          directory work in the same root)\n"
-               "  mixed:  look up, create, read metadata, list, delete (baseline: echo)\n"
-               "  upcall: the kernel's upcall for an app with a data and two group\n"
-               "          containers (baseline: echo on the same seqpacket transport)\n"
-               "  --requests counts requests per client (default 10000)\n");
+  std::fprintf(
+      stderr,
+      "usage: vessa-bench --root DIR [--mode lookup|create|mixed|upcall|memory] [--clients N] "
+      "[--requests N]\n"
+      "                   [--containers N] [--idle N]\n"
+      "  lookup: command 0 on one existing container (baseline: echo server)\n"
+      "  create: command 0 creating a new container per request (baseline: raw\n"
+      "          directory work in the same root)\n"
+      "  mixed:  create, look up, read metadata, list, delete (baseline: the same\n"
+      "          file work done by hand in one serial loop)\n"
+      "  upcall: the kernel's upcall for an app with a data and two group\n"
+      "          containers (baseline: echo on the same seqpacket transport)\n"
+      "  memory: makes --containers containers (default 10000), leaves --idle\n"
+      "          connections idle (default 100), prints the daemon's RSS, then\n"
+      "          its RSS before and after a soak of look-ups (the daemon's user:\n"
+      "          some idle connections come from uid 501)\n"
+      "  --requests counts requests per client (default 10000)\n");
   return 2;
 }
 }  // namespace
@@ -297,10 +484,14 @@ int main(int argc, char** argv) {
       o.clients = std::atoi(value().c_str());
     else if (a == "--requests")
       o.requests = std::atoi(value().c_str());
+    else if (a == "--containers")
+      o.containers = std::atoi(value().c_str());
+    else if (a == "--idle")
+      o.idle = std::atoi(value().c_str());
     else
       return usage();
   }
-  if (o.clients < 1 || o.requests < 1) return usage();
+  if (o.clients < 1 || o.requests < 1 || o.containers < 1 || o.idle < 0) return usage();
   std::string socket = o.root + "/run/vessad/com.tamsk.vessad";
   std::string pid = std::to_string(getpid());
   std::printf("vessa-bench: mode %s, %d client(s) x %d request(s)\n", o.mode.c_str(), o.clients,
@@ -381,11 +572,19 @@ int main(int argc, char** argv) {
           return request(10, id);
       }
     };
-    Result base = runEcho(o, make);
-    // Reported against the echo server only: a raw loop doing the same file
-    // work is the fair baseline, and it is not built yet.
-    printPair("mixed", base, runClients(socket, o, make, true), o, "socket echo (report only)", 0);
+    double raw = rawMixedLoop(o.root, o);
+    Result daemon = runClients(socket, o, make, true);
+    std::printf(
+        "mixed      raw serial loop %.0f requests/s, vessad %.0f requests/s (p50 %.1f us, p99 "
+        "%.1f us)\nratio: %.2fx\nerrors: %ld, lost replies: %ld\n",
+        raw, daemon.perSecond(), daemon.percentile(0.5), daemon.percentile(0.99),
+        daemon.perSecond() / raw, daemon.errors, daemon.lost);
+    std::string measure = "mixed, " + std::to_string(o.clients) + " clients";
+    VSABenchRecord(measure.c_str(), "raw serial loop, same mix", daemon.perSecond() / raw, 0.6);
+    if (daemon.errors || daemon.lost)
+      VSABenchRecord((measure + ": errors or lost replies").c_str(), "none", 0, 1);
     return 0;
   }
+  if (o.mode == "memory") return runMemory(socket, o);
   return usage();
 }
