@@ -45,9 +45,12 @@ class ThreadPool final : public VSAWorkQueueExecutor {
     if (jobs_.size() > static_cast<size_t>(idle_)) {
       ++threads_;
       std::thread([this] { worker(); }).detach();
-    } else {
-      cv_.notify_one();
+      return;
     }
+    // Woken after the unlock: a thread woken while the lock is still held
+    // would only block on it again (one more switch on every hand-off).
+    lock.unlock();
+    cv_.notify_one();
   }
 
  private:

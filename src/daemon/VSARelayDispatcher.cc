@@ -86,7 +86,8 @@ void VSARelayDispatcher::processRelayEvent(const VSAIPCMessageRef& message) {
     auto commandQueue = std::make_shared<VSACommandQueue>();
     const VSAAuditToken& token = message->connection()->auditToken();
     // While this request is served, the thread runs as the client's persona.
-    VSACurrentPersonaScope persona(token.pid, token.startTime);
+    VSACurrentPersonaScope persona(token.pid, token.startTime,
+                                   message->connection()->personaRecordMemo());
     identity = VSAClientIdentity::clientIdentityWithRelayConnection(*message->connection(),
                                                                     *context_.userIdentityCache);
     VSAGrants grants = VSADeriveGrants(*entry, identity.get());

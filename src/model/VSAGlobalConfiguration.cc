@@ -22,13 +22,32 @@ VSAGlobalConfiguration::VSAGlobalConfiguration(VSASystemRoot root,
 
 VSAGlobalConfiguration::~VSAGlobalConfiguration() = default;
 
+namespace {
+// Paths remembered as ensured (a few per user and class; bounded all the same).
+constexpr size_t kEnsuredDirectoriesLimit = 4096;
+}  // namespace
+
 std::string VSAGlobalConfiguration::ensureDirectory(const std::string& path, uid_t owner,
                                                     uint32_t protectionClass,
                                                     const char* failureFormat,
                                                     std::optional<gid_t> group) {
+  bool known;
+  {
+    std::lock_guard lock(ensuredMutex_);
+    known = ensured_.count(path) > 0;
+  }
+  if (known && fileManager_->directoryExistsAtURL(path)) return path;
   VSAErrorRef error;
-  if (!fileManager_->createDirectoryAtURL(path, true, 0755, owner, protectionClass, &error, group))
+  if (!fileManager_->createDirectoryAtURL(path, true, 0755, owner, protectionClass, &error,
+                                          group)) {
     VSALog(kVSALogError, "VSAGlobalConfiguration", failureFormat, path, error);
+    std::lock_guard lock(ensuredMutex_);
+    ensured_.erase(path);
+    return path;
+  }
+  std::lock_guard lock(ensuredMutex_);
+  if (ensured_.size() >= kEnsuredDirectoriesLimit) ensured_.clear();
+  ensured_.insert(path);
   return path;
 }
 

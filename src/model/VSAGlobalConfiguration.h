@@ -15,6 +15,7 @@
 #include <mutex>
 #include <optional>
 #include <string>
+#include <unordered_set>
 #include <vector>
 
 #include "model/VSAContainerClass.h"
@@ -76,7 +77,9 @@ class VSAGlobalConfiguration {
   // Creates `path` (mode 0755, parents too); logs `failureFormat` on failure.
   // A directory it makes goes to `owner` and `group` (default: the owner's
   // primary group). The path comes back either way: whatever acts on it next
-  // goes through the file system, which refuses a link in its way.
+  // goes through the file system, which refuses a link in its way. A path
+  // ensured before costs one status call while it is still a directory; one
+  // that went missing (or became anything else) is ensured again.
   std::string ensureDirectory(const std::string& path, uid_t owner, uint32_t protectionClass,
                               const char* failureFormat, std::optional<gid_t> group = {});
 
@@ -91,4 +94,6 @@ class VSAGlobalConfiguration {
   bool internalImage_ = false;
   std::mutex perUserMutex_;
   std::map<std::string, std::shared_ptr<VSAPerUserConfiguration>> perUser_;
+  std::mutex ensuredMutex_;
+  std::unordered_set<std::string> ensured_;  // paths ensured without an error
 };

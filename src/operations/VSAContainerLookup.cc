@@ -186,11 +186,13 @@ struct CreateSteps {
 VSAMetadataRef VSAContainerLookup::createOrLookupContainerWithContainerIdentity(
     const VSAContainerIdentityRef& identity, bool createIfNecessary, bool transient,
     bool useLocking, VSAResultCode* withError) {
-  VSALog(kVSALogDebug, kOrigin,
-         "createOrLookup; identity: %@, createIfNecessary: %d, transient: %d, allowOtherIdLookup: "
-         "%d, unrestricted: %d, clientBundleIdentifier: %@",
-         identity ? identity->description() : std::string("(null)"), createIfNecessary, transient,
-         grants_.allowOtherIdLookup, grants_.unrestricted, grants_.clientIdentifier);
+  // The identity's description is built only when the line is kept (every look-up passes here).
+  if (VSALogger::enabled(kVSALogDebug))
+    VSALog(kVSALogDebug, kOrigin,
+           "createOrLookup; identity: %@, createIfNecessary: %d, transient: %d, "
+           "allowOtherIdLookup: %d, unrestricted: %d, clientBundleIdentifier: %@",
+           identity ? identity->description() : std::string("(null)"), createIfNecessary, transient,
+           grants_.allowOtherIdLookup, grants_.unrestricted, grants_.clientIdentifier);
   if (!identity) {
     VSALog(kVSALogError, kOrigin, "Cannot lookup a nil container identity.");
     VSASetCode(withError, VSAResult::kOutOfRange);

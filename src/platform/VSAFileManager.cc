@@ -374,6 +374,11 @@ bool VSAFileManager::itemExistsAtURL(const std::string& path) {
   return rc == 0;
 }
 
+bool VSAFileManager::directoryExistsAtURL(const std::string& path) {
+  struct stat st;
+  return fs_->lstat(path, &st) == 0 && S_ISDIR(st.st_mode);
+}
+
 bool VSAFileManager::itemDoesNotExistAtURL(const std::string& path) {
   struct stat st;
   int rc = fs_->lstat(path, &st);

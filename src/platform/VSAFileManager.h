@@ -117,6 +117,8 @@ class VSAFileManager {
                                     VSAErrorRef* error);
 
   bool itemExistsAtURL(const std::string& path);
+  // A directory (not a link to one) is at `path`: one status call, no log.
+  bool directoryExistsAtURL(const std::string& path);
   bool itemDoesNotExistAtURL(const std::string& path);
   // Visible entries (names not starting with ".") of one directory.
   std::optional<std::vector<VSADirectoryItem>> urlsForItemsInDirectoryAtURL(const std::string& path,

@@ -37,6 +37,7 @@
 #include "platform/VSAAuditToken.h"
 #include "platform/VSAClientRegistry.h"
 #include "platform/VSAPeerExecutable.h"
+#include "platform/VSAPersonaService.h"
 #include "platform/VSAUniqueFd.h"
 
 // Bytes of replies a connection may have waiting for its peer to read them.
@@ -67,6 +68,8 @@ class VSAIPCConnection {
   const std::optional<VSAClientRegistryEntry>& registryEntry() const { return registryEntry_; }
   // The peer process is alive and still runs the executable pinned at accept.
   bool peerIsUnchanged() const;
+  // The peer's persona record, read by its first request (see VSACurrentPersonaScope).
+  VSAPersonaRecordMemo* personaRecordMemo() const { return &personaRecord_; }
   std::string description() const;
 
   // --- For the listener's I/O thread. ---
@@ -101,6 +104,7 @@ class VSAIPCConnection {
   // The peer process's /proc directory, opened at accept (-1 when it could not be).
   VSAUniqueFd processDirectory_;
   std::optional<VSAClientRegistryEntry> registryEntry_;
+  mutable VSAPersonaRecordMemo personaRecord_;
   size_t maxPendingOutput_;
 
   mutable std::mutex outMutex_;

@@ -14,6 +14,7 @@ namespace {
 constexpr size_t kVSAProcessRecordMaxSize = 64;
 
 thread_local std::optional<std::pair<pid_t, uint64_t>> tServedProcess;
+thread_local VSAPersonaRecordMemo* tServedMemo = nullptr;
 
 std::optional<VSAPersonaAttributes> parseRecord(const VSAValue& record, const VSASystemRoot& root) {
   auto bad = [&](const char* why) {
@@ -68,12 +69,29 @@ std::string VSAPersonaAttributes::description() const {
                    uniqueString ? *uniqueString : std::string("(none)"));
 }
 
-VSACurrentPersonaScope::VSACurrentPersonaScope(pid_t pid, uint64_t startTime)
-    : previous_(tServedProcess) {
-  tServedProcess = std::make_pair(pid, startTime);
+std::optional<uint32_t> VSAPersonaRecordMemo::get(
+    const std::function<std::optional<uint32_t>()>& read) {
+  std::lock_guard lock(mutex_);
+  if (!known_) {
+    persona_ = read();
+    known_ = true;
+  }
+  return persona_;
 }
 
-VSACurrentPersonaScope::~VSACurrentPersonaScope() { tServedProcess = previous_; }
+VSACurrentPersonaScope::VSACurrentPersonaScope(pid_t pid, uint64_t startTime,
+                                               VSAPersonaRecordMemo* memo)
+    : previous_(tServedProcess), previousMemo_(tServedMemo) {
+  tServedProcess = std::make_pair(pid, startTime);
+  tServedMemo = memo;
+}
+
+VSACurrentPersonaScope::~VSACurrentPersonaScope() {
+  tServedProcess = previous_;
+  tServedMemo = previousMemo_;
+}
+
+VSAPersonaRecordMemo* VSACurrentPersonaScope::currentMemo() { return tServedMemo; }
 
 std::optional<std::pair<pid_t, uint64_t>> VSACurrentPersonaScope::current() {
   return tServedProcess;
@@ -151,7 +169,9 @@ std::optional<VSAPersonaAttributes> VSALinuxPersonaService::currentPersona() {
   if (!served) return std::nullopt;
   auto personas = listPersonas();
   if (!personas) return std::nullopt;
-  auto recorded = recordedPersonaID(served->first, served->second);
+  auto read = [&] { return recordedPersonaID(served->first, served->second); };
+  VSAPersonaRecordMemo* memo = VSACurrentPersonaScope::currentMemo();
+  auto recorded = memo ? memo->get(read) : read();
   for (const VSAPersonaAttributes& a : *personas) {
     if (recorded ? a.personaID == *recorded : a.isPersonal()) return a;
   }

@@ -13,6 +13,7 @@
 
 #include <cstdint>
 #include <functional>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
@@ -47,19 +48,37 @@ class VSAPersonaService {
                                 std::function<void(VSAErrorRef)> completion) = 0;
 };
 
+// A process's persona record as one connection read it: a client's identity
+// is fixed when it connects, so its first request reads the record and later
+// requests on the same connection reuse the answer (a record that is absent
+// is remembered as absent). Thread-safe.
+class VSAPersonaRecordMemo {
+ public:
+  // The remembered answer, or `read()`'s, remembered.
+  std::optional<uint32_t> get(const std::function<std::optional<uint32_t>()>& read);
+
+ private:
+  std::mutex mutex_;
+  bool known_ = false;
+  std::optional<uint32_t> persona_;
+};
+
 // While alive, the calling thread serves the process `pid` (started at
 // `startTime`): the persona service answers that process's persona as the
-// thread's current persona. Scopes nest.
+// thread's current persona, through `memo` when one is given. Scopes nest.
 class VSACurrentPersonaScope {
  public:
-  VSACurrentPersonaScope(pid_t pid, uint64_t startTime);
+  VSACurrentPersonaScope(pid_t pid, uint64_t startTime, VSAPersonaRecordMemo* memo = nullptr);
   ~VSACurrentPersonaScope();
   VSACurrentPersonaScope(const VSACurrentPersonaScope&) = delete;
   VSACurrentPersonaScope& operator=(const VSACurrentPersonaScope&) = delete;
 
   // The process the calling thread serves, if any.
   static std::optional<std::pair<pid_t, uint64_t>> current();
+  // The memo of the connection the calling thread serves, if any.
+  static VSAPersonaRecordMemo* currentMemo();
 
  private:
   std::optional<std::pair<pid_t, uint64_t>> previous_;
+  VSAPersonaRecordMemo* previousMemo_;
 };

@@ -130,6 +130,36 @@ TEST_F(Layout, DirectoriesArePlacedOwnedAndRecreated) {
   EXPECT_TRUE(config_->migrationFileExistsWithName("marker"));
 }
 
+// A directory ensured once costs one status call later; whatever happens to
+// it behind the daemon's back (removed, replaced by a file or a link, a failed
+// creation) makes the next call ensure it again.
+TEST_F(Layout, EnsuredDirectoriesAreCheckedCheaplyAndRecreatedWhenGone) {
+  std::string staging = config_->stagingDirectory();
+  int mkdirs = faults_->callCount(Op::Mkdir), lstats = faults_->callCount(Op::Lstat);
+  EXPECT_EQ(config_->stagingDirectory(), staging);
+  EXPECT_EQ(faults_->callCount(Op::Mkdir), mkdirs) << "no creation attempt for a known directory";
+  EXPECT_EQ(faults_->callCount(Op::Lstat), lstats + 2) << "one status call for it and its parent";
+  fs::remove_all(staging);
+  config_->stagingDirectory();
+  EXPECT_TRUE(fs::is_directory(fs::symlink_status(staging))) << "removed: made again";
+  fs::remove(staging);
+  std::ofstream(staging) << "a file";
+  config_->stagingDirectory();
+  EXPECT_TRUE(fs::is_regular_file(fs::symlink_status(staging))) << "never replaced by force";
+  fs::remove(staging);
+  fs::create_directory_symlink(temp_.path() + "/etc", staging);
+  config_->stagingDirectory();
+  EXPECT_TRUE(fs::is_symlink(fs::symlink_status(staging))) << "a link is not taken for it";
+  fs::remove(staging);
+  // A creation that fails is not remembered: the next call tries again.
+  faults_->failAll(Op::Mkdir, EACCES);
+  config_->stagingDirectory();
+  EXPECT_FALSE(fs::exists(fs::symlink_status(staging)));
+  faults_->reset();
+  config_->stagingDirectory();
+  EXPECT_TRUE(fs::is_directory(fs::symlink_status(staging)));
+}
+
 TEST_F(Layout, MetadataRoundTripsAndIsNeverWrittenInPlace) {
   auto m = makeContainer(2, personal_);
   VSAValue raw = readPlist(m->url());

@@ -89,6 +89,42 @@ TEST_F(PersonaFiles, CurrentPersonaComesFromTheServedProcessRecord) {
   EXPECT_FALSE(VSACurrentPersonaScope::current());
 }
 
+// Served through a connection's memo, the record is read by the first
+// request only: the connection keeps the persona its client had when it was
+// first served, and a new connection reads the record again.
+TEST_F(PersonaFiles, ConnectionMemoReadsTheRecordOnce) {
+  write(
+      VSAValue::Dictionary{{"Personas", VSAValue::Array{record(1, "personal", VSAValue("P")),
+                                                        record(2, "enterprise", VSAValue("E"))}}});
+  VSALinuxPersonaService service{VSASystemRoot(root_)};
+  uint64_t start = VSAAuditToken::processStartTime(getpid());
+  VSAPersonaRecordMemo first;
+  {
+    VSACurrentPersonaScope scope(getpid(), start, &first);
+    EXPECT_EQ(service.currentPersona()->personaID, 1u) << "no record yet: personal";
+  }
+  std::ofstream(service.processRecordPath(getpid())) << start << " 2\n";
+  {
+    VSACurrentPersonaScope scope(getpid(), start, &first);
+    EXPECT_EQ(service.currentPersona()->personaID, 1u) << "the absent record is remembered";
+    EXPECT_EQ(VSACurrentPersonaScope::currentMemo(), &first);
+  }
+  VSAPersonaRecordMemo second;
+  {
+    VSACurrentPersonaScope scope(getpid(), start, &second);
+    EXPECT_EQ(service.currentPersona()->personaID, 2u) << "a new connection reads it";
+    std::filesystem::remove(service.processRecordPath(getpid()));
+    EXPECT_EQ(service.currentPersona()->personaID, 2u);
+    {
+      VSACurrentPersonaScope inner(getpid(), start);  // no memo: read every time
+      EXPECT_EQ(service.currentPersona()->personaID, 1u);
+      EXPECT_EQ(VSACurrentPersonaScope::currentMemo(), nullptr);
+    }
+    EXPECT_EQ(VSACurrentPersonaScope::currentMemo(), &second) << "scopes nest";
+  }
+  EXPECT_EQ(VSACurrentPersonaScope::currentMemo(), nullptr);
+}
+
 // The parsed list is kept between calls; every way of changing the file
 // (atomic replacement with a same-sized text, removal) is seen at once.
 TEST_F(PersonaFiles, KeptListFollowsEveryChangeOfTheFile) {
