@@ -11,6 +11,9 @@ device_prepare() {
   build=${BUILD_DIR:-build}
   root=${2:-$(mktemp -d "/tmp/$1-XXXXXX")}
   mkdir -p "$root"
+  # Like a device's /, the root is open to every user (mktemp makes it 0700):
+  # clients of any uid reach the daemon's socket through it.
+  chmod 0755 "$root"
   root=$(cd "$root" && pwd)
   scripts/provision-root.sh "$root" "$repo/$build/vessactl"
 }

@@ -245,6 +245,9 @@ VSAValue request(uint64_t command, const std::string& id, bool create = false) {
                               {"CreateIfNecessary", VSAValue(create)}};
 }
 
+// The name of a container's metadata file.
+constexpr const char* kMetadataName = ".com.tamsk.vessa_keeper.metadata.plist";
+
 // Container directory work done by hand, in a scratch directory of the root:
 // what the daemon does on disk for each request, without its cache, IPC or
 // checks. It is the baseline of the create and mixed modes.
@@ -270,7 +273,7 @@ class RawContainers {
                                              {"VSAMetadataUUID", VSAValue(name)}};
     auto bytes = VSAPlist::serialize(metadata, VSAPlist::Format::Binary, nullptr);
     fs_.writeFile(dir + "/.tmp-metadata", *bytes, 0644);
-    fs_.rename(dir + "/.tmp-metadata", dir + "/.metadata.plist");
+    fs_.rename(dir + "/.tmp-metadata", dir + "/" + kMetadataName);
     for (const char* s :
          {"Documents", "Library", "Library/Caches", "Library/Preferences", "SystemData", "tmp"}) {
       std::string sub = dir + "/" + s;
@@ -284,18 +287,22 @@ class RawContainers {
   // A look-up finds the container and checks that its metadata file is there.
   bool exists(const std::string& name) {
     struct stat st;
-    return fs_.lstat(live_ + "/" + name + "/.metadata.plist", &st) == 0;
+    return fs_.lstat(live_ + "/" + name + "/" + kMetadataName, &st) == 0;
   }
   // Reading a container's metadata: the file, parsed.
   bool readMetadata(const std::string& name) {
-    return VSA_dictionaryWithContentsOfURL(live_ + "/" + name + "/.metadata.plist", 0, nullptr)
+    return VSA_dictionaryWithContentsOfURL(live_ + "/" + name + "/" + kMetadataName, 0, nullptr)
         .has_value();
   }
-  // Listing a class: every container's metadata, read and parsed.
-  size_t list() {
+  // Listing a class: every container's metadata in `classDirectory` (the
+  // daemon's own class directory, so both list the same containers), read
+  // and parsed.
+  size_t list(const std::string& classDirectory) {
     size_t n = 0;
-    for (const auto& e : std::filesystem::directory_iterator(live_))
-      n += readMetadata(e.path().filename().string());
+    std::error_code ec;
+    for (const auto& e : std::filesystem::directory_iterator(classDirectory, ec))
+      n += VSA_dictionaryWithContentsOfURL(e.path().string() + "/" + kMetadataName, 0, nullptr)
+               .has_value();
     return n;
   }
   // Deleting: the rename out of the class directory, then the removal of the
@@ -336,7 +343,7 @@ double rawMixedLoop(const std::string& root, const Options& o) {
           raw.readMetadata(name);
           break;
         case 3:
-          raw.list();
+          raw.list(o.root + "/private/var/mobile/Containers/Data/Application");
           break;
         default:
           raw.remove(name);
@@ -417,6 +424,9 @@ int runMemory(const std::string& socket, const Options& o) {
       idle.push_back(client);
   }
   int held = o.idle > own ? holdConnectionsAs(501, socket, o.idle - own) : -1;
+  if (o.idle > own && held < 0)
+    std::fprintf(stderr, "vessa-bench: uid 501 could not hold %d connections (can it reach %s?)\n",
+                 o.idle - own, socket.c_str());
   std::this_thread::sleep_for(std::chrono::milliseconds(500));  // let the daemon accept them
   long cached = daemonMemoryKiB(o.root);
   RequestMaker lookup = [&](int c, int i) { return request(0, id((c * 7919 + i) % o.containers)); };
