@@ -3,7 +3,6 @@
 #include <pthread.h>
 
 #include <algorithm>
-#include <atomic>
 #include <cstdlib>
 #include <cstring>
 #include <set>
@@ -16,7 +15,9 @@ namespace {
 struct LockRecord {
   pthread_rwlock_t lock;
   uint64_t refCount;
-  std::atomic<int32_t> lockState;  // 0 free, -1 write, n > 0 readers
+  // 0 free, -1 write, n > 0 readers: a check on the per-key lock, changed
+  // only under the table's mutex so that it costs no locked instruction.
+  int32_t lockState;
   std::string key;
   uint64_t hash;
 };
@@ -123,9 +124,11 @@ struct LockTable {
   Condition identifierReaderCondition;
   LockMap* identifierToLockMap = nullptr;
   std::vector<LockRecord*> freeRecords;
+  // Kept apart: a compiler that tests two adjacent counters with one wide load
+  // right after storing one of them stalls on the store's forwarding.
   uint32_t identifierReaderCount = 0;
-  uint32_t identifierWriterCount = 0;
   int32_t allReaderWriterState = 0;
+  uint32_t identifierWriterCount = 0;
 };
 
 // Never destroyed: lock calls may come from threads still running at exit.
@@ -152,7 +155,45 @@ LockTable& gVSALocks = *new LockTable();
 
 const char* mode(bool writing) { return writing ? "writing" : "reading"; }
 
+// Records the grant of `record`'s lock in its shadow state. Called under the
+// table's mutex.
+void noteGranted(LockRecord* record, bool writing) {
+  if (writing) {
+    VSA_LOCK_ASSERT(record->lockState == 0);
+    record->lockState = -1;
+  } else {
+    VSA_LOCK_ASSERT(record->lockState >= 0);
+    ++record->lockState;
+  }
+}
+
+// The record for `key`, created (or taken from the reuse cache) when no
+// holder or waiter has it. Called under the table's mutex.
+LockRecord* recordForKey(const std::string& key) {
+  if (!gVSALocks.identifierToLockMap) gVSALocks.identifierToLockMap = new LockMap();
+  uint64_t hash = hashKey(key);
+  LockRecord* lockPtr = gVSALocks.identifierToLockMap->find(key, hash);
+  if (lockPtr) return lockPtr;
+  if (!gVSALocks.freeRecords.empty()) {
+    lockPtr = gVSALocks.freeRecords.back();
+    gVSALocks.freeRecords.pop_back();
+  } else {
+    lockPtr = new LockRecord;
+  }
+  // A recycled record gets a fresh lock: it now stands for another key (and
+  // lock-order checkers must see a new lock, not the old key's).
+  pthread_rwlock_init(&lockPtr->lock, nullptr);
+  lockPtr->refCount = 0;
+  lockPtr->lockState = 0;
+  lockPtr->key.assign(key);
+  lockPtr->hash = hash;
+  gVSALocks.identifierToLockMap->insert(lockPtr);
+  return lockPtr;
+}
+
 void take_one_lock(const std::string& key, bool writing) {
+  VSALogIn(VSALogCategory::Locking, kVSALogDebug, "take_one_lock", "Waiting to lock %@ for %s", key,
+           mode(writing));
   pthread_mutex_lock(&gVSALocks.mutex);
   if (writing) {
     while (gVSALocks.allReaderWriterState != 0)
@@ -163,37 +204,24 @@ void take_one_lock(const std::string& key, bool writing) {
       gVSALocks.identifierReaderCondition.wait(&gVSALocks.mutex);
     ++gVSALocks.identifierReaderCount;
   }
-  if (!gVSALocks.identifierToLockMap) gVSALocks.identifierToLockMap = new LockMap();
-  uint64_t hash = hashKey(key);
-  LockRecord* lockPtr = gVSALocks.identifierToLockMap->find(key, hash);
-  if (!lockPtr) {
-    if (!gVSALocks.freeRecords.empty()) {
-      lockPtr = gVSALocks.freeRecords.back();
-      gVSALocks.freeRecords.pop_back();
-    } else {
-      lockPtr = new LockRecord;
-    }
-    // A recycled record gets a fresh lock: it now stands for another key.
-    pthread_rwlock_init(&lockPtr->lock, nullptr);
-    lockPtr->refCount = 0;
-    lockPtr->lockState.store(0);
-    lockPtr->key.assign(key);
-    lockPtr->hash = hash;
-    gVSALocks.identifierToLockMap->insert(lockPtr);
-  }
+  LockRecord* lockPtr = recordForKey(key);
   ++lockPtr->refCount;
-  pthread_mutex_unlock(&gVSALocks.mutex);
-
-  VSALogIn(VSALogCategory::Locking, kVSALogDebug, "take_one_lock", "Waiting to lock %@ for %s", key,
-           mode(writing));
-  if (writing) {
-    pthread_rwlock_wrlock(&lockPtr->lock);
-    int32_t expected = 0;
-    VSA_LOCK_ASSERT(atomic_compare_exchange_strong(&lockPtr->lockState, &expected, -1));
-  } else {
-    pthread_rwlock_rdlock(&lockPtr->lock);
-    VSA_LOCK_ASSERT(atomic_fetch_add(&lockPtr->lockState, 1) >= 0);
+  // The key's lock is free (or shared with readers) most of the time: take it
+  // here without blocking. Otherwise wait for it outside the table's mutex and
+  // come back only to note the grant.
+  int taken =
+      writing ? pthread_rwlock_trywrlock(&lockPtr->lock) : pthread_rwlock_tryrdlock(&lockPtr->lock);
+  if (taken != 0) {
+    pthread_mutex_unlock(&gVSALocks.mutex);
+    if (writing) {
+      pthread_rwlock_wrlock(&lockPtr->lock);
+    } else {
+      pthread_rwlock_rdlock(&lockPtr->lock);
+    }
+    pthread_mutex_lock(&gVSALocks.mutex);
   }
+  noteGranted(lockPtr, writing);
+  pthread_mutex_unlock(&gVSALocks.mutex);
   VSALogIn(VSALogCategory::Locking, kVSALogDebug, "take_one_lock", "Got lock on identifier %@",
            key);
 }
@@ -208,16 +236,15 @@ void unlock_one_lock(const std::string& key) {
   VSA_LOCK_ASSERT(gVSALocks.identifierToLockMap);
   LockRecord* lockPtr = gVSALocks.identifierToLockMap->find(key, hashKey(key));
   VSA_LOCK_ASSERT(lockPtr);
-  VSA_LOCK_ASSERT(atomic_load(&lockPtr->lockState) != 0);
-  if (atomic_load(&lockPtr->lockState) != -1) {
-    VSA_LOCK_ASSERT(atomic_fetch_sub(&lockPtr->lockState, 1) > 0);
+  VSA_LOCK_ASSERT(lockPtr->lockState != 0);
+  if (lockPtr->lockState != -1) {
+    --lockPtr->lockState;
     VSA_LOCK_ASSERT(gVSALocks.allReaderWriterState >= 0);
     VSA_LOCK_ASSERT(gVSALocks.identifierReaderCount > 0);
     --gVSALocks.identifierReaderCount;
     if (allCountersZero()) gVSALocks.globalWriterCondition.signal();
   } else {
-    int32_t expected = -1;
-    VSA_LOCK_ASSERT(atomic_compare_exchange_strong(&lockPtr->lockState, &expected, 0));
+    lockPtr->lockState = 0;
     VSA_LOCK_ASSERT(gVSALocks.allReaderWriterState == 0);
     VSA_LOCK_ASSERT(gVSALocks.identifierWriterCount > 0);
     --gVSALocks.identifierWriterCount;
@@ -231,7 +258,7 @@ void unlock_one_lock(const std::string& key) {
   if (lockPtr->refCount == 0) {
     VSALogIn(VSALogCategory::Locking, kVSALogDebug, "unlock_one_lock",
              "Destroying lock for identifier %@", key);
-    VSA_LOCK_ASSERT(0 == atomic_load(&lockPtr->lockState));
+    VSA_LOCK_ASSERT(0 == lockPtr->lockState);
     gVSALocks.identifierToLockMap->erase(lockPtr);
     pthread_rwlock_destroy(&lockPtr->lock);
     if (gVSALocks.freeRecords.size() < kCachedRecords) {

@@ -8,9 +8,9 @@
 #include <thread>
 #include <vector>
 
+#include "base/VSALocks.h"
 #include "base/VSALog.h"
 #include "base/VSAUUID.h"
-#include "base/VSALocks.h"
 
 namespace {
 
@@ -203,6 +203,42 @@ TEST(VSALocks, WaitingGlobalWriterDoesNotHoldBackIdentifierTraffic) {
   unlock_identifier(VSAValue("A"));
   writer.join();
   EXPECT_TRUE(writerIn);
+}
+
+// Readers and writers crowding one key: most requests find the key's lock
+// free or shared and take it at once, the rest wait for it. Either way a
+// writer is alone and readers overlap only with readers.
+TEST(VSALocks, OneKeyUnderMixedTrafficKeepsWritersAlone) {
+  std::atomic<int> readers{0}, writers{0}, violations{0};
+  std::atomic<long> writes{0};
+  std::vector<std::thread> threads;
+  for (int t = 0; t < 6; ++t) {
+    threads.emplace_back([&, t] {
+      std::mt19937 rng(t + 100);
+      for (int i = 0; i < 3000; ++i) {
+        bool writing = rng() % 4 == 0;
+        VSAIdentifierLockGuard g(VSAValue("K"), writing);
+        if (writing) {
+          if (writers.fetch_add(1) != 0 || readers.load() != 0) ++violations;
+          ++writes;
+          if (i % 64 == 0) std::this_thread::yield();
+          writers.fetch_sub(1);
+        } else {
+          if (writers.load() != 0) ++violations;
+          readers.fetch_add(1);
+          if (i % 32 == 0) std::this_thread::yield();
+          readers.fetch_sub(1);
+        }
+      }
+    });
+  }
+  for (auto& th : threads) th.join();
+  EXPECT_EQ(violations.load(), 0);
+  EXPECT_GT(writes.load(), 0);
+  VSALockTableState s = VSALockTableSnapshot();
+  EXPECT_EQ(s.recordCount, 0u);
+  EXPECT_EQ(s.identifierReaderCount, 0u);
+  EXPECT_EQ(s.identifierWriterCount, 0u);
 }
 
 TEST(VSALocks, GuardsWithoutLockingTakeNothing) {
