@@ -56,10 +56,14 @@ std::string VSADirectoryName(std::string_view path) {
   return std::string(path.substr(0, slash));
 }
 
-std::string VSALastPathComponent(std::string_view path) {
+std::string_view VSALastPathComponentView(std::string_view path) {
   while (path.size() > 1 && path.back() == '/') path.remove_suffix(1);
   size_t slash = path.rfind('/');
-  return std::string(slash == std::string_view::npos ? path : path.substr(slash + 1));
+  return slash == std::string_view::npos ? path : path.substr(slash + 1);
+}
+
+std::string VSALastPathComponent(std::string_view path) {
+  return std::string(VSALastPathComponentView(path));
 }
 
 bool VSAIsSafeFileName(std::string_view name) {

@@ -22,6 +22,8 @@ std::string VSAPathJoin(std::string_view base, std::string_view component);
 
 // The last component of a path, ignoring trailing slashes ("/a/b/" gives "b").
 std::string VSALastPathComponent(std::string_view path);
+// The same, as a view into `path`.
+std::string_view VSALastPathComponentView(std::string_view path);
 
 // The path without its last component ("/a/b/" and "/a/b" give "/a"; "b" gives "").
 std::string VSADirectoryName(std::string_view path);

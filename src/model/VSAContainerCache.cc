@@ -48,9 +48,9 @@ std::string VSAContainerCache::cacheKeyForUserIdentity(const VSAUserIdentityRef&
 bool VSAContainerCache::containerURLIsValidForContainerClass(
     const std::string& url, VSAContainerClass c,
     const std::function<bool(const std::string&, VSAContainerClass)>& isWellknown) {
-  std::string name = VSALastPathComponent(url);
+  std::string_view name = VSALastPathComponentView(url);
   if (VSAUUID::parse(name)) return true;
-  return (c == 12 || c == 13) && isWellknown && isWellknown(name, c);
+  return (c == 12 || c == 13) && isWellknown && isWellknown(std::string(name), c);
 }
 
 bool VSAContainerCache::hasClassMap(const VSAUserIdentityRef& user, VSAContainerClass c,
@@ -90,6 +90,7 @@ VSAContainerCache::ClassMap* VSAContainerCache::_lock_getCache(const VSAUserIden
   auto items = config.fileManager().urlsForItemsInDirectoryAtURL(*dir, error);
   if (!items) return nullptr;
   ClassMap map;
+  map.reserve(items->size());
   for (const auto& item : *items) {
     if (!containerURLIsValidForContainerClass(item.path, c, deps_.isWellknown)) continue;
     VSAErrorRef readError;
@@ -113,7 +114,7 @@ VSAContainerCache::ClassMap* VSAContainerCache::_lock_getCache(const VSAUserIden
     map[m->identifier()] = std::move(m);
   }
   if (built) *built = true;
-  return &(maps[key] = std::move(map));
+  return &maps.insert_or_assign(key, std::move(map)).first->second;
 }
 
 VSAMetadataRef VSAContainerCache::_lock_metadataFromSandbox(const VSAContainerIdentity& identity) {

@@ -18,6 +18,7 @@
 #include <mutex>
 #include <optional>
 #include <string>
+#include <unordered_map>
 #include <vector>
 
 #include "model/VSAContainerIdentity.h"
@@ -86,7 +87,9 @@ class VSAContainerCache : public VSAUserIdentityCacheObserver,
   std::vector<ClassMapSize> classMapSizes();
 
  private:
-  using ClassMap = std::map<std::string, VSAMetadataRef>;
+  // Identifier -> metadata. Hashed: a sorted tree of 10,000 entries costs a
+  // cache miss per level on every insertion while the map is built.
+  using ClassMap = std::unordered_map<std::string, VSAMetadataRef>;
   explicit VSAContainerCache(Dependencies deps) : deps_(std::move(deps)) {}
   // `built` (if given) is set when the map was read from disk by this call.
   ClassMap* _lock_getCache(const VSAUserIdentityRef& user, VSAContainerClass c, bool transient,

@@ -18,10 +18,21 @@ constexpr const char* kInfoKey = "VSAMetadataInfo";
 constexpr const char* kAssetsKey = "VSAMetadataUserManagedAssetsDirName";
 constexpr const char* kVersionKey = "VSAMetadataVersion";
 
-std::string parentOf(const std::string& path) {
+std::string_view parentView(std::string_view path) {
   size_t slash = path.find_last_of('/');
-  if (slash == std::string::npos) return ".";
+  if (slash == std::string_view::npos) return ".";
   return slash == 0 ? "/" : path.substr(0, slash);
+}
+
+std::string parentOf(const std::string& path) { return std::string(parentView(path)); }
+
+// Whether `whole` is VSAPathJoin(base, component); the join is only built
+// when a slash at the seam makes the plain comparison unsure.
+bool isJoinOf(std::string_view whole, std::string_view base, std::string_view component) {
+  if (base.empty() || base.back() == '/' || component.empty() || component.front() == '/')
+    return whole == VSAPathJoin(base, component);
+  return whole.size() == base.size() + 1 + component.size() && whole.starts_with(base) &&
+         whole[base.size()] == '/' && whole.ends_with(component);
 }
 
 template <typename... A>
@@ -202,11 +213,11 @@ VSAMetadataRef VSAMetadata::readAndValidateMetadataAtFileUrl(
                    file);
   std::string container = parentOf(file);
   if (checkClassPath) {
-    std::string classDir = parentOf(container);
-    std::string expectedDir =
-        VSAPathJoin(parentOf(parentOf(classDir)), VSAContainerClassPathComponent(c));
-    if (classDir != expectedDir)
-      return invalid(error, bad, "Invalid metadata-URLs should match: %@ : %@", file, expectedDir);
+    std::string_view classDir = parentView(container);
+    std::string_view root = parentView(parentView(classDir));
+    if (!isJoinOf(classDir, root, VSAContainerClassPathComponent(c)))
+      return invalid(error, bad, "Invalid metadata-URLs should match: %@ : %@", file,
+                     VSAPathJoin(root, VSAContainerClassPathComponent(c)));
   }
   VSAResultCode code = VSAResult::kSuccess;
   auto identity = VSAConcreteContainerIdentity::containerIdentityWithUUID(

@@ -400,6 +400,7 @@ std::optional<std::vector<VSADirectoryItem>> VSAFileManager::urlsForItemsInDirec
     return std::nullopt;
   }
   std::vector<VSADirectoryItem> items;
+  items.reserve(entries.size());
   for (const auto& e : entries) {
     if (e.name.empty() || e.name[0] == '.') continue;
     items.push_back({VSAPathJoin(path, e.name), e.type == VSADirectoryEntry::Type::Directory});
