@@ -15,6 +15,9 @@
 //    containers, made by the first launch) over the upcall's seqpacket
 //    socket, against an echo server on the daemon's own upcall transport
 //    that sends the same packet and a memfd of the same bytes back.
+// The lookup, create and upcall modes run baseline and daemon in ten
+// alternating rounds and sum each side, so that both see the same drift in
+// the machine's latencies.
 // The client must be registered in the root's client registry with the
 // "com.tamsk.private.Vessa.allowed" entitlement, and as the kernel bridge for
 // the upcall mode (scripts/vessa-bench.sh does both).
@@ -107,6 +110,35 @@ Result runThreads(const Options& o, const std::function<ClientStep(int c)>& setU
     all.lost += p.lost;
   }
   return all;
+}
+
+// Adds `part`'s requests and time to `total`.
+void merge(Result& total, const Result& part) {
+  total.seconds += part.seconds;
+  total.latenciesUs.insert(total.latenciesUs.end(), part.latenciesUs.begin(),
+                           part.latenciesUs.end());
+  total.errors += part.errors;
+  total.lost += part.lost;
+}
+
+// A round's share of the run: `o` with o.requests split over kRounds.
+using RoundRunner = std::function<Result(const Options& round, int index)>;
+constexpr int kRounds = 10;
+
+// Runs the baseline and the daemon in alternating rounds and sums each side.
+// This machine's fsync and scheduling latencies drift over seconds: one long
+// run of each compared two different machines; alternating rounds give both
+// sides the same mix of quiet and busy moments.
+std::pair<Result, Result> alternate(const Options& o, const RoundRunner& base,
+                                    const RoundRunner& daemon) {
+  Options round = o;
+  round.requests = std::max(1, o.requests / kRounds);
+  Result b, d;
+  for (int k = 0; k < kRounds; ++k) {
+    merge(b, base(round, k));
+    merge(d, daemon(round, k));
+  }
+  return {b, d};
 }
 
 Result runClients(const std::string& socket, const Options& o, const RequestMaker& make,
@@ -317,11 +349,17 @@ class RawContainers {
   std::string base_, staging_, live_, trash_;
 };
 
-double rawCreateLoop(const std::string& root, int count) {
+Result rawCreateLoop(const std::string& root, int count) {
   RawContainers raw(root);
+  Result r;
   auto start = Clock::now();
-  for (int i = 0; i < count; ++i) raw.create(VSAUUID::random().string());
-  return count / std::chrono::duration<double>(Clock::now() - start).count();
+  for (int i = 0; i < count; ++i) {
+    auto one = Clock::now();
+    raw.create(VSAUUID::random().string());
+    r.latenciesUs.push_back(std::chrono::duration<double, std::micro>(Clock::now() - one).count());
+  }
+  r.seconds = std::chrono::duration<double>(Clock::now() - start).count();
+  return r;
 }
 
 // The mixed mode's requests, all clients' in turn, done by hand on one thread.
@@ -476,7 +514,8 @@ int usage() {
       "          connections idle (default 100), prints the daemon's RSS, then\n"
       "          its RSS before and after a soak of look-ups (the daemon's user:\n"
       "          some idle connections come from uid 501)\n"
-      "  --requests counts requests per client (default 10000)\n");
+      "  --requests counts requests per client (default 10000)\n"
+      "lookup, create and upcall alternate baseline and vessad in 10 rounds.\n");
   return 2;
 }
 }  // namespace
@@ -513,28 +552,34 @@ int main(int argc, char** argv) {
     runClients(
         socket, one, [&](int, int) { return request(0, "com.bench.lookup", true); }, true);
     RequestMaker make = [](int, int) { return request(0, "com.bench.lookup"); };
-    Result base = runEcho(o, make);
-    printPair("look-up", base, runClients(socket, o, make, true), o, "socket echo, same framing",
-              o.clients == 1 ? 0.8 : 0.5);
+    auto [base, daemon] = alternate(
+        o, [&](const Options& r, int) { return runEcho(r, make); },
+        [&](const Options& r, int) { return runClients(socket, r, make, true); });
+    printPair("look-up", base, daemon, o, "socket echo, same framing", o.clients == 1 ? 0.8 : 0.5);
     return 0;
   }
   if (o.mode == "create") {
-    double raw = rawCreateLoop(o.root, o.requests * o.clients);
-    Result daemon = runClients(
-        socket, o,
-        [&](int c, int i) {
-          return request(
-              0, "com.bench.create." + pid + "." + std::to_string(c) + "." + std::to_string(i),
+    auto [raw, daemon] = alternate(
+        o, [&](const Options& r, int) { return rawCreateLoop(o.root, r.requests * r.clients); },
+        [&](const Options& r, int k) {
+          return runClients(
+              socket, r,
+              [&, k](int c, int i) {
+                return request(0,
+                               "com.bench.create." + pid + "." + std::to_string(c) + "." +
+                                   std::to_string(k * r.requests + i),
+                               true);
+              },
               true);
-        },
-        true);
+        });
     std::printf(
-        "create     raw loop %.0f containers/s, vessad %.0f containers/s (p50 %.1f us, p99 "
-        "%.1f us)\nratio: %.2fx\nerrors: %ld, lost replies: %ld\n",
-        raw, daemon.perSecond(), daemon.percentile(0.5), daemon.percentile(0.99),
-        daemon.perSecond() / raw, daemon.errors, daemon.lost);
-    VSABenchRecord("creation, 1 client", "raw loop, same work and fsyncs", daemon.perSecond() / raw,
-                   0.8);
+        "create     raw loop %.0f containers/s (p50 %.1f us, p99 %.1f us), vessad %.0f "
+        "containers/s (p50 %.1f us, p99 %.1f us)\nratio: %.2fx\nerrors: %ld, lost replies: %ld\n",
+        raw.perSecond(), raw.percentile(0.5), raw.percentile(0.99), daemon.perSecond(),
+        daemon.percentile(0.5), daemon.percentile(0.99), daemon.perSecond() / raw.perSecond(),
+        daemon.errors, daemon.lost);
+    VSABenchRecord("creation, 1 client", "raw loop, same work and fsyncs",
+                   daemon.perSecond() / raw.perSecond(), 0.8);
     return 0;
   }
   if (o.mode == "upcall") {
@@ -559,8 +604,10 @@ int main(int argc, char** argv) {
       std::fprintf(stderr, "vessa-bench: the first upcall failed (is this a kernel bridge?)\n");
       return 1;
     }
-    Result base = runUpcallEcho(o);
-    printPair("upcall", base, runUpcalls(upcallSocket, o, true), o, "seqpacket+memfd echo", 0.7);
+    auto [base, daemon] = alternate(
+        o, [&](const Options& r, int) { return runUpcallEcho(r); },
+        [&](const Options& r, int) { return runUpcalls(upcallSocket, r, true); });
+    printPair("upcall", base, daemon, o, "seqpacket+memfd echo", 0.7);
     return 0;
   }
   if (o.mode == "mixed") {
