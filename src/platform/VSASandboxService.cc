@@ -153,11 +153,18 @@ int VSASandboxService::setUserStateItem(uid_t uid, uint64_t itemType, const std:
     std::lock_guard lock(mutex_);
     load(uid);
     auto& items = tables_[uid];
-    if (path)
-      items[{identifier, containerClass, personaID}] = {itemType, identifier, containerClass,
-                                                        personaID, *path};
-    else
-      items.erase({identifier, containerClass, personaID});
+    std::tuple<std::string, uint64_t, int32_t> key{identifier, containerClass, personaID};
+    auto it = items.find(key);
+    // Launches and look-ups push the same mapping again and again: only a
+    // change makes the table worth rewriting.
+    if (path) {
+      if (it != items.end() && it->second.itemType == itemType && it->second.path == *path)
+        return 0;
+      items[key] = {itemType, identifier, containerClass, personaID, *path};
+    } else {
+      if (it == items.end()) return 0;
+      items.erase(it);
+    }
     dirty_.insert(uid);
   }
   changed_.notify_one();

@@ -49,6 +49,36 @@ TEST(VSASandboxService, ContainerTableOutlivesTheService) {
   EXPECT_EQ(*VSASandboxItemTypeForClass(13), 9u);
 }
 
+// Launches push the same mappings over and over: only a change (a new path
+// or item type, an added or removed item) rewrites the table.
+TEST(VSASandboxService, OnlyChangesRewriteTheTable) {
+  VSATestTempDir temp("vessa-sandbox");
+  VSASandboxService sandbox{VSASystemRoot(temp.path())};
+  const std::string table = temp.path() + "/run/vessad/sandbox/501.plist";
+  ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app", 2, 1000, std::string("/c/A")), 0);
+  sandbox.flush();
+  ASSERT_TRUE(std::filesystem::exists(table));
+  // The file is removed behind the service's back: it comes back only when
+  // something changed.
+  std::filesystem::remove(table);
+  ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app", 2, 1000, std::string("/c/A")), 0);
+  ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.gone", 2, 1000, std::nullopt), 0);
+  sandbox.flush();
+  EXPECT_FALSE(std::filesystem::exists(table)) << "nothing changed";
+  ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app", 2, 1000, std::string("/c/B")), 0);
+  sandbox.flush();
+  EXPECT_TRUE(std::filesystem::exists(table)) << "a new path";
+  std::filesystem::remove(table);
+  ASSERT_EQ(sandbox.setUserStateItem(501, 4, "com.app", 2, 1000, std::string("/c/B")), 0);
+  sandbox.flush();
+  EXPECT_TRUE(std::filesystem::exists(table)) << "a new item type";
+  std::filesystem::remove(table);
+  ASSERT_EQ(sandbox.setUserStateItem(501, 4, "com.app", 2, 1000, std::nullopt), 0);
+  sandbox.flush();
+  ASSERT_TRUE(std::filesystem::exists(table)) << "a removal";
+  EXPECT_FALSE(sandbox.userStateItem(501, "com.app", 2, 1000));
+}
+
 // The writer thread persists changes on its own, without a flush or the
 // service going away, and a burst of changes ends in one consistent file.
 TEST(VSASandboxService, WriterThreadPersistsBurstsWithoutAFlush) {
