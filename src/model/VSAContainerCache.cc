@@ -193,11 +193,15 @@ VSAMetadataRef VSAContainerCache::containerForContainerIdentity(
   VSAContainerClass c = identity.containerClass();
   std::string key = cacheKeyForUserIdentity(user, c);
   VSAMetadataRef found;
-  bool built = false;  // read from disk by this very call: no need to look again
+  bool built = false;        // read from disk by this very call: no need to look again
+  bool fromSandbox = false;  // a fresh object of this call, shared with no map
   {
     std::lock_guard lock(cacheLock_);
     ClassMap* map = _lock_getCache(user, c, transient, updateSandbox, false, nullptr);
-    if (!map && allowKernelLookup && !transient) found = _lock_metadataFromSandbox(identity);
+    if (!map && allowKernelLookup && !transient) {
+      found = _lock_metadataFromSandbox(identity);
+      built = fromSandbox = found != nullptr;
+    }
     if (!found) {
       if (!map) map = _lock_getCache(user, c, transient, updateSandbox, true, nullptr, &built);
       if (!map) {
@@ -216,7 +220,7 @@ VSAMetadataRef VSAContainerCache::containerForContainerIdentity(
       found = it->second;
     }
   }
-  auto copy = std::make_shared<VSAMetadata>(*found);
+  auto copy = fromSandbox ? found : std::make_shared<VSAMetadata>(*found);
   if (!built && !checkFound(copy, key, transient, error)) return nullptr;
   VSALogIn(VSALogCategory::Cache, kVSALogDebug, kOrigin, "Cache: %@%@: Found Identifier: %@", key,
            transientTag(transient), identity.identifier());

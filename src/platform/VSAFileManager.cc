@@ -366,8 +366,7 @@ bool VSAFileManager::setDataProtectionClassOfItem(const VSAWalkItem& item, int p
 }
 
 bool VSAFileManager::itemExistsAtURL(const std::string& path) {
-  struct stat st;
-  int rc = fs_->lstat(path, &st);
+  int rc = fs_->exists(path);
   if (rc != 0 && rc != ENOENT)
     VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "Failed to determine if %@ exists: %s",
              path, std::strerror(rc));
@@ -380,8 +379,7 @@ bool VSAFileManager::directoryExistsAtURL(const std::string& path) {
 }
 
 bool VSAFileManager::itemDoesNotExistAtURL(const std::string& path) {
-  struct stat st;
-  int rc = fs_->lstat(path, &st);
+  int rc = fs_->exists(path);
   if (rc != 0 && rc != ENOENT)
     VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "Failed to determine if %@ exists: %s",
              path, std::strerror(rc));

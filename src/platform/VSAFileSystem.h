@@ -75,6 +75,12 @@ class VSAFileSystem {
   virtual ~VSAFileSystem() = default;
 
   virtual int lstat(const std::string& path, struct stat* st) = 0;
+  // 0 when `path` names an item (a link counts and is not followed), else
+  // the error lstat would give.
+  virtual int exists(const std::string& path) {
+    struct stat st;
+    return lstat(path, &st);
+  }
   virtual int mkdir(const std::string& path, mode_t mode) = 0;
   virtual int lchown(const std::string& path, uid_t uid, gid_t gid) = 0;
   // Changes the mode of a non-link item (links have no mode of their own).

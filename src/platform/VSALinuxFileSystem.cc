@@ -61,6 +61,18 @@ int VSALinuxFileSystem::lstat(const std::string& path, struct stat* st) {
   return atParent(path, [&](int dir, const std::string& name) { return statAt(dir, name, st); });
 }
 
+int VSALinuxFileSystem::exists(const std::string& path) {
+  std::string_view name = VSALastPathComponentView(path);
+  if (name.empty() || name == "." || name == ".." || path.back() == '/') {
+    struct stat st;
+    return lstat(path, &st);  // the same refusals and trailing-slash meaning as lstat
+  }
+  // O_PATH with O_NOFOLLOW opens a final link itself, as lstat reports it; a
+  // link before it fails the open as it fails the walk to the parent.
+  VSAUniqueFd fd;
+  return openNoSymlinks(path, O_PATH | O_NOFOLLOW, &fd);
+}
+
 int VSALinuxFileSystem::mkdir(const std::string& path, mode_t mode) {
   return atParent(path, [&](int dir, const std::string& name) { return mkdirAt(dir, name, mode); });
 }

@@ -1,8 +1,8 @@
 // Trees that their owner changes while root walks them: a directory swapped
 // for a link between the daemon's listing and its next step, links in the
 // middle of a path, trees deeper than any walk should follow.
-#include <gtest/gtest.h>
 #include <fcntl.h>
+#include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -139,6 +139,41 @@ TEST_F(HostileTree, NoCallGoesThroughALinkInTheMiddleOfAPath) {
   // The link itself, as the last name, is an entry: removed, not followed.
   EXPECT_TRUE(fm_->removeItemAtURL(root_ + "/Containers/Data", &error));
   EXPECT_TRUE(fs::exists(outside_ + "/secret"));
+}
+
+TEST_F(HostileTree, ExistenceAnswersAsLstatWithoutFollowingLinks) {
+  fs::create_symlink(outside_ + "/secret", container_ + "/final-link");
+  fs::create_symlink(root_ + "/nowhere", container_ + "/dangling-link");
+  fs::create_directory_symlink(outside_, container_ + "/dir-link");
+  mkfifo((container_ + "/fifo").c_str(), 0644);
+  VSALinuxFileSystem linux;
+  struct Case {
+    std::string path;
+    int expected;
+  };
+  std::vector<Case> cases = {
+      {container_ + "/dir/secret", 0},
+      {container_ + "/dir", 0},
+      {container_ + "/fifo", 0},  // opened as a path: never blocks
+      {container_ + "/final-link", 0},
+      {container_ + "/dangling-link", 0},
+      {container_ + "/dir-link/secret", ELOOP},  // what lies behind a link is not reached
+      {container_ + "/missing", ENOENT},
+      {container_ + "/missing/deeper", ENOENT},
+      {container_ + "/dir/secret/below-a-file", ENOTDIR},
+      {container_ + "/dir/", 0},
+      {container_ + "/dir/..", EINVAL},
+  };
+  for (const Case& c : cases) {
+    struct stat st;
+    EXPECT_EQ(linux.exists(c.path), c.expected) << c.path;
+    EXPECT_EQ(linux.lstat(c.path, &st), c.expected) << c.path << " (lstat)";
+  }
+  EXPECT_TRUE(fm_->itemExistsAtURL(container_ + "/dangling-link"));
+  EXPECT_FALSE(fm_->itemExistsAtURL(container_ + "/dir-link/secret"));
+  EXPECT_FALSE(fm_->itemDoesNotExistAtURL(container_ + "/dir-link/secret"))
+      << "a link in the way is not the same as an absent item";
+  EXPECT_TRUE(fm_->itemDoesNotExistAtURL(container_ + "/missing"));
 }
 
 TEST_F(HostileTree, SingleFileRemovalRefusesATree) {
