@@ -70,9 +70,7 @@ std::optional<VSACodeSigningEntry> VSACodeSigningMapping::_onQueue_entry(
   VSACheckOnQueue(*queue_, __func__);
   VSAErrorRef e;
   auto entry = codeSigningMappingDB_->codeSigningEntryWithIdentifier(identifier, &e);
-  if (!entry && e &&
-      !(e->domain() == kVSAErrorDomain &&
-        e->code() == static_cast<int64_t>(VSAResult::kNotFoundInDatabase))) {
+  if (!entry && e && !VSASQLiteDB::isNotFound(e)) {
     logMapping(kVSALogError, "Error retrieving entry from DB with identifier %@ : %@", identifier,
                e);
     VSASetError(error, e);
@@ -292,9 +290,14 @@ std::optional<VSAValue> VSACodeSigningMapping::getCodeSigningInfoForIdentifier(
 
 VSAContainerClass VSACodeSigningMapping::dataContainerTypeForIdentifier(
     const std::string& identifier) {
+  // Asked on every launch: only the class column is read.
   return sync([&]() -> VSAContainerClass {
-    auto entry = _onQueue_entry(identifier, nullptr);
-    return entry ? entry->dataContainerClass() : 0;
+    VSAErrorRef e;
+    auto c = codeSigningMappingDB_->dataContainerClassWithIdentifier(identifier, &e);
+    if (!c && e && !VSASQLiteDB::isNotFound(e))
+      logMapping(kVSALogError, "Error retrieving entry from DB with identifier %@ : %@", identifier,
+                 e);
+    return c.value_or(0);
   });
 }
 

@@ -37,6 +37,10 @@ constexpr const char* kSelectOne =
     "code_signing_info.registered_by_caller, code_signing_info.data_container_class FROM "
     "code_signing_info, code_signing_data WHERE code_signing_info.id = "
     "code_signing_data.cs_info_id AND code_signing_info.code_signing_id_text = ?;";
+constexpr const char* kSelectClass =
+    "SELECT code_signing_info.data_container_class FROM code_signing_info, code_signing_data "
+    "WHERE code_signing_info.id = code_signing_data.cs_info_id AND "
+    "code_signing_info.code_signing_id_text = ?;";
 constexpr const char* kEnumerateAll =
     "SELECT code_signing_data.data, code_signing_info.invalid, code_signing_info.placeholder, "
     "code_signing_info.registered_by_caller, code_signing_info.data_container_class, "
@@ -293,12 +297,10 @@ bool VSASQLiteDB::transaction(const std::function<bool(VSAErrorRef*)>& body, VSA
 
 // ---- Queries ----------------------------------------------------------------
 
-namespace {
-bool isNotFound(const VSAErrorRef& e) {
+bool VSASQLiteDB::isNotFound(const VSAErrorRef& e) {
   return e && e->domain() == kVSAErrorDomain &&
          e->code() == static_cast<int64_t>(VSAResult::kNotFoundInDatabase);
 }
-}  // namespace
 
 bool VSASQLiteDB::_performSingleParameterQuery(const char* sql, const std::string& input,
                                                int expectedChanges, VSAErrorRef* error) {
@@ -484,6 +486,21 @@ std::optional<VSACodeSigningEntry> VSASQLiteDB::codeSigningEntryWithIdentifier(
   }
   if (!entry || !fillChildren(*entry, identifier, error)) return std::nullopt;
   return entry;
+}
+
+std::optional<VSAContainerClass> VSASQLiteDB::dataContainerClassWithIdentifier(
+    const std::string& identifier, VSAErrorRef* error) {
+  Statement s(*this, kSelectClass, "select", error);
+  if (!s || !s.bindText(1, identifier, "code_signing_id_text", error)) return std::nullopt;
+  int rc = s.step(error);
+  if (rc == SQLITE_DONE) {
+    VSASetError(error,
+                dbError(VSAResult::kNotFoundInDatabase, "_selectCodeSigningEntryWithIdentifier",
+                        "Identifier: \"%@\" Not Found in DB", identifier));
+    return std::nullopt;
+  }
+  if (rc != SQLITE_ROW) return std::nullopt;
+  return static_cast<VSAContainerClass>(sqlite3_column_int64(s.get(), 0));
 }
 
 bool VSASQLiteDB::deleteCodeSigningEntryWithIdentifier(const std::string* identifier,

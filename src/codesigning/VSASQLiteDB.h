@@ -52,10 +52,16 @@ class VSASQLiteDB {
   // delete (and when the database is closed): equal values mean nothing
   // was written in between.
   uint64_t changeCount() const;
+  // Whether a query's error only says that the identifier has no entry.
+  static bool isNotFound(const VSAErrorRef& error);
 
   bool addCodeSigningEntry(const VSACodeSigningEntry* entry, const std::string* identifier,
                            VSAErrorRef* error);
   std::optional<VSACodeSigningEntry> codeSigningEntryWithIdentifier(const std::string& identifier,
+                                                                    VSAErrorRef* error);
+  // The stored data container class of an entry (one indexed select: no
+  // info to decode, no children to list); not found as the entry above.
+  std::optional<VSAContainerClass> dataContainerClassWithIdentifier(const std::string& identifier,
                                                                     VSAErrorRef* error);
   bool deleteCodeSigningEntryWithIdentifier(const std::string* identifier, VSAErrorRef* error);
   bool invalidateCodeSigningWithIdentifier(const std::string& identifier, VSAErrorRef* error);

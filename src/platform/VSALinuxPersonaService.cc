@@ -12,6 +12,8 @@ namespace {
 // 20 + 1 + 10 digits and a newline; anything longer was not written by the
 // launcher.
 constexpr size_t kVSAProcessRecordMaxSize = 64;
+// How long a watched, kept persona list is used without a look at the file.
+constexpr auto kTrustWithoutLooking = std::chrono::seconds(1);
 
 thread_local std::optional<std::pair<pid_t, uint64_t>> tServedProcess;
 thread_local VSAPersonaRecordMemo* tServedMemo = nullptr;
@@ -100,21 +102,39 @@ std::optional<std::pair<pid_t, uint64_t>> VSACurrentPersonaScope::current() {
 VSALinuxPersonaService::VSALinuxPersonaService(VSASystemRoot root) : root_(std::move(root)) {}
 
 std::optional<std::vector<VSAPersonaAttributes>> VSALinuxPersonaService::listPersonas() {
+  auto now = std::chrono::steady_clock::now();
+  uint64_t generation;
+  {
+    std::lock_guard lock(cacheMutex_);
+    if (watched_ && cachedStamp_ && now < trustedUntil_) return cachedPersonas_;
+    generation = changesHeard_;
+  }
   struct stat st;
   if (stat(personasPath().c_str(), &st) != 0) return readPersonas();  // missing or unreadable
   FileStamp stamp{static_cast<uint64_t>(st.st_dev), static_cast<uint64_t>(st.st_ino),
                   static_cast<uint64_t>(st.st_size), st.st_mtim.tv_sec, st.st_mtim.tv_nsec};
   {
     std::lock_guard lock(cacheMutex_);
-    if (cachedStamp_ == stamp) return cachedPersonas_;
+    if (cachedStamp_ == stamp) {
+      if (generation == changesHeard_) trustedUntil_ = now + kTrustWithoutLooking;
+      return cachedPersonas_;
+    }
   }
   auto personas = readPersonas();
   if (personas) {
     std::lock_guard lock(cacheMutex_);
     cachedStamp_ = stamp;
     cachedPersonas_ = *personas;
+    // A change heard while this file was read may be newer than what was read.
+    if (generation == changesHeard_) trustedUntil_ = now + kTrustWithoutLooking;
   }
   return personas;
+}
+
+void VSALinuxPersonaService::forgetTrust() {
+  std::lock_guard lock(cacheMutex_);
+  ++changesHeard_;
+  trustedUntil_ = {};
 }
 
 std::optional<std::vector<VSAPersonaAttributes>> VSALinuxPersonaService::readPersonas() {
@@ -181,15 +201,24 @@ std::optional<VSAPersonaAttributes> VSALinuxPersonaService::currentPersona() {
 void VSALinuxPersonaService::registerObserver(const std::string& serviceName,
                                               std::function<void()> onChange,
                                               std::function<void(VSAErrorRef)> completion) {
+  // The kept list is let go before the observer hears of the change, so that
+  // what it reads in answer is the new file.
   auto watcher = std::make_unique<VSAInotifyWatcher>(
       root_.resolve("/etc/vessad"), std::set<std::string>{"personas.plist"},
       VSAWorkQueue::create(serviceName),
-      [onChange = std::move(onChange)](const std::string&) { onChange(); });
+      [this, onChange = std::move(onChange)](const std::string&) {
+        forgetTrust();
+        onChange();
+      });
   VSAErrorRef error;
   bool ok = watcher->start(&error);
   if (ok) {
     std::lock_guard lock(watcherMutex_);
     watcher_ = std::move(watcher);
+    // The file may have changed before the watch began: look once more.
+    std::lock_guard cacheLock(cacheMutex_);
+    watched_ = true;
+    trustedUntil_ = {};
   }
   VSAWorkQueue::global()->async(
       [completion = std::move(completion), error, ok] { completion(ok ? nullptr : error); });

@@ -14,9 +14,14 @@
 // A process without a (current, root-owned) record runs in the personal
 // persona. Changes of personas.plist are watched with inotify. The parsed
 // list is kept while the file's identity (device, inode, size, modification
-// time) stays the same, so a request costs one stat, not a parse. Thread-safe.
+// time) stays the same, so a request costs at most one stat, not a parse.
+// While an observer's watch is up, not even the stat: the kept list is
+// trusted until the watch reports a change of the file, and for at most a
+// second (a watch that lost its directory to a rename reports nothing more).
+// Thread-safe.
 #pragma once
 
+#include <chrono>
 #include <memory>
 #include <mutex>
 
@@ -49,11 +54,16 @@ class VSALinuxPersonaService : public VSAPersonaService {
     bool operator==(const FileStamp&) const = default;
   };
   std::optional<std::vector<VSAPersonaAttributes>> readPersonas();
+  // Makes the next listPersonas() look at the file again.
+  void forgetTrust();
 
   VSASystemRoot root_;
   std::mutex cacheMutex_;
   std::optional<FileStamp> cachedStamp_;
   std::vector<VSAPersonaAttributes> cachedPersonas_;
+  bool watched_ = false;  // a watch is up: the kept list may be trusted until...
+  std::chrono::steady_clock::time_point trustedUntil_;  // ...this moment
+  uint64_t changesHeard_ = 0;  // a look begun before a change does not renew trust
   std::mutex watcherMutex_;
   std::unique_ptr<VSAInotifyWatcher> watcher_;
 };

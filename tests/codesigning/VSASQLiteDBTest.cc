@@ -87,6 +87,28 @@ TEST_F(CodeSigningDB, NotFoundAndNoChildren) {
   EXPECT_EQ(error->code(), 67);
 }
 
+// The class alone, as launches ask for it, answers as the whole entry does.
+TEST_F(CodeSigningDB, ClassAloneAgreesWithTheEntry) {
+  VSAErrorRef error;
+  EXPECT_FALSE(db_->dataContainerClassWithIdentifier("none", &error));
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code(), 67);
+  EXPECT_TRUE(VSASQLiteDB::isNotFound(error));
+  ASSERT_TRUE(add(entry("A", {"com.p.child"}), "com.p"));
+  EXPECT_EQ(db_->dataContainerClassWithIdentifier("com.p", &error), 2u);
+  auto plugin = entry("A");
+  plugin.setDataContainerClass(4);
+  ASSERT_TRUE(add(plugin, "com.p"));
+  EXPECT_EQ(db_->dataContainerClassWithIdentifier("com.p", &error), 4u);
+  EXPECT_EQ(db_->codeSigningEntryWithIdentifier("com.p", &error)->dataContainerClass(), 4u);
+  EXPECT_FALSE(db_->dataContainerClassWithIdentifier("com.p.child", &error))
+      << "a child link is not an entry of its own";
+  std::string id = "com.p";
+  ASSERT_TRUE(db_->deleteCodeSigningEntryWithIdentifier(&id, &error));
+  EXPECT_FALSE(db_->dataContainerClassWithIdentifier("com.p", &error));
+  EXPECT_TRUE(VSASQLiteDB::isNotFound(error));
+}
+
 TEST_F(CodeSigningDB, DeletingAParentCascadesLinksNotChildren) {
   ASSERT_TRUE(add(entry("A", {"com.p.child"}), "com.p"));
   ASSERT_TRUE(add(entry("C"), "com.p.child"));

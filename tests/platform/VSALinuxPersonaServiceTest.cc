@@ -202,4 +202,40 @@ TEST_F(PersonaFiles, ObserverHearsFileChanges) {
   EXPECT_GE(changes.load(), 1);
 }
 
+// With a watch up the kept list is used without looking at the file; a
+// change reaches the observer only after the list was let go, and a watch
+// that lost its directory still lets a change through within seconds.
+TEST_F(PersonaFiles, WatchedListIsNeverOlderThanWhatTheObserverHeard) {
+  VSALinuxPersonaService service{VSASystemRoot(root_)};
+  write(VSAValue::Array{record(1, "personal", VSAValue("P"))});
+  std::atomic<int> changes{0};
+  std::promise<bool> started;
+  service.registerObserver(
+      "test.personawatch", [&] { ++changes; }, [&](VSAErrorRef e) { started.set_value(!e); });
+  ASSERT_TRUE(started.get_future().get());
+  ASSERT_EQ(service.listPersonas()->size(), 1u);
+  for (uint64_t id = 2; id <= 4; ++id) {
+    int before = changes;
+    write(VSAValue::Array{record(1, "personal", VSAValue("P")),
+                          record(id, "enterprise", VSAValue("E"))});
+    for (int i = 0; i < 400 && changes == before; ++i) std::this_thread::sleep_for(5ms);
+    ASSERT_GT(changes.load(), before) << "the watch reported nothing";
+    auto list = service.listPersonas();
+    ASSERT_TRUE(list && list->size() == 2u);
+    EXPECT_EQ(list->at(1).personaID, id) << "the observer heard of a change the list missed";
+  }
+  // The watched directory is moved away and a new one takes its place.
+  std::filesystem::rename(root_ + "/etc/vessad", root_ + "/etc/vessad.old");
+  std::filesystem::create_directories(root_ + "/etc/vessad");
+  write(VSAValue::Array{record(9, "personal", VSAValue("P9"))});
+  std::optional<std::vector<VSAPersonaAttributes>> list;
+  for (int i = 0; i < 600; ++i) {
+    list = service.listPersonas();
+    if (list && list->front().personaID == 9u) break;
+    std::this_thread::sleep_for(5ms);
+  }
+  ASSERT_TRUE(list);
+  EXPECT_EQ(list->front().personaID, 9u) << "a lost watch must not keep the old list for ever";
+}
+
 }  // namespace
