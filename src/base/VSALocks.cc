@@ -20,6 +20,10 @@ struct LockRecord {
   int32_t lockState;
   std::string key;
   uint64_t hash;
+  // Links in the table's list of idle records (refCount 0), oldest first.
+  bool idle;
+  LockRecord* idlePrev;
+  LockRecord* idleNext;
 };
 
 // Keys are mostly 36-character UUID strings: hash them eight bytes at a time
@@ -44,7 +48,7 @@ uint64_t hashKey(std::string_view s) {
 // The key -> record map: open addressing with linear probing and
 // backward-shift deletion, each record carrying its hash, so that one lock
 // or unlock hashes its key once and allocates nothing in steady state. It
-// holds exactly the keys in use.
+// holds the keys in use and the table's idle records.
 class LockMap {
  public:
   LockMap() : slots_(16, nullptr) {}
@@ -95,8 +99,11 @@ class LockMap {
   size_t size_ = 0;
 };
 
-// Records whose last holder left go to a small cache for reuse.
-constexpr size_t kCachedRecords = 64;
+// A record whose last holder left stays in the map, idle, so that a key
+// locked again soon (the usual pattern: look-up after look-up of one
+// container) finds its record and lock ready. Beyond this many idle records
+// the oldest is destroyed.
+constexpr size_t kIdleRecords = 64;
 
 // A condition variable that knows whether anybody waits, so that the many
 // wake-ups the protocol asks for cost nothing when nobody does.
@@ -123,12 +130,16 @@ struct LockTable {
   Condition identifierWriterCondition;
   Condition identifierReaderCondition;
   LockMap* identifierToLockMap = nullptr;
-  std::vector<LockRecord*> freeRecords;
-  // Kept apart: a compiler that tests two adjacent counters with one wide load
-  // right after storing one of them stalls on the store's forwarding.
-  uint32_t identifierReaderCount = 0;
-  int32_t allReaderWriterState = 0;
-  uint32_t identifierWriterCount = 0;
+  size_t recordsInUse = 0;  // records with holders or waiters
+  size_t idleCount = 0;
+  LockRecord* idleOldest = nullptr;
+  LockRecord* idleNewest = nullptr;
+  // Each in its own eight bytes: a compiler tests adjacent counters with one
+  // wide load, and that load, right after a store to one of them, stalls
+  // until the store has left the store buffer.
+  alignas(8) uint32_t identifierReaderCount = 0;
+  alignas(8) int32_t allReaderWriterState = 0;
+  alignas(8) uint32_t identifierWriterCount = 0;
 };
 
 // Never destroyed: lock calls may come from threads still running at exit.
@@ -167,27 +178,58 @@ void noteGranted(LockRecord* record, bool writing) {
   }
 }
 
-// The record for `key`, created (or taken from the reuse cache) when no
-// holder or waiter has it. Called under the table's mutex.
+// Idle list upkeep, under the table's mutex.
+void unlinkIdle(LockRecord* r) {
+  (r->idlePrev ? r->idlePrev->idleNext : gVSALocks.idleOldest) = r->idleNext;
+  (r->idleNext ? r->idleNext->idlePrev : gVSALocks.idleNewest) = r->idlePrev;
+  r->idle = false;
+  --gVSALocks.idleCount;
+}
+
+void linkIdle(LockRecord* r) {
+  r->idle = true;
+  r->idleNext = nullptr;
+  r->idlePrev = gVSALocks.idleNewest;
+  (gVSALocks.idleNewest ? gVSALocks.idleNewest->idleNext : gVSALocks.idleOldest) = r;
+  gVSALocks.idleNewest = r;
+  ++gVSALocks.idleCount;
+}
+
+// Destroys the oldest idle records beyond the kept number. A record is only
+// ever reused for its own key, so a key's lock is one lock object for its
+// whole life (which is what lock-order checkers expect).
+void trimIdle() {
+  while (gVSALocks.idleCount > kIdleRecords) {
+    LockRecord* r = gVSALocks.idleOldest;
+    unlinkIdle(r);
+    gVSALocks.identifierToLockMap->erase(r);
+    pthread_rwlock_destroy(&r->lock);
+    delete r;
+  }
+}
+
+// The record for `key`: found in use or idle, or created. Called under the
+// table's mutex.
 LockRecord* recordForKey(const std::string& key) {
   if (!gVSALocks.identifierToLockMap) gVSALocks.identifierToLockMap = new LockMap();
   uint64_t hash = hashKey(key);
   LockRecord* lockPtr = gVSALocks.identifierToLockMap->find(key, hash);
-  if (lockPtr) return lockPtr;
-  if (!gVSALocks.freeRecords.empty()) {
-    lockPtr = gVSALocks.freeRecords.back();
-    gVSALocks.freeRecords.pop_back();
-  } else {
-    lockPtr = new LockRecord;
+  if (lockPtr) {
+    if (lockPtr->idle) {
+      unlinkIdle(lockPtr);
+      ++gVSALocks.recordsInUse;
+    }
+    return lockPtr;
   }
-  // A recycled record gets a fresh lock: it now stands for another key (and
-  // lock-order checkers must see a new lock, not the old key's).
+  lockPtr = new LockRecord;
   pthread_rwlock_init(&lockPtr->lock, nullptr);
   lockPtr->refCount = 0;
   lockPtr->lockState = 0;
   lockPtr->key.assign(key);
   lockPtr->hash = hash;
+  lockPtr->idle = false;
   gVSALocks.identifierToLockMap->insert(lockPtr);
+  ++gVSALocks.recordsInUse;
   return lockPtr;
 }
 
@@ -259,13 +301,11 @@ void unlock_one_lock(const std::string& key) {
     VSALogIn(VSALogCategory::Locking, kVSALogDebug, "unlock_one_lock",
              "Destroying lock for identifier %@", key);
     VSA_LOCK_ASSERT(0 == lockPtr->lockState);
-    gVSALocks.identifierToLockMap->erase(lockPtr);
-    pthread_rwlock_destroy(&lockPtr->lock);
-    if (gVSALocks.freeRecords.size() < kCachedRecords) {
-      gVSALocks.freeRecords.push_back(lockPtr);
-    } else {
-      delete lockPtr;
-    }
+    // Nobody holds or waits for the key: its record goes idle (and the
+    // oldest idle one is destroyed when there are too many).
+    --gVSALocks.recordsInUse;
+    linkIdle(lockPtr);
+    trimIdle();
   }
   pthread_mutex_unlock(&gVSALocks.mutex);
 }
@@ -345,9 +385,9 @@ void unlock_all_identifiers() {
 
 VSALockTableState VSALockTableSnapshot() {
   pthread_mutex_lock(&gVSALocks.mutex);
-  VSALockTableState s{gVSALocks.identifierToLockMap ? gVSALocks.identifierToLockMap->size() : 0,
-                      gVSALocks.identifierReaderCount, gVSALocks.identifierWriterCount,
-                      gVSALocks.allReaderWriterState};
+  VSALockTableState s{gVSALocks.recordsInUse, gVSALocks.identifierReaderCount,
+                      gVSALocks.identifierWriterCount, gVSALocks.allReaderWriterState,
+                      gVSALocks.idleCount};
   pthread_mutex_unlock(&gVSALocks.mutex);
   return s;
 }

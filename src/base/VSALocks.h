@@ -38,10 +38,11 @@ void unlock_all_identifiers();
 
 // Introspection for tests and diagnostics.
 struct VSALockTableState {
-  size_t recordCount;
+  size_t recordCount;  // keys held or waited for
   uint32_t identifierReaderCount;
   uint32_t identifierWriterCount;
   int32_t allReaderWriterState;
+  size_t idleRecords;  // records of released keys kept for their next use
 };
 VSALockTableState VSALockTableSnapshot();
 

@@ -296,4 +296,34 @@ TEST(VSALocks, ManyKeysSurviveGrowthAndScrambledRelease) {
   EXPECT_EQ(VSALockTableSnapshot().identifierWriterCount, 0u);
 }
 
+// Released keys keep their records for the next use, a bounded number of
+// them; a key whose record was kept, or destroyed, must lock as before.
+TEST(VSALocks, KeptRecordsAreBoundedAndStillExclude) {
+  std::vector<std::string> keys;
+  for (int i = 0; i < 200; ++i) keys.push_back(VSAUUID::random().string());
+  for (auto& k : keys) {
+    lock_identifier_read(VSAValue(k));
+    unlock_identifier(VSAValue(k));
+  }
+  VSALockTableState s = VSALockTableSnapshot();
+  EXPECT_EQ(s.recordCount, 0u);
+  EXPECT_GT(s.idleRecords, 0u);
+  EXPECT_LE(s.idleRecords, 64u);
+  // keys[0] was destroyed long ago, keys[199] is kept: both exclude a writer
+  // while a reader holds them, and both let it in afterwards.
+  for (const std::string& k : {keys.front(), keys.back()}) {
+    VSAValue key(k);
+    lock_identifier_read(key);
+    EXPECT_EQ(VSALockTableSnapshot().recordCount, 1u);
+    auto fut = std::async(std::launch::async, [key] { VSAIdentifierLockGuard g(key, true); });
+    EXPECT_EQ(fut.wait_for(30ms), std::future_status::timeout) << k;
+    unlock_identifier(key);
+    fut.get();
+  }
+  s = VSALockTableSnapshot();
+  EXPECT_EQ(s.recordCount, 0u);
+  EXPECT_EQ(s.identifierReaderCount + s.identifierWriterCount, 0u);
+  EXPECT_LE(s.idleRecords, 64u);
+}
+
 }  // namespace
