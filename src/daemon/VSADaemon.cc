@@ -15,10 +15,11 @@
 #include "platform/VSANamedSemaphore.h"
 #include "platform/VSAServiceManager.h"
 
-#ifndef VESSA_BUILD_DATE
+// The start-up line reports when this file was compiled. A time stamped at
+// configure would change on every configure and rebuild and relink every
+// binary each time a script runs the build.
 #define VESSA_BUILD_DATE __DATE__
 #define VESSA_BUILD_TIME __TIME__
-#endif
 
 VSADaemon::VSADaemon(Options options)
     : options_(std::move(options)),

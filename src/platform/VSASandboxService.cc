@@ -149,6 +149,7 @@ int VSASandboxService::setUserStateItem(uid_t uid, uint64_t itemType, const std:
                                         uint64_t containerClass, int32_t personaID,
                                         const std::optional<std::string>& path) {
   if (identifier.empty()) return EINVAL;
+  bool wake = false;
   {
     std::lock_guard lock(mutex_);
     load(uid);
@@ -165,9 +166,12 @@ int VSASandboxService::setUserStateItem(uid_t uid, uint64_t itemType, const std:
       if (it == items.end()) return 0;
       items.erase(it);
     }
+    // The writer is woken by the first change only: while it gathers, more
+    // changes join the same write without a wake-up (a context switch) each.
+    wake = dirty_.empty();
     dirty_.insert(uid);
   }
-  changed_.notify_one();
+  if (wake) changed_.notify_one();
   return 0;
 }
 
