@@ -280,13 +280,14 @@ VSAValue request(uint64_t command, const std::string& id, bool create = false) {
 // The name of a container's metadata file.
 constexpr const char* kMetadataName = ".com.tamsk.vessa_keeper.metadata.plist";
 
-// Container directory work done by hand, in a scratch directory of the root:
+// Container directory work done by hand, in a scratch directory beside the
+// daemon's own (so that the file system places both sides' inodes alike):
 // what the daemon does on disk for each request, without its cache, IPC or
 // checks. It is the baseline of the create and mixed modes.
 class RawContainers {
  public:
   explicit RawContainers(const std::string& root)
-      : base_(root + "/private/var/mobile/bench-raw"),
+      : base_(root + "/private/var/mobile/Containers/bench-raw"),
         staging_(base_ + "/Staging"),
         live_(base_ + "/Live"),
         trash_(base_ + "/Trash") {
@@ -349,8 +350,10 @@ class RawContainers {
   std::string base_, staging_, live_, trash_;
 };
 
-Result rawCreateLoop(const std::string& root, int count) {
-  RawContainers raw(root);
+// `raw` lives for the whole run: the daemon's containers stay on disk, so the
+// raw loop's stay too, and their removal does not land in the next daemon
+// round (freeing a round's inodes made the next allocations scan past them).
+Result rawCreateLoop(RawContainers& raw, int count) {
   Result r;
   auto start = Clock::now();
   for (int i = 0; i < count; ++i) {
@@ -559,8 +562,9 @@ int main(int argc, char** argv) {
     return 0;
   }
   if (o.mode == "create") {
+    RawContainers containers(o.root);
     auto [raw, daemon] = alternate(
-        o, [&](const Options& r, int) { return rawCreateLoop(o.root, r.requests * r.clients); },
+        o, [&](const Options& r, int) { return rawCreateLoop(containers, r.requests * r.clients); },
         [&](const Options& r, int k) {
           return runClients(
               socket, r,
