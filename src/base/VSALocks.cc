@@ -20,8 +20,9 @@ struct LockRecord {
   int32_t lockState;
   std::string key;
   uint64_t hash;
-  // Links in the table's list of idle records (refCount 0), oldest first.
-  bool idle;
+  // Links in the table's list of idle records (those in the map with
+  // refCount 0: a caller counts itself in right after finding its record),
+  // oldest first.
   LockRecord* idlePrev;
   LockRecord* idleNext;
 };
@@ -182,12 +183,10 @@ void noteGranted(LockRecord* record, bool writing) {
 void unlinkIdle(LockRecord* r) {
   (r->idlePrev ? r->idlePrev->idleNext : gVSALocks.idleOldest) = r->idleNext;
   (r->idleNext ? r->idleNext->idlePrev : gVSALocks.idleNewest) = r->idlePrev;
-  r->idle = false;
   --gVSALocks.idleCount;
 }
 
 void linkIdle(LockRecord* r) {
-  r->idle = true;
   r->idleNext = nullptr;
   r->idlePrev = gVSALocks.idleNewest;
   (gVSALocks.idleNewest ? gVSALocks.idleNewest->idleNext : gVSALocks.idleOldest) = r;
@@ -215,7 +214,7 @@ LockRecord* recordForKey(const std::string& key) {
   uint64_t hash = hashKey(key);
   LockRecord* lockPtr = gVSALocks.identifierToLockMap->find(key, hash);
   if (lockPtr) {
-    if (lockPtr->idle) {
+    if (lockPtr->refCount == 0) {
       unlinkIdle(lockPtr);
       ++gVSALocks.recordsInUse;
     }
@@ -227,7 +226,6 @@ LockRecord* recordForKey(const std::string& key) {
   lockPtr->lockState = 0;
   lockPtr->key.assign(key);
   lockPtr->hash = hash;
-  lockPtr->idle = false;
   gVSALocks.identifierToLockMap->insert(lockPtr);
   ++gVSALocks.recordsInUse;
   return lockPtr;

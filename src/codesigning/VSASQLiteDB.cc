@@ -468,20 +468,23 @@ bool VSASQLiteDB::fillChildren(VSACodeSigningEntry& entry, const std::string& id
   return true;
 }
 
+bool VSASQLiteDB::stepToIdentifierRow(Statement& s, const std::string& identifier,
+                                      VSAErrorRef* error) {
+  if (!s || !s.bindText(1, identifier, "code_signing_id_text", error)) return false;
+  int rc = s.step(error);
+  if (rc == SQLITE_DONE)
+    VSASetError(error,
+                dbError(VSAResult::kNotFoundInDatabase, "_selectCodeSigningEntryWithIdentifier",
+                        "Identifier: \"%@\" Not Found in DB", identifier));
+  return rc == SQLITE_ROW;
+}
+
 std::optional<VSACodeSigningEntry> VSASQLiteDB::codeSigningEntryWithIdentifier(
     const std::string& identifier, VSAErrorRef* error) {
   std::optional<VSACodeSigningEntry> entry;
   {
     Statement s(*this, kSelectOne, "select", error);
-    if (!s || !s.bindText(1, identifier, "code_signing_id_text", error)) return std::nullopt;
-    int rc = s.step(error);
-    if (rc == SQLITE_DONE) {
-      VSASetError(error,
-                  dbError(VSAResult::kNotFoundInDatabase, "_selectCodeSigningEntryWithIdentifier",
-                          "Identifier: \"%@\" Not Found in DB", identifier));
-      return std::nullopt;
-    }
-    if (rc != SQLITE_ROW) return std::nullopt;
+    if (!stepToIdentifierRow(s, identifier, error)) return std::nullopt;
     entry = _codeSigningEntryFromStatementRow(s, error);
   }
   if (!entry || !fillChildren(*entry, identifier, error)) return std::nullopt;
@@ -491,15 +494,7 @@ std::optional<VSACodeSigningEntry> VSASQLiteDB::codeSigningEntryWithIdentifier(
 std::optional<VSAContainerClass> VSASQLiteDB::dataContainerClassWithIdentifier(
     const std::string& identifier, VSAErrorRef* error) {
   Statement s(*this, kSelectClass, "select", error);
-  if (!s || !s.bindText(1, identifier, "code_signing_id_text", error)) return std::nullopt;
-  int rc = s.step(error);
-  if (rc == SQLITE_DONE) {
-    VSASetError(error,
-                dbError(VSAResult::kNotFoundInDatabase, "_selectCodeSigningEntryWithIdentifier",
-                        "Identifier: \"%@\" Not Found in DB", identifier));
-    return std::nullopt;
-  }
-  if (rc != SQLITE_ROW) return std::nullopt;
+  if (!stepToIdentifierRow(s, identifier, error)) return std::nullopt;
   return static_cast<VSAContainerClass>(sqlite3_column_int64(s.get(), 0));
 }
 

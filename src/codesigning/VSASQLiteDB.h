@@ -98,6 +98,9 @@ class VSASQLiteDB {
   std::optional<VSACodeSigningEntry> _codeSigningEntryFromStatementRow(Statement& statement,
                                                                        VSAErrorRef* error);
   bool fillChildren(VSACodeSigningEntry& entry, const std::string& identifier, VSAErrorRef* error);
+  // Binds `identifier` to a by-identifier select and steps to its row; a
+  // missing row sets the not-found error.
+  bool stepToIdentifierRow(Statement& s, const std::string& identifier, VSAErrorRef* error);
   bool transaction(const std::function<bool(VSAErrorRef*)>& body, VSAErrorRef* error);
 
   sqlite3_stmt* takeCachedStatement(const char* sql);
