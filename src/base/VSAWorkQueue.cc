@@ -33,6 +33,18 @@ struct CurrentQueueScope {
   ~CurrentQueueScope() { tCurrentQueues.pop_back(); }
 };
 
+// Several queues current at once, given innermost first; the outermost is
+// pushed first, as nested drains would push them.
+struct CurrentQueueChainScope {
+  explicit CurrentQueueChainScope(const std::vector<VSAWorkQueue*>& innermostFirst)
+      : count(innermostFirst.size()) {
+    for (auto it = innermostFirst.rbegin(); it != innermostFirst.rend(); ++it)
+      tCurrentQueues.push_back(*it);
+  }
+  ~CurrentQueueChainScope() { tCurrentQueues.resize(tCurrentQueues.size() - count); }
+  size_t count;
+};
+
 // A pool that grows whenever every thread is busy, so that a block that waits
 // for another block can never starve it; idle threads retire after a while.
 class ThreadPool final : public VSAWorkQueueExecutor {
@@ -201,31 +213,62 @@ void runAndWait(const std::function<void(VSAWorkQueue::Block)>& submit, VSAWorkQ
 }  // namespace
 
 void VSAWorkQueue::sync(Block block) {
-  // Fast path: a serial queue that runs on the shared pool and is idle is
-  // taken over by the calling thread for the block, which saves two thread
-  // switches. Owning the drain flag keeps every other block out meanwhile,
-  // exactly as a running drain would; blocks that arrive are drained after.
-  if (kind_ == Kind::Serial && !executor_ && target_ && target_->executor_ &&
-      target_->kind_ == Kind::Concurrent) {
-    bool owned = false;
-    {
-      std::lock_guard lock(mutex_);
-      if (!drainScheduled_ && suspendCount_ == 0 && items_.empty()) {
-        drainScheduled_ = true;
-        owned = true;
+  // An idle serial queue is taken over by the calling thread for the block,
+  // which saves two thread switches.
+  if (runIfIdle(block)) return;
+  runAndWait([this](Block b) { async(std::move(b)); }, std::move(block));
+}
+
+bool VSAWorkQueue::claimIdleChain(std::vector<VSAWorkQueue*>& claimed) {
+  for (VSAWorkQueue* q = this;; q = q->target_.get()) {
+    // The chain must end at a concurrent pool; the main queue runs only on its own thread.
+    bool serialLink = q->kind_ == Kind::Serial && !q->executor_ && q->target_;
+    bool idle = false;
+    if (serialLink) {
+      std::lock_guard lock(q->mutex_);
+      if (!q->drainScheduled_ && q->suspendCount_ == 0 && q->items_.empty()) {
+        q->drainScheduled_ = true;  // keeps every other block out, as a running drain would
+        idle = true;
       }
     }
-    if (owned) {
-      runItem(block);
-      {
-        std::lock_guard lock(mutex_);
-        drainScheduled_ = false;
+    if (!idle) {
+      for (VSAWorkQueue* c : claimed) {
+        {
+          std::lock_guard lock(c->mutex_);
+          c->drainScheduled_ = false;
+        }
+        c->submitDrain();
       }
-      submitDrain();
-      return;
+      claimed.clear();
+      return false;
+    }
+    claimed.push_back(q);
+    VSAWorkQueue* next = q->target_.get();
+    if (next->executor_ && next->kind_ == Kind::Concurrent) return true;
+  }
+}
+
+bool VSAWorkQueue::runIfIdle(const Block& block) {
+  std::vector<VSAWorkQueue*> claimed;
+  if (!claimIdleChain(claimed)) return false;
+  {
+    CurrentQueueChainScope scope(claimed);
+    try {
+      block();
+    } catch (...) {
+      std::terminate();  // as in runItem: an exception may not leave a block
     }
   }
-  runAndWait([this](Block b) { async(std::move(b)); }, std::move(block));
+  // Released innermost first: work that arrived on an inner queue meanwhile
+  // is handed to its target before the target itself is released.
+  for (VSAWorkQueue* q : claimed) {
+    {
+      std::lock_guard lock(q->mutex_);
+      q->drainScheduled_ = false;
+    }
+    q->submitDrain();
+  }
+  return true;
 }
 
 void VSAWorkQueue::barrierSync(Block block) {

@@ -16,6 +16,12 @@
 //    from a block already running on it (or on a queue it targets) deadlocks,
 //    exactly like the platform's queues. isCurrent() lets `_onQueue_` methods
 //    assert where they run.
+//  - runIfIdle() runs a block on the calling thread when the queue could
+//    start it at once: a serial queue, not suspended, with nothing queued or
+//    running, whose serial targets (up to the shared pool) are idle too. The
+//    block is then ordered exactly as if it had been submitted and run at
+//    once; blocks submitted meanwhile wait for it. Otherwise it returns false
+//    and runs nothing.
 // Blocks run on a shared, growing thread pool (default or background
 // priority) or, for the main queue, on the thread that calls runMain().
 #pragma once
@@ -26,6 +32,7 @@
 #include <memory>
 #include <mutex>
 #include <string>
+#include <vector>
 
 class VSAWorkQueueExecutor;
 
@@ -52,6 +59,8 @@ class VSAWorkQueue : public std::enable_shared_from_this<VSAWorkQueue> {
 
   void async(Block block);
   void sync(Block block);
+  // Runs `block` here and now when the queue is idle (see above); false otherwise.
+  bool runIfIdle(const Block& block);
   // Barriers on a concurrent queue; on a serial queue they are plain blocks.
   void barrierAsync(Block block);
   void barrierSync(Block block);
@@ -81,6 +90,9 @@ class VSAWorkQueue : public std::enable_shared_from_this<VSAWorkQueue> {
   void drainSerial();
   void pumpConcurrent();
   void runItem(const Block& block);
+  // Marks this queue and its serial targets as draining when all are idle;
+  // appends them, innermost first, to `claimed`. False (nothing claimed) otherwise.
+  bool claimIdleChain(std::vector<VSAWorkQueue*>& claimed);
 
   std::string label_;
   Kind kind_;

@@ -62,11 +62,7 @@ int VSADaemon::run() {
     if (!stopping_ && listener_->listen(&error)) {
       listener_->setHandler(
           [this](const VSAIPCMessageRef& m) { dispatcher_->processRelayEvent(m); });
-      listener_->setRouter([queue = testLockQueue_](const VSAValue& body) -> VSAWorkQueue::Ref {
-        const VSAValue* command = body.get(kVSARequestCommandKey);
-        bool testLock = command && command->uint64Value() == kVSATestLockCommand;
-        return testLock ? queue : nullptr;
-      });
+      listener_->setRouter([this](const VSAValue& body) { return routeRequest(body); });
       listener_->resume();
     } else {
       if (!stopping_) {
@@ -86,6 +82,21 @@ int VSADaemon::run() {
   VSALogIn(VSALogCategory::Daemon, kVSALogNotice, "main", "vessad stopped");
   VSALogger::shared().closeRotatingLog();
   return 0;
+}
+
+// Test-lock commands have their own queue, so that one can thaw requests
+// frozen on the listener's queue. Every other request is handled on the
+// listener's I/O thread while the listener's queue is idle: a look-up then
+// costs no thread hand-off. Its handler waits for nothing but locks and the
+// disk, so the I/O thread is back within the request's own time.
+VSAIPCListener::Route VSADaemon::routeRequest(const VSAValue& body) {
+  const VSAValue* command = body.get(kVSARequestCommandKey);
+  if (command && command->uint64Value() == kVSATestLockCommand) {
+    testLocksInUse_ = true;
+    return {testLockQueue_, false};
+  }
+  bool mayFreeze = testLocksInUse_ || VSATestLocks::shared().enabled();
+  return {nullptr, !mayFreeze};
 }
 
 void VSADaemon::requestStop() {
@@ -126,13 +137,16 @@ void VSADaemon::drainForShutdown() {
   VSALogIn(VSALogCategory::Daemon, kVSALogNotice, "main",
            "Stopping: no new requests; waiting for %d open transactions",
            context_->transactions->openCount());
+  // A request frozen at a test lock would hold its transaction open forever,
+  // and one frozen on an I/O thread would hold up the stops below. Turned off
+  // again after them, in case a test-lock command came in meanwhile.
+  VSATestLocks::shared().setEnabled(false);
   {
     std::lock_guard lock(listenerMutex_);
     if (listener_) listener_->stopAccepting();
     // Upcalls already received are still answered: their replies hold the peer.
     if (upcall_) upcall_->stop();
   }
-  // A request frozen at a test lock would hold its transaction open forever.
   VSATestLocks::shared().setEnabled(false);
   if (!context_->transactions->waitUntilIdle(std::chrono::seconds(30)))
     VSALogIn(VSALogCategory::Daemon, kVSALogError, "main",

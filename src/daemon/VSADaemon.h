@@ -53,6 +53,7 @@ class VSADaemon {
   bool isFirstBoot();
   void startCleanups(bool firstBoot);
   void drainForShutdown();
+  VSAIPCListener::Route routeRequest(const VSAValue& body);
   void writePidFile();
 
   Options options_;
@@ -66,6 +67,10 @@ class VSADaemon {
   std::unique_ptr<VSAKernelUpcall> upcall_;
   std::string firstBootSemaphore_;
   std::atomic<bool> stopping_{false};
+  // A test-lock command has been received: requests may freeze at test locks
+  // from now on, so none runs on the listener's I/O thread, which must stay
+  // free to read the command that thaws them.
+  std::atomic<bool> testLocksInUse_{false};
   std::atomic<bool> cleanupsDone_{false};  // the every-start cleanup has finished
   std::atomic<bool> initialized_{false};   // the subsystems are set; a dump may read them
   VSAWorkQueue::Ref stateQueue_;           // runs state dumps, one at a time

@@ -1,6 +1,7 @@
 #include "daemon/VSAKernelUpcall.h"
 
 #include "base/VSALog.h"
+#include "base/VSATestLocks.h"
 #include "daemon/VSAClientConnection.h"
 
 VSAUpcallEnvironment VSAKernelUpcall::environmentFor(VSADaemonContext& context) {
@@ -49,8 +50,15 @@ bool VSAKernelUpcall::start() {
   bool started = listener_->start(
       [this](VSAUpcallPacket packet, VSAUpcallListener::Reply reply) {
         auto token = context_.transactions->open();
-        queue_->async([this, token, packet = std::move(packet),
-                       reply = std::move(reply)]() mutable { serve(std::move(packet), reply); });
+        VSAWorkQueue::Block block = [this, token, packet = std::move(packet),
+                                     reply = std::move(reply)]() mutable {
+          serve(std::move(packet), reply);
+        };
+        // Served right here while the queues are idle: no hand-off to a pool
+        // thread. Not while test locks may freeze it, so that a frozen upcall
+        // holds up only the pool thread it waits on.
+        if (!VSATestLocks::shared().enabled() && queue_->runIfIdle(block)) return;
+        queue_->async(std::move(block));
       },
       &error);
   if (!started) {

@@ -3,6 +3,8 @@
 // so upcalls and client requests never overlap) and the server, whose
 // containers are made by a privileged client connection marked as the
 // kernel and granted other-identifier, group and unrestricted lookups.
+// The listener's I/O thread serves an upcall itself while both queues are
+// idle, and hands it to the upcall queue otherwise.
 // Started once by the daemon's initialisation; stopped with the daemon.
 #pragma once
 

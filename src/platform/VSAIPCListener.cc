@@ -524,14 +524,16 @@ void VSAIPCListener::deliver(const VSAIPCConnectionRef& connection, std::optiona
   auto message = std::make_shared<VSAIPCMessage>(connection, std::move(body), std::move(problem),
                                                  transactions_->open(), std::move(inFlight));
   Handler handler;
-  VSAWorkQueue::Ref queue;
+  Route route;
   {
     std::lock_guard lock(handlerMutex_);
     handler = handler_;
-    if (router_) queue = router_(message->body());
+    if (router_) route = router_(message->body());
   }
-  if (!queue) queue = queue_;
-  queue->async([handler, message] {
+  VSAWorkQueue::Ref queue = route.queue ? route.queue : queue_;
+  VSAWorkQueue::Block block = [handler, message] {
     if (handler) handler(message);
-  });
+  };
+  if (route.runInline && queue->runIfIdle(block)) return;
+  queue->async(std::move(block));
 }

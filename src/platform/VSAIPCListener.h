@@ -3,7 +3,8 @@
 // listen() binds the socket (or adopts one passed by systemd socket
 // activation). Nothing is accepted until resume(): then an I/O thread accepts
 // peers, reassembles frames and submits each message, in arrival order, to
-// the listener's serial work queue, where the handler runs. The same thread
+// the listener's serial work queue, where the handler runs (or, for a route
+// that allows it, runs the handler itself while that queue is idle). The same thread
 // writes out replies that a peer's socket did not take at once (see
 // VSAIPCConnection), so the handler never waits for a slow reader.
 //
@@ -63,8 +64,18 @@ struct VSAIPCListenerLimits {
 class VSAIPCListener {
  public:
   using Handler = std::function<void(const VSAIPCMessageRef&)>;
-  // Picks the queue a request is handled on; null keeps the listener's queue.
-  using Router = std::function<VSAWorkQueue::Ref(const VSAValue& body)>;
+  // Where a request is handled. `queue` null keeps the listener's queue.
+  // With `runInline`, the I/O thread runs the handler itself when the queue
+  // is idle (VSAWorkQueue::runIfIdle), saving the hand-off to a pool thread
+  // and back: the order of requests is the same, but the I/O thread reads,
+  // accepts and flushes nothing while such a handler runs, so it is only for
+  // handlers that never wait for another request to arrive.
+  struct Route {
+    VSAWorkQueue::Ref queue;
+    bool runInline = false;
+  };
+  // Without a router every request goes to the listener's queue, never inline.
+  using Router = std::function<Route(const VSAValue& body)>;
 
   // `registry` (may be null) gives each accepted peer its registry entry.
   VSAIPCListener(std::string socketPath, VSAWorkQueue::Ref queue,

@@ -1,9 +1,11 @@
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <atomic>
 #include <chrono>
 #include <future>
 #include <mutex>
+#include <string>
 #include <thread>
 #include <vector>
 
@@ -131,6 +133,117 @@ TEST(VSAWorkQueue, SuspendingATargetHoldsItsChildren) {
   parent->resume();
   child->sync([] {});
   EXPECT_EQ(ran.load(), 1);
+}
+
+TEST(VSAWorkQueue, RunIfIdleRunsHereOnlyWhenTheWholeChainCouldStartIt) {
+  auto parent = VSAWorkQueue::create("test.inline.parent");
+  auto child = VSAWorkQueue::create("test.inline.child", VSAWorkQueue::Kind::Serial, parent);
+  std::thread::id ranOn;
+  bool bothCurrent = false;
+  std::string label;
+  ASSERT_TRUE(child->runIfIdle([&] {
+    ranOn = std::this_thread::get_id();
+    bothCurrent = child->isCurrent() && parent->isCurrent();
+    label = VSAWorkQueue::currentLabel();
+  }));
+  EXPECT_EQ(ranOn, std::this_thread::get_id());
+  EXPECT_TRUE(bothCurrent);
+  EXPECT_EQ(label, "test.inline.child");
+  EXPECT_FALSE(child->isCurrent() || parent->isCurrent());
+
+  // A busy target refuses, and the child it had claimed is left usable.
+  std::promise<void> release;
+  std::promise<void> started;
+  parent->async([&, gate = release.get_future().share()] {
+    started.set_value();
+    gate.wait();
+  });
+  started.get_future().wait();
+  bool ran = false;
+  EXPECT_FALSE(child->runIfIdle([&] { ran = true; }));
+  EXPECT_FALSE(parent->runIfIdle([&] { ran = true; }));
+  std::atomic<bool> later{false};
+  child->async([&] { later = true; });
+  release.set_value();
+  child->sync([] {});
+  EXPECT_TRUE(later.load());
+  EXPECT_FALSE(ran);
+
+  child->suspend();
+  EXPECT_FALSE(child->runIfIdle([&] { ran = true; }));
+  child->resume();
+  EXPECT_FALSE(VSAWorkQueue::create("test.inline.concurrent", VSAWorkQueue::Kind::Concurrent)
+                   ->runIfIdle([&] { ran = true; }));
+  EXPECT_FALSE(VSAWorkQueue::main()->runIfIdle([&] { ran = true; }));
+  EXPECT_FALSE(ran);
+}
+
+TEST(VSAWorkQueue, BlocksSubmittedDuringAnInlineRunWaitForIt) {
+  auto parent = VSAWorkQueue::create("test.inline.parent");
+  auto child = VSAWorkQueue::create("test.inline.child", VSAWorkQueue::Kind::Serial, parent);
+  std::mutex mutex;
+  std::vector<std::string> order;
+  auto note = [&](const char* what) {
+    std::lock_guard lock(mutex);
+    order.push_back(what);
+  };
+  ASSERT_TRUE(child->runIfIdle([&] {
+    child->async([&] { note("child 1"); });
+    parent->async([&] { note("parent"); });
+    child->async([&] { note("child 2"); });
+    std::this_thread::sleep_for(30ms);  // time enough for a pool thread to take them, wrongly
+    note("inline");
+  }));
+  child->sync([] {});
+  parent->sync([] {});
+  ASSERT_EQ(order.size(), 4u);
+  EXPECT_EQ(order[0], "inline");
+  auto at = [&](const char* what) { return std::find(order.begin(), order.end(), what); };
+  EXPECT_LT(at("child 1"), at("child 2"));
+}
+
+// One submitter that tries inline first and falls back to async, racing with
+// other submitters: its blocks run in its order, and never two at once.
+TEST(VSAWorkQueue, InlineAndQueuedBlocksOfOneSubmitterKeepTheirOrder) {
+  auto parent = VSAWorkQueue::create("test.inline.parent");
+  auto q = VSAWorkQueue::create("test.inline.mixed", VSAWorkQueue::Kind::Serial, parent);
+  std::atomic<int> inside{0};
+  std::atomic<bool> overlap{false};
+  std::vector<int> order;
+  std::atomic<int> inlined{0};
+  auto body = [&](int i) {
+    return [&, i] {
+      if (inside.fetch_add(1) != 0) overlap = true;
+      order.push_back(i);
+      inside.fetch_sub(1);
+    };
+  };
+  std::atomic<bool> done{false};
+  std::thread noise([&] {
+    while (!done) {
+      parent->async([&] {
+        if (inside.fetch_add(1) != 0) overlap = true;
+        inside.fetch_sub(1);
+      });
+      std::this_thread::sleep_for(20us);
+    }
+  });
+  for (int i = 0; i < 5000; ++i) {
+    VSAWorkQueue::Block block = body(i);
+    if (q->runIfIdle(block)) {
+      ++inlined;
+    } else {
+      q->async(std::move(block));
+    }
+  }
+  done = true;
+  noise.join();
+  q->sync([] {});
+  parent->sync([] {});
+  ASSERT_EQ(order.size(), 5000u);
+  for (int i = 0; i < 5000; ++i) ASSERT_EQ(order[i], i);
+  EXPECT_FALSE(overlap);
+  EXPECT_GT(inlined.load(), 0);
 }
 
 TEST(VSAWorkQueueDeathTest, OverResumeAborts) {

@@ -1,10 +1,12 @@
 #include <gtest/gtest.h>
+#include <pthread.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
 #include <atomic>
 #include <chrono>
 #include <filesystem>
+#include <future>
 #include <mutex>
 #include <thread>
 #include <vector>
@@ -139,6 +141,58 @@ TEST_F(VSAIPCListenerTest, GarbageOnOneConnectionLeavesOthersServed) {
   EXPECT_EQ(*reply->get("Echo")->stringValue(), "ok");
   std::lock_guard lock(mutex_);
   EXPECT_EQ(problems_.size(), 2u);  // the undecodable payload and the array
+  EXPECT_TRUE(transactions_->waitUntilIdle(2s));
+}
+
+// An inline route runs the handler on the I/O thread while the queue is idle
+// and falls back to the queue while it is busy; either way one peer's
+// requests are handled in the order they were sent, never two at once.
+TEST_F(VSAIPCListenerTest, InlineRouteKeepsArrivalOrderWhetherTheQueueIsIdleOrBusy) {
+  std::vector<int64_t> order;
+  std::atomic<int> inIO{0}, inPool{0}, inside{0};
+  std::atomic<bool> overlap{false}, offQueue{false};
+  listener_->setRouter([](const VSAValue&) { return VSAIPCListener::Route{nullptr, true}; });
+  listener_->setHandler([&](const VSAIPCMessageRef& m) {
+    if (inside.fetch_add(1) != 0) overlap = true;
+    if (!queue_->isCurrent()) offQueue = true;
+    char name[16] = {};
+    pthread_getname_np(pthread_self(), name, sizeof name);
+    (std::string(name) == "vessa-ipc" ? inIO : inPool)++;
+    {
+      std::lock_guard lock(mutex_);
+      order.push_back(m->body().get("Value")->int64Value().value_or(-1));
+    }
+    inside.fetch_sub(1);
+    m->sendReply(*m->createReply());
+  });
+  VSAIPCClient client;
+  VSAErrorRef error;
+  ASSERT_TRUE(client.connect(path_, &error));
+  auto sendBatch = [&](int from, int count, std::vector<uint64_t>& ids) {
+    for (int i = from; i < from + count; ++i)
+      ids.push_back(*client.send(VSAValue::Dictionary{{"Value", VSAValue(i)}}, &error));
+  };
+  std::vector<uint64_t> ids;
+  sendBatch(0, 20, ids);
+  for (uint64_t id : ids) ASSERT_TRUE(client.waitForReply(id, 5s, &error));
+  EXPECT_EQ(inIO.load(), 20) << "an idle queue is run on the I/O thread";
+
+  // The queue is held busy: what arrives now waits on it, and what arrives
+  // after it is freed must not overtake what waits.
+  std::promise<void> release;
+  queue_->async([gate = release.get_future().share()] { gate.wait(); });
+  ids.clear();
+  sendBatch(20, 30, ids);
+  std::this_thread::sleep_for(50ms);
+  release.set_value();
+  sendBatch(50, 30, ids);
+  for (uint64_t id : ids) ASSERT_TRUE(client.waitForReply(id, 5s, &error));
+  EXPECT_GT(inPool.load(), 0);
+  EXPECT_FALSE(overlap.load());
+  EXPECT_FALSE(offQueue.load());
+  std::lock_guard lock(mutex_);
+  ASSERT_EQ(order.size(), 80u);
+  for (int64_t i = 0; i < 80; ++i) EXPECT_EQ(order[static_cast<size_t>(i)], i);
   EXPECT_TRUE(transactions_->waitUntilIdle(2s));
 }
 
