@@ -235,6 +235,9 @@ TEST(VSAWorkQueue, InlineAndQueuedBlocksOfOneSubmitterKeepTheirOrder) {
     } else {
       q->async(std::move(block));
     }
+    // Now and then the queue drains, so that both paths are taken however
+    // slow the pool is (a submitter faster than it would never find it idle).
+    if (i % 100 == 99) q->sync([] {});
   }
   done = true;
   noise.join();
