@@ -238,6 +238,15 @@ void VSAIPCListener::run() {
                strerror(errno));
       return;
     }
+    // A request runs inline only when its peer is the only one ready: with
+    // several waiting, handing off lets this thread read the next ones while
+    // a pool thread serves, so one descheduled thread cannot stall them all.
+    int ready = 0;
+    for (int i = 0; i < n; ++i) {
+      int fd = events[i].data.fd;
+      ready += fd != stopFd_ && fd != resumer_->fd && fd != listenFd_;
+    }
+    inlineAllowed_ = ready == 1;
     for (int i = 0; i < n; ++i) {
       int fd = events[i].data.fd;
       uint32_t what = events[i].events;
@@ -534,6 +543,6 @@ void VSAIPCListener::deliver(const VSAIPCConnectionRef& connection, std::optiona
   VSAWorkQueue::Block block = [handler, message] {
     if (handler) handler(message);
   };
-  if (route.runInline && queue->runIfIdle(block)) return;
+  if (route.runInline && inlineAllowed_ && queue->runIfIdle(block)) return;
   queue->async(std::move(block));
 }

@@ -66,8 +66,9 @@ class VSAIPCListener {
   using Handler = std::function<void(const VSAIPCMessageRef&)>;
   // Where a request is handled. `queue` null keeps the listener's queue.
   // With `runInline`, the I/O thread runs the handler itself when the queue
-  // is idle (VSAWorkQueue::runIfIdle), saving the hand-off to a pool thread
-  // and back: the order of requests is the same, but the I/O thread reads,
+  // is idle and no other peer is waiting to be read (VSAWorkQueue::runIfIdle),
+  // saving the hand-off to a pool thread and back: the order of requests is
+  // the same, but the I/O thread reads,
   // accepts and flushes nothing while such a handler runs, so it is only for
   // handlers that never wait for another request to arrive.
   struct Route {
@@ -150,7 +151,8 @@ class VSAIPCListener {
   mutable std::mutex peersMutex_;
   std::map<int, std::unique_ptr<Peer>> peers_;
   std::map<uid_t, size_t> connectionsPerUID_;
-  size_t bufferedInput_ = 0;  // I/O thread only
+  size_t bufferedInput_ = 0;    // I/O thread only
+  bool inlineAllowed_ = false;  // I/O thread only: one peer is ready in this wake-up
   uint64_t nextIdentifier_ = 1;
   // Accepting pauses briefly when even the reserve descriptor is gone.
   Clock::time_point acceptPausedUntil_{};
