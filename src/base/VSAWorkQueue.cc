@@ -232,13 +232,7 @@ bool VSAWorkQueue::claimIdleChain(std::vector<VSAWorkQueue*>& claimed) {
       }
     }
     if (!idle) {
-      for (VSAWorkQueue* c : claimed) {
-        {
-          std::lock_guard lock(c->mutex_);
-          c->drainScheduled_ = false;
-        }
-        c->submitDrain();
-      }
+      releaseClaimed(claimed);
       claimed.clear();
       return false;
     }
@@ -252,15 +246,17 @@ bool VSAWorkQueue::runIfIdle(const Block& block) {
   std::vector<VSAWorkQueue*> claimed;
   if (!claimIdleChain(claimed)) return false;
   {
-    CurrentQueueChainScope scope(claimed);
-    try {
-      block();
-    } catch (...) {
-      std::terminate();  // as in runItem: an exception may not leave a block
-    }
+    // The targets are current too, as the drains they would run it in make them.
+    CurrentQueueChainScope targets({claimed.begin() + 1, claimed.end()});
+    runItem(block);
   }
-  // Released innermost first: work that arrived on an inner queue meanwhile
-  // is handed to its target before the target itself is released.
+  releaseClaimed(claimed);
+  return true;
+}
+
+// Released innermost first: work that arrived on an inner queue meanwhile is
+// handed to its target before the target itself is released.
+void VSAWorkQueue::releaseClaimed(const std::vector<VSAWorkQueue*>& claimed) {
   for (VSAWorkQueue* q : claimed) {
     {
       std::lock_guard lock(q->mutex_);
@@ -268,7 +264,6 @@ bool VSAWorkQueue::runIfIdle(const Block& block) {
     }
     q->submitDrain();
   }
-  return true;
 }
 
 void VSAWorkQueue::barrierSync(Block block) {

@@ -93,6 +93,8 @@ class VSAWorkQueue : public std::enable_shared_from_this<VSAWorkQueue> {
   // Marks this queue and its serial targets as draining when all are idle;
   // appends them, innermost first, to `claimed`. False (nothing claimed) otherwise.
   bool claimIdleChain(std::vector<VSAWorkQueue*>& claimed);
+  // Lets go of queues claimed by claimIdleChain and drains what arrived meanwhile.
+  static void releaseClaimed(const std::vector<VSAWorkQueue*>& claimed);
 
   std::string label_;
   Kind kind_;
