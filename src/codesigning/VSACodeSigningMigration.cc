@@ -54,7 +54,7 @@ bool VSACodeSigningMigration::performAllCodeSigningMigrationAndReconciliationWit
   return ok;
 }
 
-std::optional<std::vector<VSAMetadataRef>> VSACodeSigningMigration::containers(
+std::optional<std::vector<VSAConstMetadataRef>> VSACodeSigningMigration::containers(
     const VSAUserIdentityRef& user, VSAContainerClass c, VSAErrorRef* error) {
   return containerCache_->allContainersForUserIdentity(user, c, false, false, error);
 }

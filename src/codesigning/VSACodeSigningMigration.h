@@ -52,7 +52,7 @@ class VSACodeSigningMigration {
  private:
   // Removes one info value from a container's metadata file (and its cache entry).
   bool clearInfoValue(const VSAMetadata& container, const char* key);
-  std::optional<std::vector<VSAMetadataRef>> containers(const VSAUserIdentityRef& user,
+  std::optional<std::vector<VSAConstMetadataRef>> containers(const VSAUserIdentityRef& user,
                                                         VSAContainerClass c, VSAErrorRef* error);
 
   std::shared_ptr<VSACodeSigningMapping> mapping_;

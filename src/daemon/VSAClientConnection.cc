@@ -52,7 +52,7 @@ VSAMetadataRef VSAClientConnection::createOrLookupContainerWithContainerIdentity
                                                     useLocking, withError);
 }
 
-std::optional<std::vector<VSAMetadataRef>> VSAClientConnection::containersWithClass(
+std::optional<std::vector<VSAConstMetadataRef>> VSAClientConnection::containersWithClass(
     VSAContainerClass containerClass, bool transient, VSAResultCode* withError) {
   return VSAContainerLookup(services_, grants_)
       .containersWithClass(containerClass, transient, withError);

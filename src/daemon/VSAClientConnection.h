@@ -71,7 +71,7 @@ class VSAClientConnection {
       VSAContainerClass containerClass) const {
     return grants_.lookupForContainerClass(containerClass);
   }
-  std::optional<std::vector<VSAMetadataRef>> containersWithClass(VSAContainerClass containerClass,
+  std::optional<std::vector<VSAConstMetadataRef>> containersWithClass(VSAContainerClass containerClass,
                                                                  bool transient,
                                                                  VSAResultCode* withError);
   VSAMetadataRef metadataWithContainerIdentity(const VSAContainerIdentityRef& identity,

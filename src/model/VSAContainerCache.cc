@@ -153,34 +153,34 @@ VSAMetadataRef VSAContainerCache::_lock_metadataFromSandbox(const VSAContainerId
   return m;
 }
 
-bool VSAContainerCache::checkFound(const VSAMetadataRef& m, const std::string& key, bool transient,
+bool VSAContainerCache::checkFound(const VSAMetadata& m, const std::string& key, bool transient,
                                    VSAErrorRef* error) {
-  if (m->url().empty()) {
+  if (m.url().empty()) {
     VSASetError(error,
-                cacheError(47, "Cache: %@%@: nil URL from %@", key, transientTag(transient), *m));
+                cacheError(47, "Cache: %@%@: nil URL from %@", key, transientTag(transient), m));
     return false;
   }
-  std::string metadataFile = VSAPathJoin(m->url(), kVSAMetadataFileName);
+  std::string metadataFile = VSAPathJoin(m.url(), kVSAMetadataFileName);
   VSAFileManager& fm = deps_.configuration->fileManager();
   if (fm.itemExistsAtURL(metadataFile)) return true;
   if (!fm.itemDoesNotExistAtURL(metadataFile)) {
     // The disk could not say (an I/O error): dropping the entry would let the
     // next creation make a second container, so it stays and this look-up fails.
     VSASetError(error, cacheError(44, "Cache: %@%@: cannot check the metadata at: %@ for id: %@",
-                                  key, transientTag(transient), m->url(), m->identifier()));
+                                  key, transientTag(transient), m.url(), m.identifier()));
     return false;
   }
   {
     VSASetError(
         error,
         cacheError(44, "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu", key,
-                   transientTag(transient), m->url(), m->identifier(), m->containerClass()));
+                   transientTag(transient), m.url(), m.identifier(), m.containerClass()));
     VSAErrorRef removeError;
-    if (!removeContainerForUserIdentity(m->userIdentity(), m->containerClass(), m->identifier(),
+    if (!removeContainerForUserIdentity(m.userIdentity(), m.containerClass(), m.identifier(),
                                         transient, &removeError))
       VSALogIn(VSALogCategory::Cache, kVSALogError, kOrigin,
                "Failed to remove from cache user: %@, id: %@, class: %llu, transient: %d : %@",
-               m->userIdentity(), m->identifier(), m->containerClass(), transient, removeError);
+               m.userIdentity(), m.identifier(), m.containerClass(), transient, removeError);
     return false;
   }
   return true;
@@ -192,15 +192,15 @@ VSAMetadataRef VSAContainerCache::containerForContainerIdentity(
   const auto& user = identity.userIdentity();
   VSAContainerClass c = identity.containerClass();
   std::string key = cacheKeyForUserIdentity(user, c);
-  VSAMetadataRef found;
-  bool built = false;        // read from disk by this very call: no need to look again
-  bool fromSandbox = false;  // a fresh object of this call, shared with no map
+  VSAMetadataRef fromSandbox;  // a fresh object of this call, shared with no map
+  VSAConstMetadataRef found;
+  bool built = false;  // read from disk by this very call: no need to look again
   {
     std::lock_guard lock(cacheLock_);
     ClassMap* map = _lock_getCache(user, c, transient, updateSandbox, false, nullptr);
     if (!map && allowKernelLookup && !transient) {
-      found = _lock_metadataFromSandbox(identity);
-      built = fromSandbox = found != nullptr;
+      found = fromSandbox = _lock_metadataFromSandbox(identity);
+      built = found != nullptr;
     }
     if (!found) {
       if (!map) map = _lock_getCache(user, c, transient, updateSandbox, true, nullptr, &built);
@@ -220,14 +220,15 @@ VSAMetadataRef VSAContainerCache::containerForContainerIdentity(
       found = it->second;
     }
   }
-  auto copy = fromSandbox ? found : std::make_shared<VSAMetadata>(*found);
-  if (!built && !checkFound(copy, key, transient, error)) return nullptr;
+  // The caller may change what it gets; the map's entry stays as stored.
+  VSAMetadataRef copy = fromSandbox ? fromSandbox : std::make_shared<VSAMetadata>(*found);
+  if (!built && !checkFound(*copy, key, transient, error)) return nullptr;
   VSALogIn(VSALogCategory::Cache, kVSALogDebug, kOrigin, "Cache: %@%@: Found Identifier: %@", key,
            transientTag(transient), identity.identifier());
   return copy;
 }
 
-std::optional<std::vector<VSAMetadataRef>> VSAContainerCache::allContainersForUserIdentity(
+std::optional<std::vector<VSAConstMetadataRef>> VSAContainerCache::allContainersForUserIdentity(
     const VSAUserIdentityRef& user, VSAContainerClass c, bool transient, bool populateSandbox,
     VSAErrorRef* error) {
   if (!VSAContainerClassIsValid(c)) {
@@ -235,7 +236,7 @@ std::optional<std::vector<VSAMetadataRef>> VSAContainerCache::allContainersForUs
                                   static_cast<long>(c)));
     return std::nullopt;
   }
-  std::vector<VSAMetadataRef> entries;
+  std::vector<VSAConstMetadataRef> entries;
   std::string key = cacheKeyForUserIdentity(user, c);
   bool built = false;  // every entry was read from disk by this very call
   {
@@ -243,12 +244,12 @@ std::optional<std::vector<VSAMetadataRef>> VSAContainerCache::allContainersForUs
     ClassMap* map = _lock_getCache(user, c, transient, populateSandbox, true, error, &built);
     if (!map) return std::nullopt;
     entries.reserve(map->size());
-    for (const auto& [id, m] : *map) entries.push_back(std::make_shared<VSAMetadata>(*m));
+    for (const auto& [id, m] : *map) entries.push_back(m);
   }
-  std::vector<VSAMetadataRef> out;
+  std::vector<VSAConstMetadataRef> out;
   out.reserve(entries.size());
   for (auto& m : entries) {
-    if (!built && !checkFound(m, key, transient, nullptr)) continue;
+    if (!built && !checkFound(*m, key, transient, nullptr)) continue;
     VSALogIn(VSALogCategory::Cache, kVSALogDebug, kOrigin, "Cache: %@%@: ALL Found Identifier: %@",
              key, transientTag(transient), m->identifier());
     out.push_back(std::move(m));

@@ -51,7 +51,9 @@ class VSAContainerCache : public VSAUserIdentityCacheObserver,
   VSAMetadataRef containerForContainerIdentity(const VSAContainerIdentity& identity) {
     return containerForContainerIdentity(identity, false, false, false, nullptr);
   }
-  std::optional<std::vector<VSAMetadataRef>> allContainersForUserIdentity(
+  // The entries are the maps' own (read-only, never changed once stored):
+  // listing a class of 10,000 containers copies no metadata.
+  std::optional<std::vector<VSAConstMetadataRef>> allContainersForUserIdentity(
       const VSAUserIdentityRef& user, VSAContainerClass contentClass, bool transient,
       bool populateSandboxCache, VSAErrorRef* error);
   bool addContainerMetadata(const VSAMetadata& metadata, const std::string& url, bool transient,
@@ -89,7 +91,7 @@ class VSAContainerCache : public VSAUserIdentityCacheObserver,
  private:
   // Identifier -> metadata. Hashed: a sorted tree of 10,000 entries costs a
   // cache miss per level on every insertion while the map is built.
-  using ClassMap = std::unordered_map<std::string, VSAMetadataRef>;
+  using ClassMap = std::unordered_map<std::string, VSAConstMetadataRef>;
   explicit VSAContainerCache(Dependencies deps) : deps_(std::move(deps)) {}
   // `built` (if given) is set when the map was read from disk by this call.
   ClassMap* _lock_getCache(const VSAUserIdentityRef& user, VSAContainerClass c, bool transient,
@@ -97,8 +99,7 @@ class VSAContainerCache : public VSAUserIdentityCacheObserver,
                            bool* built = nullptr);
   VSAMetadataRef _lock_metadataFromSandbox(const VSAContainerIdentity& identity);
   // The on-disk checks done outside the lock; false (and the entry dropped) when stale.
-  bool checkFound(const VSAMetadataRef& m, const std::string& key, bool transient,
-                  VSAErrorRef* error);
+  bool checkFound(const VSAMetadata& m, const std::string& key, bool transient, VSAErrorRef* error);
 
   Dependencies deps_;
   std::mutex cacheLock_;

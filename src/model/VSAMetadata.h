@@ -35,6 +35,8 @@ class VSAGlobalConfiguration;
 class VSAUserIdentityCache;
 class VSAMetadata;
 using VSAMetadataRef = std::shared_ptr<VSAMetadata>;
+// An entry shared with the cache's maps: read-only, so handing it out needs no copy.
+using VSAConstMetadataRef = std::shared_ptr<const VSAMetadata>;
 
 class VSAMetadata {
  public:

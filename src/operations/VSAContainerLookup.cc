@@ -250,7 +250,7 @@ VSAMetadataRef VSAContainerLookup::createOrLookupContainerWithContainerIdentity(
   return found;
 }
 
-std::optional<std::vector<VSAMetadataRef>> VSAContainerLookup::containersWithClass(
+std::optional<std::vector<VSAConstMetadataRef>> VSAContainerLookup::containersWithClass(
     VSAContainerClass containerClass, bool transient, VSAResultCode* withError) {
   VSAUserIdentityRef user = grants_.clientUserIdentity;
   if (!user) user = services_.userIdentityCache->defaultUserIdentity();
@@ -268,7 +268,7 @@ std::optional<std::vector<VSAMetadataRef>> VSAContainerLookup::containersWithCla
   // Without a grant for other identifiers a client sees only its own and
   // those its lookup entitlement lists.
   if (!grants_.allowOtherIdLookup && !grants_.unrestricted) {
-    std::erase_if(*all, [&](const VSAMetadataRef& m) {
+    std::erase_if(*all, [&](const VSAConstMetadataRef& m) {
       return m->identifier() != grants_.clientIdentifier &&
              !grants_.isEntitledForLookupWithClass(containerClass, m->identifier());
     });

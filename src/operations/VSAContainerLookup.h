@@ -28,7 +28,7 @@ class VSAContainerLookup {
       bool useLocking, VSAResultCode* withError);
   // The client's containers of one class (its own user identity), filtered
   // to what its grants let it see.
-  std::optional<std::vector<VSAMetadataRef>> containersWithClass(VSAContainerClass containerClass,
+  std::optional<std::vector<VSAConstMetadataRef>> containersWithClass(VSAContainerClass containerClass,
                                                                  bool transient,
                                                                  VSAResultCode* withError);
   // A live container's metadata, re-read under its identifier read lock.
