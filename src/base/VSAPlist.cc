@@ -9,6 +9,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <cstdio>
 #include <cstring>
 #include <limits>
 #include <new>
@@ -318,6 +319,29 @@ std::optional<VSAValue> VSAPlist::parse(const uint8_t* bytes, size_t length, VSA
   return value;
 }
 
+namespace {
+// Puts `tmp` in the place of the regular file `path` without making the
+// kernel write `tmp`'s data out now. Replacing a file by rename does (ext4
+// allocates and flushes the new file's blocks, and the next journal commit,
+// which any fsync of the daemon's requests waits for, waits for them too):
+// a guard for files that must outlive a power loss. Run-time state need not,
+// so the two names are swapped and the old file, now at `tmp`, is dropped;
+// the data is left to ordinary writeback, which a file replaced again within
+// seconds never reaches. Anything but a regular file at `path` (or nothing)
+// gets the plain rename and its answer.
+int replaceWithoutFlush(const std::string& tmp, const std::string& path) {
+  struct stat st;
+  if (::lstat(path.c_str(), &st) == 0 && S_ISREG(st.st_mode)) {
+    if (::renameat2(AT_FDCWD, tmp.c_str(), AT_FDCWD, path.c_str(), RENAME_EXCHANGE) == 0) {
+      ::unlink(tmp.c_str());
+      return 0;
+    }
+    if (errno != EINVAL && errno != ENOSYS && errno != ENOENT) return errno;
+  }
+  return ::rename(tmp.c_str(), path.c_str()) == 0 ? 0 : errno;
+}
+}  // namespace
+
 bool VSAWriteFileAtomically(const std::string& path, const std::vector<uint8_t>& bytes, mode_t mode,
                             VSAErrorRef* error, bool sync) {
   std::string tmp = path + ".tmp-XXXXXX";
@@ -340,7 +364,9 @@ bool VSAWriteFileAtomically(const std::string& path, const std::vector<uint8_t>&
   if (!err && fchmod(fd, mode) != 0) err = errno;
   if (!err && sync && fsync(fd) != 0) err = errno;
   if (::close(fd) != 0 && !err) err = errno;
-  if (!err && ::rename(tmp.c_str(), path.c_str()) != 0) err = errno;
+  if (!err)
+    err = sync ? (::rename(tmp.c_str(), path.c_str()) == 0 ? 0 : errno)
+               : replaceWithoutFlush(tmp, path);
   if (err) {
     ::unlink(tmp.c_str());
     VSASetError(error, VSA_POSIX_ERROR(err));

@@ -81,7 +81,9 @@ std::optional<VSAValue> VSA_dictionaryWithContentsOfURL(const std::string& path,
                                                         size_t limit = kVSADefaultReadFileLimit);
 
 // Writes `bytes` to `path` atomically and durably (temporary file, fsync,
-// rename, fsync of the directory; without `sync`, neither fsync).
+// rename, fsync of the directory). Without `sync`: neither fsync, and an
+// existing regular file is replaced by swapping the names, which leaves the
+// new data to ordinary writeback instead of flushing it at once.
 bool VSAWriteFileAtomically(const std::string& path, const std::vector<uint8_t>& bytes, mode_t mode,
                             VSAErrorRef* error, bool sync = true);
 // mkdir -p: creates `path` and its missing parents (parents 0755, `path`

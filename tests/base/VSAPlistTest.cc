@@ -183,19 +183,45 @@ TEST_F(VSAPlistFiles, AFIFOInPlaceOfAPropertyListDoesNotBlock) {
 }
 
 TEST_F(VSAPlistFiles, WriteIsAtomicAndReadsBack) {
-  std::string path = VSAPathJoin(dir_, "a.plist");
-  VSAValue v = VSAValue::Dictionary{{"k", VSAValue("v1")}};
-  VSAErrorRef error;
-  ASSERT_TRUE(VSA_writeToURL(v, path, kVSAWriteFileProtectionNone, &error));
-  v.set("k", VSAValue("v2"));
-  ASSERT_TRUE(VSA_writeToURL(v, path, 0, &error));
-  auto back = VSA_dictionaryWithContentsOfURL(path, 0, &error);
-  ASSERT_TRUE(back);
-  EXPECT_EQ(*back, v);
-  // No temporary file is left beside the target.
-  int entries = 0;
-  for (auto& e : std::filesystem::directory_iterator(dir_)) (void)e, ++entries;
-  EXPECT_EQ(entries, 1);
+  // Durable writes rename over the old file; run-time state swaps names
+  // with it and drops it. Either way: the new content whole, nothing beside.
+  for (uint64_t options : {kVSAWriteFileProtectionNone, kVSAWriteFileWithoutSync}) {
+    SCOPED_TRACE(options);
+    std::filesystem::remove_all(dir_);
+    std::filesystem::create_directories(dir_);
+    std::string path = VSAPathJoin(dir_, "a.plist");
+    VSAValue v = VSAValue::Dictionary{{"k", VSAValue("v1")}};
+    VSAErrorRef error;
+    ASSERT_TRUE(VSA_writeToURL(v, path, options, &error));
+    // A reader that opened the old file keeps reading the old content.
+    int reader = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
+    ASSERT_GE(reader, 0);
+    for (const char* next : {"v2", "v3"}) {
+      v.set("k", VSAValue(next));
+      ASSERT_TRUE(VSA_writeToURL(v, path, options, &error));
+    }
+    auto back = VSA_dictionaryWithContentsOfURL(path, 0, &error);
+    ASSERT_TRUE(back);
+    EXPECT_EQ(*back, v);
+    std::vector<uint8_t> old(4096);
+    ssize_t n = ::pread(reader, old.data(), old.size(), 0);
+    ::close(reader);
+    ASSERT_GT(n, 0);
+    auto first = VSAPlist::parse(old.data(), static_cast<size_t>(n), &error);
+    ASSERT_TRUE(first);
+    EXPECT_EQ(*first->get("k")->stringValue(), "v1");
+    int entries = 0;
+    for (auto& e : std::filesystem::directory_iterator(dir_)) (void)e, ++entries;
+    EXPECT_EQ(entries, 1);
+    // A directory in the file's place is refused, not swapped away.
+    std::string taken = VSAPathJoin(dir_, "taken");
+    std::filesystem::create_directories(taken + "/inside");
+    EXPECT_FALSE(VSA_writeToURL(v, taken, options, &error));
+    EXPECT_TRUE(std::filesystem::is_directory(taken + "/inside"));
+    entries = 0;
+    for (auto& e : std::filesystem::directory_iterator(dir_)) (void)e, ++entries;
+    EXPECT_EQ(entries, 2);
+  }
 }
 
 TEST_F(VSAPlistFiles, FailedWriteLeavesTheOldFileIntact) {
