@@ -15,6 +15,7 @@
 
 #include "base/VSALog.h"
 #include "platform/VSAFrameCodec.h"
+#include "platform/VSAListeningSocket.h"
 
 namespace {
 constexpr const char* kOrigin = "VSAIPCListener";
@@ -102,11 +103,10 @@ bool VSAIPCListener::listen(VSAErrorRef* error) {
       VSASetError(error, VSA_POSIX_ERROR(EADDRINUSE, "another daemon serves " + socketPath_));
       return false;
     }
-    ::unlink(socketPath_.c_str());
+    // A stale file (its daemon is gone) is replaced by the rename.
     listenFd_ = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    if (listenFd_ < 0 || bind(listenFd_, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0 ||
-        chmod(socketPath_.c_str(), 0666) != 0 || ::listen(listenFd_, 128) != 0) {
-      int err = errno;
+    int err = listenFd_ < 0 ? errno : VSABindListeningSocket(listenFd_, socketPath_, 0666, 128);
+    if (err != 0) {
       if (listenFd_ >= 0) ::close(listenFd_);
       listenFd_ = -1;
       VSASetError(error, VSA_POSIX_ERROR(err));

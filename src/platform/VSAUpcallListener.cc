@@ -13,6 +13,7 @@
 
 #include "base/VSALog.h"
 #include "platform/VSADescriptorPassing.h"
+#include "platform/VSAListeningSocket.h"
 
 namespace {
 const char* const kOrigin = "VSAUpcallListener";
@@ -65,24 +66,14 @@ VSAUpcallListener::~VSAUpcallListener() { stop(); }
 
 bool VSAUpcallListener::start(Handler handler, VSAErrorRef* error) {
   handler_ = std::move(handler);
-  struct sockaddr_un addr = {};
-  addr.sun_family = AF_UNIX;
-  if (path_.size() >= sizeof addr.sun_path) {
-    VSASetError(error, VSA_POSIX_ERROR(ENAMETOOLONG, path_));
-    return false;
-  }
-  std::memcpy(addr.sun_path, path_.c_str(), path_.size() + 1);
   listenFd_ = ::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
   wakeFd_ = ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
-  ::unlink(path_.c_str());
-  mode_t old = ::umask(0177);  // the socket is born 0600
-  int rc = listenFd_ < 0 || wakeFd_ < 0
-               ? -1
-               : ::bind(listenFd_, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr);
-  ::umask(old);
-  if (rc != 0 || ::listen(listenFd_, 16) != 0) {
-    int e = errno;
-    VSASetError(error, VSA_POSIX_ERROR(e, VSAFormat("binding %@", path_)));
+  int rc =
+      listenFd_ < 0 || wakeFd_ < 0 ? errno : VSABindListeningSocket(listenFd_, path_, 0600, 16);
+  if (rc != 0) {
+    VSASetError(error, VSA_POSIX_ERROR(rc, VSAFormat("binding %@", path_)));
+    if (listenFd_ >= 0) ::close(listenFd_);  // the file at the path is not this one's to remove
+    listenFd_ = -1;
     stop();
     return false;
   }
