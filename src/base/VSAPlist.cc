@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <linux/openat2.h>
 #include <plist/plist.h>
+#include <sys/random.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <unistd.h>
@@ -320,68 +321,93 @@ std::optional<VSAValue> VSAPlist::parse(const uint8_t* bytes, size_t length, VSA
 }
 
 namespace {
-// Puts `tmp` in the place of the regular file `path` without making the
-// kernel write `tmp`'s data out now. Replacing a file by rename does (ext4
-// allocates and flushes the new file's blocks, and the next journal commit,
-// which any fsync of the daemon's requests waits for, waits for them too):
-// a guard for files that must outlive a power loss. Run-time state need not,
-// so the two names are swapped and the old file, now at `tmp`, is dropped;
-// the data is left to ordinary writeback, which a file replaced again within
-// seconds never reaches. Anything but a regular file at `path` (or nothing)
-// gets the plain rename and its answer.
-int replaceWithoutFlush(const std::string& tmp, const std::string& path) {
+// The directory that holds `path`, opened without following a link anywhere
+// on the way: the file is then made, renamed and synced through it.
+int openParentDirectory(const std::string& path) {
+  std::string dir = VSADirectoryName(path);
+  if (dir.empty()) dir = ".";
+  struct open_how how {};
+  how.flags = O_RDONLY | O_DIRECTORY | O_CLOEXEC;
+  how.resolve = RESOLVE_NO_SYMLINKS;
+  int fd = static_cast<int>(::syscall(SYS_openat2, AT_FDCWD, dir.c_str(), &how, sizeof how));
+  if (fd < 0 && errno == ENOSYS) fd = ::open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  return fd;
+}
+
+// A new file "<name>.tmp-XXXXXXXX" in `dir`, created exclusively; -1 with errno.
+int createTemporary(int dir, const std::string& name, std::string* tmp) {
+  for (int attempt = 0; attempt < 100; ++attempt) {
+    uint32_t r = 0;
+    if (::getrandom(&r, sizeof r, 0) != sizeof r) return -1;
+    char suffix[16];
+    std::snprintf(suffix, sizeof suffix, ".tmp-%08x", r);
+    *tmp = name + suffix;
+    int fd =
+        ::openat(dir, tmp->c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600);
+    if (fd >= 0 || errno != EEXIST) return fd;
+  }
+  errno = EEXIST;
+  return -1;
+}
+
+// Puts `tmp` in the place of the regular file `name` (both in `dir`) without
+// making the kernel write `tmp`'s data out now. Replacing a file by rename
+// does (ext4 allocates and flushes the new file's blocks, and the next
+// journal commit, which any fsync of the daemon's requests waits for, waits
+// for them too): a guard for files that must outlive a power loss. Run-time
+// state need not, so the two names are swapped and the old file, now at
+// `tmp`, is dropped; the data is left to ordinary writeback, which a file
+// replaced again within seconds never reaches. Anything but a regular file
+// at `name` (or nothing) gets the plain rename and its answer.
+int replaceWithoutFlush(int dir, const std::string& tmp, const std::string& name) {
   struct stat st;
-  if (::lstat(path.c_str(), &st) == 0 && S_ISREG(st.st_mode)) {
-    if (::renameat2(AT_FDCWD, tmp.c_str(), AT_FDCWD, path.c_str(), RENAME_EXCHANGE) == 0) {
-      ::unlink(tmp.c_str());
+  if (::fstatat(dir, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0 && S_ISREG(st.st_mode)) {
+    if (::renameat2(dir, tmp.c_str(), dir, name.c_str(), RENAME_EXCHANGE) == 0) {
+      ::unlinkat(dir, tmp.c_str(), 0);
       return 0;
     }
     if (errno != EINVAL && errno != ENOSYS && errno != ENOENT) return errno;
   }
-  return ::rename(tmp.c_str(), path.c_str()) == 0 ? 0 : errno;
+  return ::renameat(dir, tmp.c_str(), dir, name.c_str()) == 0 ? 0 : errno;
+}
+
+int writeAll(int fd, const std::vector<uint8_t>& bytes) {
+  size_t done = 0;
+  while (done < bytes.size()) {
+    ssize_t w = ::write(fd, bytes.data() + done, bytes.size() - done);
+    if (w < 0 && errno == EINTR) continue;
+    if (w < 0) return errno;
+    done += static_cast<size_t>(w);
+  }
+  return 0;
 }
 }  // namespace
 
 bool VSAWriteFileAtomically(const std::string& path, const std::vector<uint8_t>& bytes, mode_t mode,
                             VSAErrorRef* error, bool sync) {
-  std::string tmp = path + ".tmp-XXXXXX";
-  int fd = mkstemp(tmp.data());
+  std::string name = VSALastPathComponent(path), tmp;
+  int dir = openParentDirectory(path);
+  int fd = dir < 0 ? -1 : createTemporary(dir, name, &tmp);
   if (fd < 0) {
     VSASetError(error, VSA_POSIX_ERROR(errno));
+    if (dir >= 0) ::close(dir);
     return false;
   }
-  size_t done = 0;
-  int err = 0;
-  while (done < bytes.size()) {
-    ssize_t w = ::write(fd, bytes.data() + done, bytes.size() - done);
-    if (w < 0) {
-      if (errno == EINTR) continue;
-      err = errno;
-      break;
-    }
-    done += static_cast<size_t>(w);
-  }
+  int err = writeAll(fd, bytes);
   if (!err && fchmod(fd, mode) != 0) err = errno;
   if (!err && sync && fsync(fd) != 0) err = errno;
   if (::close(fd) != 0 && !err) err = errno;
   if (!err)
-    err = sync ? (::rename(tmp.c_str(), path.c_str()) == 0 ? 0 : errno)
-               : replaceWithoutFlush(tmp, path);
+    err = sync ? (::renameat(dir, tmp.c_str(), dir, name.c_str()) == 0 ? 0 : errno)
+               : replaceWithoutFlush(dir, tmp, name);
   if (err) {
-    ::unlink(tmp.c_str());
+    ::unlinkat(dir, tmp.c_str(), 0);
     VSASetError(error, VSA_POSIX_ERROR(err));
-    return false;
+  } else if (sync) {
+    ::fsync(dir);  // the rename is the commit; it is durable once the directory is synced
   }
-  if (sync) {
-    // The rename is the commit; it is durable once the directory is synced.
-    std::string dir = VSADirectoryName(path);
-    int dirFd = ::open(dir.empty() ? "." : dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    if (dirFd >= 0) {
-      ::fsync(dirFd);
-      ::close(dirFd);
-    }
-  }
-  return true;
+  ::close(dir);
+  return err == 0;
 }
 
 int VSAMakeDirectories(const std::string& path, mode_t mode) {

@@ -81,7 +81,8 @@ std::optional<VSAValue> VSA_dictionaryWithContentsOfURL(const std::string& path,
                                                         size_t limit = kVSADefaultReadFileLimit);
 
 // Writes `bytes` to `path` atomically and durably (temporary file, fsync,
-// rename, fsync of the directory). Without `sync`: neither fsync, and an
+// rename, fsync of the directory), all through the file's directory opened
+// without following a link on the way (ELOOP if there is one). Without `sync`: neither fsync, and an
 // existing regular file is replaced by swapping the names, which leaves the
 // new data to ordinary writeback instead of flushing it at once.
 bool VSAWriteFileAtomically(const std::string& path, const std::vector<uint8_t>& bytes, mode_t mode,

@@ -236,6 +236,13 @@ TEST_F(VSAPlistFiles, FailedWriteLeavesTheOldFileIntact) {
   ASSERT_TRUE(error);
   EXPECT_EQ(error->domain(), kVSAPOSIXErrorDomain);
   EXPECT_EQ(error->code(), ENOENT);
+  // A link on the way to the directory is not followed: nothing lands behind it.
+  std::filesystem::create_directories(VSAPathJoin(dir_, "real"));
+  std::filesystem::create_directory_symlink("real", VSAPathJoin(dir_, "link"));
+  EXPECT_FALSE(
+      VSA_writeToURL(v, VSAPathJoin(dir_, "link/x.plist"), kVSAWriteFileWithoutSync, &error));
+  EXPECT_EQ(error->code(), ELOOP);
+  EXPECT_TRUE(std::filesystem::is_empty(VSAPathJoin(dir_, "real")));
   auto back = VSA_dictionaryWithContentsOfURL(path, 0, &error);
   ASSERT_TRUE(back);
   EXPECT_EQ(*back->get("k")->stringValue(), "old");
