@@ -9,6 +9,7 @@
 #include <filesystem>
 #include <fstream>
 
+#include "VSATestTempDir.h"
 #include "platform/VSAListeningSocket.h"
 
 namespace fs = std::filesystem;
@@ -17,15 +18,8 @@ namespace {
 
 class VSAListeningSocketTest : public ::testing::Test {
  protected:
-  void SetUp() override {
-    char tmpl[] = "/tmp/vessa-sock-XXXXXX";
-    dir_ = mkdtemp(tmpl);
-    fd_ = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  }
-  void TearDown() override {
-    ::close(fd_);
-    fs::remove_all(dir_);
-  }
+  void SetUp() override { fd_ = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0); }
+  void TearDown() override { ::close(fd_); }
   bool connects(const std::string& path) {
     int c = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
     struct sockaddr_un addr = {};
@@ -40,7 +34,8 @@ class VSAListeningSocketTest : public ::testing::Test {
     for (auto& e : fs::directory_iterator(dir_)) (void)e, ++n;
     return n;
   }
-  std::string dir_;
+  VSATestTempDir temp_{"vessa-sock"};
+  const std::string& dir_ = temp_.path();
   int fd_ = -1;
 };
 
