@@ -22,7 +22,8 @@ VSATestLocks& VSATestLocks::shared() {
 }
 
 VSATestLocks::VSATestLocks()
-    : stateQueue_(VSAWorkQueue::create("com.tamsk.vessad.VSATestLocks.stateQueue")) {
+    : stateQueue_(VSAWorkQueue::create("com.tamsk.vessad.VSATestLocks.stateQueue")),
+      takerQueue_(VSAWorkQueue::create("com.tamsk.vessad.VSATestLocks.takerQueue")) {
   for (uint64_t lock = 2; lock < kVSATestLockCount; ++lock) {
     gates_[lock].queue = VSAWorkQueue::create("com.tamsk.vessad.VSATestLocks.lockQueue",
                                               VSAWorkQueue::Kind::Concurrent);
@@ -35,6 +36,7 @@ VSATestLocks::~VSATestLocks() {
   // A released barrier may still be returning from its semaphore: wait for
   // it before the semaphore goes.
   for (uint64_t lock = 2; lock < kVSATestLockCount; ++lock) gates_[lock].queue->barrierSync([] {});
+  takerQueue_->sync([] {});
 }
 
 void VSATestLocks::setEnabled(bool enabled) {
@@ -47,12 +49,18 @@ void VSATestLocks::setEnabled(bool enabled) {
   }
 }
 
-void VSATestLocks::acquireLock(uint64_t lock) { updateCount(lock, 1); }
+void VSATestLocks::acquireLock(uint64_t lock) {
+  std::shared_future<void> taken;
+  updateCount(lock, 1, &taken);
+  // Waited for here, with nothing of this object held.
+  if (taken.valid()) taken.wait();
+}
+
 void VSATestLocks::releaseLock(uint64_t lock) { updateCount(lock, -1); }
 
-void VSATestLocks::updateCount(uint64_t lock, int64_t delta) {
+void VSATestLocks::updateCount(uint64_t lock, int64_t delta, std::shared_future<void>* taken) {
   if (lock >= kVSATestLockCount) return;
-  stateQueue_->sync([&] { _stateQueue_updateCountForLock(lock, delta); });
+  stateQueue_->sync([&] { _stateQueue_updateCountForLock(lock, delta, taken); });
 }
 
 void VSATestLocks::releaseAllLocks() {
@@ -70,7 +78,8 @@ int64_t VSATestLocks::countForLock(uint64_t lock) const {
   return count;
 }
 
-void VSATestLocks::_stateQueue_updateCountForLock(uint64_t lock, int64_t delta) {
+void VSATestLocks::_stateQueue_updateCountForLock(uint64_t lock, int64_t delta,
+                                                  std::shared_future<void>* taken) {
   if (delta == 0) return;
   int64_t from = counts_[lock], to = from + delta;
   if (to < 0) {
@@ -81,7 +90,10 @@ void VSATestLocks::_stateQueue_updateCountForLock(uint64_t lock, int64_t delta) 
     VSACrash(message);
   }
   counts_[lock] = to;
-  if (from == 0) take(lock);
+  if (from == 0) {
+    auto acquisition = take(lock);
+    if (taken) *taken = std::move(acquisition);
+  }
   if (to == 0) release(lock);
   if (delta > 0)
     logTest(kOrigin, "Acquired test lock: %llu; count: %ld", static_cast<unsigned long long>(lock),
@@ -91,20 +103,50 @@ void VSATestLocks::_stateQueue_updateCountForLock(uint64_t lock, int64_t delta) 
             static_cast<long>(to));
 }
 
-void VSATestLocks::take(uint64_t lock) {
-  if (lock == 0) return lock_all_identifiers_write();
-  if (lock == 1) return lock_all_identifiers_read();
+std::shared_future<void> VSATestLocks::take(uint64_t lock) {
+  if (lock <= 1) {
+    // The all-identifiers lock waits for every identifier lock, and one may be
+    // held by an operation frozen at another test lock: only the taker waits.
+    auto done = std::make_shared<std::promise<void>>();
+    std::shared_future<void> taken = done->get_future().share();
+    takerQueue_->async([lock, done, &holding = holdings_[lock]] {
+      if (lock == 0)
+        lock_all_identifiers_write();
+      else
+        lock_all_identifiers_read();
+      {
+        std::lock_guard guard(holding.mutex);
+        if (holding.owed > 0) {
+          --holding.owed;
+          unlock_all_identifiers();
+        } else {
+          ++holding.held;
+        }
+      }
+      done->set_value();
+    });
+    return taken;
+  }
   Gate& gate = gates_[lock];
   gate.queue->barrierAsync([lock, semaphore = gate.semaphore.get()] {
     logTest("take", "Blocking waiters for lock: %llu", static_cast<unsigned long long>(lock));
     semaphore->acquire();
     logTest("take", "Unblocking waiters for lock: %llu", static_cast<unsigned long long>(lock));
   });
+  return {};
 }
 
 void VSATestLocks::release(uint64_t lock) {
-  if (lock <= 1) return unlock_all_identifiers();
-  gates_[lock].semaphore->release();
+  if (lock > 1) return gates_[lock].semaphore->release();
+  // Not had yet: the taker lets it go the moment it gets it.
+  Holding& holding = holdings_[lock];
+  std::lock_guard guard(holding.mutex);
+  if (holding.held > 0) {
+    --holding.held;
+    unlock_all_identifiers();
+  } else {
+    ++holding.owed;
+  }
 }
 
 void VSATestLocks::waitOnLock(uint64_t lock) {
@@ -128,13 +170,18 @@ VSAResultCode VSATestLocks::setLockFromCommand(uint64_t lock, bool enable) {
              static_cast<unsigned long long>(lock));
     return VSAResult::kOutOfRange;
   }
-  std::lock_guard guard(maskMutex_);
+  std::unique_lock guard(maskMutex_);
   uint32_t bit = 1u << lock;
   if (enable) {
     if (commandMask_ & bit) return VSAResult::kSuccess;
     commandMask_ |= bit;
     setEnabled(true);
-    acquireLock(lock);
+    std::shared_future<void> taken;
+    updateCount(lock, 1, &taken);
+    // Other test-lock commands (a release that thaws what this one waits
+    // for, among them) go on meanwhile.
+    guard.unlock();
+    if (taken.valid()) taken.wait();
     return VSAResult::kSuccess;
   }
   if (!(commandMask_ & bit)) return VSAResult::kSuccess;

@@ -6,7 +6,12 @@
 // takes the lock, from positive to 0 releases it:
 //  - lock 0 takes the all-identifiers lock for writing (every container
 //    operation stops at its identifier lock), lock 1 for reading (only
-//    operations that write stop);
+//    operations that write stop). That lock may have to wait for an
+//    operation already frozen at another test lock, so it is taken on a
+//    queue of its own: the state queue and the command's mask are never held
+//    while it waits, and a release that comes before the lock was had is
+//    settled by the taker as soon as it has it. acquireLock() returns once
+//    the lock is held, but nothing else waits with it;
 //  - locks 2-6 put a barrier on their own concurrent queue that waits on the
 //    lock's semaphore; waitOnLock() on that number runs an empty block
 //    synchronously on the queue, so it blocks behind the barrier until the
@@ -16,13 +21,15 @@
 // move to death row), 5 protection change (before the walk), 6 the cache
 // rebuild of a class.
 //
-// With the feature off, waitOnLock() returns at once. A release that would
-// make a count negative ends the process. Thread-safe; process-wide.
+// Releasing never waits for anyone. With the feature off, waitOnLock() returns
+// at once. A release that would make a count negative ends the process.
+// Thread-safe; process-wide.
 #pragma once
 
 #include <array>
 #include <atomic>
 #include <cstdint>
+#include <future>
 #include <memory>
 #include <mutex>
 #include <semaphore>
@@ -66,15 +73,26 @@ class VSATestLocks {
     VSAWorkQueue::Ref queue;
     std::unique_ptr<std::binary_semaphore> semaphore;
   };
-  void updateCount(uint64_t lock, int64_t delta);
-  void _stateQueue_updateCountForLock(uint64_t lock, int64_t delta);
-  void take(uint64_t lock);
+  // The all-identifiers lock held for lock 0 or 1: how often it is held, and
+  // how many releases came before their acquisition had finished.
+  struct Holding {
+    std::mutex mutex;
+    int64_t held = 0;
+    int64_t owed = 0;
+  };
+  // Changes a count; `taken` (when given) becomes the acquisition to wait for.
+  void updateCount(uint64_t lock, int64_t delta, std::shared_future<void>* taken = nullptr);
+  void _stateQueue_updateCountForLock(uint64_t lock, int64_t delta,
+                                      std::shared_future<void>* taken = nullptr);
+  std::shared_future<void> take(uint64_t lock);
   void release(uint64_t lock);
 
   std::atomic<bool> enabled_{false};
   VSAWorkQueue::Ref stateQueue_;
   std::array<int64_t, kVSATestLockCount> counts_{};  // on the state queue
   std::array<Gate, kVSATestLockCount> gates_;        // locks 2-6
+  VSAWorkQueue::Ref takerQueue_;                     // takes locks 0 and 1
+  std::array<Holding, 2> holdings_;                  // locks 0 and 1
   std::mutex maskMutex_;
   uint32_t commandMask_ = 0;
 };

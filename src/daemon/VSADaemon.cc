@@ -43,7 +43,10 @@ int VSADaemon::run() {
   writePidFile();
   context_->listenerQueue = VSAWorkQueue::create("com.tamsk.vessad.listener");
   auto initTransaction = context_->transactions->open();
-  testLockQueue_ = VSAWorkQueue::create("com.tamsk.vessad.testlocks");
+  // Concurrent: a command that waits to take lock 0 or 1 must not hold up the
+  // release that lets it through.
+  testLockQueue_ =
+      VSAWorkQueue::create("com.tamsk.vessad.testlocks", VSAWorkQueue::Kind::Concurrent);
   testLockQueue_->suspend();
   context_->listenerQueue->async([this, initTransaction = std::move(initTransaction)]() mutable {
     initialize();
@@ -85,7 +88,7 @@ int VSADaemon::run() {
 }
 
 // Test-lock commands have their own queue, so that one can thaw requests
-// frozen on the listener's queue. Every other request is handled on the
+// frozen on the listener's queue (and one another). Every other request is handled on the
 // listener's I/O thread while the listener's queue is idle: a look-up then
 // costs no thread hand-off. Its handler waits for nothing but locks and the
 // disk, so the I/O thread is back within the request's own time.
@@ -175,7 +178,20 @@ void VSADaemon::openLogs() {
 }
 
 bool VSADaemon::isFirstBoot() {
-  if (VSANamedSemaphore::exists(firstBootSemaphore_)) return false;
+  switch (VSANamedSemaphore::stateOf(firstBootSemaphore_)) {
+    case VSANamedSemaphore::State::Present:
+      return false;
+    case VSANamedSemaphore::State::Forged:
+      // Anyone can make a file by that name; only one the daemon made says
+      // that first-boot work was done since the device started.
+      VSALogIn(VSALogCategory::Daemon, kVSALogError, "vessad_init",
+               "Ignoring first-boot marker %s: not made by vessad; removing it",
+               VSANamedSemaphore::backingPath(firstBootSemaphore_));
+      VSANamedSemaphore::remove(firstBootSemaphore_);
+      break;
+    case VSANamedSemaphore::State::Absent:
+      break;
+  }
   VSALogIn(VSALogCategory::Daemon, kVSALogNotice, "vessad_init",
            "vessad performing first boot initialization");
   return true;

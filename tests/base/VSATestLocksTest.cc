@@ -103,6 +103,46 @@ TEST(VSATestLocks, TheCommandAcquiresOncePerLockAndChecksNumbers) {
   EXPECT_EQ(VSALockTableSnapshot().allReaderWriterState, 0);
 }
 
+// An operation frozen at lock 3 holds its identifier lock, so lock 0 cannot
+// be had until it goes on; neither the release that lets it go on, nor
+// turning the feature off, may wait for that.
+TEST(VSATestLocks, ReleasesNeverWaitBehindALockZeroThatCannotBeHadYet) {
+  VSATestLocks locks;
+  ASSERT_EQ(locks.setLockFromCommand(3, true), VSAResult::kSuccess);
+  auto frozen = std::async(std::launch::async, [&locks] {
+    VSAIdentifierLockGuard guard(VSAValue("FROZEN-KEY"), true);
+    locks.waitOnLock(3);
+  });
+  EXPECT_EQ(frozen.wait_for(200ms), std::future_status::timeout);
+  auto lockZero = std::async(std::launch::async, [&locks] { locks.setLockFromCommand(0, true); });
+  EXPECT_EQ(lockZero.wait_for(200ms), std::future_status::timeout);
+  auto release = std::async(std::launch::async, [&locks] { locks.setLockFromCommand(3, false); });
+  ASSERT_EQ(release.wait_for(5s), std::future_status::ready);
+  EXPECT_EQ(frozen.wait_for(5s), std::future_status::ready);
+  EXPECT_EQ(lockZero.wait_for(5s), std::future_status::ready);
+  EXPECT_EQ(VSALockTableSnapshot().allReaderWriterState, -1);
+
+  ASSERT_EQ(locks.setLockFromCommand(0, false), VSAResult::kSuccess);
+  EXPECT_EQ(VSALockTableSnapshot().allReaderWriterState, 0);
+
+  // Lock 1 asked for behind an operation frozen at lock 4, then everything
+  // turned off before it was had: the taker lets it go as soon as it has it.
+  ASSERT_EQ(locks.setLockFromCommand(4, true), VSAResult::kSuccess);
+  auto held = std::async(std::launch::async, [&locks] {
+    VSAIdentifierLockGuard guard(VSAValue("FROZEN-KEY"), true);
+    locks.waitOnLock(4);
+  });
+  EXPECT_EQ(held.wait_for(200ms), std::future_status::timeout);
+  auto lockOne = std::async(std::launch::async, [&locks] { locks.acquireLock(1); });
+  EXPECT_EQ(lockOne.wait_for(200ms), std::future_status::timeout);
+  auto off = std::async(std::launch::async, [&locks] { locks.setEnabled(false); });
+  ASSERT_EQ(off.wait_for(5s), std::future_status::ready);
+  EXPECT_EQ(held.wait_for(5s), std::future_status::ready);
+  EXPECT_EQ(lockOne.wait_for(5s), std::future_status::ready);
+  EXPECT_EQ(locks.countForLock(1), 0);
+  EXPECT_EQ(VSALockTableSnapshot().allReaderWriterState, 0);
+}
+
 TEST(VSATestLocksDeathTest, AnUnbalancedReleaseEndsTheProcess) {
   GTEST_FLAG_SET(death_test_style, "threadsafe");
   EXPECT_DEATH(

@@ -2,6 +2,7 @@
 // real client.
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <semaphore.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -129,6 +130,45 @@ TEST(DaemonSpine, FirstBootWorkRunsOncePerBoot) {
   EXPECT_EQ(d.stop(), 0);
   auto third = d.notifications();
   EXPECT_EQ(std::count(third.begin(), third.end(), "com.tamsk.vessad.reboot-cleanup-complete"), 2);
+}
+
+// The marker's file is in a directory every user can write. One that the
+// mobile user made (as a semaphore or a plain file, with the daemon's mode or
+// not) does not stand for first-boot work done: the daemon removes it, does
+// the work, and makes its own.
+TEST(DaemonSpine, AFirstBootMarkerMadeByTheMobileUserIsNotBelieved) {
+  for (mode_t mode : {0600, 0644}) {
+    VSATestDaemon d;
+    std::string name = d.firstBootSemaphore();
+    pid_t planter = fork();
+    if (planter == 0) {
+      if (setgid(501) != 0 || setuid(501) != 0) _exit(2);
+      umask(0);
+      sem_t* s = sem_open(("/" + name).c_str(), O_CREAT | O_EXCL, mode, 0);
+      _exit(s == SEM_FAILED ? 1 : 0);
+    }
+    int status = -1;
+    ASSERT_EQ(waitpid(planter, &status, 0), planter);
+    ASSERT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "planting as uid 501";
+    struct stat st;
+    ASSERT_EQ(stat(VSANamedSemaphore::backingPath(name).c_str(), &st), 0);
+    ASSERT_EQ(st.st_uid, 501u);
+    EXPECT_EQ(VSANamedSemaphore::stateOf(name), VSANamedSemaphore::State::Forged);
+
+    ASSERT_TRUE(d.start());
+    ASSERT_TRUE(d.waitForNotifications(2));
+    EXPECT_EQ(d.stop(), 0);
+    auto names = d.notifications();
+    EXPECT_EQ(std::count(names.begin(), names.end(), "com.tamsk.vessad.reboot-cleanup-complete"),
+              1);
+    std::string out = d.daemonOutput();
+    EXPECT_NE(out.find("not made by vessad"), std::string::npos);
+    EXPECT_NE(out.find("vessad performing first boot initialization"), std::string::npos);
+    ASSERT_EQ(stat(VSANamedSemaphore::backingPath(name).c_str(), &st), 0);
+    EXPECT_EQ(st.st_uid, 0u);
+    EXPECT_EQ(st.st_mode & 07777, 0600u);
+    EXPECT_TRUE(VSANamedSemaphore::exists(name));
+  }
 }
 
 TEST(DaemonSpine, LockStateChangesReachTheRunningDaemon) {

@@ -47,6 +47,11 @@ size_t entries(const std::string& dir) {
   if (!fs::exists(dir)) return 0;
   return static_cast<size_t>(std::distance(fs::directory_iterator(dir), {}));
 }
+size_t occurrences(const std::string& text, const char* what) {
+  size_t count = 0;
+  for (size_t at = text.find(what); at != std::string::npos; at = text.find(what, at + 1)) ++count;
+  return count;
+}
 template <typename Predicate>
 bool eventually(Predicate p, std::chrono::milliseconds limit = 10s) {
   auto deadline = std::chrono::steady_clock::now() + limit;
@@ -95,6 +100,41 @@ TEST_F(Testability, AFrozenDaemonStillTakesTheCommandThatReleasesIt) {
   EXPECT_EQ(VSAReplyError(rebuild.get()), 1u);
   EXPECT_NE(d.daemonOutput().find("Waiting on lock: 6"), std::string::npos);
   EXPECT_EQ(d.stop(), 0);
+}
+
+// Lock 0 cannot be had while a wipe frozen at lock 3 holds its identifier
+// lock: taking it waits, but the release of lock 3 (which lets it through)
+// and a stop of the daemon never wait behind it.
+TEST_F(Testability, TakingLockZeroBehindAFrozenWipeNeverHoldsUpReleasesOrAStop) {
+  const char* wipeEntitlement = "com.tamsk.private.Vessa.wipeContainer";
+  d.registerSelf("com.example.tester", VSAValue::Dictionary{{kAllowed, VSAValue(true)},
+                                                            {kTestability, VSAValue(true)},
+                                                            {wipeEntitlement, VSAValue(true)}});
+  ASSERT_EQ(VSAReplyError(d.request(create("com.example.app"))), 1u);
+  auto freezeWipe = [&] {
+    size_t seen = occurrences(d.daemonOutput(), "Waiting on lock: 3");
+    EXPECT_EQ(VSAReplyError(d.request(testLock(3, true))), 1u);
+    auto wipe = later(request(12, "com.example.app"));
+    EXPECT_TRUE(
+        eventually([&] { return occurrences(d.daemonOutput(), "Waiting on lock: 3") > seen; }));
+    return wipe;
+  };
+  auto wipe = freezeWipe();
+  auto lockZero = later(testLock(0, true));
+  EXPECT_EQ(lockZero.wait_for(300ms), std::future_status::timeout);
+  auto release = later(testLock(3, false));
+  ASSERT_EQ(release.wait_for(5s), std::future_status::ready);
+  EXPECT_EQ(VSAReplyError(release.get()), 1u);
+  EXPECT_EQ(VSAReplyError(wipe.get()), 1u);
+  EXPECT_EQ(VSAReplyError(lockZero.get()), 1u);
+  ASSERT_EQ(VSAReplyError(d.request(testLock(0, false))), 1u);
+
+  // Frozen again, with lock 1 waiting behind the wipe: a stop still ends it all.
+  auto second = freezeWipe();
+  auto lockOne = later(testLock(1, true));
+  EXPECT_EQ(lockOne.wait_for(300ms), std::future_status::timeout);
+  EXPECT_EQ(d.stop(), 0);
+  EXPECT_EQ(VSAReplyError(second.get()), 1u);
 }
 
 TEST_F(Testability, KilledWhileFrozenInsideACreationTheDaemonRestartsWithoutHalfAContainer) {
