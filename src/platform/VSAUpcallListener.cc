@@ -10,6 +10,7 @@
 #include <unistd.h>
 
 #include <cstring>
+#include <deque>
 
 #include "base/VSALog.h"
 #include "platform/VSADescriptorPassing.h"
@@ -35,12 +36,33 @@ bool readAll(int fd, std::vector<uint8_t>* out, uint64_t size) {
 
 }  // namespace
 
+// Wakes the I/O thread; shared with the peers, whose replies may come after
+// the listener has stopped.
+struct VSAUpcallListener::Waker {
+  int fd = ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
+  ~Waker() {
+    if (fd >= 0) ::close(fd);
+  }
+  void wake() const {
+    uint64_t one = 1;
+    [[maybe_unused]] ssize_t n = ::write(fd, &one, sizeof one);
+  }
+};
+
 struct VSAUpcallListener::Peer {
   int fd = -1;
   std::array<uint8_t, 32> token{};
   bool kernel = false;
   std::atomic<int> inFlight{0};
+  std::shared_ptr<Waker> waker;
+  // Replies the socket did not take yet, in order; at most kMaxInFlight,
+  // since a peer is not read while that many are unanswered.
+  std::mutex outMutex;
+  std::deque<std::pair<std::vector<uint8_t>, int>> out;
+
   ~Peer() {
+    for (auto& [message, memfd] : out)
+      if (memfd >= 0) ::close(memfd);
     if (fd >= 0) ::close(fd);
   }
   void send(const std::vector<uint8_t>& message, const std::vector<uint8_t>* memory) {
@@ -49,11 +71,34 @@ struct VSAUpcallListener::Peer {
       VSALogIn(VSALogCategory::Upcall, kVSALogError, kOrigin,
                "Could not copy the reply buffer (%zu bytes): %s", memory->size(),
                std::strerror(errno));
-    if (VSASendWithDescriptor(fd, message, memfd, MSG_DONTWAIT) < 0)
-      VSALogIn(VSALogCategory::Upcall, kVSALogError, kOrigin, "Could not send an upcall reply: %s",
-               std::strerror(errno));
-    if (memfd >= 0) ::close(memfd);
-    --inFlight;
+    std::lock_guard lock(outMutex);
+    out.emplace_back(message, memfd);
+    // Behind replies already waiting, it waits too; the I/O thread writes
+    // them out once the socket has room, so the kernel gets every answer.
+    if (!_lock_flush()) waker->wake();
+  }
+  bool hasPendingReplies() {
+    std::lock_guard lock(outMutex);
+    return !out.empty();
+  }
+  // Writes what the socket takes now; false while replies still wait.
+  bool flush() {
+    std::lock_guard lock(outMutex);
+    return _lock_flush();
+  }
+  bool _lock_flush() {
+    while (!out.empty()) {
+      auto& [message, memfd] = out.front();
+      if (VSASendWithDescriptor(fd, message, memfd, MSG_DONTWAIT) < 0) {
+        if (errno == EAGAIN || errno == EWOULDBLOCK || errno == EINTR) return false;
+        VSALogIn(VSALogCategory::Upcall, kVSALogError, kOrigin,
+                 "Could not send an upcall reply: %s", std::strerror(errno));
+      }
+      if (memfd >= 0) ::close(memfd);
+      out.pop_front();
+      --inFlight;
+    }
+    return true;
   }
 };
 
@@ -67,9 +112,9 @@ VSAUpcallListener::~VSAUpcallListener() { stop(); }
 bool VSAUpcallListener::start(Handler handler, VSAErrorRef* error) {
   handler_ = std::move(handler);
   listenFd_ = ::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
-  wakeFd_ = ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
+  waker_ = std::make_shared<Waker>();
   int rc =
-      listenFd_ < 0 || wakeFd_ < 0 ? errno : VSABindListeningSocket(listenFd_, path_, 0600, 16);
+      listenFd_ < 0 || waker_->fd < 0 ? errno : VSABindListeningSocket(listenFd_, path_, 0600, 16);
   if (rc != 0) {
     VSASetError(error, VSA_POSIX_ERROR(rc, VSAFormat("binding %@", path_)));
     if (listenFd_ >= 0) ::close(listenFd_);  // the file at the path is not this one's to remove
@@ -83,37 +128,44 @@ bool VSAUpcallListener::start(Handler handler, VSAErrorRef* error) {
 
 void VSAUpcallListener::stop() {
   stopping_ = true;
-  if (wakeFd_ >= 0) {
-    uint64_t one = 1;
-    [[maybe_unused]] ssize_t n = ::write(wakeFd_, &one, sizeof one);
-  }
+  if (waker_) waker_->wake();
   if (thread_.joinable()) thread_.join();
   peers_.clear();
   if (listenFd_ >= 0) {
     ::unlink(path_.c_str());  // no stale socket for the next start's waiters
     ::close(listenFd_);
   }
-  if (wakeFd_ >= 0) ::close(wakeFd_);
-  listenFd_ = wakeFd_ = -1;
+  waker_.reset();
+  listenFd_ = -1;
 }
 
 void VSAUpcallListener::run() {
   while (!stopping_) {
-    std::vector<struct pollfd> fds = {{wakeFd_, POLLIN, 0}, {listenFd_, POLLIN, 0}};
+    std::vector<struct pollfd> fds = {{waker_->fd, POLLIN, 0}, {listenFd_, POLLIN, 0}};
     std::vector<std::shared_ptr<Peer>> polled;
     for (const auto& p : peers_) {
-      if (p->inFlight >= kMaxInFlight) continue;
-      fds.push_back({p->fd, POLLIN, 0});
+      short events = p->hasPendingReplies() ? POLLOUT : 0;
+      if (p->inFlight < kMaxInFlight) events |= POLLIN;
+      if (!events) continue;  // answers still being worked out
+      fds.push_back({p->fd, events, 0});
       polled.push_back(p);
     }
     // A full peer is looked at again soon, when its replies have gone out.
     int n = ::poll(fds.data(), fds.size(), polled.size() < peers_.size() ? 10 : -1);
     if (n < 0 && errno != EINTR) break;
     if (stopping_) break;
+    if (fds[0].revents & POLLIN) {
+      uint64_t count;
+      [[maybe_unused]] ssize_t r = ::read(waker_->fd, &count, sizeof count);
+    }
     if (fds[1].revents & POLLIN) acceptPeer();
     for (size_t i = 0; i < polled.size(); ++i) {
-      if (!fds[i + 2].revents) continue;
-      if (!receive(polled[i])) std::erase(peers_, polled[i]);  // replies still queued keep it alive
+      short revents = fds[i + 2].revents;
+      if (!revents) continue;
+      if (revents & POLLOUT) polled[i]->flush();
+      if (!(revents & (POLLIN | POLLHUP | POLLERR))) continue;
+      // Replies still queued keep a dropped peer alive until they are sent.
+      if (!receive(polled[i])) std::erase(peers_, polled[i]);
     }
   }
 }
@@ -123,16 +175,19 @@ void VSAUpcallListener::acceptPeer() {
   if (fd < 0) return;
   auto peer = std::make_shared<Peer>();
   peer->fd = fd;
+  peer->waker = waker_;
   auto token = VSAAuditToken::fromSocket(fd);
-  if (!token || peers_.size() >= kMaxPeers) {
-    VSALogIn(VSALogCategory::Upcall, kVSALogError, kOrigin, "Refusing an upcall peer (%zu open)",
-             peers_.size());
+  // A peer outside the daemon's pid namespace is reported with pid 0, the
+  // kernel's own: it could never be told apart, so it is not served at all.
+  if (!token || token->pid <= 0 || peers_.size() >= kMaxPeers) {
+    VSALogIn(VSALogCategory::Upcall, kVSALogError, kOrigin,
+             "Refusing an upcall peer (pid %d, %zu open)", token ? token->pid : -1, peers_.size());
     return;  // the peer's destructor closes it
   }
   auto entry = registry_ ? registry_->entryForAuditToken(*token) : std::nullopt;
   peer->kernel = entry && entry->kernelBridge;
   VSAAuditToken sender = *token;
-  if (peer->kernel) sender.pid = 0;  // the kernel's messages carry pid 0
+  if (peer->kernel) sender.pid = 0;  // the kernel's messages carry pid 0, and only its
   peer->token = sender.bytes();
   VSALogIn(VSALogCategory::Upcall, kVSALogDebug, kOrigin, "Upcall peer %@ (kernel: %d)",
            token->description(), peer->kernel);
@@ -177,5 +232,6 @@ bool VSAUpcallListener::receive(const std::shared_ptr<Peer>& peer) {
            [peer](const std::vector<uint8_t>& message, const std::vector<uint8_t>* memory) {
              peer->send(message, memory);
            });
-  return true;
+  // Anyone but the kernel is answered once (with its refusal) and let go.
+  return peer->kernel;
 }

@@ -11,8 +11,14 @@
 // `maxMemorySize` bytes; a larger one is reported by size only) and closed;
 // extra descriptors make the packet malformed. The handler gets each packet
 // on the I/O thread and answers later, from any thread, through the reply
-// function it is given. Bounded: at most `kMaxPeers` connections, and a
-// peer with `kMaxInFlight` unanswered packets is not read until answered.
+// function it is given. A reply the socket does not take at once waits in
+// the peer's queue and is written out by the I/O thread as room appears:
+// none is dropped because the kernel's side was slow to read. Bounded: at
+// most `kMaxPeers` connections, and a peer with `kMaxInFlight` unanswered
+// packets is not read until answered. A peer reported with pid 0 (one outside
+// the daemon's pid namespace) is refused, so that pid 0 means the bridge
+// alone; a peer that is not the bridge gets the answer to its first packet
+// (a refusal) and is disconnected.
 #pragma once
 
 #include <atomic>
@@ -58,6 +64,7 @@ class VSAUpcallListener {
 
  private:
   struct Peer;
+  struct Waker;
   void run();
   void acceptPeer();
   bool receive(const std::shared_ptr<Peer>& peer);
@@ -67,7 +74,7 @@ class VSAUpcallListener {
   uint64_t maxMemorySize_;
   Handler handler_;
   int listenFd_ = -1;
-  int wakeFd_ = -1;
+  std::shared_ptr<Waker> waker_;
   std::atomic<bool> stopping_{false};
   std::thread thread_;
   std::vector<std::shared_ptr<Peer>> peers_;

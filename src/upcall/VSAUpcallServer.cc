@@ -82,6 +82,13 @@ int32_t readRequest(sb_packbuff* in, ProcessRequest* r) {
         r->systemGroups.push_back(value);
         break;
     }
+    // Each one may make a container: one launch must not ask for thousands.
+    if (r->groups.size() > kVSAUpcallMaxGroupItems ||
+        r->systemGroups.size() > kVSAUpcallMaxGroupItems) {
+      logUpcall(kVSALogError, "Too many items of type %s in one upcall (at most %zu)",
+                itemName(type), kVSAUpcallMaxGroupItems);
+      return kVSAUpcallInvalidArgument;
+    }
   }
   return kVSAUpcallSuccess;
 }

@@ -57,6 +57,8 @@ enum : uint16_t {
 // Requests larger than this are refused as malformed (-300): a real one
 // names a handful of identifiers.
 inline constexpr uint64_t kVSAUpcallMaxRequestSize = 1u << 20;
+// Group and system-group identifiers one request may name, each list.
+inline constexpr size_t kVSAUpcallMaxGroupItems = 128;
 
 struct VSAUpcallEnvironment {
   std::shared_ptr<VSAUserIdentityCache> userIdentityCache;

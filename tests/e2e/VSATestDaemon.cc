@@ -91,13 +91,20 @@ void VSATestDaemon::registerVessactl(const std::string& name, const std::string&
 }
 
 bool VSATestDaemon::start(bool waitForSocket, std::vector<std::string> extraArgs) {
-  std::vector<std::string> args = {VESSAD_PATH, "--root", root_, "--stderr", "--log-level", "7"};
+  std::vector<std::string> args = prefix_;
+  for (const char* a : {VESSAD_PATH, "--root", root_.c_str(), "--stderr", "--log-level", "7"})
+    args.push_back(a);
   args.insert(args.end(), extraArgs.begin(), extraArgs.end());
   pid_ = fork();
   if (pid_ == 0) {
     int out = open((root_ + "/vessad.out").c_str(), O_WRONLY | O_CREAT | O_APPEND, 0644);
     dup2(out, 1);
     dup2(out, 2);
+    if (activationFd_ >= 0) {
+      dup2(activationFd_, 3);
+      setenv("LISTEN_FDS", "1", 1);
+      setenv("LISTEN_PID", std::to_string(getpid()).c_str(), 1);
+    }
     std::vector<char*> argv;
     for (auto& a : args) argv.push_back(a.data());
     argv.push_back(nullptr);

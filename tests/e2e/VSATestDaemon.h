@@ -64,6 +64,12 @@ class VSATestDaemon {
   void registerVessactl(const std::string& name, const std::string& signingIdentifier,
                         const VSAValue& entitlements);
 
+  // Runs vessad through `prefix` (for example a program that starts it in a
+  // namespace of its own) from the next start on.
+  void setLaunchPrefix(std::vector<std::string> prefix) { prefix_ = std::move(prefix); }
+  // Hands the next start `fd` as its request socket, as socket activation
+  // does (the daemon takes over a socket that may already hold connections).
+  void setActivationSocket(int fd) { activationFd_ = fd; }
   // Starts vessad; waits for its socket unless told not to.
   bool start(bool waitForSocket = true, std::vector<std::string> extraArgs = {});
   // SIGTERM and wait; returns the exit status (or -1 on a signal/time-out).
@@ -95,4 +101,6 @@ class VSATestDaemon {
  private:
   std::string root_;
   pid_t pid_ = -1;
+  std::vector<std::string> prefix_;
+  int activationFd_ = -1;
 };
