@@ -453,7 +453,7 @@ int runMemory(const std::string& socket, const Options& o) {
   Result made = runClients(
       socket, make, [&](int c, int i) { return request(0, id(c * make.requests + i), true); },
       true);
-  // A root client may hold only so many connections: the rest come from another user.
+  // One process may hold only so many connections: the rest come from another one.
   const int own = std::min(o.idle, 48);
   std::vector<std::shared_ptr<VSAIPCClient>> idle;
   for (int i = 0; i < own; ++i) {

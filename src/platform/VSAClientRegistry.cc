@@ -162,10 +162,10 @@ std::optional<VSAClientRegistryEntry> VSAClientRegistry::entryForPeer(
     const VSAAuditToken& token, const std::string& executable) {
   auto entry = entryForExecutable(executable);
   if (!entry) return std::nullopt;
-  if (entry->user && *entry->user != token.uid) {
+  if (entry->user != token.uid) {
     VSALogIn(VSALogCategory::Relay, kVSALogError, "VSAClientRegistry",
              "Peer %@ runs %s as uid %u, but its registry entry requires uid %u: no identity",
-             token, executable, token.uid, *entry->user);
+             token, executable, token.uid, entry->user);
     return std::nullopt;
   }
   // The files may have changed hands since the entry was loaded.

@@ -4,10 +4,13 @@
 // executable: "Executable" (its path on the device, resolved below the system
 // root), "SigningIdentifier", "Entitlements" (dictionary), "Sandboxed" and
 // "KernelBridge" (booleans) and optionally "User" (the uid the client must run
-// as: an integer, or a user name from the root's user database). A peer is
-// matched on the real path of its /proc/<pid>/exe, only while its audit token
-// still names the same process, and only when its uid is the entry's "User"
-// (if one is named). A file that is not owned by root, is writable by others,
+// as: an integer, or a user name from the root's user database; root when
+// none is named). A peer is matched on the real path of its /proc/<pid>/exe,
+// only while its audit token still names the same process, and only when its
+// uid is the entry's user. The uid is the one thing the kernel fixes when a
+// peer connects; the program it runs can change by exec before the daemon
+// looks. Tying each entry to one uid means no process can become a program
+// registered for another uid that way. A file that is not owned by root, is writable by others,
 // or is malformed is skipped with a log line, and so is an entry whose
 // executable, or the directory holding it, could be changed by anyone but
 // root (not root-owned, or group/world-writable): whoever can rewrite the
@@ -36,7 +39,7 @@ struct VSAClientRegistryEntry {
   VSAValue entitlements = VSAValue::dictionary();
   bool sandboxed = false;
   bool kernelBridge = false;
-  std::optional<uid_t> user;  // the uid the peer must have, when named
+  uid_t user = 0;  // the uid the peer must have: "User", root when none is named
 };
 
 class VSAClientRegistry {

@@ -27,7 +27,7 @@ constexpr auto kRefusalLogInterval = std::chrono::seconds(1);
 struct VSAIPCListener::Peer {
   VSAIPCConnectionRef connection;
   VSAFrameReader reader;
-  uid_t uid = 0;
+  std::pair<pid_t, uint64_t> process;
   Clock::time_point lastFrame;     // accept, or the last complete frame
   Clock::time_point frameStarted;  // first byte of the incomplete frame; epoch if none
   size_t countedInput = 0;         // this peer's share of bufferedInput_
@@ -201,7 +201,7 @@ void VSAIPCListener::stop() {
       peer->connection->cancel();
     }
     peers_.clear();
-    connectionsPerUID_.clear();
+    connectionsPerProcess_.clear();
     bufferedInput_ = 0;
   }
   {
@@ -247,6 +247,9 @@ void VSAIPCListener::run() {
       ready += fd != stopFd_ && fd != resumer_->fd && fd != listenFd_;
     }
     inlineAllowed_ = ready == 1;
+    // New connections first, so that none waits behind the requests read here.
+    for (int i = 0; i < n; ++i)
+      if (events[i].data.fd == listenFd_ && accepting_) acceptPeers();
     for (int i = 0; i < n; ++i) {
       int fd = events[i].data.fd;
       uint32_t what = events[i].events;
@@ -265,7 +268,7 @@ void VSAIPCListener::run() {
       } else if (fd == resumer_->fd) {
         resumePeers();
       } else if (fd == listenFd_) {
-        if (accepting_) acceptPeers();
+        continue;  // accepted above
       } else {
         if (what & EPOLLOUT) writePeer(fd);
         if (what & (EPOLLIN | EPOLLRDHUP | EPOLLHUP | EPOLLERR)) {
@@ -334,24 +337,21 @@ void VSAIPCListener::acceptPeers() {
       ::close(fd);
       continue;
     }
-    {
-      std::lock_guard lock(peersMutex_);
-      if (connectionsPerUID_[token->uid] >= limits_.maxConnectionsPerUID) {
-        ::close(fd);
-        noteRefusal("too many connections from one uid");
-        continue;
-      }
+    ProcessKey process{token->pid, token->startTime};
+    if (!admit(process)) {
+      ::close(fd);
+      continue;
     }
     // Pins the peer's executable and identity now, before it can exec anything else.
     auto peer = std::make_unique<Peer>();
     peer->connection = std::make_shared<VSAIPCConnection>(
         fd, nextIdentifier_++, *token, registry_.get(), limits_.maxPendingOutput);
-    peer->uid = token->uid;
+    peer->process = process;
     peer->lastFrame = Clock::now();
     VSAIPCConnection& connection = *peer->connection;
     {
       std::lock_guard lock(peersMutex_);
-      ++connectionsPerUID_[peer->uid];
+      ++connectionsPerProcess_[peer->process];
       peers_[fd] = std::move(peer);
     }
     epoll_event ev{};
@@ -360,6 +360,75 @@ void VSAIPCListener::acceptPeers() {
     epoll_ctl(epollFd_, EPOLL_CTL_ADD, fd, &ev);
     connection.attachToPoller(epollFd_);
   }
+}
+
+bool VSAIPCListener::admit(const ProcessKey& process) {
+  auto countOf = [this](const ProcessKey& p) {
+    std::lock_guard lock(peersMutex_);
+    auto it = connectionsPerProcess_.find(p);
+    return it == connectionsPerProcess_.end() ? size_t{0} : it->second;
+  };
+  auto total = [this] {
+    std::lock_guard lock(peersMutex_);
+    return peers_.size();
+  };
+  if (countOf(process) >= limits_.maxConnectionsPerProcess) {
+    dropHungUpPeers(&process);
+    if (countOf(process) >= limits_.maxConnectionsPerProcess) {
+      noteRefusal("too many connections from one process");
+      return false;
+    }
+  }
+  if (total() >= limits_.maxConnections) {
+    dropHungUpPeers(nullptr);
+    if (total() >= limits_.maxConnections && !shedLargestHolder()) {
+      noteRefusal("too many connections, none of them idle");
+      return false;
+    }
+  }
+  return true;
+}
+
+void VSAIPCListener::dropHungUpPeers(const ProcessKey* process) {
+  std::vector<int> candidates;
+  {
+    std::lock_guard lock(peersMutex_);
+    for (const auto& [fd, peer] : peers_)
+      if (!process || peer->process == *process) candidates.push_back(fd);
+  }
+  for (int fd : candidates) {
+    // Bytes still to read (a last request) keep it; end of stream or an error does not.
+    uint8_t byte;
+    ssize_t n = ::recv(fd, &byte, 1, MSG_PEEK | MSG_DONTWAIT);
+    if (n == 0 || (n < 0 && errno != EAGAIN && errno != EWOULDBLOCK && errno != EINTR))
+      dropPeer(fd, nullptr);
+  }
+}
+
+bool VSAIPCListener::shedLargestHolder() {
+  std::vector<int> idle;
+  pid_t holder = 0;
+  {
+    std::lock_guard lock(peersMutex_);
+    auto largest =
+        std::max_element(connectionsPerProcess_.begin(), connectionsPerProcess_.end(),
+                         [](const auto& a, const auto& b) { return a.second < b.second; });
+    if (largest == connectionsPerProcess_.end()) return false;
+    holder = largest->first.first;
+    for (const auto& [fd, peer] : peers_) {
+      const VSAIPCConnection& c = *peer->connection;
+      if (peer->process == largest->first && c.requestsInFlight() == 0 &&
+          peer->reader.pending() == 0 && c.pendingOutput() == 0)
+        idle.push_back(fd);
+    }
+  }
+  for (int fd : idle) dropPeer(fd, nullptr);
+  if (!idle.empty())
+    VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin,
+             "Connection limit of %zu reached: closed %zu idle connections of pid %d, which held "
+             "the most",
+             limits_.maxConnections, idle.size(), holder);
+  return !idle.empty();
 }
 
 void VSAIPCListener::dropPeer(int fd, const char* why) {
@@ -374,7 +443,7 @@ void VSAIPCListener::dropPeer(int fd, const char* why) {
   peer.connection->attachToPoller(-1);
   peer.connection->cancel();
   bufferedInput_ -= peer.countedInput;
-  if (--connectionsPerUID_[peer.uid] == 0) connectionsPerUID_.erase(peer.uid);
+  if (--connectionsPerProcess_[peer.process] == 0) connectionsPerProcess_.erase(peer.process);
   peers_.erase(it);
 }
 
@@ -543,6 +612,12 @@ void VSAIPCListener::deliver(const VSAIPCConnectionRef& connection, std::optiona
   VSAWorkQueue::Block block = [handler, message] {
     if (handler) handler(message);
   };
-  if (route.runInline && inlineAllowed_ && queue->runIfIdle(block)) return;
+  if (route.runInline && inlineAllowed_) {
+    // Peers that connected meanwhile are accepted, and their programs pinned,
+    // before this thread is taken up by the request: the longer a connection
+    // waits in the backlog, the longer its process has to exec another program.
+    if (accepting_ && !acceptPaused_ && listenFd_ >= 0) acceptPeers();
+    if (queue->runIfIdle(block)) return;
+  }
   queue->async(std::move(block));
 }

@@ -13,7 +13,14 @@
 // not decode, or whose "MessageID" is neither an integer nor a string of at
 // most kVSAMaxMessageIDLength bytes, is delivered as a message without reply
 // context. Resources are bounded by VSAIPCListenerLimits:
-//  - connections per uid (root included); the excess is accepted and closed;
+//  - connections per process (pid and start time: every app shares the
+//    mobile user's uid, so a bound per uid would let one app shut out the
+//    rest); the excess of one process is accepted and closed;
+//  - connections of all processes together: at that bound the idle
+//    connections of the process holding the most are closed to make room
+//    (a newcomer is refused only when none is idle). Before either bound
+//    refuses anyone, connections whose peers have already hung up are
+//    dropped, so a closed connection never counts;
 //  - when the process is out of descriptors, a reserve descriptor is given up
 //    for a moment to accept and close the waiting peer, so the accept loop
 //    neither spins nor starves those already connected;
@@ -53,7 +60,8 @@
 inline constexpr size_t kVSAMaxMessageIDLength = 64;
 
 struct VSAIPCListenerLimits {
-  size_t maxConnectionsPerUID = 64;
+  size_t maxConnectionsPerProcess = 64;
+  size_t maxConnections = 1024;                           // all processes together
   size_t maxPendingOutput = kVSADefaultMaxPendingOutput;  // per connection
   size_t maxBufferedInput = 64u << 20;                    // all connections together
   size_t maxRequestsInFlight = 256;                       // per connection
@@ -105,6 +113,8 @@ class VSAIPCListener {
   struct Peer;
   struct Resumer;
   using Clock = std::chrono::steady_clock;
+  // A process: its pid and start time, so a reused pid is another process.
+  using ProcessKey = std::pair<pid_t, uint64_t>;
   void run();
   void acceptPeers();
   // Accepts and closes one waiting peer using the reserve descriptor.
@@ -117,6 +127,13 @@ class VSAIPCListener {
   void resumePeers();
   void writePeer(int fd);
   void dropPeer(int fd, const char* why);
+  // Whether a connection of `process` may be added, making room if it can.
+  bool admit(const ProcessKey& process);
+  // Drops the connections (of `process`, or of all) whose peers hung up.
+  void dropHungUpPeers(const ProcessKey* process);
+  // Closes the idle connections of the process holding the most; false
+  // when there was none to close.
+  bool shedLargestHolder();
   void sweep(Clock::time_point now);
   void noteRefusal(const char* why);
   void deliver(const VSAIPCConnectionRef& connection, std::optional<VSAValue> body,
@@ -150,7 +167,7 @@ class VSAIPCListener {
   bool threadExited_ = false;
   mutable std::mutex peersMutex_;
   std::map<int, std::unique_ptr<Peer>> peers_;
-  std::map<uid_t, size_t> connectionsPerUID_;
+  std::map<ProcessKey, size_t> connectionsPerProcess_;
   size_t bufferedInput_ = 0;    // I/O thread only
   bool inlineAllowed_ = false;  // I/O thread only: one peer is ready in this wake-up
   uint64_t nextIdentifier_ = 1;

@@ -11,9 +11,11 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <climits>
 #include <cstring>
 #include <filesystem>
+#include <thread>
 
 #include "base/VSAPlist.h"
 #include "e2e/VSATestDaemon.h"
@@ -28,7 +30,8 @@ const char* kAllowed = "com.tamsk.private.Vessa.allowed";
 // Sends a frame and reads bytes until the reply frame is complete, the peer
 // closes, or two seconds pass. Uses system calls only, so it is safe in a
 // child forked from this multithreaded process.
-ssize_t exchange(int fd, const std::vector<uint8_t>& request, uint8_t* reply, size_t capacity) {
+ssize_t exchange(int fd, const std::vector<uint8_t>& request, uint8_t* reply, size_t capacity,
+                 int timeoutMs = 2000) {
   if (::send(fd, request.data(), request.size(), MSG_NOSIGNAL) !=
       static_cast<ssize_t>(request.size()))
     return -1;
@@ -40,7 +43,7 @@ ssize_t exchange(int fd, const std::vector<uint8_t>& request, uint8_t* reply, si
       if (got >= 4 + length || got == capacity) return static_cast<ssize_t>(got);
     }
     pollfd pfd{fd, POLLIN, 0};
-    if (poll(&pfd, 1, 2000) <= 0) return static_cast<ssize_t>(got);
+    if (poll(&pfd, 1, timeoutMs) <= 0) return static_cast<ssize_t>(got);
     ssize_t n = recv(fd, reply + got, capacity - got, 0);
     if (n <= 0) return static_cast<ssize_t>(got);
     got += static_cast<size_t>(n);
@@ -152,5 +155,124 @@ TEST(ClientIdentity, ExecingARegisteredExecutableAfterConnectingGainsNothing) {
   EXPECT_EQ(VSAReplyError(d.request(VSAValue::Dictionary{{"Command", VSAValue(19u)}})), 18u);
   EXPECT_EQ(d.stop(), 0);
 }
+
+// A process of the mobile user connects, and execs a program registered for
+// root before the daemon has accepted its connection (the daemon is not
+// running yet and takes the socket over later, as under socket activation,
+// or it is busy serving others); a child then asks on the inherited socket.
+// Whatever the process runs by the time it is accepted, its uid is the one it
+// connected with, and an entry for root never matches it.
+class ExecBeforeAccept : public ::testing::TestWithParam<bool> {};
+
+TEST_P(ExecBeforeAccept, AMobileProcessNeverBecomesAClientRegisteredForRoot) {
+  bool beforeTheDaemonRuns = GetParam();
+  VSATestDaemon d;
+  chmod(d.root().c_str(), 0755);  // the mobile user reaches the registered program
+  std::string registered = d.path("/usr/bin/registered-sleeper");
+  std::filesystem::copy_file("/bin/sleep", registered);
+  chmod(registered.c_str(), 0755);
+  VSAErrorRef error;
+  ASSERT_TRUE(VSA_writeToURL(
+      VSAValue::Dictionary{{"Executable", VSAValue("/usr/bin/registered-sleeper")},
+                           {"SigningIdentifier", VSAValue("com.example.sleeper")},
+                           {"Entitlements", VSAValue::Dictionary{{kAllowed, VSAValue(true)}}}},
+      d.path("/etc/vessad/clients.d/sleeper.plist"), 0, &error));
+  d.registerSelf("com.example.busy", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
+  std::string socketPath = d.socketPath();
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  std::strncpy(addr.sun_path, socketPath.c_str(), sizeof addr.sun_path - 1);
+  int held = -1;
+  if (beforeTheDaemonRuns) {
+    held = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    ASSERT_EQ(bind(held, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+    chmod(socketPath.c_str(), 0666);
+    ASSERT_EQ(listen(held, 16), 0);
+  } else {
+    ASSERT_TRUE(d.start());
+  }
+  std::atomic<bool> busy{!beforeTheDaemonRuns};
+  std::thread load([&] {
+    while (busy) d.request(VSAValue::Dictionary{{"Command", VSAValue(19u)}}, 2s);
+  });
+
+  auto request = *VSAFrameCodec::encode(
+      VSAValue::Dictionary{{"Command", VSAValue(19u)}, {"MessageID", VSAValue(1u)}}, &error);
+  int report[2];
+  ASSERT_EQ(pipe(report), 0);
+  pid_t connector = fork();
+  if (connector == 0) {
+    ::close(report[0]);
+    if (setgid(501) != 0 || setuid(501) != 0) _exit(3);
+    int fd = socket(AF_UNIX, SOCK_STREAM, 0);
+    if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) _exit(2);
+    pid_t self = getpid();
+    if (fork() == 0) {
+      char link[64], target[PATH_MAX];
+      snprintf(link, sizeof link, "/proc/%d/exe", self);
+      for (int i = 0; i < 500; ++i) {
+        ssize_t len = readlink(link, target, sizeof target - 1);
+        if (len > 0 && (target[len] = '\0', std::strstr(target, "registered-sleeper"))) break;
+        usleep(2000);
+      }
+      uint8_t reply[4096];
+      ssize_t m = exchange(fd, request, reply, sizeof reply, 15000);
+      (void)!write(report[1], &m, sizeof m);
+      if (m > 0) (void)!write(report[1], reply, static_cast<size_t>(m));
+      _exit(0);
+    }
+    ::close(report[1]);
+    char arg0[] = "registered-sleeper", arg1[] = "30";
+    char* argv[] = {arg0, arg1, nullptr};
+    execv(registered.c_str(), argv);
+    _exit(127);
+  }
+  ASSERT_GT(connector, 0);
+  ::close(report[1]);
+  if (beforeTheDaemonRuns) {
+    // The program is swapped while the connection waits in the backlog; then
+    // the daemon starts and takes the socket over.
+    char link[64], target[PATH_MAX];
+    snprintf(link, sizeof link, "/proc/%d/exe", connector);
+    for (int i = 0; i < 500; ++i) {
+      ssize_t len = readlink(link, target, sizeof target - 1);
+      if (len > 0 && (target[len] = '\0', std::strstr(target, "registered-sleeper"))) break;
+      std::this_thread::sleep_for(10ms);
+    }
+    std::this_thread::sleep_for(100ms);
+    d.setActivationSocket(held);
+    ASSERT_TRUE(d.start());
+    ::close(held);
+  }
+  ssize_t n = -1;
+  std::vector<uint8_t> bytes(4096);
+  std::optional<VSAValue> reply;
+  if (read(report[0], &n, sizeof n) == sizeof n && n > 0) {
+    size_t got = 0;
+    while (got < static_cast<size_t>(n)) {
+      ssize_t r = read(report[0], bytes.data() + got, static_cast<size_t>(n) - got);
+      if (r <= 0) break;
+      got += static_cast<size_t>(r);
+    }
+    reply = decodeReply(bytes.data(), got);
+  }
+  busy = false;
+  load.join();
+  kill(connector, SIGKILL);
+  waitpid(connector, nullptr, 0);
+  ::close(report[0]);
+  // Never the registered client's answer (18): unentitled (55), or dropped.
+  EXPECT_NE(VSAReplyError(reply), 18u);
+  if (beforeTheDaemonRuns) {
+    EXPECT_EQ(VSAReplyError(reply), 55u) << "accepted after the exec, as uid 501";
+  }
+  EXPECT_EQ(d.stop(), 0);
+}
+
+INSTANTIATE_TEST_SUITE_P(ClientIdentity, ExecBeforeAccept, ::testing::Values(true, false),
+                         [](const auto& info) {
+                           return info.param ? std::string("BeforeTheDaemonRuns")
+                                             : std::string("WhileBusy");
+                         });
 
 }  // namespace

@@ -97,8 +97,11 @@ TEST_F(VSAClientRegistryTest, AnEntryNamingAUserIdentifiesOnlyThatUID) {
   EXPECT_FALSE(registry.entryForPeer(root, host("/usr/bin/byname")));
   EXPECT_TRUE(registry.entryForPeer(root, host("/usr/bin/rootname")));
   EXPECT_FALSE(registry.entryForPeer(mobile, host("/usr/bin/rootname")));
-  for (auto* token : {&root, &mobile, &other})
-    EXPECT_TRUE(registry.entryForPeer(*token, host("/usr/bin/anyone")));
+  // Naming no user means root: a process of another uid can exec the program,
+  // but never becomes that client.
+  EXPECT_TRUE(registry.entryForPeer(root, host("/usr/bin/anyone")));
+  EXPECT_FALSE(registry.entryForPeer(mobile, host("/usr/bin/anyone")));
+  EXPECT_FALSE(registry.entryForPeer(other, host("/usr/bin/anyone")));
   // A user that cannot be resolved, or a value of the wrong type, refuses the entry.
   EXPECT_FALSE(registry.entryForPeer(root, host("/usr/bin/unknown")));
   EXPECT_FALSE(registry.entryForPeer(root, host("/usr/bin/malformed")));

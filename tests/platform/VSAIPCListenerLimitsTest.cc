@@ -1,5 +1,5 @@
 // The listener's resource bounds: replies never wait for a slow reader,
-// per-connection output, per-uid connections, descriptor exhaustion, frame and
+// per-connection output, connections per process and overall, descriptor exhaustion, frame and
 // idle time-outs, the input budget and the "MessageID" rule.
 #include <gtest/gtest.h>
 #include <poll.h>
@@ -290,9 +290,30 @@ TEST_F(VSAIPCListenerLimitsTest, MessageIDIsAnIntegerOrAShortString) {
   for (auto& p : problems_) EXPECT_NE(p.find("MessageID"), std::string::npos) << p;
 }
 
-TEST_F(VSAIPCListenerLimitsTest, ConnectionsPerUIDAreCapped) {
+// In a forked child: connects, sends `frame`, and exits 0 when the echo came.
+// System calls only: the parent has threads.
+pid_t echoFromAnotherProcess(const std::string& path, const std::vector<uint8_t>& frame) {
+  pid_t child = fork();
+  if (child != 0) return child;
+  int fd = connectRaw(path);
+  if (fd < 0 || !sendAll(fd, frame)) _exit(2);
+  uint8_t buf[4096];
+  pollfd pfd{fd, POLLIN, 0};
+  if (poll(&pfd, 1, 5000) <= 0 || recv(fd, buf, sizeof buf, 0) <= 4) _exit(1);
+  _exit(0);
+}
+
+int exitStatus(pid_t child) {
+  int status = -1;
+  waitpid(child, &status, 0);
+  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+}
+
+// Every app runs as the same uid: the bound is per process, another process
+// is not refused for it, and connections closed a moment ago do not count.
+TEST_F(VSAIPCListenerLimitsTest, ConnectionsPerProcessAreCapped) {
   VSAIPCListenerLimits limits;
-  limits.maxConnectionsPerUID = 4;
+  limits.maxConnectionsPerProcess = 4;
   start(limits);
   std::vector<int> fds;
   for (int i = 0; i < 6; ++i) {
@@ -317,15 +338,47 @@ TEST_F(VSAIPCListenerLimitsTest, ConnectionsPerUIDAreCapped) {
     }
   }
   EXPECT_EQ(listener_->connectionCount(), 4u);
-  // A closed connection makes room for a new one.
-  ::close(fds[0]);
-  ASSERT_TRUE(waitForConnections(3, 2s));
-  fds[0] = connectRaw(path_);
-  ASSERT_TRUE(sendAll(fds[0], frameOf(VSAValue::Dictionary{{"Value", VSAValue(9)}})));
-  auto reply = readFrame(fds[0], 2s);
-  ASSERT_TRUE(reply);
-  EXPECT_EQ(reply->get("Echo")->int64Value(), 9);
+  // Another process of the same uid is served meanwhile.
+  EXPECT_EQ(exitStatus(echoFromAnotherProcess(path_, frameOf(VSAValue::Dictionary{}))), 0);
+  // Closed and reopened at once, before the listener saw the closes: all admitted.
+  for (int round = 0; round < 20; ++round) {
+    for (int i = 0; i < 4; ++i) {
+      ::close(fds[i]);
+      fds[i] = connectRaw(path_);
+    }
+    for (int i = 0; i < 4; ++i) {
+      ASSERT_TRUE(sendAll(fds[i], frameOf(VSAValue::Dictionary{{"Value", VSAValue(i)}})));
+      auto reply = readFrame(fds[i], 2s);
+      ASSERT_TRUE(reply) << "round " << round << ", connection " << i;
+    }
+  }
   for (int fd : fds) ::close(fd);
+}
+
+// At the bound over all processes, the process holding the most gives up its
+// idle connections; the newcomer and the others are served.
+TEST_F(VSAIPCListenerLimitsTest, AtTheOverallBoundTheLargestHolderMakesRoom) {
+  VSAIPCListenerLimits limits;
+  limits.maxConnections = 6;
+  start(limits);
+  std::vector<int> hoard;
+  for (int i = 0; i < 5; ++i) {
+    hoard.push_back(connectRaw(path_));
+    ASSERT_TRUE(waitForConnections(hoard.size(), 2s));
+  }
+  int busy = connectRaw(path_);  // one of the hoarder's, with a request in progress
+  ASSERT_TRUE(waitForConnections(6, 2s));
+  ASSERT_TRUE(sendAll(busy, frameOf(VSAValue::Dictionary{{"Value", VSAValue(7)},
+                                                         {"Hold", VSAValue(int64_t{1500})}})));
+  std::this_thread::sleep_for(200ms);
+  pid_t other = echoFromAnotherProcess(path_, frameOf(VSAValue::Dictionary{}));
+  for (int fd : hoard) EXPECT_TRUE(closedWithin(fd, 5s)) << "an idle connection of the hoarder";
+  auto reply = readFrame(busy, 5s);
+  ASSERT_TRUE(reply) << "the connection with a request in progress stays";
+  EXPECT_EQ(reply->get("Echo")->int64Value(), 7);
+  EXPECT_EQ(exitStatus(other), 0) << "the newcomer is served";
+  for (int fd : hoard) ::close(fd);
+  ::close(busy);
 }
 
 TEST_F(VSAIPCListenerLimitsTest, OutOfDescriptorsTheExcessIsShedWithoutSpinning) {
