@@ -48,7 +48,7 @@ std::vector<std::string> populate(const std::string& root, int containers, int o
   std::ofstream(root + "/etc/group") << "mobile:x:501:\n";
   // A device booting the build it last ran: a plain boot, not an upgrade.
   fs::create_directories(root + "/etc/vessad");
-  VSA_writeToURL(VSAValue::Dictionary{{"ProductBuildVersion", VSAValue("BENCH1")},
+  VSA_writeToURL(VSAValue::Dictionary{{"BuildVersion", VSAValue("BENCH1")},
                                       {"ReleaseType", VSAValue("User")}},
                  root + "/etc/vessad/system-version.plist", 0, nullptr);
   VSADaemonContext context{VSASystemRoot(root)};

@@ -1,31 +1,26 @@
 #!/usr/bin/env bash
-# Lays out a minimal demo device under a system root:
+# Lays out a demo device under a system root:
 #   scripts/provision-root.sh ROOT VESSACTL [CLIENT_USER]
-# - /etc/passwd and /etc/group with root and the "mobile" user (501)
-# - /etc/vessad/device.plist (an internal build, so debug lines reach the log)
-# - /etc/vessad/personas.plist: a personal, an enterprise and a universal persona
+# First `vessactl provision`, which writes what every root needs (the mobile
+# user 501, a personal persona, device properties, the system version, and
+# the client registry: vessactl as root's full client, vessa-upcall and
+# vessa-launch as the kernel bridge when they sit beside VESSACTL). Then what
+# the demo adds on top:
+# - etc/vessad/device.plist of an internal build, so debug lines reach the log
+#   and the test locks work;
+# - etc/vessad/personas.plist: a personal, an enterprise and a universal persona;
 # - a registered client "demo-installer" (a copy of vessactl holding the
 #   full-client entitlement) in /usr/bin and /etc/vessad/clients.d; with
 #   CLIENT_USER (a uid or a user name of the device), its entry carries "User"
-#   and it is recognised only when run as that user
-# - when vessa-upcall sits beside VESSACTL: a copy in /usr/bin registered as
-#   the kernel bridge ("KernelBridge"), the kernel's side of the upcall
-# The executable and its directory are root-owned and writable by root only:
-# the daemon refuses registry entries whose program others could rewrite.
+#   and it is recognised only when run as that user (root otherwise).
+# The executables and their directory are root-owned and writable by root
+# only: the daemon refuses registry entries whose program others could rewrite.
 set -euo pipefail
 root=$1
 vessactl=$2
 client_user=${3:-}
-mkdir -p "$root"/{etc/vessad/clients.d,usr/bin,run/vessad,tmp,private/var/mobile}
-cat > "$root/etc/passwd" <<'PW'
-root:x:0:0:root:/private/var/root:/bin/sh
-mobile:x:501:501:Mobile User:/private/var/mobile:/bin/sh
-PW
-cat > "$root/etc/group" <<'GR'
-root:x:0:
-mobile:x:501:
-systemusers:x:600:
-GR
+mkdir -p "$root"
+"$vessactl" --root "$root" provision >/dev/null
 cat > "$root/etc/vessad/device.plist" <<'PL'
 <?xml version="1.0" encoding="UTF-8"?>
 <plist version="1.0"><dict>
@@ -73,20 +68,5 @@ cat > "$root/etc/vessad/clients.d/demo-installer.plist" <<PL
 $user_key
 </dict></plist>
 PL
-upcall="$(dirname "$vessactl")/vessa-upcall"
-if [[ -x $upcall ]]; then
-  cp "$upcall" "$root/usr/bin/vessa-upcall"
-  chown 0:0 "$root/usr/bin/vessa-upcall"
-  chmod 0755 "$root/usr/bin/vessa-upcall"
-  cat > "$root/etc/vessad/clients.d/kernel-bridge.plist" <<PL
-<?xml version="1.0" encoding="UTF-8"?>
-<plist version="1.0"><dict>
-  <key>Executable</key><string>/usr/bin/vessa-upcall</string>
-  <key>SigningIdentifier</key><string>com.tamsk.kernel.sandbox-bridge</string>
-  <key>Entitlements</key><dict/>
-  <key>KernelBridge</key><true/>
-</dict></plist>
-PL
-fi
 chmod 0644 "$root"/etc/vessad/clients.d/*.plist
 echo "provisioned $root"

@@ -21,7 +21,7 @@ version() {
   cat > "$root/etc/vessad/system-version.plist" <<PL
 <?xml version="1.0" encoding="UTF-8"?>
 <plist version="1.0"><dict>
-  <key>ProductBuildVersion</key><string>$1</string><key>ReleaseType</key><string>User</string>
+  <key>BuildVersion</key><string>$1</string><key>ReleaseType</key><string>User</string>
 </dict></plist>
 PL
 }

@@ -24,7 +24,7 @@ struct VSAOldDevice {
   static void writeSystemVersion(const std::string& root, const std::string& build,
                                  const std::string& release = "User") {
     std::filesystem::create_directories(root + "/etc/vessad");
-    VSAValue version = VSAValue::Dictionary{{"ProductBuildVersion", VSAValue(build)},
+    VSAValue version = VSAValue::Dictionary{{"BuildVersion", VSAValue(build)},
                                             {"ReleaseType", VSAValue(release)}};
     VSA_writeToURL(version, root + "/etc/vessad/system-version.plist", 0, nullptr);
   }

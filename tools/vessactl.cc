@@ -15,6 +15,7 @@
 #include <string>
 
 #include "VSACtlOutput.h"
+#include "VSACtlProvision.h"
 #include "VSACtlStatus.h"
 #include "VSACtlVerbs.h"
 #include "VSACtlWaitIndicator.h"
@@ -83,6 +84,9 @@ void usage(FILE* out) {
     std::fprintf(out, "  %-12s %-42s %s\n", verb.name, verb.arguments, verb.summary);
   std::fprintf(out, "  %-12s %-42s %s\n", "status", "[--json]",
                "the daemon's state (queues, cache, death row, ...)");
+  std::fprintf(out, "  %-12s %-42s %s\n", "provision",
+               "[--mobile-user NAME] [--mobile-uid N] [--force]",
+               "lay out what a root needs before vessad serves (no daemon needed)");
   std::fprintf(out,
                "  container classes by name: data, bundle, plugin, plugin-data, group, system,\n"
                "  system-group, ... or by number (1-13); data when not given\n"
@@ -237,7 +241,12 @@ int main(int argc, char** argv) {
       return usage(stdout), 0;
     else if (a == "notifications")
       return printNotifications(root);
-    else if (a == "status") {
+    else if (a == "provision") {
+      std::vector<std::string> rest(argv + i + 1, argv + argc);
+      for (const auto& r : rest)
+        if (r == "--help" || r == "-h") return std::printf("%s", VSACtlProvision::help()), 0;
+      return VSACtlProvision::run(root, rest);
+    } else if (a == "status") {
       if (i + 1 < argc &&
           (std::string(argv[i + 1]) == "--help" || std::string(argv[i + 1]) == "-h"))
         return std::printf("%s", kStatusHelp), 0;

@@ -18,6 +18,8 @@
 #include "base/VSALog.h"
 #include "daemon/VSADaemon.h"
 #include "daemon/VSARootChecker.h"
+#include "platform/VSASystemRoot.h"
+#include "platform/VSAUserDatabase.h"
 
 namespace {
 void usage(FILE* out) {
@@ -47,6 +49,18 @@ int verify(const std::string& root, bool json) {
   std::fputs((json ? checker.json() : checker.text()).c_str(), stdout);
   return status;
 }
+// What a root lacks that the daemon cannot serve without ("" when nothing):
+// every per-user path hangs off the mobile user. Such a root is not retried,
+// it is reported with the command that provisions it.
+std::string missingFromRoot(const std::string& root) {
+  struct stat st;
+  if (::stat(root.c_str(), &st) != 0 || !S_ISDIR(st.st_mode)) return "the directory does not exist";
+  VSASystemRoot system(root);
+  if (!VSAUserDatabase(system).userNamed("mobile"))
+    return system.isHostRoot() ? "there is no user \"mobile\""
+                               : "there is no user \"mobile\" in " + system.resolve("/etc/passwd");
+  return "";
+}
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -75,6 +89,13 @@ int main(int argc, char** argv) {
     }
   }
   if (verifyRoot) return verify(options.root, json);
+  if (std::string missing = missingFromRoot(options.root); !missing.empty()) {
+    std::fprintf(stderr,
+                 "vessad: cannot serve from %s: %s; provision it with: vessactl --root %s "
+                 "provision\n",
+                 options.root.c_str(), missing.c_str(), options.root.c_str());
+    return 78;  // EX_CONFIG: a service manager does not restart it in a loop
+  }
   VSAInstallUncaughtExceptionHandler();
   // Signals are taken by one thread with sigwait; every other thread blocks them.
   sigset_t set;

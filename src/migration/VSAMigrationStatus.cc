@@ -10,7 +10,7 @@
 
 namespace {
 constexpr const char* kLastBuildInfo = "LastBuildInfo";
-constexpr const char* kBuildVersionKey = "ProductBuildVersion";
+constexpr const char* kBuildVersionKey = "BuildVersion";
 constexpr const char* kReleaseTypeKey = "ReleaseType";
 constexpr const char* kVersionNumberKey = "VSAMigrationVersionNumber";
 constexpr const char* kTimeKey = "VSAMigrationTime";

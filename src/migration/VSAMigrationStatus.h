@@ -8,7 +8,7 @@
 // saved) and one key per completed migration type
 // {"VSAMigrationVersionNumber": build, "VSAMigrationTime": date text}.
 // The system-version dictionary is `<root>/etc/vessad/system-version.plist`
-// ("ProductBuildVersion", "ReleaseType"); without it the build is "Unknown"
+// ("BuildVersion", "ReleaseType"); without it the build is "Unknown"
 // and every start is an upgrade. Every doubt about an upgrade answers YES.
 //
 // A missing status file is an empty status; one that cannot be read or is

@@ -171,6 +171,43 @@ TEST(DaemonSpine, AFirstBootMarkerMadeByTheMobileUserIsNotBelieved) {
   }
 }
 
+// A root without its mobile user is reported at once, with the command that
+// provisions it, instead of being retried; that command makes it servable,
+// registers vessactl as root's full client, and keeps what exists.
+TEST(DaemonSpine, AnUnprovisionedRootIsReportedAndProvisionedByOneCommand) {
+  VSATestDaemon d;
+  std::filesystem::remove(d.path("/etc/passwd"));
+  std::filesystem::remove(d.path("/etc/group"));
+  ASSERT_TRUE(d.start(false));
+  int status = -1;
+  ASSERT_TRUE(d.waitForExit(std::chrono::seconds(10), &status)) << "it must not retry for ever";
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 78) << status;
+  std::string out = d.daemonOutput();
+  EXPECT_NE(out.find("no user \"mobile\""), std::string::npos) << out;
+  EXPECT_NE(out.find("vessactl --root " + d.root() + " provision"), std::string::npos) << out;
+  EXPECT_EQ(std::count(out.begin(), out.end(), '\n'), 1) << out;
+
+  auto provisioned = d.vessactl("", {"provision"});
+  ASSERT_EQ(provisioned.status, 0) << provisioned.output;
+  struct stat st;
+  ASSERT_EQ(stat(d.path("/etc/vessad/clients.d/vessactl.plist").c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 022, 0u);
+  ASSERT_EQ(stat(d.path("/usr/bin/vessactl").c_str(), &st), 0);
+  EXPECT_EQ(st.st_uid, 0u);
+  ASSERT_TRUE(d.start());
+  auto made = d.vessactl("vessactl", {"create", "com.example.app"});
+  EXPECT_EQ(made.status, 0) << made.output;
+  EXPECT_EQ(d.vessactl("vessactl", {"lookup", "com.example.app"}).status, 0);
+  EXPECT_EQ(d.stop(), 0);
+  // Again, without --force: everything that exists is kept.
+  std::ofstream(d.path("/etc/vessad/device.plist"), std::ios::app) << "";
+  auto again = d.vessactl("", {"provision"});
+  EXPECT_EQ(again.status, 0) << again.output;
+  EXPECT_NE(again.output.find("kept /etc/passwd"), std::string::npos) << again.output;
+  EXPECT_EQ(again.output.find("wrote"), std::string::npos) << again.output;
+  EXPECT_EQ(d.vessactl("", {"provision", "--mobile-uid", "0"}).status, 2);
+}
+
 TEST(DaemonSpine, LockStateChangesReachTheRunningDaemon) {
   VSATestDaemon d;
   ASSERT_TRUE(d.start());

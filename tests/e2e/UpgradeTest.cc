@@ -22,16 +22,50 @@ VSAValue withContainer(uint64_t command, const char* id, uint64_t containerClass
   return v;
 }
 
-void writeVersion(VSATestDaemon& d, const char* build) {
-  VSA_writeToURL(VSAValue::Dictionary{{"ProductBuildVersion", VSAValue(build)},
-                                      {"ReleaseType", VSAValue("User")}},
-                 d.path("/etc/vessad/system-version.plist"), 0, nullptr);
+void writeVersion(VSATestDaemon& d, const char* build, const char* release = "User") {
+  VSA_writeToURL(
+      VSAValue::Dictionary{{"BuildVersion", VSAValue(build)}, {"ReleaseType", VSAValue(release)}},
+      d.path("/etc/vessad/system-version.plist"), 0, nullptr);
 }
 
 size_t count(const std::string& text, const std::string& needle) {
   size_t n = 0;
   for (size_t at = text.find(needle); at != std::string::npos; at = text.find(needle, at + 1)) ++n;
   return n;
+}
+
+// The build is the system-version file's "BuildVersion": boots of the same
+// build leave system containers where they are, a new one gives them new
+// directory names, and a new "ReleaseType" alone is no upgrade.
+TEST(DaemonUpgrade, OnlyANewBuildVersionIsAnUpgrade) {
+  VSATestDaemon d;
+  d.registerSelf("com.example.installer",
+                 VSAValue::Dictionary{{"com.tamsk.private.Vessa.allowed", VSAValue(true)}});
+  writeVersion(d, "1A100");
+  ASSERT_TRUE(d.start());
+  VSAValue create = withContainer(0, "com.example.systemservice", 12);
+  create.set("CreateIfNecessary", VSAValue(true));
+  auto made = d.request(create);
+  ASSERT_EQ(VSAReplyError(made), 1u);
+  EXPECT_EQ(d.stop(), 0);
+  auto pathAfterBoot = [&](const char* build, const char* release) {
+    writeVersion(d, build, release);
+    EXPECT_TRUE(d.start(true, {"--after-boot"}));
+    std::string path =
+        VSAReplyString(d.request(withContainer(0, "com.example.systemservice", 12)), "ReplyPath");
+    EXPECT_EQ(d.stop(), 0);
+    return path;
+  };
+  std::string first = VSAReplyString(made, "ReplyPath");
+  ASSERT_FALSE(first.empty());
+  EXPECT_EQ(pathAfterBoot("1A100", "User"), first) << "the same build is no upgrade";
+  EXPECT_EQ(pathAfterBoot("1A100", "Internal"), first) << "a release type alone is no upgrade";
+  std::string upgraded = pathAfterBoot("1A200", "Internal");
+  EXPECT_FALSE(upgraded.empty());
+  EXPECT_NE(upgraded, first) << "a new build rolls system container directory names";
+  EXPECT_TRUE(fs::is_directory(upgraded));
+  EXPECT_NE(d.daemonOutput().find("Detected upgrade from 1A100 (User) to 1A200 (Internal)"),
+            std::string::npos);
 }
 
 TEST(DaemonUpgrade, AnOldDeviceIsUpgradedAtBootAndByTheMigrationCommands) {

@@ -81,7 +81,7 @@ write("updatefile", "system", plistlib.dumps(
 write("updatefile", "negative-class", plistlib.dumps(
     dict(update, VSADataOperationProtectionClass=-1), fmt=binary))
 # statusfile: the first half of the input is the status, the second the version.
-status = plistlib.dumps({"LastBuildInfo": {"ProductBuildVersion": "1A100", "ReleaseType": "User"},
+status = plistlib.dumps({"LastBuildInfo": {"BuildVersion": "1A100", "ReleaseType": "User"},
                          "CodeSigningMigration": True, "VSAMigrationVersionNumber": 3},
                         fmt=binary)
 version = plistlib.dumps({"BuildVersion": "1A200", "ReleaseType": "User"}, fmt=binary)
