@@ -1,13 +1,19 @@
 // End to end: requests and on-disk state written by an attacker, against
 // the real daemon. Names that would leave their directory are refused at
-// the door; a user's directory swapped for a link leads nowhere; the
-// daemon's private files stay private.
+// the door; a user's directory swapped for a link leads nowhere; an app's
+// metadata file speaks for no other container; the daemon's private files
+// stay private.
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <filesystem>
 #include <fstream>
 
+#include "base/VSAJSON.h"
+#include "base/VSAPlist.h"
+#include "base/VSAUUID.h"
 #include "e2e/VSATestDaemon.h"
 
 namespace fs = std::filesystem;
@@ -101,6 +107,81 @@ TEST(HostileRequests, AUsersDirectorySwappedForALinkLeadsNowhere) {
   EXPECT_NE(VSAReplyError(d.request(request(0, "com.example.third"))), 1u);
   EXPECT_TRUE(fs::is_empty(target + "/Application"));
   EXPECT_EQ(std::distance(fs::directory_iterator(target), {}), 1) << "nothing but what was there";
+  EXPECT_EQ(d.stop(), 0);
+}
+
+TEST(HostileRequests, AnAppsMetadataFileSpeaksForNoOtherContainer) {
+  VSATestDaemon d;
+  d.registerSelf("com.example.installer",
+                 VSAValue::Dictionary{{kAllowed, VSAValue(true)},
+                                      {"com.tamsk.private.Vessa.otherIdLookup", VSAValue(true)}});
+  // The app: a client that runs as the mobile user.
+  fs::copy_file(VESSACTL_PATH, d.path("/usr/bin/app"));
+  ASSERT_TRUE(VSA_writeToURL(
+      VSAValue::Dictionary{{"Executable", VSAValue("/usr/bin/app")},
+                           {"SigningIdentifier", VSAValue("com.example.app")},
+                           {"Entitlements", VSAValue::Dictionary{{kAllowed, VSAValue(true)}}},
+                           {"User", VSAValue(uint64_t{501})}},
+      d.path("/etc/vessad/clients.d/app.plist"), 0, nullptr));
+  fs::permissions(d.root(), fs::perms(0755));  // the app reaches its client and the socket
+  ASSERT_TRUE(d.start());
+  VSAValue system =
+      VSAValue::Dictionary{{"Command", VSAValue(15u)}, {"Identifier", VSAValue("com.example.sys")}};
+  auto real = d.request(system);
+  ASSERT_EQ(VSAReplyError(real), 1u);
+  std::string systemPath = VSAReplyString(real, "ReplyPath");
+  auto app = [&](std::vector<std::string> args) {
+    std::vector<std::string> full = {d.path("/usr/bin/app"), "--root", d.root(), "--json"};
+    full.insert(full.end(), args.begin(), args.end());
+    std::vector<char*> argv;
+    for (auto& a : full) argv.push_back(a.data());
+    argv.push_back(nullptr);
+    return VSARunAsMobileUser([&] { return execv(argv[0], argv.data()), 127; });
+  };
+  auto parsed = [](const VSATestDaemon::Run& run) {
+    std::string why;
+    return VSAJSON::parse(run.output, &why);
+  };
+  auto made = app(
+      {"Command=0", "Identifier=com.example.app", "ContainerClass=2", "CreateIfNecessary=true"});
+  ASSERT_EQ(made.status, 0) << made.output;
+  std::string own = VSAReplyString(parsed(made), "ReplyPath");
+  ASSERT_FALSE(own.empty()) << made.output;
+  ASSERT_NE(own, systemPath);
+
+  // The app rewrites the metadata file of its own container to claim the
+  // system container, then has the daemon read it again.
+  auto forged = VSAPlist::serialize(
+      VSAValue::Dictionary{{"VSAMetadataIdentifier", VSAValue("com.example.sys")},
+                           {"VSAMetadataUUID", VSAValue(VSAUUID::random().string())},
+                           {"VSAMetadataContentClass", VSAValue(uint64_t{12})},
+                           {"VSAMetadataVersion", VSAValue("2")}},
+      VSAPlist::Format::Binary, nullptr);
+  ASSERT_TRUE(forged);
+  std::string file = own + "/.com.tamsk.vessa_keeper.metadata.plist";
+  ASSERT_EQ(VSARunAsMobileUser([&] {
+              unlink(file.c_str());
+              int fd = open(file.c_str(), O_WRONLY | O_CREAT | O_EXCL, 0644);
+              bool whole = fd >= 0 && write(fd, forged->data(), forged->size()) ==
+                                          static_cast<ssize_t>(forged->size());
+              return whole && close(fd) == 0 ? 0 : 1;
+            }).status,
+            0);
+  auto set =
+      app({"Command=5", "Identifier=com.example.app", "ContainerClass=2", "Key=k", "Value=v"});
+  EXPECT_EQ(VSAReplyError(parsed(set)), 12u) << set.output;
+  auto read = app({"Command=6", "Identifier=com.example.app", "ContainerClass=2", "Key=k"});
+  EXPECT_EQ(VSAReplyError(parsed(read)), 12u) << read.output;
+
+  // The system container is where it was, for every way of asking.
+  auto again = d.request(system);
+  ASSERT_EQ(VSAReplyError(again), 1u);
+  EXPECT_EQ(VSAReplyString(again, "ReplyPath"), systemPath);
+  auto looked = d.request(VSAValue::Dictionary{{"Command", VSAValue(0u)},
+                                               {"Identifier", VSAValue("com.example.sys")},
+                                               {"ContainerClass", VSAValue(12u)}});
+  ASSERT_EQ(VSAReplyError(looked), 1u);
+  EXPECT_EQ(VSAReplyString(looked, "ReplyPath"), systemPath);
   EXPECT_EQ(d.stop(), 0);
 }
 
