@@ -1,15 +1,20 @@
 // End to end: requests and on-disk state written by an attacker, against
 // the real daemon. Names that would leave their directory are refused at
 // the door; a user's directory swapped for a link leads nowhere; an app's
-// metadata file speaks for no other container; the daemon's private files
-// stay private.
+// metadata file speaks for no other container; a system container backup
+// is restored only as root left it; the daemon's private files stay
+// private.
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <poll.h>
+#include <sys/inotify.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <filesystem>
 #include <fstream>
+#include <future>
+#include <thread>
 
 #include "base/VSAJSON.h"
 #include "base/VSAPlist.h"
@@ -182,6 +187,78 @@ TEST(HostileRequests, AnAppsMetadataFileSpeaksForNoOtherContainer) {
                                                {"ContainerClass", VSAValue(12u)}});
   ASSERT_EQ(VSAReplyError(looked), 1u);
   EXPECT_EQ(VSAReplyString(looked, "ReplyPath"), systemPath);
+  EXPECT_EQ(d.stop(), 0);
+}
+
+// Every path below `dir` whose file name is `name`.
+std::vector<std::string> named(const std::string& dir, const std::string& name) {
+  std::vector<std::string> out;
+  for (const auto& p : tree(dir))
+    if (fs::path(p).filename() == name) out.push_back(p);
+  return out;
+}
+
+TEST(HostileRequests, ASystemContainerBackupIsRestoredOnlyAsRootLeftIt) {
+  VSATestDaemon d;
+  d.registerSelf("com.example.installer",
+                 VSAValue::Dictionary{{kAllowed, VSAValue(true)},
+                                      {"com.tamsk.private.Vessa.otherIdLookup", VSAValue(true)}});
+  fs::permissions(d.root(), fs::perms(0755));
+  // The backups lie in the mobile user's home. Root left one of system
+  // containers; the user made one of system group containers, a tree of its
+  // own to swap in, and a big stale in-progress directory whose removal
+  // keeps the daemon busy between its look at the backup and its move.
+  std::string base = d.path("/private/var/mobile/Library/Backup/SystemContainers");
+  fs::create_directories(base + "/Data/com.example.sys");
+  std::ofstream(base + "/Data/com.example.sys/genuine.txt") << "root's";
+  for (const char* dir : {"/private/var/mobile/Library", "/private/var/mobile/Library/Backup",
+                          "/private/var/mobile/Library/Backup/SystemContainers"})
+    ASSERT_EQ(chown(d.path(dir).c_str(), 501, 501), 0);
+  std::string armed = base + "/armed";
+  ASSERT_EQ(VSARunAsMobileUser([&] {
+              for (const std::string& dir :
+                   {base + "/Shared", base + "/Shared/systemgroup.com.example.planted",
+                    base + "/Evil", base + "/Evil/com.example.sys", base + "/Data.inprogress"})
+                if (mkdir(dir.c_str(), 0755) != 0) return 1;
+              for (const std::string& file :
+                   {base + "/Shared/systemgroup.com.example.planted/planted.txt",
+                    base + "/Evil/com.example.sys/planted.txt"})
+                if (!std::ofstream(file).put('x')) return 2;
+              for (int i = 0; i < 30000; ++i)
+                if (!std::ofstream(base + "/Data.inprogress/" + std::to_string(i))) return 3;
+              return 0;
+            }).status,
+            0);
+  // The swap, the moment the daemon starts removing the stale directory.
+  auto swapper = std::async(std::launch::async, [&] {
+    return VSARunAsMobileUser([&] {
+             int watch = inotify_init1(IN_CLOEXEC);
+             if (watch < 0 ||
+                 inotify_add_watch(watch, (base + "/Data.inprogress").c_str(), IN_DELETE) < 0)
+               return 1;
+             if (!std::ofstream(armed)) return 2;
+             pollfd p{watch, POLLIN, 0};
+             if (poll(&p, 1, 30000) != 1) return 3;
+             rename((base + "/Data").c_str(), (base + "/Data.genuine").c_str());
+             rename((base + "/Evil").c_str(), (base + "/Data").c_str());
+             return 0;
+           })
+        .status;
+  });
+  for (int i = 0; i < 1000 && !fs::exists(armed); ++i)
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  ASSERT_TRUE(fs::exists(armed));
+  ASSERT_TRUE(d.start(true, {"--after-boot"}));
+  swapper.wait();
+
+  auto reply = d.request(VSAValue::Dictionary{{"Command", VSAValue(15u)},
+                                              {"Identifier", VSAValue("com.example.sys")}});
+  ASSERT_EQ(VSAReplyError(reply), 1u);
+  std::string live = VSAReplyString(reply, "ReplyPath");
+  EXPECT_TRUE(fs::exists(live + "/genuine.txt"));
+  EXPECT_TRUE(named(d.path("/private/var/containers"), "planted.txt").empty());
+  EXPECT_TRUE(named(d.path("/private/var/root"), "planted.txt").empty());
+  EXPECT_NE(d.daemonOutput().find("Not restoring"), std::string::npos);
   EXPECT_EQ(d.stop(), 0);
 }
 
