@@ -61,9 +61,8 @@ std::optional<std::vector<VSAConstMetadataRef>> VSACodeSigningMigration::contain
 
 bool VSACodeSigningMigration::clearInfoValue(const VSAMetadata& container, const char* key) {
   VSAErrorRef error;
-  auto fresh =
-      VSAMetadata::readAndValidateMetadataAtUrl(container.url(), container.userIdentity(), false,
-                                                *configuration_, *userIdentityCache_, &error);
+  auto fresh = VSAMetadata::rereadMetadataOfCachedContainer(container, *configuration_,
+                                                            *userIdentityCache_, &error);
   if (!fresh) return false;
   VSAValue info =
       fresh->info() && fresh->info()->isDictionary() ? *fresh->info() : VSAValue::dictionary();

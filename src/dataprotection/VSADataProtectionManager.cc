@@ -334,9 +334,8 @@ void VSADataProtectionManager::recordProtectionClass(const VSAMetadataRef& metad
   // says now is read again under the lock, so that nothing written since is
   // put back to what it was when the request came.
   VSAErrorRef readError;
-  VSAMetadataRef current = VSAMetadata::readAndValidateMetadataAtUrl(
-      metadata->url(), metadata->userIdentity(), false, *env_->configuration,
-      *env_->userIdentityCache, &readError);
+  VSAMetadataRef current = VSAMetadata::rereadMetadataOfCachedContainer(
+      *metadata, *env_->configuration, *env_->userIdentityCache, &readError);
   if (!current) {
     VSALog(kVSALogError, "_startDataProtectionChangeOperation",
            "Failed to set protection class info for %@ at %@ to %d : %@", metadata->identifier(),

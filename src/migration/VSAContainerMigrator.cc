@@ -7,6 +7,7 @@
 #include "base/VSAPathString.h"
 #include "base/VSAPlist.h"
 #include "base/VSAProgressLog.h"
+#include "migration/VSAOldBundleLocation.h"
 #include "model/VSAPerUserConfiguration.h"
 
 namespace {
@@ -105,26 +106,16 @@ void VSAContainerMigrator::migrateLogFiles(const std::string& build) {
     logMigrator(kVSALogError, origin, "Failed to remove old Log directory: %@", removeError);
 }
 
-// Renames the old location into place; when something is there already (the
-// class directories a start makes), moves what is inside one level down.
+// Moves what the installation left in the old location into place (see
+// VSAOldBundleLocation.h); anything planted there stays behind.
 bool VSAContainerMigrator::migrateOldBundleLocation(VSAErrorRef* error) {
   const char* origin = "performSynchronousBuildUpgradeMigration";
   auto& fm = hooks_.configuration->fileManager();
   const std::string& old = hooks_.oldBundleLocation;
   if (old.empty() || !fm.itemExistsAtURL(old)) return true;
   logMigrator(kVSALogNotice, origin, "Moving bundle containers from user to system location");
-  std::string target = hooks_.configuration->bundleDirectory();
-  std::function<bool(const std::string&, const std::string&, int)> merge =
-      [&](const std::string& from, const std::string& to, int depth) {
-        if (fm.itemDoesNotExistAtURL(to)) return fm.moveItemAtURL(from, to, error);
-        auto items = depth < 2 ? fm.urlsForItemsInDirectoryAtURL(from, error) : std::nullopt;
-        if (!items) return false;
-        for (const auto& item : *items)
-          if (!merge(item.path, VSAPathJoin(to, VSALastPathComponent(item.path)), depth + 1))
-            return false;
-        return fm.removeItemAtURL(from, error);
-      };
-  if (!merge(old, target, 0)) {
+  if (!VSAMoveOldBundleLocation(fm.fileSystem(), old, hooks_.configuration->bundleDirectory(),
+                                error)) {
     logMigrator(kVSALogError, origin,
                 "Failed to migrate to new bundle containers location : %@.  This is terrible.",
                 error ? *error : nullptr);

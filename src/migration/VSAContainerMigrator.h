@@ -2,9 +2,10 @@
 // request, each recorded in a migration status file under a type name and
 // never run again once recorded:
 //  - build upgrade (at start, when the build changed): old log files into
-//    the log directory, the old bundle location into the global bundle
-//    directory, whether the ACL migration is needed, and well-known system
-//    containers moved to their directory names;
+//    the log directory, the containers the installation left in the old
+//    bundle location into the global bundle directory (VSAOldBundleLocation),
+//    whether the ACL migration is needed, and well-known system containers
+//    moved to their directory names;
 //  - client-requested data migration (command 24): system-container ACLs
 //    ("ACLMigration"), bundle ownership ("BundleMigration"), then the legacy
 //    code-signing migrations and reconciliation;

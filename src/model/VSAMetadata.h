@@ -81,6 +81,19 @@ class VSAMetadata {
       const std::string& fileURL, const VSAUserIdentityRef& forUserIdentity, bool checkClassPath,
       VSAGlobalConfiguration& configuration, VSAUserIdentityCache& cache, VSAErrorRef* error);
 
+  // Reads the metadata file of `cached` (a container the cache holds) again,
+  // for an operation that puts what it reads into the cache or answers it.
+  // The file lies inside the container, which its app owns and may rewrite:
+  // it counts only while it describes that same container (identifier,
+  // class, UUID, user) and the container still sits directly in its class
+  // directory (the live or transient one, as cached). A file that disagrees
+  // is this container's "unreadable" failure (code 12), logged; it never
+  // says anything about another container.
+  static VSAMetadataRef rereadMetadataOfCachedContainer(const VSAMetadata& cached,
+                                                        VSAGlobalConfiguration& configuration,
+                                                        VSAUserIdentityCache& cache,
+                                                        VSAErrorRef* error);
+
   // Whether a read failed for the system's own reasons (I/O error, no
   // memory or descriptors) rather than because of the file: the container
   // may be whole, so nothing may be decided from the failure.

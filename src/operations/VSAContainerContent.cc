@@ -73,13 +73,11 @@ std::string VSAContainerContent::assetsDirectory(const VSAMetadata& container) c
 
 bool VSAContainerContent::recordAssetsDirectory(VSAMetadata& container, VSAResultCode* withError) {
   VSAErrorRef error;
-  auto fresh = VSAMetadata::readAndValidateMetadataAtUrl(container.url(), container.userIdentity(),
-                                                         false, *services_.configuration,
-                                                         *services_.userIdentityCache, &error);
+  auto fresh = VSAMetadata::rereadMetadataOfCachedContainer(container, *services_.configuration,
+                                                            *services_.userIdentityCache, &error);
   if (!fresh)
     return fail("recordAssetsDirectory", codeOf(error, VSAResult::kMetadataUnreadable), withError,
                 VSAFormat("Failed to read metadata of %@: %@", container.url(), error));
-  fresh->setTransient(container.transient());
   fresh->setUserManagedAssetsDirName(std::string(kVSAUserManagedAssetsDirName));
   if (!fresh->writeMetadataToDiskWithError(*services_.configuration, &error)) {
     VSASetCode(withError, codeOf(error, VSAResult::kWriteFailed));

@@ -284,9 +284,8 @@ VSAMetadataRef VSAContainerLookup::metadataWithContainerIdentity(
   // Re-read under the identifier lock so that a concurrent info change is seen whole.
   VSAIdentifierLockGuard lock(VSAValue(found->uuid().string()), false);
   VSAErrorRef error;
-  auto fresh = VSAMetadata::readAndValidateMetadataAtUrl(found->url(), found->userIdentity(), false,
-                                                         *services_.configuration,
-                                                         *services_.userIdentityCache, &error);
+  auto fresh = VSAMetadata::rereadMetadataOfCachedContainer(*found, *services_.configuration,
+                                                            *services_.userIdentityCache, &error);
   if (!fresh) {
     VSASetCode(withError, error ? error->resultCode(VSAResult::kMetadataUnreadable)
                                 : VSAResult::kMetadataUnreadable);

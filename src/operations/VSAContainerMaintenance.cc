@@ -83,16 +83,14 @@ std::optional<std::string> VSAContainerMaintenance::lockKey(const VSAContainerId
 VSAMetadataRef VSAContainerMaintenance::reread(const VSAMetadata& cached, const char* origin,
                                                VSAResultCode* withError) {
   VSAErrorRef error;
-  auto fresh = VSAMetadata::readAndValidateMetadataAtUrl(cached.url(), cached.userIdentity(), false,
-                                                         *services_.configuration,
-                                                         *services_.userIdentityCache, &error);
+  auto fresh = VSAMetadata::rereadMetadataOfCachedContainer(cached, *services_.configuration,
+                                                            *services_.userIdentityCache, &error);
   if (!fresh) {
     fail(origin,
          error ? error->resultCode(VSAResult::kMetadataUnreadable) : VSAResult::kMetadataUnreadable,
          withError, VSAFormat("Failed to read metadata of %@: %@", cached.url(), error));
     return nullptr;
   }
-  fresh->setTransient(cached.transient());
   return fresh;
 }
 

@@ -3,6 +3,7 @@
 #include <sys/stat.h>
 
 #include <cstring>
+#include <optional>
 
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
@@ -23,55 +24,98 @@ void VSASystemContainerRestore::moveSystemContainersIntoPlace() {
   auto perUser =
       services_.configuration->getPerUserConfigurationForUserIdentity(grants_.clientUserIdentity);
   if (!perUser) return;
-  std::string system = perUser->systemContainerBackupDirectory();
-  std::string group = perUser->systemGroupContainerBackupDirectory();
-  bool systemMoved = moveToInProgress(system, "Failed to move system containers to inprogress: %@");
-  bool groupMoved =
-      moveToInProgress(group, "Failed to move shared system containers to inprogress: %@");
+  auto holding = holdingDirectory();
+  if (!holding) return;
+  std::string system = VSAPathJoin(*holding, "Data.inprogress");
+  std::string group = VSAPathJoin(*holding, "Shared.inprogress");
+  bool systemMoved = moveToInProgress(perUser->systemContainerBackupDirectory(), system,
+                                      "Failed to move system containers to inprogress: %@");
+  bool groupMoved = moveToInProgress(perUser->systemGroupContainerBackupDirectory(), group,
+                                     "Failed to move shared system containers to inprogress: %@");
   if (systemMoved) {
     logRestore(kVSALogNotice, kOrigin, "Installing system containers");
-    installAll(system + ".inprogress", 12, "Couldn't find any system containers at %@: %@");
+    installAll(system, 12, "Couldn't find any system containers at %@: %@");
   }
   if (groupMoved) {
     logRestore(kVSALogNotice, kOrigin, "Installing system group containers");
-    installAll(group + ".inprogress", 13, "Couldn't find any system shared containers at %@: %@");
+    installAll(group, 13, "Couldn't find any system shared containers at %@: %@");
   }
   if (services_.configuration->isInternalImage()) return;  // kept for inspection
-  std::string base = perUser->systemContainerBackupBaseDirectory();
+  for (const std::string& base : {perUser->systemContainerBackupBaseDirectory(), *holding}) {
+    VSAErrorRef error;
+    if (!services_.fileManager->removeItemAtURL(base, &error))
+      logRestore(kVSALogError, kOrigin, "Failed to remove system container base dir %@: %@", base,
+                 error);
+  }
+}
+
+std::optional<std::string> VSASystemContainerRestore::holdingDirectory() {
+  auto& fm = *services_.fileManager;
+  std::string holding =
+      VSAPathJoin(services_.configuration->libraryDirectory(), kVSASystemContainerRestoreDirName);
   VSAErrorRef error;
-  if (!services_.fileManager->removeItemAtURL(base, &error))
-    logRestore(kVSALogError, kOrigin, "Failed to remove system container base dir %@: %@", base,
-               error);
+  if (fm.createDirectoryAtURL(holding, true, 0700, 0, kVSANoProtectionClass, &error) &&
+      fm.restrictItemToRootAtURL(holding, &error))
+    return holding;
+  logRestore(kVSALogError, kOrigin, "Cannot restore system containers without %@: %@", holding,
+             error);
+  return std::nullopt;
 }
 
 bool VSASystemContainerRestore::moveToInProgress(const std::string& backup,
+                                                 const std::string& inProgress,
                                                  const char* moveFailure) {
   auto& fm = *services_.fileManager;
-  std::string inProgress = backup + ".inprogress";
   struct stat st {};
   if (fm.fileSystem().lstat(backup, &st) != 0) {
     // A restore a crash interrupted: its in-progress directory is all that
     // is left of the backup, so it is restored rather than thrown away.
-    if (fm.fileSystem().lstat(inProgress, &st) != 0 || !S_ISDIR(st.st_mode) || st.st_uid != 0 ||
-        (st.st_mode & 022))
+    if (fm.fileSystem().lstat(inProgress, &st) != 0 || !acceptBackup(inProgress, inProgress))
       return false;
     logRestore(kVSALogNotice, kOrigin, "Resuming the interrupted restore of %@", inProgress);
     return true;
-  }
-  // Only what root backed up goes into system containers: a backup that
-  // anyone else could have written is not restored.
-  if (!S_ISDIR(st.st_mode) || st.st_uid != 0 || (st.st_mode & 022)) {
-    logRestore(kVSALogError, kOrigin,
-               "Not restoring %@: not a directory owned by root and writable by root only", backup);
-    return false;
   }
   VSAErrorRef error;
   if (!fm.removeItemAtURL(inProgress, &error))
     logRestore(kVSALogError, kOrigin, "Failed to remove existing inprogress system containers: %@",
                error);
-  if (fm.moveItemAtURL(backup, inProgress, &error)) return true;
-  logRestore(kVSALogError, kOrigin, moveFailure, error);
-  return false;
+  // The backup lies in the user's home, where the user can put anything at
+  // its name at any moment: whatever is there is first taken out of the
+  // user's reach (one rename, never a copy) and only then looked at, so the
+  // directory checked is the directory restored.
+  if (int rc = fm.fileSystem().rename(backup, inProgress)) {
+    logRestore(kVSALogError, kOrigin, moveFailure,
+               VSAError::posix(rc, "moveToInProgress", __LINE__,
+                               VSAFormat("%@ -> %@: %s", backup, inProgress, std::strerror(rc))));
+    return false;
+  }
+  return acceptBackup(inProgress, backup);
+}
+
+bool VSASystemContainerRestore::acceptBackup(const std::string& inProgress,
+                                             const std::string& shownAs) {
+  auto& fm = *services_.fileManager;
+  struct stat st {};
+  int rc = fm.fileSystem().lstat(inProgress, &st);
+  VSAErrorRef error;
+  // Only what root backed up goes into system containers: a backup that
+  // anyone else could have written is not restored, and does not stay.
+  if (rc != 0 || !S_ISDIR(st.st_mode) || st.st_uid != 0 || (st.st_mode & 022)) {
+    logRestore(kVSALogError, kOrigin,
+               "Not restoring %@: not a directory owned by root and writable by root only",
+               shownAs);
+    if (rc == 0 && !fm.removeItemAtURL(inProgress, &error))
+      logRestore(kVSALogError, kOrigin, "Failed to remove %@: %@", inProgress, error);
+    return false;
+  }
+  // System containers hold nobody else's items: the whole backup is given
+  // to root before any of it moves into a live container.
+  if (!fm.standardizeOwnershipAtURL(inProgress, 0, 0, &error)) {
+    logRestore(kVSALogError, kOrigin, "Not restoring %@: cannot give it to root: %@", shownAs,
+               error);
+    return false;
+  }
+  return true;
 }
 
 void VSASystemContainerRestore::installAll(const std::string& inProgress, VSAContainerClass c,

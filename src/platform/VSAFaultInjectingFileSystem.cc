@@ -250,6 +250,12 @@ int VSAFaultInjectingFileSystem::unlinkAt(int dir, const std::string& name, bool
   return inner_->unlinkAt(dir, name, directory);
 }
 
+int VSAFaultInjectingFileSystem::renameAt(int fromDir, const std::string& fromName, int toDir,
+                                          const std::string& toName) {
+  if (int e = injected(Op::Rename)) return e;
+  return inner_->renameAt(fromDir, fromName, toDir, toName);
+}
+
 int VSAFaultInjectingFileSystem::chownAt(int dir, const std::string& name, uid_t uid, gid_t gid) {
   if (int e = injected(Op::Chown)) return e;
   return inner_->chownAt(dir, name, uid, gid);

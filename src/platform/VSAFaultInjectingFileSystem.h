@@ -5,10 +5,10 @@
 // fails every call of `op`. Call counts per operation let a test enumerate
 // the steps of an operation and fail each in turn. A descriptor-relative call
 // counts as the operation of its path form (statAt as Lstat, unlinkAt as
-// Unlink or Rmdir, ...). crashAfter(n) stops every call after the n-th, for
-// crash-point sweeps. readOnly() makes a layer that refuses every call that
-// would change the disk (EROFS), for code that must only look, such as the
-// root checker. Thread-safe.
+// Unlink or Rmdir, renameAt as Rename, ...). crashAfter(n) stops every call
+// after the n-th, for crash-point sweeps. readOnly() makes a layer that
+// refuses every call that would change the disk (EROFS), for code that must
+// only look, such as the root checker. Thread-safe.
 #pragma once
 
 #include <array>
@@ -72,6 +72,8 @@ class VSAFaultInjectingFileSystem : public VSAFileSystem {
   int readDirectoryAt(int dir, std::vector<VSADirectoryEntry>* entries) override;
   int mkdirAt(int dir, const std::string& name, mode_t mode) override;
   int unlinkAt(int dir, const std::string& name, bool directory) override;
+  int renameAt(int fromDir, const std::string& fromName, int toDir,
+               const std::string& toName) override;
   int chownAt(int dir, const std::string& name, uid_t uid, gid_t gid) override;
   int chmodAt(int dir, const std::string& name, mode_t mode) override;
   int getFlagsAt(int dir, const std::string& name, int* flags) override;

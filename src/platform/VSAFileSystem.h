@@ -154,6 +154,10 @@ class VSAFileSystem {
   virtual int readDirectoryAt(int dir, std::vector<VSADirectoryEntry>* entries) = 0;
   virtual int mkdirAt(int dir, const std::string& name, mode_t mode) = 0;
   virtual int unlinkAt(int dir, const std::string& name, bool directory) = 0;
+  // Renames entry `fromName` of `fromDir` to `toName` of `toDir`, never over
+  // an existing item (EEXIST), then syncs `toDir` (a commit, as rename).
+  virtual int renameAt(int fromDir, const std::string& fromName, int toDir,
+                       const std::string& toName) = 0;
   // Empty name: `dir` itself. A link is changed itself (owner) or left alone (mode).
   virtual int chownAt(int dir, const std::string& name, uid_t uid, gid_t gid) = 0;
   virtual int chmodAt(int dir, const std::string& name, mode_t mode) = 0;

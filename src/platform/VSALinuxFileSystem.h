@@ -62,6 +62,8 @@ class VSALinuxFileSystem : public VSAFileSystem {
   int readDirectoryAt(int dir, std::vector<VSADirectoryEntry>* entries) override;
   int mkdirAt(int dir, const std::string& name, mode_t mode) override;
   int unlinkAt(int dir, const std::string& name, bool directory) override;
+  int renameAt(int fromDir, const std::string& fromName, int toDir,
+               const std::string& toName) override;
   int chownAt(int dir, const std::string& name, uid_t uid, gid_t gid) override;
   int chmodAt(int dir, const std::string& name, mode_t mode) override;
   int getFlagsAt(int dir, const std::string& name, int* flags) override;

@@ -9,6 +9,7 @@
 #include <sys/syscall.h>
 #include <sys/xattr.h>
 
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 
@@ -159,6 +160,20 @@ int VSALinuxFileSystem::mkdirAt(int dir, const std::string& name, mode_t mode) {
 
 int VSALinuxFileSystem::unlinkAt(int dir, const std::string& name, bool directory) {
   return err(::unlinkat(dir, name.c_str(), directory ? AT_REMOVEDIR : 0));
+}
+
+int VSALinuxFileSystem::renameAt(int fromDir, const std::string& fromName, int toDir,
+                                 const std::string& toName) {
+  if (::renameat2(fromDir, fromName.c_str(), toDir, toName.c_str(), RENAME_NOREPLACE) != 0) {
+    if (errno != EINVAL && errno != ENOSYS) return errno;
+    // A file system without the flag: the caller's directories are its own,
+    // so a look first is as good.
+    struct stat st;
+    if (::fstatat(toDir, toName.c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0) return EEXIST;
+    if (::renameat(fromDir, fromName.c_str(), toDir, toName.c_str()) != 0) return errno;
+  }
+  syncDirectory(toDir);
+  return 0;
 }
 
 int VSALinuxFileSystem::chownAt(int dir, const std::string& name, uid_t uid, gid_t gid) {

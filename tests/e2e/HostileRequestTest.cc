@@ -1,13 +1,24 @@
 // End to end: requests and on-disk state written by an attacker, against
 // the real daemon. Names that would leave their directory are refused at
-// the door; a user's directory swapped for a link leads nowhere; the
-// daemon's private files stay private.
+// the door; a user's directory swapped for a link leads nowhere; an app's
+// metadata file speaks for no other container; a system container backup
+// is restored only as root left it; the daemon's private files stay
+// private.
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <poll.h>
+#include <sys/inotify.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <filesystem>
 #include <fstream>
+#include <future>
+#include <thread>
 
+#include "base/VSAJSON.h"
+#include "base/VSAPlist.h"
+#include "base/VSAUUID.h"
 #include "e2e/VSATestDaemon.h"
 
 namespace fs = std::filesystem;
@@ -101,6 +112,153 @@ TEST(HostileRequests, AUsersDirectorySwappedForALinkLeadsNowhere) {
   EXPECT_NE(VSAReplyError(d.request(request(0, "com.example.third"))), 1u);
   EXPECT_TRUE(fs::is_empty(target + "/Application"));
   EXPECT_EQ(std::distance(fs::directory_iterator(target), {}), 1) << "nothing but what was there";
+  EXPECT_EQ(d.stop(), 0);
+}
+
+TEST(HostileRequests, AnAppsMetadataFileSpeaksForNoOtherContainer) {
+  VSATestDaemon d;
+  d.registerSelf("com.example.installer",
+                 VSAValue::Dictionary{{kAllowed, VSAValue(true)},
+                                      {"com.tamsk.private.Vessa.otherIdLookup", VSAValue(true)}});
+  // The app: a client that runs as the mobile user.
+  fs::copy_file(VESSACTL_PATH, d.path("/usr/bin/app"));
+  ASSERT_TRUE(VSA_writeToURL(
+      VSAValue::Dictionary{{"Executable", VSAValue("/usr/bin/app")},
+                           {"SigningIdentifier", VSAValue("com.example.app")},
+                           {"Entitlements", VSAValue::Dictionary{{kAllowed, VSAValue(true)}}},
+                           {"User", VSAValue(uint64_t{501})}},
+      d.path("/etc/vessad/clients.d/app.plist"), 0, nullptr));
+  fs::permissions(d.root(), fs::perms(0755));  // the app reaches its client and the socket
+  ASSERT_TRUE(d.start());
+  VSAValue system =
+      VSAValue::Dictionary{{"Command", VSAValue(15u)}, {"Identifier", VSAValue("com.example.sys")}};
+  auto real = d.request(system);
+  ASSERT_EQ(VSAReplyError(real), 1u);
+  std::string systemPath = VSAReplyString(real, "ReplyPath");
+  auto app = [&](std::vector<std::string> args) {
+    std::vector<std::string> full = {d.path("/usr/bin/app"), "--root", d.root(), "--json"};
+    full.insert(full.end(), args.begin(), args.end());
+    std::vector<char*> argv;
+    for (auto& a : full) argv.push_back(a.data());
+    argv.push_back(nullptr);
+    return VSARunAsMobileUser([&] { return execv(argv[0], argv.data()), 127; });
+  };
+  auto parsed = [](const VSATestDaemon::Run& run) {
+    std::string why;
+    return VSAJSON::parse(run.output, &why);
+  };
+  auto made = app(
+      {"Command=0", "Identifier=com.example.app", "ContainerClass=2", "CreateIfNecessary=true"});
+  ASSERT_EQ(made.status, 0) << made.output;
+  std::string own = VSAReplyString(parsed(made), "ReplyPath");
+  ASSERT_FALSE(own.empty()) << made.output;
+  ASSERT_NE(own, systemPath);
+
+  // The app rewrites the metadata file of its own container to claim the
+  // system container, then has the daemon read it again.
+  auto forged = VSAPlist::serialize(
+      VSAValue::Dictionary{{"VSAMetadataIdentifier", VSAValue("com.example.sys")},
+                           {"VSAMetadataUUID", VSAValue(VSAUUID::random().string())},
+                           {"VSAMetadataContentClass", VSAValue(uint64_t{12})},
+                           {"VSAMetadataVersion", VSAValue("2")}},
+      VSAPlist::Format::Binary, nullptr);
+  ASSERT_TRUE(forged);
+  std::string file = own + "/.com.tamsk.vessa_keeper.metadata.plist";
+  ASSERT_EQ(VSARunAsMobileUser([&] {
+              unlink(file.c_str());
+              int fd = open(file.c_str(), O_WRONLY | O_CREAT | O_EXCL, 0644);
+              bool whole = fd >= 0 && write(fd, forged->data(), forged->size()) ==
+                                          static_cast<ssize_t>(forged->size());
+              return whole && close(fd) == 0 ? 0 : 1;
+            }).status,
+            0);
+  auto set =
+      app({"Command=5", "Identifier=com.example.app", "ContainerClass=2", "Key=k", "Value=v"});
+  EXPECT_EQ(VSAReplyError(parsed(set)), 12u) << set.output;
+  auto read = app({"Command=6", "Identifier=com.example.app", "ContainerClass=2", "Key=k"});
+  EXPECT_EQ(VSAReplyError(parsed(read)), 12u) << read.output;
+
+  // The system container is where it was, for every way of asking.
+  auto again = d.request(system);
+  ASSERT_EQ(VSAReplyError(again), 1u);
+  EXPECT_EQ(VSAReplyString(again, "ReplyPath"), systemPath);
+  auto looked = d.request(VSAValue::Dictionary{{"Command", VSAValue(0u)},
+                                               {"Identifier", VSAValue("com.example.sys")},
+                                               {"ContainerClass", VSAValue(12u)}});
+  ASSERT_EQ(VSAReplyError(looked), 1u);
+  EXPECT_EQ(VSAReplyString(looked, "ReplyPath"), systemPath);
+  EXPECT_EQ(d.stop(), 0);
+}
+
+// Every path below `dir` whose file name is `name`.
+std::vector<std::string> named(const std::string& dir, const std::string& name) {
+  std::vector<std::string> out;
+  for (const auto& p : tree(dir))
+    if (fs::path(p).filename() == name) out.push_back(p);
+  return out;
+}
+
+TEST(HostileRequests, ASystemContainerBackupIsRestoredOnlyAsRootLeftIt) {
+  VSATestDaemon d;
+  d.registerSelf("com.example.installer",
+                 VSAValue::Dictionary{{kAllowed, VSAValue(true)},
+                                      {"com.tamsk.private.Vessa.otherIdLookup", VSAValue(true)}});
+  fs::permissions(d.root(), fs::perms(0755));
+  // The backups lie in the mobile user's home. Root left one of system
+  // containers; the user made one of system group containers, a tree of its
+  // own to swap in, and a big stale in-progress directory whose removal
+  // keeps the daemon busy between its look at the backup and its move.
+  std::string base = d.path("/private/var/mobile/Library/Backup/SystemContainers");
+  fs::create_directories(base + "/Data/com.example.sys");
+  std::ofstream(base + "/Data/com.example.sys/genuine.txt") << "root's";
+  for (const char* dir : {"/private/var/mobile/Library", "/private/var/mobile/Library/Backup",
+                          "/private/var/mobile/Library/Backup/SystemContainers"})
+    ASSERT_EQ(chown(d.path(dir).c_str(), 501, 501), 0);
+  std::string armed = base + "/armed";
+  ASSERT_EQ(VSARunAsMobileUser([&] {
+              for (const std::string& dir :
+                   {base + "/Shared", base + "/Shared/systemgroup.com.example.planted",
+                    base + "/Evil", base + "/Evil/com.example.sys", base + "/Data.inprogress"})
+                if (mkdir(dir.c_str(), 0755) != 0) return 1;
+              for (const std::string& file :
+                   {base + "/Shared/systemgroup.com.example.planted/planted.txt",
+                    base + "/Evil/com.example.sys/planted.txt"})
+                if (!std::ofstream(file).put('x')) return 2;
+              for (int i = 0; i < 30000; ++i)
+                if (!std::ofstream(base + "/Data.inprogress/" + std::to_string(i))) return 3;
+              return 0;
+            }).status,
+            0);
+  // The swap, the moment the daemon starts removing the stale directory.
+  auto swapper = std::async(std::launch::async, [&] {
+    return VSARunAsMobileUser([&] {
+             int watch = inotify_init1(IN_CLOEXEC);
+             if (watch < 0 ||
+                 inotify_add_watch(watch, (base + "/Data.inprogress").c_str(), IN_DELETE) < 0)
+               return 1;
+             if (!std::ofstream(armed)) return 2;
+             pollfd p{watch, POLLIN, 0};
+             if (poll(&p, 1, 30000) != 1) return 3;
+             rename((base + "/Data").c_str(), (base + "/Data.genuine").c_str());
+             rename((base + "/Evil").c_str(), (base + "/Data").c_str());
+             return 0;
+           })
+        .status;
+  });
+  for (int i = 0; i < 1000 && !fs::exists(armed); ++i)
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  ASSERT_TRUE(fs::exists(armed));
+  ASSERT_TRUE(d.start(true, {"--after-boot"}));
+  swapper.wait();
+
+  auto reply = d.request(VSAValue::Dictionary{{"Command", VSAValue(15u)},
+                                              {"Identifier", VSAValue("com.example.sys")}});
+  ASSERT_EQ(VSAReplyError(reply), 1u);
+  std::string live = VSAReplyString(reply, "ReplyPath");
+  EXPECT_TRUE(fs::exists(live + "/genuine.txt"));
+  EXPECT_TRUE(named(d.path("/private/var/containers"), "planted.txt").empty());
+  EXPECT_TRUE(named(d.path("/private/var/root"), "planted.txt").empty());
+  EXPECT_NE(d.daemonOutput().find("Not restoring"), std::string::npos);
   EXPECT_EQ(d.stop(), 0);
 }
 

@@ -1,12 +1,17 @@
 // End to end: a device left by an earlier release is upgraded by the real
 // daemon at its first start after a boot, then the client-requested
 // migrations (24, 30) finish the work; later starts find nothing to do.
+// What the mobile user planted in the old bundle location stays there.
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include <filesystem>
 #include <fstream>
 
 #include "base/VSAPlist.h"
+#include "base/VSAUUID.h"
 #include "e2e/VSATestDaemon.h"
 
 namespace fs = std::filesystem;
@@ -113,6 +118,51 @@ TEST(DaemonUpgrade, AnOldDeviceIsUpgradedAtBootAndByTheMigrationCommands) {
   EXPECT_EQ(count(d.daemonOutput(), "skipping upgrade"), 1u);
   EXPECT_EQ(VSAReplyError(d.request(body(24))), 1u);
   EXPECT_EQ(count(d.daemonOutput(), "Performing code signing migration"), 1u);
+  EXPECT_EQ(d.stop(), 0);
+}
+
+TEST(DaemonUpgrade, ABundleTheUserPlantedInTheOldLocationIsLeftThere) {
+  VSATestDaemon d;
+  d.registerSelf("com.example.installer",
+                 VSAValue::Dictionary{{"com.tamsk.private.Vessa.allowed", VSAValue(true)}});
+  writeVersion(d, "OLD1");
+  ASSERT_TRUE(d.start());
+  EXPECT_EQ(d.stop(), 0);
+  // The old bundle location lies in the mobile user's Containers directory:
+  // the user makes a bundle container there, with a metadata file of its own.
+  std::string containers = d.path("/private/var/mobile/Containers");
+  fs::create_directories(containers);
+  ASSERT_EQ(chown(containers.c_str(), 501, 501), 0);
+  fs::permissions(d.root(), fs::perms(0755));
+  std::string uuid = VSAUUID::random().string();
+  std::string planted = containers + "/Bundle/Application/" + uuid;
+  auto forged = VSAPlist::serialize(
+      VSAValue::Dictionary{{"VSAMetadataIdentifier", VSAValue("com.example.victim")},
+                           {"VSAMetadataUUID", VSAValue(VSAUUID::random().string())},
+                           {"VSAMetadataContentClass", VSAValue(uint64_t{1})},
+                           {"VSAMetadataVersion", VSAValue("2")}},
+      VSAPlist::Format::Binary, nullptr);
+  ASSERT_TRUE(forged);
+  std::string metadata = planted + "/.com.tamsk.vessa_keeper.metadata.plist";
+  ASSERT_EQ(VSARunAsMobileUser([&] {
+              for (const std::string& dir :
+                   {containers + "/Bundle", containers + "/Bundle/Application", planted})
+                if (mkdir(dir.c_str(), 0755) != 0) return 1;
+              int fd = open(metadata.c_str(), O_WRONLY | O_CREAT | O_EXCL, 0644);
+              bool whole = fd >= 0 && write(fd, forged->data(), forged->size()) ==
+                                          static_cast<ssize_t>(forged->size());
+              return whole && close(fd) == 0 ? 0 : 1;
+            }).status,
+            0);
+
+  writeVersion(d, "NEW2");
+  ASSERT_TRUE(d.start(true, {"--after-boot"}));
+  EXPECT_NE(d.daemonOutput().find("Detected upgrade from OLD1"), std::string::npos);
+  auto victim = d.request(withContainer(0, "com.example.victim", 1));
+  EXPECT_EQ(VSAReplyError(victim), 21u) << VSAReplyString(victim, "ReplyPath");
+  EXPECT_FALSE(fs::exists(d.path("/private/var/containers/Bundle/Application/" + uuid)));
+  EXPECT_TRUE(fs::exists(metadata));
+  EXPECT_NE(d.daemonOutput().find("Leaving " + containers + "/Bundle"), std::string::npos);
   EXPECT_EQ(d.stop(), 0);
 }
 

@@ -1,6 +1,7 @@
 #include "e2e/VSATestDaemon.h"
 
 #include <fcntl.h>
+#include <grp.h>
 #include <signal.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -240,4 +241,24 @@ void VSAInitialisationHold::release() {
 VSAInitialisationHold::~VSAInitialisationHold() {
   stop_ = true;
   if (reader_.joinable()) reader_.join();
+}
+
+VSATestDaemon::Run VSARunAsMobileUser(const std::function<int()>& body) {
+  int out[2];
+  if (pipe(out) != 0) return {-1, ""};
+  pid_t pid = fork();
+  if (pid == 0) {
+    dup2(out[1], 1);
+    close(out[0]);
+    if (setgroups(0, nullptr) != 0 || setgid(501) != 0 || setuid(501) != 0) _exit(100);
+    _exit(body());
+  }
+  close(out[1]);
+  std::string text;
+  char buf[4096];
+  for (ssize_t n; (n = read(out[0], buf, sizeof buf)) > 0;) text.append(buf, n);
+  close(out[0]);
+  int status = 0;
+  waitpid(pid, &status, 0);
+  return {WIFEXITED(status) ? WEXITSTATUS(status) : -1, text};
 }

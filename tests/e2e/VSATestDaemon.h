@@ -11,6 +11,7 @@
 
 #include <atomic>
 #include <chrono>
+#include <functional>
 #include <optional>
 #include <string>
 #include <thread>
@@ -104,3 +105,8 @@ class VSATestDaemon {
   std::vector<std::string> prefix_;
   int activationFd_ = -1;
 };
+
+// Runs `body` in a child process of the mobile user (uid and gid 501, no
+// other groups), as an app would act: the child's exit status (`body`'s
+// result) and what it wrote to its standard output.
+VSATestDaemon::Run VSARunAsMobileUser(const std::function<int()>& body);

@@ -1,7 +1,9 @@
 // Upgrades: the migration status file, the legacy code-signing pass (also
 // interrupted after each of its file-system steps), and the container
-// migrator's build-upgrade and client-requested migrations.
+// migrator's build-upgrade (which leaves what the user planted in the old
+// bundle location) and client-requested migrations.
 #include <gtest/gtest.h>
+#include <unistd.h>
 
 #include <cstdlib>
 #include <filesystem>
@@ -278,6 +280,54 @@ TEST_F(Migration, TheBuildUpgradeMovesLogsBundlesAndWellKnownSystemContainers) {
   auto bare = status();
   ASSERT_TRUE(context_->containerMigrator->performSynchronousBuildUpgradeMigration(*bare, &error));
   EXPECT_TRUE(bare->hasMigrationOccurredForType("ACLMigration"));
+}
+
+TEST_F(Migration, TheBuildUpgradeMovesOnlyWhatTheInstallationLeftInTheOldBundleLocation) {
+  std::string old = root_ + "/private/var/mobile/Containers/Bundle/Application";
+  // A bundle container of the old release, with its metadata file.
+  auto container = [&](const std::string& id, uid_t owner, const std::string& in) {
+    std::string dir = in + "/" + VSAUUID::random().string();
+    fs::create_directories(dir);
+    VSAMetadata m(
+        VSAConcreteContainerIdentity::containerIdentityWithUUID(
+            VSAUUID::random(), context_->userIdentityCache->defaultUserIdentity(), id, 1, nullptr),
+        std::nullopt, dir, std::nullopt);
+    EXPECT_TRUE(m.writeMetadataToDiskWithError(*context_->globalConfiguration, nullptr));
+    EXPECT_EQ(::chown(dir.c_str(), owner, owner), 0);
+    EXPECT_EQ(::chown((dir + "/" + kVSAMetadataFileName).c_str(), owner, owner), 0);
+    return dir;
+  };
+  std::string genuine = container("com.example.genuine", 0, old);
+  // What the mobile user can put there: its own directory with a forged
+  // metadata file, a directory that anyone may write, a root-owned
+  // directory holding the user's metadata file, a link to a container.
+  std::vector<std::string> planted = {
+      container("com.example.victim", 501, old), container("com.example.open", 0, old),
+      container("com.example.mixed", 0, old), old + "/" + VSAUUID::random().string()};
+  fs::permissions(planted[1], fs::perms::all);
+  ASSERT_EQ(::chown((planted[2] + "/" + kVSAMetadataFileName).c_str(), 501, 501), 0);
+  fs::create_directory_symlink(container("com.example.linked", 0, root_ + "/private/var/elsewhere"),
+                               planted[3]);
+  startContext();
+  VSAOldDevice::writeSystemVersion(root_, "NEW2");
+  auto s = status();
+  VSAErrorRef error;
+  ASSERT_TRUE(context_->containerMigrator->performSynchronousBuildUpgradeMigration(*s, &error))
+      << error;
+  std::string bundles = context_->globalConfiguration->bundleDirectory() + "/Application";
+  std::string moved = bundles + "/" + fs::path(genuine).filename().string();
+  EXPECT_TRUE(fs::exists(moved + "/" + kVSAMetadataFileName));
+  auto found = lookup("com.example.genuine", 1);
+  ASSERT_TRUE(found);
+  EXPECT_EQ(found->url(), moved);
+  for (const auto& dir : planted) {
+    SCOPED_TRACE(dir);
+    EXPECT_FALSE(fs::exists(bundles + "/" + fs::path(dir).filename().string()));
+    EXPECT_TRUE(fs::exists(fs::symlink_status(dir)));
+  }
+  for (const char* id :
+       {"com.example.victim", "com.example.open", "com.example.mixed", "com.example.linked"})
+    EXPECT_FALSE(lookup(id, 1)) << id;
 }
 
 TEST_F(Migration, PerUserMigrationRestoresStructureOnceAndRemovesDeprecatedContainers) {

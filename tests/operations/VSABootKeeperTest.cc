@@ -13,6 +13,7 @@
 #include "model/VSAPerUserConfiguration.h"
 #include "operations/VSABootKeeper.h"
 #include "operations/VSADeathRow.h"
+#include "operations/VSASystemContainerRestore.h"
 
 namespace fs = std::filesystem;
 
@@ -44,6 +45,11 @@ class Boot : public VSAContainerTestRoot {
   std::shared_ptr<VSAPerUserConfiguration> perUser() {
     return context_->globalConfiguration->getPerUserConfigurationForUserIdentity(
         installer()->grants().clientUserIdentity);
+  }
+  // Where backups are restored from: the daemon's own directory.
+  std::string library() {
+    return context_->globalConfiguration->libraryDirectory() + "/" +
+           kVSASystemContainerRestoreDirName;
   }
   void deviceFlags(const VSAValue& device) {
     fs::create_directories(root_ + "/etc/vessad");
@@ -84,12 +90,14 @@ TEST_F(Boot, BackedUpSystemContainersReplaceLiveItemsAndTheBackupGoes) {
   EXPECT_FALSE(fs::exists(perUser()->systemContainerBackupBaseDirectory()));
 
   // A restore a crash interrupted after the rename to .inprogress is resumed.
-  fs::create_directories(backup + ".inprogress/com.example.sys");
-  put(backup + ".inprogress/com.example.sys/shared.txt", "resumed");
+  std::string inProgress = library() + "/Data.inprogress";
+  fs::create_directories(inProgress + "/com.example.sys");
+  put(inProgress + "/com.example.sys/shared.txt", "resumed");
   rebootSetup();
   EXPECT_EQ(read(live->url() + "/shared.txt"), "resumed");
   EXPECT_TRUE(logged("Resuming the interrupted restore"));
   EXPECT_FALSE(fs::exists(perUser()->systemContainerBackupBaseDirectory()));
+  EXPECT_FALSE(fs::exists(library()));
 
   // A backup that a user could have written is not restored.
   fs::create_directories(backup + "/com.example.sys");
@@ -98,6 +106,82 @@ TEST_F(Boot, BackedUpSystemContainersReplaceLiveItemsAndTheBackupGoes) {
   rebootSetup();
   EXPECT_EQ(read(live->url() + "/shared.txt"), "resumed");
   EXPECT_TRUE(logged("Not restoring"));
+}
+
+// Puts the user's own directory in the backup's place the moment the daemon
+// moves the backup: what the user can do while the daemon is between
+// checking the backup and moving it, made deterministic.
+class BackupSwappingFileSystem : public VSAFaultInjectingFileSystem {
+ public:
+  using VSAFaultInjectingFileSystem::VSAFaultInjectingFileSystem;
+  void arm(const std::string& backup, const std::string& planted) {
+    backup_ = backup;
+    planted_ = planted;
+  }
+  bool swapped() const { return swapped_; }
+  int rename(const std::string& from, const std::string& to) override {
+    swapIfBackup(from);
+    return VSAFaultInjectingFileSystem::rename(from, to);
+  }
+  int renameWithoutSync(const std::string& from, const std::string& to) override {
+    swapIfBackup(from);
+    return VSAFaultInjectingFileSystem::renameWithoutSync(from, to);
+  }
+
+ private:
+  void swapIfBackup(const std::string& from) {
+    if (swapped_ || from != backup_) return;
+    swapped_ = true;
+    fs::rename(backup_, backup_ + ".genuine");
+    fs::rename(planted_, backup_);
+  }
+  std::string backup_, planted_;
+  bool swapped_ = false;
+};
+
+TEST_F(Boot, ABackupSwappedBeforeItIsMovedIsNotRestoredAndRestoredItemsAreRoots) {
+  VSAResultCode code;
+  auto live = create(*installer(), "com.example.sys", &code, false, 12);
+  ASSERT_TRUE(live) << code;
+  put(live->url() + "/shared.txt", "live");
+  std::string backup = perUser()->systemContainerBackupDirectory();
+  std::string planted = perUser()->systemContainerBackupBaseDirectory() + "/planted";
+  fs::create_directories(backup + "/com.example.sys");
+  put(backup + "/com.example.sys/shared.txt", "backup");
+  fs::create_directories(planted + "/com.example.sys");
+  put(planted + "/com.example.sys/shared.txt", "planted");
+  for (const auto& p :
+       {planted, planted + "/com.example.sys", planted + "/com.example.sys/shared.txt"})
+    ASSERT_EQ(::chown(p.c_str(), 501, 501), 0);
+  std::shared_ptr<BackupSwappingFileSystem> swapper;
+  context_.reset();
+  context_ = std::make_unique<VSADaemonContext>(
+      VSASystemRoot(root_), [&](std::shared_ptr<VSAFileSystem> real) {
+        swapper = std::make_shared<BackupSwappingFileSystem>(std::move(real));
+        faults_ = swapper;
+        return swapper;
+      });
+  user_ = context_->userIdentityCache->userIdentityForPersonalPersona();
+  swapper->arm(backup, planted);
+  rebootSetup();
+  EXPECT_TRUE(swapper->swapped());
+  EXPECT_EQ(read(live->url() + "/shared.txt"), "live");
+  EXPECT_TRUE(logged("Not restoring"));
+  EXPECT_FALSE(fs::exists(library() + "/Data.inprogress"));
+
+  // A root-owned backup is restored, and what it holds becomes root's
+  // before it enters the live container.
+  fs::create_directories(backup + "/com.example.sys/Library/Mine");
+  put(backup + "/com.example.sys/Library/Mine/file", "user's");
+  for (const char* p : {"/Library/Mine", "/Library/Mine/file"})
+    ASSERT_EQ(::chown((backup + "/com.example.sys" + p).c_str(), 501, 501), 0);
+  rebootSetup();
+  EXPECT_EQ(read(live->url() + "/Library/Mine/file"), "user's");
+  for (const char* p : {"/Library/Mine", "/Library/Mine/file"}) {
+    struct stat st {};
+    ASSERT_EQ(::lstat((live->url() + p).c_str(), &st), 0);
+    EXPECT_NE(st.st_uid, 501u) << p;
+  }
 }
 
 TEST_F(Boot, OnlyEntriesThatAreNotLiveContainersAreCleanedAway) {

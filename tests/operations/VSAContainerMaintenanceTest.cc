@@ -1,10 +1,13 @@
 // Per-container maintenance: a new directory UUID, the default structure
-// made again, and info values read and written through the metadata file.
+// made again, and info values read and written through the metadata file,
+// which the app may rewrite but which never speaks for another container.
 #include <gtest/gtest.h>
 #include <sys/acl.h>
 
 #include <filesystem>
 #include <fstream>
+#include <functional>
+#include <future>
 
 #include "VSAContainerTestRoot.h"
 
@@ -29,6 +32,18 @@ class Maintenance : public VSAContainerTestRoot {
                                const VSAValue& key = VSAValue("k")) {
     *code = VSAResult::kSuccess;
     return installer()->infoValueForKey(&key, identity(id), true, code);
+  }
+  // What an app can write into its own container: a metadata file naming
+  // whatever identifier, class and UUID it likes.
+  void forge(const std::string& dir, const std::string& id, VSAContainerClass c,
+             const VSAUUID& uuid) {
+    auto owner = VSAUserIdentity::isUserIdentityRequiredForContainerClass(c)
+                     ? user_
+                     : context_->userIdentityCache->defaultUserIdentity();
+    VSAMetadata forged(
+        VSAConcreteContainerIdentity::containerIdentityWithUUID(uuid, owner, id, c, nullptr),
+        std::nullopt, dir, std::nullopt);
+    ASSERT_TRUE(forged.writeMetadataToDiskWithError(*context_->globalConfiguration, nullptr));
   }
   static std::string aclOf(const std::string& path) {
     acl_t acl = acl_get_file(path.c_str(), ACL_TYPE_ACCESS);
@@ -135,6 +150,68 @@ TEST_F(Maintenance, InfoValuesAreWrittenThroughTheMetadataFileAndRemovable) {
   EXPECT_FALSE(info("com.example.app", &code));
   EXPECT_EQ(code, 24u);
   EXPECT_EQ(setInfo("com.example.missing", VSAValue("v")), VSAResult::kContainerNotFound);
+}
+
+TEST_F(Maintenance, AMetadataFileNamingAnotherContainerIsOnlyItsOwnReadFailure) {
+  VSAResultCode code;
+  auto sys = create(*installer(), "com.example.sys", &code, false, 12);
+  auto app = create(*installer(), "com.example.app", &code);
+  ASSERT_TRUE(sys && app) << code;
+  auto appIdentity = identity("com.example.app");
+  // Every operation that reads the app's metadata file again (commands 5,
+  // 6, 7, 28 and the protection change of 21), with the code it answers
+  // (none for the protection change, which is made, and only not recorded).
+  std::vector<std::pair<const char*, std::function<std::optional<VSAResultCode>()>>> rereads = {
+      {"set info", [&] { return setInfo("com.example.app", VSAValue("v")); }},
+      {"read info", [&] { return info("com.example.app", &code), std::optional(code); }},
+      {"metadata",
+       [&] {
+         code = VSAResult::kSuccess;
+         installer()->metadataWithContainerIdentity(appIdentity, &code);
+         return std::optional(code);
+       }},
+      {"assets path",
+       [&] {
+         code = VSAResult::kSuccess;
+         bool existed = false;
+         installer()->userManagedAssetsPathWithContainerIdentity(appIdentity, false, true, &existed,
+                                                                 &code);
+         return std::optional(code);
+       }},
+      {"protection", [&] {
+         std::promise<VSAResultCode> done;
+         context_->dataProtectionManager->setDataProtectionOnDataContainerForContainerIdentity(
+             *appIdentity, 3, false, false, [&](VSAResultCode c) { done.set_value(c); });
+         done.get_future().wait();
+         return std::optional<VSAResultCode>();
+       }}};
+  struct Forgery {
+    const char* id;
+    VSAContainerClass c;
+    VSAUUID uuid;
+  };
+  const Forgery forgeries[] = {{"com.example.sys", 12, sys->uuid()},        // the system container
+                               {"com.example.app", 2, VSAUUID::random()}};  // another UUID
+  for (const auto& [name, run] : rereads) {
+    for (const auto& forgery : forgeries) {
+      SCOPED_TRACE(std::string(name) + " of a file claiming " + forgery.id);
+      forge(app->url(), forgery.id, forgery.c, forgery.uuid);
+      if (auto result = run()) {
+        EXPECT_EQ(*result, VSAResult::kMetadataUnreadable);
+      }
+      auto system = lookup("com.example.sys", 12);
+      ASSERT_TRUE(system);
+      EXPECT_EQ(system->url(), sys->url());
+      auto own = lookup("com.example.app");
+      ASSERT_TRUE(own);
+      EXPECT_EQ(own->url(), app->url());
+      EXPECT_EQ(own->uuid(), app->uuid());
+      ASSERT_TRUE(app->writeMetadataToDiskWithError(*context_->globalConfiguration, nullptr));
+    }
+  }
+  // The genuine file is read as before.
+  EXPECT_EQ(setInfo("com.example.app", VSAValue("v")), VSAResult::kSuccess);
+  EXPECT_TRUE(info("com.example.app", &code)) << code;
 }
 
 TEST_F(Maintenance, DiskUsageCountsTheContainersBytesForClientsThatMayLookItUp) {
