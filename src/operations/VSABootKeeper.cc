@@ -237,7 +237,20 @@ void VSABootKeeper::keeperCleanupWithCompletion(std::function<void()> completion
           collect(config.stagingDirectoryURLForUserIdentity(user, c),
                   "Failed to get items at per-user staging URL: %@ : %@");
       });
-  // Staging directories are never resumed: whatever a crash left there goes.
+  // Staging directories are never resumed: whatever a crash left there goes,
+  // except an old container that a replace file still names (its recovery
+  // failed or was not reached): it waits there for the next start's. When
+  // the replace files cannot all be read, staging stays as it is this time.
+  auto waiting = VSAReplaceOperation(services_).stagingURLsAwaitingRecovery();
+  if (!waiting) {
+    VSALogIn(VSALogCategory::Startup, kVSALogError, "keeperCleanupWithCompletion",
+             "Keeping every staging entry: the replace files could not all be read");
+    staged.clear();
+  }
+  for (const auto& url : waiting.value_or(std::set<std::string>{}))
+    if (staged.erase(url))
+      VSALogIn(VSALogCategory::Startup, kVSALogError, "keeperCleanupWithCompletion",
+               "Keeping %@ for the recovery of an unfinished replace", url);
   auto deathRow = services_.deathRow;
   VSADeathRow::_sharedBackgroundQueue()->async(
       [deathRow, staged = std::move(staged), token, completion = std::move(completion)] {
