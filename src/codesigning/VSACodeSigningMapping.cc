@@ -154,6 +154,10 @@ VSAResultCode VSACodeSigningMapping::_onQueue_processCodeSigningInfo(
         identifiers.push_back(parentID);
       }
     }
+    // The deletions a change calls for wait here until the change is
+    // written: while the stored entries still name a container, it stays.
+    VSACommandQueue deletions;
+    VSACommandQueue* pending = commandQueue ? &deletions : nullptr;
     if (flagOption(options, kVSAOptionRegByCaller)) entry.setRegisteredByCaller(true);
     if (flagOption(options, kVSAOptionPlaceholder)) entry.setPlaceholder(true);
     if (flagOption(options, kVSAOptionAdvanceCopy)) entry.setAdvanceCopy(true);
@@ -168,19 +172,19 @@ VSAResultCode VSACodeSigningMapping::_onQueue_processCodeSigningInfo(
         return v && v->boolValue().value_or(false);
       };
       if (flag(oldE) && !flag(newEntitlements))
-        _onQueue_queueSystemContainerDeletion(identifier, commandQueue);
+        _onQueue_queueSystemContainerDeletion(identifier, pending);
       auto newApp = copyApplicationGroupEntitlementForIdentifier(identifier, newEntitlements,
                                                                  kVSAEntitlementApplicationGroups);
       auto oldApp = copyApplicationGroupEntitlementForIdentifier(identifier, oldE,
                                                                  kVSAEntitlementApplicationGroups);
       if (newApp || oldApp)
         _onQueue_handleChangeFromOldGroupContainerIds(oldApp, newApp, kVSAGroupTypeApplication,
-                                                      commandQueue);
+                                                      pending);
       auto newSystem = systemGroupIds(identifier, newEntitlements, false);
       auto oldSystem = systemGroupIds(identifier, oldE, true);
       if (newSystem || oldSystem)
         _onQueue_handleChangeFromOldGroupContainerIds(oldSystem, newSystem, kVSAGroupTypeSystem,
-                                                      commandQueue);
+                                                      pending);
       auto list = [](const std::optional<std::vector<std::string>>& l) {
         std::string s = "(";
         for (const auto& id : l.value_or(std::vector<std::string>{}))
@@ -195,7 +199,16 @@ VSAResultCode VSACodeSigningMapping::_onQueue_processCodeSigningInfo(
       identifiers.push_back(identifier);
     }
     if (values.empty()) return VSAResult::kSuccess;
-    return _onQueue_setCodeSigningDictionaryValues(values, identifiers);
+    VSAResultCode written = _onQueue_setCodeSigningDictionaryValues(values, identifiers);
+    if (written != VSAResult::kSuccess) {
+      if (deletions.count() > 0)
+        logMapping(kVSALogError,
+                   "Keeping the containers that the entry of %@ names: it was not written (%llu)",
+                   identifier, written);
+      return written;
+    }
+    for (const auto& command : deletions.pendingCommands()) commandQueue->insertCommand(command);
+    return VSAResult::kSuccess;
   } catch (const std::exception& e) {
     logMapping(kVSALogError, "Got exception: %@ : %@", "std::exception", e.what());
     return VSAResult::kExceptionInTransaction;

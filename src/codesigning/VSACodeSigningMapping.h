@@ -2,7 +2,7 @@
 // in the code-signing database, and the container work that follows from
 // changes: group containers whose last reference goes and system containers
 // no longer entitled are queued for deletion on the caller's command queue
-// (never deleted inline).
+// (never deleted inline), and only once the change is in the database.
 //
 // Every operation runs on the serial queue "com.tamsk.Vessa.EntitlementQueue":
 // public methods enter it synchronously and must not be called from it;

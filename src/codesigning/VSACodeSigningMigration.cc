@@ -49,8 +49,14 @@ bool VSACodeSigningMigration::performAllCodeSigningMigrationAndReconciliationWit
   if (!multiUser) ok = migrateAppGroupIdsFromDataContainersToFile() && ok;
   ok = mapping_->migrateDataFromLegacyEntitlementsFileToCodeSigningFile() && ok;
   ok = migrateCachedCodeSigningInfoFromBundleContainersToMapping() && ok;
-  if (!multiUser)
+  // A step that failed kept its source for the next pass; a group that only
+  // that source names would look unreferenced now, so reconciliation waits
+  // for a pass that completes.
+  if (!multiUser && ok)
     groupManager_->reconcileGroupContainersOfType(kVSAGroupTypeApplication, commandQueue);
+  else if (!multiUser)
+    logMigration(kVSALogError, "performAllCodeSigningMigrationAndReconciliationWithCommandQueue",
+                 "Not reconciling application groups: the migration did not complete");
   return ok;
 }
 

@@ -2,8 +2,10 @@
 // migrator with its command queue: group identifiers kept in data
 // containers' metadata, the legacy entitlements file and code-signing info
 // cached in bundle containers' metadata all move into the code-signing
-// database, then application groups are reconciled. The whole pass holds the
-// all-identifiers lock for writing.
+// database, then application groups are reconciled (only after a pass in
+// which every step succeeded: a step that failed keeps its source for the
+// next pass, and the groups only that source names are still in use). The
+// whole pass holds the all-identifiers lock for writing.
 //
 // Group identifiers (marker "GroupIdMigration") and cached code-signing info
 // (marker "CodeSigningMigration") run once each: the marker is set only when
@@ -53,7 +55,8 @@ class VSACodeSigningMigration {
   // Removes one info value from a container's metadata file (and its cache entry).
   bool clearInfoValue(const VSAMetadata& container, const char* key);
   std::optional<std::vector<VSAConstMetadataRef>> containers(const VSAUserIdentityRef& user,
-                                                        VSAContainerClass c, VSAErrorRef* error);
+                                                             VSAContainerClass c,
+                                                             VSAErrorRef* error);
 
   std::shared_ptr<VSACodeSigningMapping> mapping_;
   std::shared_ptr<VSAGroupManager> groupManager_;

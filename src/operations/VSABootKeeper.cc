@@ -3,6 +3,7 @@
 #include <cerrno>
 #include <set>
 
+#include "base/VSALocks.h"
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
 #include "base/VSAProgressLog.h"
@@ -146,27 +147,46 @@ void VSABootKeeper::rebootKeeperCleanupWithCompletion(std::function<void()> comp
   });
 }
 
-void VSABootKeeper::_cleanupOrphanedDataForDirectories(const std::vector<std::string>& entries,
-                                                       VSAContainerClass c,
-                                                       VSAProgressLog* progress) {
-  const char* origin = "_cleanupOrphanedDataForDirectories";
+bool VSABootKeeper::_isOrphanedEntry(const std::string& url, VSAContainerClass c, bool* valid) {
   auto& fm = *services_.fileManager;
   auto isWellknown = [&](const std::string& name, VSAContainerClass cls) {
     return services_.wellknownContainerForId &&
            services_.wellknownContainerForId(name, cls).has_value();
   };
-  std::vector<std::string> orphans;
+  // A live container (most entries) costs one status call: its metadata
+  // file exists, so the entry does too.
+  *valid = VSAContainerCache::containerURLIsValidForContainerClass(url, c, isWellknown);
+  if (*valid && fm.itemExistsAtURL(VSAPathJoin(url, kVSAMetadataFileName))) return false;
+  if (fm.itemDoesNotExistAtURL(url)) {
+    VSALogIn(VSALogCategory::Startup, kVSALogDebug, "_cleanupOrphanedDataForDirectories",
+             "Ignoring deleted container path during cleanup: [%@]", url);
+    return false;
+  }
+  return true;
+}
+
+void VSABootKeeper::_cleanupOrphanedDataForDirectories(const std::vector<std::string>& entries,
+                                                       VSAContainerClass c,
+                                                       VSAProgressLog* progress) {
+  const char* origin = "_cleanupOrphanedDataForDirectories";
+  bool valid = false;
+  std::vector<std::string> suspects;
   for (const auto& url : entries) {
     if (progress) progress->advance();
-    // A live container (most entries) costs one status call: its metadata
-    // file exists, so the entry does too.
-    bool valid = VSAContainerCache::containerURLIsValidForContainerClass(url, c, isWellknown);
-    if (valid && fm.itemExistsAtURL(VSAPathJoin(url, kVSAMetadataFileName))) continue;
-    if (fm.itemDoesNotExistAtURL(url)) {
-      VSALogIn(VSALogCategory::Startup, kVSALogDebug, origin,
-               "Ignoring deleted container path during cleanup: [%@]", url);
-      continue;
-    }
+    if (_isOrphanedEntry(url, c, &valid)) suspects.push_back(url);
+  }
+  if (suspects.empty()) return;
+  // Requests are served while the scan runs. An operation that moves
+  // containers (creation, replace and the wipe that uses it, deletion, a
+  // new directory UUID) holds the all-identifiers lock for writing, and may
+  // leave a live path without its metadata file in between: a wipe empties
+  // it between its two renames. Under the lock for reading no such
+  // operation is half done, so each suspect is judged again there and
+  // moved before the lock goes.
+  VSAAllIdentifiersLockGuard lock(false);
+  std::vector<std::string> orphans;
+  for (const auto& url : suspects) {
+    if (!_isOrphanedEntry(url, c, &valid)) continue;
     if (valid)
       VSALogIn(VSALogCategory::Startup, kVSALogError, origin,
                "Deleting orphaned data missing a metadata file at: %@", url);
@@ -176,7 +196,7 @@ void VSABootKeeper::_cleanupOrphanedDataForDirectories(const std::vector<std::st
       VSALogIn(VSALogCategory::Startup, kVSALogError, origin,
                "\tSomeone is writing invalid data to a container, which has now been orphaned. "
                "Here are the invalid files:");
-      fm.printDirectoryStructureAtURL(url);
+      services_.fileManager->printDirectoryStructureAtURL(url);
       VSALogIn(VSALogCategory::Startup, kVSALogError, origin, "***END INTERNAL BUILD REQUEST");
     }
     orphans.push_back(url);
@@ -217,7 +237,20 @@ void VSABootKeeper::keeperCleanupWithCompletion(std::function<void()> completion
           collect(config.stagingDirectoryURLForUserIdentity(user, c),
                   "Failed to get items at per-user staging URL: %@ : %@");
       });
-  // Staging directories are never resumed: whatever a crash left there goes.
+  // Staging directories are never resumed: whatever a crash left there goes,
+  // except an old container that a replace file still names (its recovery
+  // failed or was not reached): it waits there for the next start's. When
+  // the replace files cannot all be read, staging stays as it is this time.
+  auto waiting = VSAReplaceOperation(services_).stagingURLsAwaitingRecovery();
+  if (!waiting) {
+    VSALogIn(VSALogCategory::Startup, kVSALogError, "keeperCleanupWithCompletion",
+             "Keeping every staging entry: the replace files could not all be read");
+    staged.clear();
+  }
+  for (const auto& url : waiting.value_or(std::set<std::string>{}))
+    if (staged.erase(url))
+      VSALogIn(VSALogCategory::Startup, kVSALogError, "keeperCleanupWithCompletion",
+               "Keeping %@ for the recovery of an unfinished replace", url);
   auto deathRow = services_.deathRow;
   VSADeathRow::_sharedBackgroundQueue()->async(
       [deathRow, staged = std::move(staged), token, completion = std::move(completion)] {

@@ -38,12 +38,20 @@ class VSABootKeeper {
   void _regenerateAllSystemContainerPaths(const VSAOperationGrants& grants);
   // Sends every entry that is not a live container of `containerClass` (a
   // name that is not valid for the class, or no metadata file) to death row.
-  // `progress` (may be null) advances by one per entry.
+  // An entry is judged without a lock first; one that looks orphaned is
+  // judged again and moved under the all-identifiers lock (for reading), so
+  // that a container operation in progress is never taken for an orphan.
+  // The caller holds no identifier lock. `progress` (may be null) advances
+  // by one per entry.
   void _cleanupOrphanedDataForDirectories(const std::vector<std::string>& entries,
                                           VSAContainerClass containerClass,
                                           VSAProgressLog* progress = nullptr);
   void _cleanupOprhanedCodeSigningMappingData();
 
  private:
+  // Whether `url` is there and is no live container of the class; `valid`
+  // tells whether its name is valid for the class.
+  bool _isOrphanedEntry(const std::string& url, VSAContainerClass c, bool* valid);
+
   const VSAOperationServices& services_;
 };

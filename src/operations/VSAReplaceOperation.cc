@@ -332,3 +332,22 @@ bool VSAReplaceOperation::_recoverFromReplaceOperationsWithError(VSAErrorRef* er
   }
   return true;
 }
+
+std::optional<std::set<std::string>> VSAReplaceOperation::stagingURLsAwaitingRecovery() {
+  auto& fm = *services_.fileManager;
+  std::set<std::string> staged;
+  VSAErrorRef listError;
+  auto items =
+      fm.urlsForItemsInDirectoryAtURL(services_.configuration->replaceDirectory(), &listError);
+  if (!items) {
+    if (listError && listError->domain() == kVSAPOSIXErrorDomain && listError->code() == ENOENT)
+      return staged;  // no directory, no replace in progress
+    return std::nullopt;
+  }
+  for (const auto& item : *items) {
+    auto info = VSAReplaceFile::_readAndValidateReplaceFileAtUrl(fm, item.path, nullptr);
+    if (!info) return std::nullopt;
+    staged.insert(info->stagingURL);
+  }
+  return staged;
+}

@@ -15,8 +15,14 @@
 // A failure after the old container has been moved aside moves it back and
 // returns it to the cache; only if that fails too do the staging directory
 // and the replace file stay, for the next start's recovery. Recovery runs
-// once at start-up, before staging directories are cleaned.
+// once at start-up, before staging directories are cleaned; a recovery that
+// fails keeps its replace file, and the staging cleanup keeps what such a
+// file names, so a later start tries again.
 #pragma once
+
+#include <optional>
+#include <set>
+#include <string>
 
 #include "base/VSAError.h"
 #include "model/VSAContainerIdentity.h"
@@ -33,6 +39,12 @@ class VSAReplaceOperation {
   // Puts back every old container that a replace file says was moved aside
   // and not replaced, then discards the replace files.
   bool _recoverFromReplaceOperationsWithError(VSAErrorRef* error);
+  // The staging directories that the replace files still on disk name: the
+  // old containers that a recovery could not yet put back (or did not reach)
+  // wait there for the next start and must survive the staging cleanup.
+  // Nothing when a replace file or the directory cannot be read: then any
+  // staging entry may be one of them.
+  std::optional<std::set<std::string>> stagingURLsAwaitingRecovery();
 
  private:
   const VSAOperationServices& services_;

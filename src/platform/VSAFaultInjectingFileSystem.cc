@@ -34,6 +34,12 @@ void VSAFaultInjectingFileSystem::failCall(int n, int error) {
   failCallError_ = error;
 }
 
+void VSAFaultInjectingFileSystem::afterNextLstatOf(const std::string& path,
+                                                   std::function<void()> hook) {
+  std::lock_guard lock(mutex_);
+  lstatHooks_.emplace_back(path, std::move(hook));
+}
+
 bool VSAFaultInjectingFileSystem::crashed() const {
   std::lock_guard lock(mutex_);
   return crashRemaining_ == 0;
@@ -45,6 +51,7 @@ void VSAFaultInjectingFileSystem::reset() {
   crashRemaining_ = -1;
   failCallRemaining_ = -1;
   counts_.fill(0);
+  lstatHooks_.clear();
 }
 
 int VSAFaultInjectingFileSystem::callCount(Op op) const {
@@ -78,8 +85,20 @@ int VSAFaultInjectingFileSystem::injected(Op op) {
 }
 
 int VSAFaultInjectingFileSystem::lstat(const std::string& path, struct stat* st) {
-  if (int e = injected(Op::Lstat)) return e;
-  return inner_->lstat(path, st);
+  int rc = injected(Op::Lstat);
+  if (rc == 0) rc = inner_->lstat(path, st);
+  std::function<void()> hook;
+  {
+    std::lock_guard lock(mutex_);
+    for (auto it = lstatHooks_.begin(); it != lstatHooks_.end(); ++it) {
+      if (it->first != path) continue;
+      hook = std::move(it->second);
+      lstatHooks_.erase(it);
+      break;
+    }
+  }
+  if (hook) hook();  // outside the mutex: it may call this file system
+  return rc;
 }
 
 int VSAFaultInjectingFileSystem::mkdir(const std::string& path, mode_t mode) {

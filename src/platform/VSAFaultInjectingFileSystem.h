@@ -8,10 +8,13 @@
 // Unlink or Rmdir, renameAt as Rename, ...). crashAfter(n) stops every call
 // after the n-th, for crash-point sweeps. readOnly() makes a layer that
 // refuses every call that would change the disk (EROFS), for code that must
-// only look, such as the root checker. Thread-safe.
+// only look, such as the root checker. afterNextLstatOf() runs a test's code
+// at one exact point of an operation, to make a race with another thread
+// happen every time. Thread-safe.
 #pragma once
 
 #include <array>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <vector>
@@ -33,6 +36,10 @@ class VSAFaultInjectingFileSystem : public VSAFileSystem {
   // The n-th call from now, whatever its kind, fails with `error` (ENOSPC,
   // EIO, ...) and changes nothing; the calls after it go through.
   void failCall(int n, int error);
+  // Runs `hook` once, on the calling thread, right after the next lstat of
+  // exactly `path` (also through exists()) has returned, whether it failed
+  // or not. The hook may use this file system. reset() drops unrun hooks.
+  void afterNextLstatOf(const std::string& path, std::function<void()> hook);
   bool crashed() const;
   void reset();
   int callCount(Op op) const;
@@ -97,6 +104,7 @@ class VSAFaultInjectingFileSystem : public VSAFileSystem {
   mutable std::mutex mutex_;
   std::array<int, static_cast<size_t>(Op::Count)> counts_{};
   std::vector<Rule> rules_;
+  std::vector<std::pair<std::string, std::function<void()>>> lstatHooks_;
   int crashRemaining_ = -1;     // -1: no crash planned
   int failCallRemaining_ = -1;  // -1: no single failure planned
   int failCallError_ = 0;

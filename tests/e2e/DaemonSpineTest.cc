@@ -16,6 +16,7 @@
 #include "base/VSAJSON.h"
 #include "base/VSAPlist.h"
 #include "e2e/VSATestDaemon.h"
+#include "e2e/VSATestDatabase.h"
 #include "platform/VSAFrameCodec.h"
 #include "platform/VSAIPCClient.h"
 #include "platform/VSALockStateService.h"
@@ -385,6 +386,46 @@ TEST(DaemonCodeSigning, RecordThenReadThroughTheRealDaemon) {
   EXPECT_EQ(VSAReplyError(d.request(VSAValue::Dictionary{{"Command", VSAValue(19u)}})), 18u);
   EXPECT_TRUE(
       std::filesystem::exists(d.path("/private/var/root/Library/Vessa/containers.sqlite3")));
+  EXPECT_EQ(d.stop(), 0);
+}
+
+// A registration that drops an identifier's last group deletes the group's
+// container only once the new entry is written: while the database refuses
+// the write, the stored entry still names the group and its container stays.
+TEST(DaemonCodeSigning, AGroupStaysWhileTheRegistrationThatDropsItIsNotWritten) {
+  VSATestDaemon d;
+  d.registerSelf("com.example.installer", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
+  auto record = [&](VSAValue entitlements) {
+    return VSAReplyError(d.request(VSAValue::Dictionary{
+        {"Command", VSAValue(18u)},
+        {"Identifier", VSAValue("com.example.app")},
+        {"CodeSigningInfo",
+         VSAValue::Dictionary{{"com.tamsk.Vessa.Entitlements", std::move(entitlements)}}}}));
+  };
+  auto group = [&] {
+    return VSAReplyString(
+        d.request(VSAValue::Dictionary{{"Command", VSAValue(0u)},
+                                       {"Identifier", VSAValue("group.example.only")},
+                                       {"ContainerClass", VSAValue(7u)},
+                                       {"CreateIfNecessary", VSAValue(true)}}),
+        "ReplyPath");
+  };
+  ASSERT_TRUE(d.start());
+  ASSERT_EQ(record(VSAValue::Dictionary{
+                {"com.tamsk.security.application-groups", VSAValue("group.example.only")}}),
+            1u);
+  std::string path = group();
+  ASSERT_FALSE(path.empty());
+  EXPECT_EQ(d.stop(), 0);
+  ASSERT_EQ(VSARefuseEntryWrites(d, "com.example.app", true), "");
+  ASSERT_TRUE(d.start());
+  EXPECT_NE(record(VSAValue::dictionary()), 1u);
+  EXPECT_TRUE(std::filesystem::exists(path + "/.com.tamsk.vessa_keeper.metadata.plist"));
+  EXPECT_EQ(d.stop(), 0);
+  ASSERT_EQ(VSARefuseEntryWrites(d, "com.example.app", false), "");
+  ASSERT_TRUE(d.start());
+  EXPECT_EQ(record(VSAValue::dictionary()), 1u);
+  EXPECT_FALSE(std::filesystem::exists(path)) << "written: the group goes";
   EXPECT_EQ(d.stop(), 0);
 }
 

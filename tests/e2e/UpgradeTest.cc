@@ -1,7 +1,8 @@
 // End to end: a device left by an earlier release is upgraded by the real
 // daemon at its first start after a boot, then the client-requested
 // migrations (24, 30) finish the work; later starts find nothing to do.
-// What the mobile user planted in the old bundle location stays there.
+// What the mobile user planted in the old bundle location stays there, and a
+// pass that cannot store a legacy source removes no group that it names.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
@@ -13,6 +14,7 @@
 #include "base/VSAPlist.h"
 #include "base/VSAUUID.h"
 #include "e2e/VSATestDaemon.h"
+#include "e2e/VSATestDatabase.h"
 
 namespace fs = std::filesystem;
 
@@ -163,6 +165,45 @@ TEST(DaemonUpgrade, ABundleTheUserPlantedInTheOldLocationIsLeftThere) {
   EXPECT_FALSE(fs::exists(d.path("/private/var/containers/Bundle/Application/" + uuid)));
   EXPECT_TRUE(fs::exists(metadata));
   EXPECT_NE(d.daemonOutput().find("Leaving " + containers + "/Bundle"), std::string::npos);
+
+// The group ID migration cannot store what a data container's metadata says
+// about its groups (the database refuses that identifier's entry): the value
+// stays for the next pass, and so does the group container that only it
+// names. The next pass that completes keeps the group, now referenced.
+TEST(DaemonUpgrade, APassThatKeepsASourceForItsRetryRemovesNoGroupThatSourceNames) {
+  VSATestDaemon d;
+  d.registerSelf("com.example.installer",
+                 VSAValue::Dictionary{{"com.tamsk.private.Vessa.allowed", VSAValue(true)},
+                                      {"com.tamsk.private.Vessa.dataMigration", VSAValue(true)}});
+  writeVersion(d, "OLD1");
+  ASSERT_TRUE(d.start());
+  for (auto [id, containerClass] :
+       {std::pair<const char*, uint64_t>{"com.example.grouped", 2}, {"group.example.legacy", 7}}) {
+    VSAValue create = withContainer(0, id, containerClass);
+    create.set("CreateIfNecessary", VSAValue(true));
+    ASSERT_EQ(VSAReplyError(d.request(create)), 1u) << id;
+  }
+  VSAValue lookup = withContainer(0, "group.example.legacy", 7);
+  std::string group = VSAReplyString(d.request(lookup), "ReplyPath");
+  VSAValue setInfo = withContainer(5, "com.example.grouped", 2);
+  setInfo.set("Key", VSAValue("com.tamsk.Ferrox.GroupContainerIDs"));
+  setInfo.set("Value", VSAValue(VSAValue::Array{VSAValue("group.example.legacy")}));
+  ASSERT_EQ(VSAReplyError(d.request(setInfo)), 1u);
+  EXPECT_EQ(d.stop(), 0);
+
+  ASSERT_EQ(VSARefuseEntryWrites(d, "com.example.grouped", true), "");
+  writeVersion(d, "NEW2");
+  ASSERT_TRUE(d.start(true, {"--after-boot"}));
+  EXPECT_NE(VSAReplyError(d.request(body(24))), 1u);
+  EXPECT_TRUE(fs::exists(group + "/.com.tamsk.vessa_keeper.metadata.plist"));
+  EXPECT_NE(d.daemonOutput().find("Not reconciling application groups"), std::string::npos);
+  EXPECT_EQ(d.stop(), 0);
+
+  ASSERT_EQ(VSARefuseEntryWrites(d, "com.example.grouped", false), "");
+  ASSERT_TRUE(d.start());
+  EXPECT_EQ(VSAReplyError(d.request(body(24))), 1u);
+  EXPECT_TRUE(fs::exists(group + "/.com.tamsk.vessa_keeper.metadata.plist"));
+  EXPECT_EQ(VSAReplyString(d.request(lookup), "ReplyPath"), group);
   EXPECT_EQ(d.stop(), 0);
 }
 

@@ -1,21 +1,25 @@
 // Boot-time setup and cleanup: system containers restored from backups,
 // orphaned class entries removed (and only they), system container
 // directories renamed after an upgrade, group reconciliation in multi-user
-// mode only. Log lines are read from a rotating log file the test opens.
+// mode only, and an orphan scan that runs while a wipe replaces a container.
+// Log lines are read from a rotating log file the test opens.
 #include <gtest/gtest.h>
 
 #include <filesystem>
 #include <fstream>
+#include <thread>
 
 #include "VSAContainerTestRoot.h"
 #include "VSAOldDevice.h"
 #include "base/VSALog.h"
+#include "base/VSATestLocks.h"
 #include "model/VSAPerUserConfiguration.h"
 #include "operations/VSABootKeeper.h"
 #include "operations/VSADeathRow.h"
 #include "operations/VSASystemContainerRestore.h"
 
 namespace fs = std::filesystem;
+using namespace std::chrono_literals;
 
 namespace {
 
@@ -213,6 +217,47 @@ TEST_F(Boot, OnlyEntriesThatAreNotLiveContainersAreCleanedAway) {
   EXPECT_TRUE(logged("***INTERNAL BUILD REQUEST"));
   EXPECT_TRUE(logged("Someone is writing invalid data to a container"));
   EXPECT_TRUE(logged("***END INTERNAL BUILD REQUEST"));
+}
+
+// The scan runs while requests are served. A wipe leaves its container's
+// path empty between its two renames (held there by test lock 3): the scan
+// finds no metadata file in that moment, and the wipe finishes before the
+// scan looks again. The fresh container must stay.
+TEST_F(Boot, TheOrphanScanLeavesAloneAContainerThatAWipeIsReplacing) {
+  VSAResultCode code;
+  auto live = create(*installer(), "com.example.app", &code);
+  ASSERT_TRUE(live) << code;
+  put(live->url() + "/Documents/old", "x");
+  auto& locks = VSATestLocks::shared();
+  struct Off {
+    ~Off() { VSATestLocks::shared().setEnabled(false); }
+  } off;
+  locks.setEnabled(true);
+  locks.acquireLock(kVSATestLockReplace);
+  std::promise<VSAResultCode> wiped;
+  auto result = wiped.get_future();
+  std::thread wiper([&] {
+    VSAResultCode c = VSAResult::kSuccess;
+    installer()->deleteDataContainerContentWithContainerIdentity(identity("com.example.app"), &c);
+    wiped.set_value(c);
+  });
+  for (int i = 0; i < 1000 && fs::exists(live->url()); ++i) std::this_thread::sleep_for(10ms);
+  bool halfway = !fs::exists(live->url());
+  faults_->afterNextLstatOf(live->url() + "/" + kVSAMetadataFileName, [&] {
+    locks.releaseLock(kVSATestLockReplace);
+    result.wait();
+  });
+  if (halfway) keeper()._cleanupOrphanedDataForDirectories({live->url()}, 2);
+  if (!halfway) locks.releaseLock(kVSATestLockReplace);
+  wiper.join();
+  ASSERT_TRUE(halfway) << "the wipe never moved the old container aside";
+  EXPECT_EQ(result.get(), VSAResult::kSuccess);
+  EXPECT_TRUE(fs::exists(live->url() + "/" + kVSAMetadataFileName));
+  EXPECT_FALSE(fs::exists(live->url() + "/Documents/old"));
+  EXPECT_FALSE(logged("Deleting orphaned data missing a metadata file at: " + live->url()));
+  auto found = lookup("com.example.app");
+  ASSERT_TRUE(found);
+  EXPECT_EQ(found->url(), live->url());
 }
 
 TEST_F(Boot, AnUpgradeRenamesSystemContainersExceptWellKnownAndAnalytics) {

@@ -179,6 +179,44 @@ TEST_F(ReplaceAndWipe, ARestrictedClientWipesOnlyListedPluginData) {
   EXPECT_EQ(entries(classDirectory(2, true)), 0u);
 }
 
+// A crash between a wipe's renames left the old container in staging. The
+// next start cannot move it back; its staging cleanup must keep it (and its
+// replace file), and the start after that puts it back.
+TEST_F(ReplaceAndWipe, AnOldContainerThatRecoveryCannotMoveBackWaitsForALaterStart) {
+  VSAResultCode code;
+  auto app = create(*installer(), "com.example.app", &code);
+  ASSERT_TRUE(app) << code;
+  put(app->url() + "/Documents/diary", "kept");
+  std::string aside = staging() + "/" + VSAUUID::random().string();
+  std::string fresh = classDirectory(2, true) + "/" + VSAUUID::random().string();
+  ASSERT_TRUE(VSAReplaceFile::_writeToDiskReplaceAt(
+      *context_->fileManager, replaceDirectory() + "/" + VSAUUID::random().string() + ".plist",
+      app->url(), fresh, aside, app->url(), nullptr));
+  fs::create_directories(staging());
+  fs::rename(app->url(), aside);
+
+  context_.reset();
+  startContext();
+  faults_->failAll(VSAFileSystem::Op::Rename, EIO);
+  installer()->keeperSetup();
+  faults_->reset();
+  std::promise<void> cleaned;
+  installer()->keeperCleanupWithCompletion([&] { cleaned.set_value(); });
+  cleaned.get_future().wait();
+  EXPECT_EQ(read(aside + "/Documents/diary"), "kept");
+  EXPECT_EQ(entries(replaceDirectory()), 1u);
+  EXPECT_FALSE(fs::exists(app->url()));
+
+  restart();
+  auto back = lookup("com.example.app");
+  ASSERT_TRUE(back);
+  EXPECT_EQ(back->url(), app->url());
+  EXPECT_EQ(back->uuid(), app->uuid());
+  EXPECT_EQ(read(app->url() + "/Documents/diary"), "kept");
+  EXPECT_EQ(entries(replaceDirectory()), 0u);
+  EXPECT_EQ(stagedItems(), 0u);
+}
+
 TEST_F(ReplaceAndWipe, RecoveryActsOnlyOnValidReplaceFilesWhoseOldDirectoryIsGone) {
   auto& fm = *context_->fileManager;
   std::string base = root_ + "/scratch";
