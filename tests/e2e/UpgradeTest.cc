@@ -165,6 +165,8 @@ TEST(DaemonUpgrade, ABundleTheUserPlantedInTheOldLocationIsLeftThere) {
   EXPECT_FALSE(fs::exists(d.path("/private/var/containers/Bundle/Application/" + uuid)));
   EXPECT_TRUE(fs::exists(metadata));
   EXPECT_NE(d.daemonOutput().find("Leaving " + containers + "/Bundle"), std::string::npos);
+  EXPECT_EQ(d.stop(), 0);
+}
 
 // The group ID migration cannot store what a data container's metadata says
 // about its groups (the database refuses that identifier's entry): the value
