@@ -230,7 +230,12 @@ TEST(KernelUpcall, APeerSeenWithPidZeroIsNotTheKernel) {
   EXPECT_FALSE(parsed && parsed->returnCode == 0) << "served as the kernel";
   EXPECT_FALSE(fs::exists(d.path("/private/var/mobile/Containers/Data/Application")) &&
                !fs::is_empty(d.path("/private/var/mobile/Containers/Data/Application")));
+  // unshare ends at once and hands its child SIGTERM: wait for that stop to
+  // finish (its last step removes the pid file) before the root goes.
   d.crash();
+  for (int i = 0; i < 1000 && fs::exists(d.path("/run/vessad/vessad.pid")); ++i)
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  EXPECT_FALSE(fs::exists(d.path("/run/vessad/vessad.pid")));
 }
 
 }  // namespace
