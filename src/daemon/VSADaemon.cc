@@ -48,6 +48,12 @@ int VSADaemon::run() {
   testLockQueue_ =
       VSAWorkQueue::create("com.tamsk.vessad.testlocks", VSAWorkQueue::Kind::Concurrent);
   testLockQueue_->suspend();
+  // Both sockets take connections from here on; initialisation starts
+  // serving the upcall's, so an upcall made meanwhile waits in its backlog
+  // instead of failing.
+  upcallListener_ = VSAKernelUpcall::listenerFor(*context_);
+  if (VSAErrorRef error; !upcallListener_->bind(&error))
+    VSALogIn(VSALogCategory::Upcall, kVSALogError, "main", "bootstrap_check_in: %@", error);
   context_->listenerQueue->async([this, initTransaction = std::move(initTransaction)]() mutable {
     initialize();
     initialized_ = true;
@@ -230,7 +236,8 @@ void VSADaemon::initialize() {
   {
     std::lock_guard lock(listenerMutex_);
     upcall_ = std::make_unique<VSAKernelUpcall>(*context_, context_->listenerQueue);
-    if (!upcall_->start()) VSACrash("Failed to initialize kernel upcall interface.");
+    if (!upcall_->start(std::move(upcallListener_)))
+      VSACrash("Failed to initialize kernel upcall interface.");
   }
 
   int status = context_->lockState->registerForLockStatus(

@@ -65,6 +65,9 @@ class VSADaemon {
   std::unique_ptr<VSAClientConnection> sharedConnection_;
   std::unique_ptr<VSALockStateMonitor> lockStateMonitor_;
   std::unique_ptr<VSAKernelUpcall> upcall_;
+  // The upcall socket, bound with the request socket before initialisation
+  // and handed to upcall_ when initialisation starts serving it.
+  std::unique_ptr<VSAUpcallListener> upcallListener_;
   std::string firstBootSemaphore_;
   std::atomic<bool> stopping_{false};
   // A test-lock command has been received: requests may freeze at test locks

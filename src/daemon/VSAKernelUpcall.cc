@@ -43,9 +43,13 @@ VSAKernelUpcall::VSAKernelUpcall(VSADaemonContext& context, VSAWorkQueue::Ref ta
 
 VSAKernelUpcall::~VSAKernelUpcall() { stop(); }
 
-bool VSAKernelUpcall::start() {
-  listener_ = std::make_unique<VSAUpcallListener>(
-      context_.systemRoot.upcallSocketPath(), context_.clientRegistry, kVSAUpcallMaxRequestSize);
+std::unique_ptr<VSAUpcallListener> VSAKernelUpcall::listenerFor(VSADaemonContext& context) {
+  return std::make_unique<VSAUpcallListener>(context.systemRoot.upcallSocketPath(),
+                                             context.clientRegistry, kVSAUpcallMaxRequestSize);
+}
+
+bool VSAKernelUpcall::start(std::unique_ptr<VSAUpcallListener> bound) {
+  listener_ = bound ? std::move(bound) : listenerFor(context_);
   VSAErrorRef error;
   bool started = listener_->start(
       [this](VSAUpcallPacket packet, VSAUpcallListener::Reply reply) {

@@ -20,8 +20,12 @@ class VSAKernelUpcall {
  public:
   VSAKernelUpcall(VSADaemonContext& context, VSAWorkQueue::Ref targetQueue);
   ~VSAKernelUpcall();
-  // Binds the socket and starts serving; false (logged) when it cannot.
-  bool start();
+  // Starts serving on `bound` (a listener whose socket was bound before
+  // initialisation, so that upcalls wait in its backlog meanwhile), or binds
+  // one now; false (logged) when it cannot.
+  bool start(std::unique_ptr<VSAUpcallListener> bound = nullptr);
+  // A listener for this daemon's upcall socket, not yet serving.
+  static std::unique_ptr<VSAUpcallListener> listenerFor(VSADaemonContext& context);
   void stop();
 
   // The environment the server works in, over `context` (tests use it directly).

@@ -90,9 +90,8 @@ bool VSAIPCListener::isValidMessageID(const VSAValue& id) {
 }
 
 bool VSAIPCListener::listen(VSAErrorRef* error) {
-  if (sd_listen_fds(0) >= 1 &&
-      sd_is_socket_unix(SD_LISTEN_FDS_START, SOCK_STREAM, 1, socketPath_.c_str(), 0) > 0) {
-    listenFd_ = SD_LISTEN_FDS_START;  // socket activation: systemd owns the file
+  if (int activated = VSAActivatedListeningSocket(SOCK_STREAM, socketPath_); activated >= 0) {
+    listenFd_ = activated;  // socket activation: systemd owns the file
   } else {
     sockaddr_un addr;
     if (!fillAddress(socketPath_, addr)) {

@@ -3,6 +3,7 @@
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
+#include <systemd/sd-daemon.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -24,4 +25,11 @@ int VSABindListeningSocket(int fd, const std::string& path, mode_t mode, int bac
     rc = errno;
   if (rc != 0) ::unlink(temporary.c_str());
   return rc;
+}
+
+int VSAActivatedListeningSocket(int type, const std::string& path) {
+  int count = sd_listen_fds(0);  // the environment stays: each listener looks
+  for (int fd = SD_LISTEN_FDS_START; fd < SD_LISTEN_FDS_START + count; ++fd)
+    if (sd_is_socket_unix(fd, type, 1, path.c_str(), 0) > 0) return fd;
+  return -1;
 }

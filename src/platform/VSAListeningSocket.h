@@ -1,4 +1,5 @@
-// Putting a listening unix socket at its path in one step.
+// Putting a listening unix socket at its path in one step, or taking over
+// the one a service manager holds for that path.
 #pragma once
 
 #include <sys/types.h>
@@ -14,3 +15,8 @@
 // left alone (other threads may be creating files meanwhile). Returns 0 or
 // an errno; on failure no file is left behind and `path` is untouched.
 int VSABindListeningSocket(int fd, const std::string& path, mode_t mode, int backlog);
+
+// The listening unix socket of `type` (SOCK_STREAM, SOCK_SEQPACKET) at `path`
+// among those passed by socket activation (systemd's LISTEN_FDS), or -1. The
+// service manager owns the file; several listeners may each find theirs.
+int VSAActivatedListeningSocket(int type, const std::string& path);

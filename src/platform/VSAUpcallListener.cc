@@ -109,16 +109,36 @@ VSAUpcallListener::VSAUpcallListener(std::string socketPath,
 
 VSAUpcallListener::~VSAUpcallListener() { stop(); }
 
-bool VSAUpcallListener::start(Handler handler, VSAErrorRef* error) {
-  handler_ = std::move(handler);
+bool VSAUpcallListener::bind(VSAErrorRef* error) {
+  if (listenFd_ >= 0) return true;
+  if (int activated = VSAActivatedListeningSocket(SOCK_SEQPACKET, path_); activated >= 0) {
+    listenFd_ = activated;
+    ::fcntl(listenFd_, F_SETFL, ::fcntl(listenFd_, F_GETFL) | O_NONBLOCK);
+    // The unit gives all its sockets one mode: only root talks to this one.
+    ::chmod(path_.c_str(), 0600);
+    return true;
+  }
   listenFd_ = ::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
-  waker_ = std::make_shared<Waker>();
-  int rc =
-      listenFd_ < 0 || waker_->fd < 0 ? errno : VSABindListeningSocket(listenFd_, path_, 0600, 16);
+  int rc = listenFd_ < 0 ? errno : VSABindListeningSocket(listenFd_, path_, 0600, 16);
   if (rc != 0) {
     VSASetError(error, VSA_POSIX_ERROR(rc, VSAFormat("binding %@", path_)));
     if (listenFd_ >= 0) ::close(listenFd_);  // the file at the path is not this one's to remove
     listenFd_ = -1;
+    return false;
+  }
+  ownsSocketFile_ = true;
+  return true;
+}
+
+bool VSAUpcallListener::start(Handler handler, VSAErrorRef* error) {
+  handler_ = std::move(handler);
+  waker_ = std::make_shared<Waker>();
+  if (waker_->fd < 0) {
+    VSASetError(error, VSA_POSIX_ERROR(errno));
+    stop();
+    return false;
+  }
+  if (!bind(error)) {
     stop();
     return false;
   }
@@ -132,7 +152,8 @@ void VSAUpcallListener::stop() {
   if (thread_.joinable()) thread_.join();
   peers_.clear();
   if (listenFd_ >= 0) {
-    ::unlink(path_.c_str());  // no stale socket for the next start's waiters
+    // No stale socket for the next start's waiters; one systemd holds stays.
+    if (ownsSocketFile_) ::unlink(path_.c_str());
     ::close(listenFd_);
   }
   waker_.reset();

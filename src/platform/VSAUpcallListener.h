@@ -57,7 +57,10 @@ class VSAUpcallListener {
   VSAUpcallListener(const VSAUpcallListener&) = delete;
   VSAUpcallListener& operator=(const VSAUpcallListener&) = delete;
 
-  // Binds the socket and starts the I/O thread.
+  // Takes over the socket a service manager passed for the path, or binds
+  // it (mode 0600). Connections wait in its backlog until start().
+  bool bind(VSAErrorRef* error);
+  // Binds the socket when bind() has not, and starts the I/O thread.
   bool start(Handler handler, VSAErrorRef* error);
   void stop();
   const std::string& socketPath() const { return path_; }
@@ -74,6 +77,7 @@ class VSAUpcallListener {
   uint64_t maxMemorySize_;
   Handler handler_;
   int listenFd_ = -1;
+  bool ownsSocketFile_ = false;  // not when a service manager passed it
   std::shared_ptr<Waker> waker_;
   std::atomic<bool> stopping_{false};
   std::thread thread_;

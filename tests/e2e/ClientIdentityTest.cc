@@ -240,7 +240,7 @@ TEST_P(ExecBeforeAccept, AMobileProcessNeverBecomesAClientRegisteredForRoot) {
       std::this_thread::sleep_for(10ms);
     }
     std::this_thread::sleep_for(100ms);
-    d.setActivationSocket(held);
+    d.setActivationSockets({held});
     ASSERT_TRUE(d.start());
     ::close(held);
   }

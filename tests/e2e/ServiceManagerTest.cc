@@ -4,19 +4,25 @@
 // over (socket activation); the unit files pass systemd's own check.
 #include <gtest/gtest.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <chrono>
 #include <cstdlib>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
+#include <optional>
 #include <string>
 #include <thread>
 #include <vector>
 
 #include "e2e/VSATestDaemon.h"
+#include "platform/VSAUpcallClient.h"
+#include "upcall/VSAUpcallMessage.h"
+#include "upcall/VSAUpcallPayload.h"
 
 using namespace std::chrono_literals;
 
@@ -117,6 +123,89 @@ TEST(DaemonServiceManager, ASocketTheManagerHoldsIsTakenOver) {
   int status = 0;
   ::waitpid(pid, &status, 0);
   EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+}
+
+namespace {
+// An upcall for an app of the mobile user, sent on its own thread: the
+// reply's return code, or nothing.
+std::thread upcallInBackground(const std::string& path, std::optional<int32_t>* code) {
+  VSAUpcallProcess app;
+  app.codeSignatureID = "com.example.app";
+  app.uid = 501;
+  app.personaID = 1000;
+  auto memory = *app.pack();
+  VSAUpcallRequest request;
+  request.descriptorSize = request.requestSize = static_cast<uint32_t>(memory.size());
+  return std::thread([path, memory, request, code] {
+    VSAUpcallClient client;
+    std::string why;
+    std::vector<uint8_t> reply;
+    std::optional<std::vector<uint8_t>> replyMemory;
+    if (client.connect(path, &why) &&
+        client.call(request.bytes(), &memory, &reply, &replyMemory, &why, 20000))
+      if (auto parsed = VSAUpcallReply::parse(reply.data(), reply.size()))
+        *code = parsed->returnCode;
+  });
+}
+
+int listeningSocket(int type, const std::string& path) {
+  int fd = ::socket(AF_UNIX, type | SOCK_CLOEXEC, 0);
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  std::strncpy(addr.sun_path, path.c_str(), sizeof addr.sun_path - 1);
+  if (::bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0 || ::listen(fd, 16) != 0)
+    return -1;
+  return fd;
+}
+}  // namespace
+
+// The upcall's socket is there as soon as the request socket is: an upcall
+// made while the daemon is still starting waits and is answered.
+TEST(DaemonServiceManager, AnUpcallDuringStartUpWaitsAndIsAnswered) {
+  VSATestDaemon d;
+  d.registerSelfAsKernelBridge();
+  VSAInitialisationHold hold(d.root());
+  ASSERT_TRUE(d.start(false));
+  for (int i = 0; i < 500 && !std::filesystem::exists(d.socketPath()); ++i)
+    std::this_thread::sleep_for(10ms);
+  ASSERT_TRUE(std::filesystem::exists(d.upcallSocketPath())) << "the upcall socket came later";
+  std::optional<int32_t> code;
+  auto upcall = upcallInBackground(d.upcallSocketPath(), &code);
+  std::this_thread::sleep_for(300ms);
+  EXPECT_FALSE(code) << "answered before start-up had finished";
+  hold.release();
+  upcall.join();
+  EXPECT_EQ(code, std::optional<int32_t>(0));
+  EXPECT_EQ(d.stop(), 0);
+}
+
+// Under socket activation the manager holds both sockets: an upcall sent
+// before the daemon runs is answered once it has started, and the upcall's
+// socket (which the unit makes with the request socket's mode) is root's alone.
+TEST(DaemonServiceManager, BothSocketsTheManagerHoldsAreTakenOver) {
+  VSATestDaemon d;
+  d.registerSelfAsKernelBridge();
+  int requests = listeningSocket(SOCK_STREAM, d.socketPath());
+  int upcalls = listeningSocket(SOCK_SEQPACKET, d.upcallSocketPath());
+  ASSERT_GE(requests, 0);
+  ASSERT_GE(upcalls, 0);
+  ::chmod(d.upcallSocketPath().c_str(), 0666);
+  std::optional<int32_t> code;
+  auto upcall = upcallInBackground(d.upcallSocketPath(), &code);
+  std::this_thread::sleep_for(300ms);
+  d.setActivationSockets({requests, upcalls});
+  ASSERT_TRUE(d.start());
+  upcall.join();
+  EXPECT_EQ(code, std::optional<int32_t>(0));
+  struct stat st;
+  ASSERT_EQ(::stat(d.upcallSocketPath().c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0600u);
+  // The request socket was taken over too (the bridge holds no entitlement).
+  EXPECT_EQ(VSAReplyError(d.request(VSAValue::Dictionary{{"Command", VSAValue(19u)}})), 55u);
+  EXPECT_EQ(d.stop(), 0);
+  EXPECT_TRUE(std::filesystem::exists(d.upcallSocketPath())) << "the manager's file stays";
+  ::close(requests);
+  ::close(upcalls);
 }
 
 TEST(DaemonServiceManager, TheUnitFilesPassSystemdsCheck) {

@@ -101,9 +101,12 @@ bool VSATestDaemon::start(bool waitForSocket, std::vector<std::string> extraArgs
     int out = open((root_ + "/vessad.out").c_str(), O_WRONLY | O_CREAT | O_APPEND, 0644);
     dup2(out, 1);
     dup2(out, 2);
-    if (activationFd_ >= 0) {
-      dup2(activationFd_, 3);
-      setenv("LISTEN_FDS", "1", 1);
+    if (!activationFds_.empty()) {
+      // Above every descriptor they might be moved onto, then into place from 3.
+      std::vector<int> high;
+      for (int fd : activationFds_) high.push_back(fcntl(fd, F_DUPFD, 100));
+      for (size_t i = 0; i < high.size(); ++i) dup2(high[i], 3 + static_cast<int>(i));
+      setenv("LISTEN_FDS", std::to_string(high.size()).c_str(), 1);
       setenv("LISTEN_PID", std::to_string(getpid()).c_str(), 1);
     }
     std::vector<char*> argv;
@@ -116,7 +119,7 @@ bool VSATestDaemon::start(bool waitForSocket, std::vector<std::string> extraArgs
   for (int i = 0; i < 1000; ++i) {
     VSAIPCClient probe;
     if (probe.connect(socketPath(), nullptr)) {
-      // The upcall socket comes at the end of initialisation, after boot setup.
+      // Both sockets are bound before initialisation; this only guards a slow start.
       for (int j = 0; j < 1000 && !fs::exists(upcallSocketPath()); ++j)
         std::this_thread::sleep_for(10ms);
       return true;

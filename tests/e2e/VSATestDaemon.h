@@ -68,9 +68,9 @@ class VSATestDaemon {
   // Runs vessad through `prefix` (for example a program that starts it in a
   // namespace of its own) from the next start on.
   void setLaunchPrefix(std::vector<std::string> prefix) { prefix_ = std::move(prefix); }
-  // Hands the next start `fd` as its request socket, as socket activation
-  // does (the daemon takes over a socket that may already hold connections).
-  void setActivationSocket(int fd) { activationFd_ = fd; }
+  // Hands the next start `fds` (listening sockets) as socket activation does:
+  // the daemon takes over sockets that may already hold connections.
+  void setActivationSockets(std::vector<int> fds) { activationFds_ = std::move(fds); }
   // Starts vessad; waits for its socket unless told not to.
   bool start(bool waitForSocket = true, std::vector<std::string> extraArgs = {});
   // SIGTERM and wait; returns the exit status (or -1 on a signal/time-out).
@@ -103,7 +103,7 @@ class VSATestDaemon {
   std::string root_;
   pid_t pid_ = -1;
   std::vector<std::string> prefix_;
-  int activationFd_ = -1;
+  std::vector<int> activationFds_;
 };
 
 // Runs `body` in a child process of the mobile user (uid and gid 501, no
