@@ -135,6 +135,9 @@ std::string VSACtlStatus::summary(const VSAValue& state) {
   const VSAValue* dead = state.get("deathRow");
   line(VSAFormat("Death row: %llu entries, %@", dead ? number(*dead, "entries") : 0,
                  VSAProgressLog::byteCount(dead ? number(*dead, "bytes") : 0)));
+  const VSAValue* left = state.get("tmpLeftovers");
+  line(VSAFormat("Left in /tmp by death row: %llu entries, %@", left ? number(*left, "entries") : 0,
+                 VSAProgressLog::byteCount(left ? number(*left, "bytes") : 0)));
   line(VSAFormat("Pending protection changes: %llu", number(state, "pendingProtectionUpdates")));
   line(VSAFormat("Replace files in progress: %llu", number(state, "replaceFilesInProgress")));
   const VSAValue* locks = state.get("testLocks");

@@ -15,6 +15,7 @@
 #include "dataprotection/VSADataProtectionUpdateFile.h"
 #include "model/VSAMetadata.h"
 #include "model/VSAPerUserConfiguration.h"
+#include "operations/VSADeathRow.h"
 #include "platform/VSAFaultInjectingFileSystem.h"
 #include "platform/VSAIPCClient.h"
 
@@ -95,6 +96,7 @@ VSARootChecker::Status VSARootChecker::check() {
   std::vector<VSADirectoryEntry> dead;
   if (context_->fileSystem->readDirectory(config.deathrowDirectory(), &dead) == 0)
     counts_["deathRowEntries"] = dead.size();
+  checkTempLeftovers();
   checkDatabase();
   if (!unreadable_.empty()) return kUnreadable;
   return findings_.empty() ? kClean : kFindings;
@@ -190,6 +192,22 @@ void VSARootChecker::checkLeftovers(const std::string& directory, const char* ki
   for (const auto& entry : entries)
     add(kind, VSAPathJoin(directory, entry.name), "left by an operation that did not finish",
         repair);
+}
+
+// Trees death row could not remove wait in /tmp, where nothing removes
+// them: deleted app data that stays, so each one is a finding.
+void VSARootChecker::checkTempLeftovers() {
+  uint64_t bytes = 0;
+  auto leftovers = VSADeathRow::leftoversInTemp(*context_->globalConfiguration);
+  for (const auto& leftover : leftovers) {
+    bytes += leftover.bytes;
+    add("deathrow-leftover", leftover.path,
+        "moved aside when death row could not remove it; " + std::to_string(leftover.bytes) +
+            " bytes",
+        kAttention);
+  }
+  counts_["tmpLeftovers"] = leftovers.size();
+  counts_["tmpLeftoverBytes"] = bytes;
 }
 
 void VSARootChecker::checkPendingUpdates() {

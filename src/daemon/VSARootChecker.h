@@ -17,6 +17,8 @@
 //   - nothing is left in staging or in the replace journals (each start
 //     finishes or undoes them), and no half-written state file;
 //   - every pending protection update reads back and names a live container;
+//   - nothing that death row moved aside waits in the root's /tmp (counted
+//     as "tmpLeftovers" and "tmpLeftoverBytes");
 //   - the code-signing database passes SQLite's integrity check.
 // Each finding names its kind, the path, what is wrong and what brings it
 // into order. Notes are what is worth knowing but not wrong: an
@@ -74,6 +76,7 @@ class VSARootChecker {
   static std::string identityKey(const VSAUserIdentityRef& user, VSAContainerClass c,
                                  bool transient, const std::string& identifier);
   void checkLeftovers(const std::string& directory, const char* kind, const char* repair);
+  void checkTempLeftovers();
   void checkPendingUpdates();
   void checkDatabase();
   void add(const char* kind, const std::string& path, std::string detail, const char* repair);

@@ -14,6 +14,7 @@
 #include "codesigning/VSASQLiteDB.h"
 #include "daemon/VSADaemonContext.h"
 #include "migration/VSAMigrationStatus.h"
+#include "operations/VSADeathRow.h"
 
 namespace {
 constexpr size_t kMigrationStatusMaxSize = 1 << 20;
@@ -44,6 +45,7 @@ VSAValue VSAStateDump::collect(uint64_t generation) {
   state.set("openTransactions", VSAValue(static_cast<int64_t>(context_.transactions->openCount())));
   state.set("containerCache", cache());
   state.set("deathRow", deathRow());
+  state.set("tmpLeftovers", tmpLeftovers());
   state.set("pendingProtectionUpdates", VSAValue(entriesIn(config.pendingUpdatesDirectory())));
   state.set("replaceFilesInProgress", VSAValue(entriesIn(config.replaceDirectory())));
   state.set("testLocks", testLocks());
@@ -85,6 +87,15 @@ VSAValue VSAStateDump::deathRow() {
   for (const auto& e : entries)
     bytes += context_.fileManager->diskUsageForURL(VSAPathJoin(directory, e.name));
   return VSAValue::Dictionary{{"entries", VSAValue(static_cast<uint64_t>(entries.size()))},
+                              {"bytes", VSAValue(bytes)}};
+}
+
+// What death row moved to /tmp because it could not remove it.
+VSAValue VSAStateDump::tmpLeftovers() {
+  uint64_t bytes = 0;
+  auto leftovers = VSADeathRow::leftoversInTemp(*context_.globalConfiguration);
+  for (const auto& leftover : leftovers) bytes += leftover.bytes;
+  return VSAValue::Dictionary{{"entries", VSAValue(static_cast<uint64_t>(leftovers.size()))},
                               {"bytes", VSAValue(bytes)}};
 }
 

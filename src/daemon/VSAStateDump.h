@@ -1,13 +1,15 @@
 // The daemon's state for people debugging it, taken on SIGUSR1: its queues
 // and their depth, open transactions, the container cache's class maps,
-// death row, pending protection changes, replace journals, test locks, the
-// migration status, work under way and the code-signing database's size.
-// The state goes to the log (one line per part) and, as JSON, atomically to
-// "state.json" in the run directory, where `vessactl status` reads it.
+// death row and what it left in /tmp, pending protection changes, replace
+// journals, test locks, the migration status, work under way and the
+// code-signing database's size. The state goes to the log (one line per
+// part) and, as JSON, atomically to "state.json" in the run directory,
+// where `vessactl status` reads it.
 //
-// Taking it only reads; it is cheap except for death row's size, which is a
-// walk of death row. Call it once the daemon has finished starting (the
-// subsystems it reads are set then); before that, startingUp() is the state.
+// Taking it only reads; it is cheap except for the sizes of death row and
+// its leftovers, which are walks of them. Call it once the daemon has
+// finished starting (the subsystems it reads are set then); before that,
+// startingUp() is the state.
 #pragma once
 
 #include <string>
@@ -40,6 +42,7 @@ class VSAStateDump {
   VSAValue queues();
   VSAValue cache();
   VSAValue deathRow();
+  VSAValue tmpLeftovers();
   uint64_t entriesIn(const std::string& directory);
   VSAValue testLocks();
   VSAValue migration();

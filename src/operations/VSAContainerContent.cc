@@ -11,6 +11,7 @@
 #include "base/VSATestLocks.h"
 #include "base/VSAUUID.h"
 #include "operations/VSAContainerLookup.h"
+#include "platform/VSAUniqueFd.h"
 
 namespace {
 constexpr VSAResultCode kCacheAddFailed = 45;
@@ -208,13 +209,26 @@ bool VSAContainerContent::copyIntoPlace(const VSAMetadata& data, const std::stri
   if (fs.lstat(source, &before) != 0)
     return fail(origin, VSAResult::kInvalidArgument, withError,
                 VSAFormat("Source %@ does not exist", source));
-  VSAContainerClass c = data.containerClass();
-  const auto& owner = data.userIdentity();
-  uid_t uid = owner->posixUIDForContainerClass(c);
-  gid_t gid = owner->posixGIDForContainerClass(c);
-  std::string staging =
-      VSAPathJoin(services_.configuration->stagingDirectoryURLForUserIdentity(owner, c),
-                  VSAUUID::random().string());
+  // What lands in the container is given to the container's owner, as the
+  // directory it lands in says: opened once, and the missing directories
+  // of the destination are made through it.
+  std::string prefix = VSAPathJoin(data.url(), "");
+  if (destination.rfind(prefix, 0) != 0)
+    return fail(origin, VSAResult::kInvalidArgument, withError,
+                VSAFormat("Destination %@ is not inside %@", destination, data.url()));
+  int raw = -1;
+  int rc = fs.openDirectory(data.url(), &raw);
+  VSAUniqueFd container(raw);
+  struct stat owner {};
+  if (rc == 0) rc = fs.statAt(container.get(), "", &owner);
+  if (rc != 0)
+    return fail(origin, VSAResult::kWriteFailed, withError,
+                VSAFormat("Failed to open %@: %s", data.url(), std::strerror(rc)));
+  uid_t uid = owner.st_uid;
+  gid_t gid = owner.st_gid;
+  std::string staging = VSAPathJoin(services_.configuration->stagingDirectoryURLForUserIdentity(
+                                        data.userIdentity(), data.containerClass()),
+                                    VSAUUID::random().string());
   VSAErrorRef error;
   auto discard = [&](VSAResultCode code, const std::string& message) {
     VSAErrorRef cleanup;
@@ -230,10 +244,10 @@ bool VSAContainerContent::copyIntoPlace(const VSAMetadata& data, const std::stri
   if (!fm.standardizeOwnershipAtURL(staging, uid, gid, &error))
     return discard(codeOf(error, VSAResult::kWriteFailed),
                    VSAFormat("Failed to give %@ to %u: %@", staging, uid, error));
-  std::string parent = VSADirectoryName(destination);
-  if (!fm.createDirectoryAtURL(parent, true, 0755, uid, kVSANoProtectionClass, &error, gid))
+  std::string parent = VSADirectoryName(destination.substr(prefix.size()));
+  if (!parent.empty() && !fm.createDirectoriesAt(container.get(), parent, 0755, uid, gid, &error))
     return discard(codeOf(error, VSAResult::kWriteFailed),
-                   VSAFormat("Failed to create %@: %@", parent, error));
+                   VSAFormat("Failed to create %@ in %@: %@", parent, data.url(), error));
   struct stat existing {};
   if (fs.lstat(destination, &existing) != 0) {
     if (!fm.moveItemAtURL(staging, destination, &error))

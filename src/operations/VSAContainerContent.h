@@ -21,14 +21,17 @@
 //  - deleting an asset moves the item named (a link itself, not its target)
 //    to death row; a missing asset is success; the assets directory itself
 //    cannot be named.
-//  - staged shared content is copied (cloned where the file system can)
-//    from the bundle container (class 1) into the data container's staging
-//    directory, given to the data container's owner, then renamed into
-//    place: it lands whole or not at all. Content already at the
-//    destination is exchanged with the new in one step and then goes to
-//    death row, so the destination never goes missing. A regular source file that changes
-//    while it is copied fails the request (34) and nothing lands. Leftovers
-//    of a crash stay in staging, which keeper cleanup empties.
+//  - staged shared content is copied (cloned where the file system can,
+//    walked by descriptor, on one device) from the bundle container
+//    (class 1) into the data container's staging directory, given to the
+//    owner of the data container's directory, then renamed into place: it
+//    lands whole or not at all. Missing directories of the destination are
+//    made through the container's descriptor and belong to that owner too.
+//    Content already at the destination is exchanged with the new in one
+//    step and then goes to death row, so the destination never goes
+//    missing. A regular source file that changes while it is copied fails
+//    the request (34) and nothing lands. Leftovers of a crash stay in
+//    staging, which keeper cleanup empties.
 #pragma once
 
 #include <optional>

@@ -5,6 +5,7 @@
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
 #include "base/VSAProgressLog.h"
+#include "base/VSAUUID.h"
 
 namespace {
 constexpr VSAResultCode kDeleteFailed = 28;
@@ -150,11 +151,35 @@ bool VSADeathRow::_removeItemOrMoveToTempAtURL(const std::string& url, VSAErrorR
   VSAErrorRef removeError;
   if (fm.removeItemAtURL(url, &removeError, observer)) return true;
   VSALog(kVSALogDebug, fn, "Couldn't remove, so moving item to /tmp: %@ : %@", url, removeError);
-  std::string tmp = configuration_->systemRoot().resolve("/tmp");
+  std::string tmp = temporaryDirectory(*configuration_);
   if (fm.itemDoesNotExistAtURL(tmp))
     fm.createDirectoryAtURL(tmp, true, 01777, 0, kVSANoProtectionClass, nullptr);
   std::string destination = VSAPathJoin(tmp, VSALastPathComponent(url));
   if (fm.moveItemAtURL(url, destination, error)) return true;
   VSALog(kVSALogError, fn, "Failed to move dir: %@ to: %@", url, destination);
   return false;
+}
+
+std::string VSADeathRow::temporaryDirectory(const VSAGlobalConfiguration& configuration) {
+  return configuration.systemRoot().resolve("/tmp");
+}
+
+bool VSADeathRow::isDeathRowEntryName(const std::string& name) {
+  if (name.size() == 11 && name.rfind("temp.", 0) == 0) return true;
+  return VSAUUID::parse(name).has_value();
+}
+
+std::vector<VSADeathRow::Leftover> VSADeathRow::leftoversInTemp(
+    const VSAGlobalConfiguration& configuration) {
+  VSAFileManager& fm = configuration.fileManager();
+  std::string tmp = temporaryDirectory(configuration);
+  std::vector<VSADirectoryEntry> entries;
+  std::vector<Leftover> found;
+  if (fm.fileSystem().readDirectory(tmp, &entries) != 0) return found;
+  for (const auto& e : entries) {
+    if (!isDeathRowEntryName(e.name)) continue;
+    std::string path = VSAPathJoin(tmp, e.name);
+    found.push_back({path, fm.diskUsageForURL(path)});
+  }
+  return found;
 }

@@ -10,6 +10,7 @@
 // reachable through the cache).
 #pragma once
 
+#include <cstdint>
 #include <functional>
 #include <memory>
 #include <string>
@@ -46,7 +47,18 @@ class VSADeathRow : public std::enable_shared_from_this<VSADeathRow> {
   bool _removeItemOrMoveToTempAtURL(const std::string& url, VSAErrorRef* error,
                                     const VSAFileManager::RemovalObserver& observer = {});
 
+  // What death row moved aside and nothing removes: the entries of the
+  // root's /tmp named as death-row entries are (a container's UUID, or
+  // "temp." and six characters), with their sizes. Only reads.
+  struct Leftover {
+    std::string path;
+    uint64_t bytes = 0;
+  };
+  static std::vector<Leftover> leftoversInTemp(const VSAGlobalConfiguration& configuration);
+  static bool isDeathRowEntryName(const std::string& name);
+
  private:
+  static std::string temporaryDirectory(const VSAGlobalConfiguration& configuration);
   VSAResultCode emptyDeathRow();
 
   std::shared_ptr<VSAGlobalConfiguration> configuration_;

@@ -163,18 +163,6 @@ int VSAFaultInjectingFileSystem::getxattr(const std::string& path, const std::st
   return inner_->getxattr(path, name, value);
 }
 
-int VSAFaultInjectingFileSystem::setxattr(const std::string& path, const std::string& name,
-                                          const std::string& value) {
-  if (int e = injected(Op::SetXattr)) return e;
-  return inner_->setxattr(path, name, value);
-}
-
-int VSAFaultInjectingFileSystem::listxattr(const std::string& path,
-                                           std::vector<std::string>* names) {
-  if (int e = injected(Op::ListXattr)) return e;
-  return inner_->listxattr(path, names);
-}
-
 int VSAFaultInjectingFileSystem::getFlags(const std::string& path, int* flags) {
   if (int e = injected(Op::GetFlags)) return e;
   return inner_->getFlags(path, flags);
@@ -183,17 +171,6 @@ int VSAFaultInjectingFileSystem::getFlags(const std::string& path, int* flags) {
 int VSAFaultInjectingFileSystem::setFlags(const std::string& path, int flags) {
   if (int e = injected(Op::SetFlags)) return e;
   return inner_->setFlags(path, flags);
-}
-
-int VSAFaultInjectingFileSystem::copyData(const std::string& from, const std::string& to,
-                                          mode_t mode) {
-  if (int e = injected(Op::CopyData)) return e;
-  return inner_->copyData(from, to, mode);
-}
-
-int VSAFaultInjectingFileSystem::symlink(const std::string& target, const std::string& path) {
-  if (int e = injected(Op::Symlink)) return e;
-  return inner_->symlink(target, path);
 }
 
 int VSAFaultInjectingFileSystem::writeFile(const std::string& path,
@@ -316,4 +293,40 @@ int VSAFaultInjectingFileSystem::setProtectionClassAt(int dir, const std::string
 int VSAFaultInjectingFileSystem::syncDirectory(int dir) {
   if (int e = injected(Op::SyncDirectory)) return e;
   return inner_->syncDirectory(dir);
+}
+
+int VSAFaultInjectingFileSystem::copyDataAt(int fromDir, const std::string& fromName, int toDir,
+                                            const std::string& toName, mode_t mode) {
+  if (int e = injected(Op::CopyData)) return e;
+  return inner_->copyDataAt(fromDir, fromName, toDir, toName, mode);
+}
+
+int VSAFaultInjectingFileSystem::readlinkAt(int dir, const std::string& name, std::string* target) {
+  if (int e = injected(Op::Readlink)) return e;
+  return inner_->readlinkAt(dir, name, target);
+}
+
+int VSAFaultInjectingFileSystem::symlinkAt(const std::string& target, int dir,
+                                           const std::string& name) {
+  if (int e = injected(Op::Symlink)) return e;
+  return inner_->symlinkAt(target, dir, name);
+}
+
+int VSAFaultInjectingFileSystem::listxattrAt(int dir, const std::string& name,
+                                             std::vector<std::string>* names) {
+  if (int e = injected(Op::ListXattr)) return e;
+  return inner_->listxattrAt(dir, name, names);
+}
+
+int VSAFaultInjectingFileSystem::getxattrAt(int dir, const std::string& name,
+                                            const std::string& attribute, std::string* value) {
+  if (int e = injected(Op::GetXattr)) return e;
+  return inner_->getxattrAt(dir, name, attribute, value);
+}
+
+int VSAFaultInjectingFileSystem::setxattrAt(int dir, const std::string& name,
+                                            const std::string& attribute,
+                                            const std::string& value) {
+  if (int e = injected(Op::SetXattr)) return e;
+  return inner_->setxattrAt(dir, name, attribute, value);
 }

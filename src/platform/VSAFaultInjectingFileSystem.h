@@ -58,12 +58,8 @@ class VSAFaultInjectingFileSystem : public VSAFileSystem {
   int rmdir(const std::string& path) override;
   int readDirectory(const std::string& path, std::vector<VSADirectoryEntry>* entries) override;
   int getxattr(const std::string& path, const std::string& name, std::string* value) override;
-  int setxattr(const std::string& path, const std::string& name, const std::string& value) override;
-  int listxattr(const std::string& path, std::vector<std::string>* names) override;
   int getFlags(const std::string& path, int* flags) override;
   int setFlags(const std::string& path, int flags) override;
-  int copyData(const std::string& from, const std::string& to, mode_t mode) override;
-  int symlink(const std::string& target, const std::string& path) override;
   int writeFile(const std::string& path, const std::vector<uint8_t>& bytes, mode_t mode) override;
   int readFile(const std::string& path, std::vector<uint8_t>* bytes, size_t maxSize) override;
   int mkdtemp(const std::string& templ, std::string* path) override;
@@ -90,6 +86,15 @@ class VSAFaultInjectingFileSystem : public VSAFileSystem {
   int getProtectionClassAt(int dir, const std::string& name, int* protectionClass) override;
   int setProtectionClassAt(int dir, const std::string& name, int protectionClass) override;
   int syncDirectory(int dir) override;
+  int copyDataAt(int fromDir, const std::string& fromName, int toDir, const std::string& toName,
+                 mode_t mode) override;
+  int readlinkAt(int dir, const std::string& name, std::string* target) override;
+  int symlinkAt(const std::string& target, int dir, const std::string& name) override;
+  int listxattrAt(int dir, const std::string& name, std::vector<std::string>* names) override;
+  int getxattrAt(int dir, const std::string& name, const std::string& attribute,
+                 std::string* value) override;
+  int setxattrAt(int dir, const std::string& name, const std::string& attribute,
+                 const std::string& value) override;
 
  private:
   // Counts the call; answers the errno to fail it with, or 0 to forward it.

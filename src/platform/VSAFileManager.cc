@@ -7,6 +7,7 @@
 #include "base/VSAPathString.h"
 #include "base/VSAUUID.h"
 #include "platform/VSAFileManagerErrors.h"
+#include "platform/VSAUniqueFd.h"
 
 namespace {
 constexpr const char* kOrigin = "VSAFileManager";
@@ -185,6 +186,40 @@ bool VSAFileManager::createDirectoryAtURL(const std::string& path, bool intermed
   return true;
 }
 
+bool VSAFileManager::createDirectoriesAt(int base, const std::string& relativePath, mode_t mode,
+                                         uid_t owner, gid_t group, VSAErrorRef* error) {
+  struct stat baseStat;
+  int rc = fs_->statAt(base, "", &baseStat);
+  VSAUniqueFd held;
+  int current = base;
+  std::string reached;
+  for (const std::string& name : components(relativePath)) {
+    if (rc != 0) break;
+    reached = reached.empty() ? name : reached + "/" + name;
+    rc = fs_->mkdirAt(current, name, mode);
+    bool created = rc == 0;
+    if (rc != 0 && rc != EEXIST) break;
+    int raw = -1;
+    if ((rc = fs_->openDirectoryAt(current, name, &raw))) break;
+    VSAUniqueFd next(raw);
+    struct stat st;
+    if ((rc = fs_->statAt(next.get(), "", &st))) break;
+    if (st.st_dev != baseStat.st_dev) {
+      rc = EXDEV;
+      break;
+    }
+    // Given away through the descriptor of what was opened, never by a name
+    // that could have been swapped since.
+    if (created && (rc = fs_->chownAt(next.get(), "", owner, group))) break;
+    held = std::move(next);
+    current = held.get();
+  }
+  if (rc == 0) return true;
+  VSASetError(error, VSAFileManagerFail(rc, "createDirectoriesAt", "mkpath_np of %s failed: %s",
+                                        reached, std::strerror(rc)));
+  return false;
+}
+
 // Tries the directory itself first and climbs only while parents are
 // missing: a directory whose parent exists (the usual case) costs one mkdir,
 // an existing one a mkdir and an lstat, however deep the path. A non-directory
@@ -318,8 +353,15 @@ bool VSAFileManager::copyItem(const std::string& from, const std::string& to, bo
   bool missing = false;
   if (!failIfSrcMissing && !checkSource(from, fn, &missing, error)) return false;
   if (missing) return true;
-  std::string failed;
-  if (int rc = copyTree(from, to, &failed)) {
+  int raw = -1;
+  std::string fromName, toName;
+  int rc = openParent(from, &raw, &fromName);
+  VSAUniqueFd fromDir(raw);
+  raw = -1;
+  if (rc == 0) rc = openParent(to, &raw, &toName);
+  VSAUniqueFd toDir(raw);
+  if (rc == 0) rc = copyTree(fromDir.get(), fromName, from, toDir.get(), toName, to);
+  if (rc != 0) {
     VSASetError(error, VSAFileManagerFail(rc, fn, "copyfile of %@ to %@ failed: %s", from, to,
                                           std::strerror(rc)));
     return false;

@@ -27,6 +27,8 @@ inline constexpr const char* kVSAMetadataFileName = ".com.tamsk.vessa_keeper.met
 inline constexpr uint32_t kVSANoProtectionClass = 0xFFFFFFFF;
 inline constexpr uid_t kVSANobodyID = 4294967294u;  // owner of system container items
 
+class VSADirectoryStack;
+
 struct VSADirectoryItem {
   std::string path;
   bool isDirectory = false;
@@ -40,10 +42,6 @@ struct VSAWalkItem {
   int directory;
   const std::string& name;
 };
-
-// How deep a walk or removal descends; deeper directories are reported as
-// failures (ELOOP) and left alone.
-inline constexpr int kVSAMaxWalkDepth = 256;
 
 class VSAFileManager {
  public:
@@ -64,6 +62,12 @@ class VSAFileManager {
   bool createDirectoryAtURL(const std::string& path, bool withIntermediateDirectories, mode_t mode,
                             uid_t owner, uint32_t protectionClass, VSAErrorRef* error,
                             std::optional<gid_t> group = std::nullopt);
+  // Makes the missing directories of `relativePath` (plain names joined by
+  // "/") below directory `base`, by descriptor and on `base`'s device: each
+  // one made gets `mode` and is given to `owner`:`group`; one already there
+  // keeps its owner. A link or non-directory in the way is ELOOP or ENOTDIR.
+  bool createDirectoriesAt(int base, const std::string& relativePath, mode_t mode, uid_t owner,
+                           gid_t group, VSAErrorRef* error);
   // `durable` false: the rename is not synced (for moves a crash may undo
   // because they are redone, such as orphans sent to death row at boot).
   bool moveItemAtURL(const std::string& from, const std::string& to, VSAErrorRef* error,
@@ -85,9 +89,10 @@ class VSAFileManager {
   bool copyItemIfExistsAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
   // Told of each file a removal unlinks, with its size (progress of long removals).
   using RemovalObserver = std::function<void(uint64_t bytes)>;
-  // Recursive, through directory descriptors and on one device; a missing
-  // item is success; immutable items are unlocked and removed. An observer
-  // costs one status call per file.
+  // Recursive, through directory descriptors and on one device, at any
+  // depth with a bounded number of descriptors; a missing item is success;
+  // immutable items are unlocked and removed. An observer costs one status
+  // call per file.
   bool removeItemAtURL(const std::string& path, VSAErrorRef* error,
                        const RemovalObserver& observer = {});
   // One file or link, never a tree (a directory is EISDIR); missing is success.
@@ -123,10 +128,12 @@ class VSAFileManager {
   // Visible entries (names not starting with ".") of one directory.
   std::optional<std::vector<VSADirectoryItem>> urlsForItemsInDirectoryAtURL(const std::string& path,
                                                                             VSAErrorRef* error);
-  // Walks a tree on one device through directory descriptors; directories
-  // are reported before and after their contents. The block stops the walk
-  // by returning false. No link is followed, and a directory swapped for
-  // something else between its status and its opening is a failure.
+  // Walks a tree on one device through directory descriptors, at any depth
+  // with a bounded number of descriptors open (VSADirectoryStack);
+  // directories are reported before and after their contents. The block
+  // stops the walk by returning false. No link is followed; a directory
+  // swapped for something else between its status and its opening, or one
+  // that cannot be reached again on the way back up, is a failure.
   bool traverseDirectory(const std::string& path, VSAErrorRef* error, const WalkBlock& block);
   std::optional<std::string> createTemporaryDirectoryInDirectoryURL(
       const std::string& directory, VSAErrorRef* error,
@@ -148,14 +155,20 @@ class VSAFileManager {
                 VSAErrorRef* error, bool durable = true);
   bool copyItem(const std::string& from, const std::string& to, bool failIfSrcMissing,
                 VSAErrorRef* error);
-  int copyTree(const std::string& from, const std::string& to, std::string* failedPath);
+  int copyTree(int fromDir, const std::string& fromName, const std::string& fromPath, int toDir,
+               const std::string& toName, const std::string& toPath);
+  int copyEntry(int fromDir, const std::string& fromName, const struct stat& st, int toDir,
+                const std::string& toName);
+  int copyAttributes(int fromDir, const std::string& fromName, const struct stat& st, int toDir,
+                     const std::string& toName);
   struct Walk;
   struct Removal;
-  bool walk(Walk& w, int directory, const std::string& name, const std::string& path,
-            const struct stat& st, int depth);
-  void removeEntry(Removal& r, int directory, const std::string& name, const std::string& path,
-                   bool isDirectory, int depth);
-  void removeDirectoryContents(Removal& r, int directory, const std::string& path, int depth);
+  bool walk(Walk& w, int parent, const std::string& name, const std::string& path,
+            const struct stat& st);
+  void removeTree(Removal& r, int parent, const std::string& name, const std::string& path);
+  bool enterForRemoval(Removal& r, VSADirectoryStack& stack, const std::string& name,
+                       const std::string& path);
+  int removeFile(Removal& r, int directory, const std::string& name, const std::string& path);
   int unlinkUnlocking(int directory, const std::string& name, const std::string& path,
                       bool isDirectory);
   // Opens the directory holding `path` and names its last component: 0 or an errno.

@@ -4,6 +4,7 @@
 
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
+#include "platform/VSADirectoryStack.h"
 #include "platform/VSAFileManager.h"
 #include "platform/VSAFileManagerErrors.h"
 #include "platform/VSAUniqueFd.h"
@@ -41,33 +42,46 @@ struct VSAFileManager::Walk {
     failureErrno = rc;
     return false;
   }
+  bool visit(const VSAWalkItem& item, WalkPhase phase) {
+    ++entries;
+    return block(item, phase);
+  }
 };
 
-bool VSAFileManager::walk(Walk& w, int directory, const std::string& name, const std::string& path,
-                          const struct stat& st, int depth) {
-  VSAWalkItem item{path, st, directory, name};
-  ++w.entries;
-  if (!S_ISDIR(st.st_mode)) return w.block(item, WalkPhase::Item);
-  if (!w.block(item, WalkPhase::Directory)) return false;
-  if (st.st_dev == w.device) {  // stay on one device: do not descend into mounts
-    if (depth >= kVSAMaxWalkDepth) return w.fail(path, ELOOP);
-    int raw = -1;
-    if (int rc = fs_->openDirectoryAt(directory, name, &raw)) return w.fail(path, rc);
-    VSAUniqueFd fd(raw);
-    struct stat opened;
-    if (int rc = fs_->statAt(fd.get(), "", &opened)) return w.fail(path, rc);
-    if (opened.st_dev != st.st_dev || opened.st_ino != st.st_ino) return w.fail(path, ESTALE);
-    std::vector<VSADirectoryEntry> entries;
-    if (int rc = fs_->readDirectoryAt(fd.get(), &entries)) return w.fail(path, rc);
-    for (const auto& e : entries) {
-      std::string child = VSAPathJoin(path, e.name);
+// Depth first without recursion: the directories being walked are on a
+// stack that keeps few descriptors, so no depth is too deep. A directory is
+// entered only when it is on the walk's device and is still the directory
+// whose status the walk took.
+bool VSAFileManager::walk(Walk& w, int parent, const std::string& name, const std::string& path,
+                          const struct stat& st) {
+  VSAWalkItem top{path, st, parent, name};
+  if (!S_ISDIR(st.st_mode)) return w.visit(top, WalkPhase::Item);
+  if (!w.visit(top, WalkPhase::Directory)) return false;
+  VSADirectoryStack stack(*fs_, parent, path);
+  if (int rc = stack.enter(name, &st, w.device)) return w.fail(path, rc);
+  while (!stack.empty()) {
+    if (const VSADirectoryEntry* e = stack.nextEntry()) {
+      std::string child = VSAPathJoin(stack.path(), e->name);
       struct stat cst;
-      if (int rc = fs_->statAt(fd.get(), e.name, &cst)) return w.fail(child, rc);
-      if (!walk(w, fd.get(), e.name, child, cst, depth + 1)) return false;
+      if (int rc = fs_->statAt(stack.fd(), e->name, &cst)) return w.fail(child, rc);
+      VSAWalkItem item{child, cst, stack.fd(), e->name};
+      if (!S_ISDIR(cst.st_mode)) {
+        if (!w.visit(item, WalkPhase::Item)) return false;
+      } else if (!w.visit(item, WalkPhase::Directory)) {
+        return false;
+      } else if (cst.st_dev == w.device) {  // stay on one device: do not descend into mounts
+        if (int rc = stack.enter(e->name, &cst, w.device)) return w.fail(child, rc);
+      } else if (!w.visit(item, WalkPhase::DirectoryEnd)) {
+        return false;
+      }
+      continue;
     }
+    if (int rc = stack.reopenParent()) return w.fail(stack.path(), rc);
+    VSAWalkItem item{stack.path(), stack.status(), stack.parentFd(), stack.name()};
+    if (!w.visit(item, WalkPhase::DirectoryEnd)) return false;
+    stack.pop();
   }
-  ++w.entries;
-  return w.block(item, WalkPhase::DirectoryEnd);
+  return true;
 }
 
 bool VSAFileManager::traverseDirectory(const std::string& path, VSAErrorRef* error,
@@ -85,7 +99,7 @@ bool VSAFileManager::traverseDirectory(const std::string& path, VSAErrorRef* err
     return false;
   }
   Walk w{block, st.st_dev, {}, 0, 0};
-  walk(w, parent.get(), name, path, st, 0);  // a walk stopped by the block is not an error
+  walk(w, parent.get(), name, path, st);  // a walk stopped by the block is not an error
   VSALogIn(VSALogCategory::FS, kVSALogDebug, "TraversingDirectory", "%zu entries under %s",
            w.entries, path);
   if (w.failureErrno) {
@@ -139,43 +153,65 @@ int VSAFileManager::unlinkUnlocking(int directory, const std::string& name, cons
   return rc;
 }
 
-void VSAFileManager::removeDirectoryContents(Removal& r, int directory, const std::string& path,
-                                             int depth) {
-  std::vector<VSADirectoryEntry> entries;
-  if (int rc = fs_->readDirectoryAt(directory, &entries)) r.record(path, rc);
-  for (const auto& e : entries)
-    removeEntry(r, directory, e.name, VSAPathJoin(path, e.name),
-                e.type == VSADirectoryEntry::Type::Directory, depth + 1);
+// Unlinks a non-directory, telling the observer its size: 0, EISDIR when it
+// is a directory after all, or the error.
+int VSAFileManager::removeFile(Removal& r, int directory, const std::string& name,
+                               const std::string& path) {
+  struct stat st;
+  bool observed = r.observer && *r.observer && fs_->statAt(directory, name, &st) == 0;
+  int rc = unlinkUnlocking(directory, name, path, false);
+  if (rc == 0 && observed) (*r.observer)(static_cast<uint64_t>(st.st_size));
+  return rc;
 }
 
-// Depth first, going on past errors (the first is kept). Each directory is
-// opened without following links and checked to be on the device the
-// removal started on before anything in it is touched.
-void VSAFileManager::removeEntry(Removal& r, int directory, const std::string& name,
-                                 const std::string& path, bool isDirectory, int depth) {
-  if (!isDirectory) {
-    struct stat st;
-    bool observed = r.observer && *r.observer && fs_->statAt(directory, name, &st) == 0;
-    int rc = unlinkUnlocking(directory, name, path, false);
-    if (rc == 0 && observed) (*r.observer)(static_cast<uint64_t>(st.st_size));
-    if (rc != EISDIR) return r.record(path, rc);
+// Enters directory `name` of the stack's deepest directory to empty it;
+// false (recorded) when it cannot be. Something that is no longer a
+// directory is removed as it now is.
+bool VSAFileManager::enterForRemoval(Removal& r, VSADirectoryStack& stack, const std::string& name,
+                                     const std::string& path) {
+  int listError = 0;
+  int rc = stack.enter(name, nullptr, r.device, VSADirectoryStack::Listing::Tolerated, &listError);
+  if (rc == ENOTDIR || rc == ELOOP) {
+    int unlinked = unlinkUnlocking(stack.current(), name, path, false);
+    r.record(path, unlinked == EISDIR ? rc : unlinked);  // EISDIR: a directory met twice
+    return false;
   }
-  if (depth >= kVSAMaxWalkDepth) return r.record(path, ELOOP);
-  int raw = -1;
-  int rc = fs_->openDirectoryAt(directory, name, &raw);
-  VSAUniqueFd fd(raw);
-  if (rc == ENOTDIR || rc == ELOOP) {  // no longer a directory: remove it as it now is
-    return r.record(path, unlinkUnlocking(directory, name, path, false));
-  }
-  if (rc) return r.record(path, rc);
-  struct stat st;
-  if ((rc = fs_->statAt(fd.get(), "", &st))) return r.record(path, rc);
-  if (st.st_dev != r.device) return r.record(path, EXDEV);
-  removeDirectoryContents(r, fd.get(), path, depth);
-  fd.reset();
-  rc = unlinkUnlocking(directory, name, path, true);
-  if (rc == ENOTDIR) rc = unlinkUnlocking(directory, name, path, false);  // swapped meanwhile
   r.record(path, rc);
+  r.record(path, listError);  // entered all the same: its removal reports what stays
+  return rc == 0;
+}
+
+// Depth first, going on past errors (the first is kept), without recursion:
+// the directories being emptied are on a stack that keeps few descriptors,
+// so no depth is too deep. Each directory is opened without following
+// links and checked to be on the device the removal started on before
+// anything in it is touched.
+void VSAFileManager::removeTree(Removal& r, int parent, const std::string& name,
+                                const std::string& path) {
+  VSADirectoryStack stack(*fs_, parent, path);
+  if (!enterForRemoval(r, stack, name, path)) return;
+  while (!stack.empty()) {
+    if (const VSADirectoryEntry* e = stack.nextEntry()) {
+      std::string child = VSAPathJoin(stack.path(), e->name);
+      if (e->type != VSADirectoryEntry::Type::Directory) {
+        int rc = removeFile(r, stack.fd(), e->name, child);
+        if (rc != EISDIR) {
+          r.record(child, rc);
+          continue;
+        }
+      }
+      enterForRemoval(r, stack, e->name, child);
+      continue;
+    }
+    std::string done = stack.path(), doneName = stack.name();
+    // A directory that cannot be reached again is not acted on: stop here.
+    if (int rc = stack.reopenParent()) return r.record(done, rc);
+    int above = stack.parentFd();
+    stack.pop();
+    int rc = unlinkUnlocking(above, doneName, done, true);
+    if (rc == ENOTDIR) rc = unlinkUnlocking(above, doneName, done, false);  // swapped meanwhile
+    r.record(done, rc);
+  }
 }
 
 bool VSAFileManager::removeItemAtURL(const std::string& path, VSAErrorRef* error,
@@ -198,7 +234,11 @@ bool VSAFileManager::removeItemAtURL(const std::string& path, VSAErrorRef* error
     return false;
   }
   Removal r{st.st_dev, 0, &observer};
-  removeEntry(r, parent.get(), name, path, S_ISDIR(st.st_mode), 0);
+  rc = S_ISDIR(st.st_mode) ? EISDIR : removeFile(r, parent.get(), name, path);
+  if (rc == EISDIR)
+    removeTree(r, parent.get(), name, path);
+  else
+    r.record(path, rc);
   if (r.firstError != 0) {
     VSASetError(error,
                 VSAFileManagerFail(r.firstError, "removeItemAtURL", "removefile of %@ failed: %s",
@@ -229,40 +269,73 @@ bool VSAFileManager::restrictItemToRootAtURL(const std::string& path, VSAErrorRe
   return false;
 }
 
-// Copies data, extended attributes (ACLs included), owner and mode, never
-// following links. Returns 0 or the first errno.
-int VSAFileManager::copyTree(const std::string& from, const std::string& to, std::string* failed) {
-  struct stat st;
-  if (int rc = fs_->lstat(from, &st)) return *failed = from, rc;
-  int rc = 0;
-  if (S_ISDIR(st.st_mode)) {
-    if ((rc = fs_->mkdir(to, 0700))) return *failed = to, rc;
-    std::vector<VSADirectoryEntry> entries;
-    if ((rc = fs_->readDirectory(from, &entries))) return *failed = from, rc;
-    for (const auto& e : entries)
-      if ((rc = copyTree(VSAPathJoin(from, e.name), VSAPathJoin(to, e.name), failed))) return rc;
-  } else if (S_ISLNK(st.st_mode)) {
-    std::string target;
-    if ((rc = fs_->readlink(from, &target)) || (rc = fs_->symlink(target, to)))
-      return *failed = from, rc;
-    fs_->lchown(to, st.st_uid, st.st_gid);
-    return 0;
-  } else if (S_ISREG(st.st_mode)) {
-    if ((rc = fs_->copyData(from, to, 0600))) return *failed = from, rc;
-  } else {
-    return 0;  // sockets, fifos and devices are not container content
-  }
-  if ((rc = fs_->lchown(to, st.st_uid, st.st_gid))) return *failed = to, rc;
-  if ((rc = fs_->chmod(to, st.st_mode & 07777))) return *failed = to, rc;
+// Owner, mode and extended attributes (ACLs included) of one item; an
+// empty name stands for the directory itself.
+int VSAFileManager::copyAttributes(int fromDir, const std::string& fromName, const struct stat& st,
+                                   int toDir, const std::string& toName) {
+  if (int rc = fs_->chownAt(toDir, toName, st.st_uid, st.st_gid)) return rc;
+  if (int rc = fs_->chmodAt(toDir, toName, st.st_mode & 07777)) return rc;
   std::vector<std::string> names;
-  if (fs_->listxattr(from, &names) == 0) {
-    for (const auto& name : names) {
-      std::string value;
-      if (fs_->getxattr(from, name, &value) != 0) continue;
-      if ((rc = fs_->setxattr(to, name, value)) && rc != ENOTSUP) return *failed = to, rc;
-    }
+  if (fs_->listxattrAt(fromDir, fromName, &names) != 0) return 0;
+  for (const auto& attribute : names) {
+    std::string value;
+    if (fs_->getxattrAt(fromDir, fromName, attribute, &value) != 0) continue;
+    int rc = fs_->setxattrAt(toDir, toName, attribute, value);
+    if (rc != 0 && rc != ENOTSUP) return rc;
   }
   return 0;
+}
+
+// One item that is not a directory: a link as a link, a regular file with
+// its data and attributes.
+int VSAFileManager::copyEntry(int fromDir, const std::string& fromName, const struct stat& st,
+                              int toDir, const std::string& toName) {
+  if (S_ISLNK(st.st_mode)) {
+    std::string target;
+    if (int rc = fs_->readlinkAt(fromDir, fromName, &target)) return rc;
+    if (int rc = fs_->symlinkAt(target, toDir, toName)) return rc;
+    fs_->chownAt(toDir, toName, st.st_uid, st.st_gid);
+    return 0;
+  }
+  if (!S_ISREG(st.st_mode)) return 0;  // sockets, fifos and devices are not container content
+  if (int rc = fs_->copyDataAt(fromDir, fromName, toDir, toName, 0600)) return rc;
+  return copyAttributes(fromDir, fromName, st, toDir, toName);
+}
+
+// Copies item `fromName` of `fromDir` to the new `toName` of `toDir`,
+// never following links. Directories are walked as every tree is: by
+// descriptor, both trees on stacks that keep few open, on the source's
+// device (mounts inside are not copied); each directory gets its owner,
+// mode and attributes once its contents are in. Returns 0 or the first errno.
+int VSAFileManager::copyTree(int fromDir, const std::string& fromName, const std::string& fromPath,
+                             int toDir, const std::string& toName, const std::string& toPath) {
+  struct stat st, target;
+  if (int rc = fs_->statAt(fromDir, fromName, &st)) return rc;
+  if (!S_ISDIR(st.st_mode)) return copyEntry(fromDir, fromName, st, toDir, toName);
+  if (int rc = fs_->statAt(toDir, "", &target)) return rc;
+  if (int rc = fs_->mkdirAt(toDir, toName, 0700)) return rc;
+  using Listing = VSADirectoryStack::Listing;
+  VSADirectoryStack from(*fs_, fromDir, fromPath), to(*fs_, toDir, toPath);
+  int rc = from.enter(fromName, &st, st.st_dev);
+  if (rc == 0) rc = to.enter(toName, nullptr, target.st_dev, Listing::None);
+  while (rc == 0 && !from.empty()) {
+    if (const VSADirectoryEntry* e = from.nextEntry()) {
+      struct stat cst;
+      if ((rc = fs_->statAt(from.fd(), e->name, &cst))) break;
+      if (!S_ISDIR(cst.st_mode)) {
+        rc = copyEntry(from.fd(), e->name, cst, to.fd(), e->name);
+      } else if (cst.st_dev == st.st_dev && (rc = fs_->mkdirAt(to.fd(), e->name, 0700)) == 0 &&
+                 (rc = from.enter(e->name, &cst, st.st_dev)) == 0) {
+        rc = to.enter(e->name, nullptr, target.st_dev, Listing::None);
+      }
+      continue;
+    }
+    if ((rc = copyAttributes(from.fd(), "", from.status(), to.fd(), ""))) break;
+    if ((rc = from.reopenParent()) || (rc = to.reopenParent())) break;
+    from.pop();
+    to.pop();
+  }
+  return rc;
 }
 
 bool VSAFileManager::standardizeOwnershipAtURL(const std::string& path, uid_t uid, gid_t gid,

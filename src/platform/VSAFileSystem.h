@@ -100,16 +100,9 @@ class VSAFileSystem {
   // Every entry but "." and "..", with its type.
   virtual int readDirectory(const std::string& path, std::vector<VSADirectoryEntry>* entries) = 0;
   virtual int getxattr(const std::string& path, const std::string& name, std::string* value) = 0;
-  virtual int setxattr(const std::string& path, const std::string& name,
-                       const std::string& value) = 0;
-  virtual int listxattr(const std::string& path, std::vector<std::string>* names) = 0;
   // Inode flags (FS_IMMUTABLE_FL ...); ENOTTY/EOPNOTSUPP where unsupported.
   virtual int getFlags(const std::string& path, int* flags) = 0;
   virtual int setFlags(const std::string& path, int flags) = 0;
-  // Creates `to` (which must not exist) with the data of regular file
-  // `from`, cloning extents where the file system can.
-  virtual int copyData(const std::string& from, const std::string& to, mode_t mode) = 0;
-  virtual int symlink(const std::string& target, const std::string& path) = 0;
   // Creates or truncates `path` with `bytes` and syncs it.
   virtual int writeFile(const std::string& path, const std::vector<uint8_t>& bytes,
                         mode_t mode) = 0;
@@ -170,6 +163,18 @@ class VSAFileSystem {
   virtual int setProtectionClassAt(int dir, const std::string& name, int protectionClass) = 0;
   // Flushes a directory's entries to disk (the second half of a commit).
   virtual int syncDirectory(int dir) = 0;
+  // Creates `toName` in `toDir` (it must not exist) with the data of regular
+  // file `fromName` of `fromDir`, cloning extents where the file system can.
+  virtual int copyDataAt(int fromDir, const std::string& fromName, int toDir,
+                         const std::string& toName, mode_t mode) = 0;
+  virtual int readlinkAt(int dir, const std::string& name, std::string* target) = 0;
+  virtual int symlinkAt(const std::string& target, int dir, const std::string& name) = 0;
+  // Extended attributes of an item (a link's own); an empty name: `dir` itself.
+  virtual int listxattrAt(int dir, const std::string& name, std::vector<std::string>* names) = 0;
+  virtual int getxattrAt(int dir, const std::string& name, const std::string& attribute,
+                         std::string* value) = 0;
+  virtual int setxattrAt(int dir, const std::string& name, const std::string& attribute,
+                         const std::string& value) = 0;
 
   static constexpr int kDeviceLockedError = EAGAIN;
   // The inode flag that forbids changing or removing an item.

@@ -6,7 +6,6 @@
 #include <sys/acl.h>
 #include <sys/ioctl.h>
 #include <sys/quota.h>
-#include <sys/sendfile.h>
 #include <sys/sysmacros.h>
 #include <sys/xattr.h>
 #include <unistd.h>
@@ -21,8 +20,6 @@
 #include "base/VSAPlist.h"
 
 namespace {
-int err(int rc) { return rc == 0 ? 0 : errno; }
-
 // Opens an item for an ioctl without following a link.
 int openNoFollow(const std::string& path) {
   VSAUniqueFd fd;
@@ -119,14 +116,8 @@ int VSALinuxFileSystem::exchange(const std::string& a, const std::string& b) {
 }
 
 int VSALinuxFileSystem::readlink(const std::string& path, std::string* target) {
-  return atParent(path, [&](int dir, const std::string& name) {
-    char buf[1024];
-    ssize_t n = ::readlinkat(dir, name.c_str(), buf, sizeof buf);
-    if (n < 0) return errno;
-    if (static_cast<size_t>(n) >= sizeof buf) return ENAMETOOLONG;
-    target->assign(buf, n);
-    return 0;
-  });
+  return atParent(path,
+                  [&](int dir, const std::string& name) { return readlinkAt(dir, name, target); });
 }
 
 // The one call that follows links: it answers where a path really leads.
@@ -156,35 +147,8 @@ int VSALinuxFileSystem::readDirectory(const std::string& path,
 
 int VSALinuxFileSystem::getxattr(const std::string& path, const std::string& name,
                                  std::string* value) {
-  return atParent(path, [&](int dir, const std::string& item) {
-    char buf[65536];
-    ssize_t n = ::lgetxattr(procPath(dir, item).c_str(), name.c_str(), buf, sizeof buf);
-    if (n < 0) return errno;
-    value->assign(buf, n);
-    return 0;
-  });
-}
-
-int VSALinuxFileSystem::setxattr(const std::string& path, const std::string& name,
-                                 const std::string& value) {
-  return atParent(path, [&](int dir, const std::string& item) {
-    return err(
-        ::lsetxattr(procPath(dir, item).c_str(), name.c_str(), value.data(), value.size(), 0));
-  });
-}
-
-int VSALinuxFileSystem::listxattr(const std::string& path, std::vector<std::string>* names) {
-  return atParent(path, [&](int dir, const std::string& item) {
-    char buf[65536];
-    ssize_t n = ::llistxattr(procPath(dir, item).c_str(), buf, sizeof buf);
-    if (n < 0) return errno;
-    for (ssize_t i = 0; i < n;) {
-      std::string name(buf + i);
-      i += name.size() + 1;
-      if (!name.empty()) names->push_back(std::move(name));
-    }
-    return 0;
-  });
+  return atParent(
+      path, [&](int dir, const std::string& item) { return getxattrAt(dir, item, name, value); });
 }
 
 int VSALinuxFileSystem::getFlags(const std::string& path, int* flags) {
@@ -195,59 +159,6 @@ int VSALinuxFileSystem::getFlags(const std::string& path, int* flags) {
 int VSALinuxFileSystem::setFlags(const std::string& path, int flags) {
   return atParent(path,
                   [&](int dir, const std::string& name) { return setFlagsAt(dir, name, flags); });
-}
-
-int VSALinuxFileSystem::copyData(const std::string& from, const std::string& to, mode_t mode) {
-  VSAUniqueFd source;
-  if (int rc = openNoSymlinks(from, O_RDONLY | O_NOFOLLOW | O_NONBLOCK, &source)) return rc;
-  struct stat sourceStat;
-  if (::fstat(source.get(), &sourceStat) != 0) return errno;
-  if (!S_ISREG(sourceStat.st_mode)) return EINVAL;
-  VSAUniqueFd toDir;
-  std::string toName;
-  if (int rc = openParent(to, &toDir, &toName)) return rc;
-  int in = source.release();
-  int out = ::openat(toDir.get(), toName.c_str(),
-                     O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, mode);
-  if (out < 0) {
-    int e = errno;
-    ::close(in);
-    return e;
-  }
-  int rc = 0;
-  if (ioctl(out, FICLONE, in) != 0) {  // no reflinks here: copy the bytes in the kernel
-    for (;;) {
-      ssize_t n = copy_file_range(in, nullptr, out, nullptr, 1 << 30, 0);
-      if (n > 0) continue;
-      if (n == 0) break;
-      if (errno == EINTR) continue;
-      if (errno == EXDEV || errno == ENOSYS || errno == EINVAL) {
-        off_t off = 0;
-        struct stat st;
-        fstat(in, &st);
-        while (off < st.st_size) {
-          ssize_t s = sendfile(out, in, &off, st.st_size - off);
-          if (s <= 0) {
-            rc = s < 0 ? errno : EIO;
-            break;
-          }
-        }
-        break;
-      }
-      rc = errno;
-      break;
-    }
-  }
-  ::close(in);
-  if (::close(out) != 0 && rc == 0) rc = errno;
-  if (rc != 0) ::unlinkat(toDir.get(), toName.c_str(), 0);
-  return rc;
-}
-
-int VSALinuxFileSystem::symlink(const std::string& target, const std::string& path) {
-  return atParent(path, [&](int dir, const std::string& name) {
-    return err(::symlinkat(target.c_str(), dir, name.c_str()));
-  });
 }
 
 int VSALinuxFileSystem::writeFile(const std::string& path, const std::vector<uint8_t>& bytes,

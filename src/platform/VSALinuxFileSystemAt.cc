@@ -6,8 +6,10 @@
 #include <linux/openat2.h>
 #include <sys/acl.h>
 #include <sys/ioctl.h>
+#include <sys/sendfile.h>
 #include <sys/syscall.h>
 #include <sys/xattr.h>
+#include <unistd.h>
 
 #include <cstdio>
 #include <cstdlib>
@@ -268,4 +270,93 @@ int VSALinuxFileSystem::syncDirectory(int dir) {
   VSAUniqueFd real(::openat(dir, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (!real) return errno;
   return err(::fsync(real.get()));
+}
+
+namespace {
+// Copies the rest of `in` to `out`: a clone where the file system shares
+// extents, else a copy in the kernel.
+int copyBytes(int in, int out) {
+  if (ioctl(out, FICLONE, in) == 0) return 0;
+  for (;;) {
+    ssize_t n = copy_file_range(in, nullptr, out, nullptr, 1 << 30, 0);
+    if (n > 0) continue;
+    if (n == 0) return 0;
+    if (errno == EINTR) continue;
+    if (errno != EXDEV && errno != ENOSYS && errno != EINVAL) return errno;
+    off_t off = 0;
+    struct stat st;
+    if (fstat(in, &st) != 0) return errno;
+    while (off < st.st_size) {
+      ssize_t s = sendfile(out, in, &off, st.st_size - off);
+      if (s <= 0) return s < 0 ? errno : EIO;
+    }
+    return 0;
+  }
+}
+}  // namespace
+
+int VSALinuxFileSystem::copyDataAt(int fromDir, const std::string& fromName, int toDir,
+                                   const std::string& toName, mode_t mode) {
+  VSAUniqueFd in(
+      ::openat(fromDir, fromName.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+  if (!in) return errno;
+  struct stat st;
+  if (::fstat(in.get(), &st) != 0) return errno;
+  if (!S_ISREG(st.st_mode)) return EINVAL;
+  int out =
+      ::openat(toDir, toName.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, mode);
+  if (out < 0) return errno;
+  int rc = copyBytes(in.get(), out);
+  if (::close(out) != 0 && rc == 0) rc = errno;
+  if (rc != 0) ::unlinkat(toDir, toName.c_str(), 0);
+  return rc;
+}
+
+int VSALinuxFileSystem::readlinkAt(int dir, const std::string& name, std::string* target) {
+  char buf[1024];
+  ssize_t n = ::readlinkat(dir, name.c_str(), buf, sizeof buf);
+  if (n < 0) return errno;
+  if (static_cast<size_t>(n) >= sizeof buf) return ENAMETOOLONG;
+  target->assign(buf, n);
+  return 0;
+}
+
+int VSALinuxFileSystem::symlinkAt(const std::string& target, int dir, const std::string& name) {
+  return err(::symlinkat(target.c_str(), dir, name.c_str()));
+}
+
+// An empty name follows /proc's link to the directory itself; otherwise the
+// item is reached through its directory and not followed.
+int VSALinuxFileSystem::listxattrAt(int dir, const std::string& name,
+                                    std::vector<std::string>* names) {
+  char buf[65536];
+  std::string path = procPath(dir, name);
+  ssize_t n = name.empty() ? ::listxattr(path.c_str(), buf, sizeof buf)
+                           : ::llistxattr(path.c_str(), buf, sizeof buf);
+  if (n < 0) return errno;
+  for (ssize_t i = 0; i < n;) {
+    std::string attribute(buf + i);
+    i += attribute.size() + 1;
+    if (!attribute.empty()) names->push_back(std::move(attribute));
+  }
+  return 0;
+}
+
+int VSALinuxFileSystem::getxattrAt(int dir, const std::string& name, const std::string& attribute,
+                                   std::string* value) {
+  char buf[65536];
+  std::string path = procPath(dir, name);
+  ssize_t n = name.empty() ? ::getxattr(path.c_str(), attribute.c_str(), buf, sizeof buf)
+                           : ::lgetxattr(path.c_str(), attribute.c_str(), buf, sizeof buf);
+  if (n < 0) return errno;
+  value->assign(buf, n);
+  return 0;
+}
+
+int VSALinuxFileSystem::setxattrAt(int dir, const std::string& name, const std::string& attribute,
+                                   const std::string& value) {
+  std::string path = procPath(dir, name);
+  if (name.empty())
+    return err(::setxattr(path.c_str(), attribute.c_str(), value.data(), value.size(), 0));
+  return err(::lsetxattr(path.c_str(), attribute.c_str(), value.data(), value.size(), 0));
 }

@@ -1,5 +1,6 @@
 // End to end: containers created, found, protected and deleted through the
 // real daemon and its socket.
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <unistd.h>
 
@@ -8,11 +9,14 @@
 #include <future>
 #include <thread>
 
+#include "base/VSAJSON.h"
 #include "base/VSAPlist.h"
+#include "base/VSAUUID.h"
 #include "e2e/VSATestDaemon.h"
 #include "platform/VSAAuditToken.h"
 #include "platform/VSALinuxFileSystem.h"
 #include "platform/VSALockStateService.h"
+#include "platform/VSAUniqueFd.h"
 
 namespace fs = std::filesystem;
 using namespace std::chrono_literals;
@@ -241,6 +245,69 @@ TEST(DaemonContainers, ProtectionChangeWaitsForTheUnlock) {
   protect.set("DataProtectionClass", VSAValue(2));
   EXPECT_EQ(VSAReplyError(d.request(protect)), 11u);
   EXPECT_EQ(d.stop(), 0);
+}
+
+// An app nests 400 directories in its Documents (by descriptor, as an app
+// can): deleting the container and emptying death row leaves nothing, on
+// death row nor moved aside into the root's /tmp.
+TEST(DaemonContainers, AnAppsDeepTreeGoesWholeWithItsContainer) {
+  VSATestDaemon d;
+  d.registerSelf("com.example.installer", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
+  ASSERT_TRUE(d.start());
+  auto created = d.request(createRequest("com.example.app"));
+  ASSERT_EQ(VSAReplyError(created), 1u);
+  std::string path = VSAReplyString(created, "ReplyPath");
+  VSAUniqueFd dir(::open((path + "/Documents").c_str(), O_RDONLY | O_DIRECTORY));
+  for (int i = 0; dir && i < 400; ++i) {
+    ASSERT_EQ(::mkdirat(dir.get(), "nested", 0755), 0);
+    dir = VSAUniqueFd(::openat(dir.get(), "nested", O_RDONLY | O_DIRECTORY));
+    ASSERT_TRUE(dir);
+    ASSERT_EQ(::fchown(dir.get(), 501, 501), 0);
+  }
+  ASSERT_TRUE(dir);
+  std::ofstream(path + "/Documents/nested/nested/diary") << "private";
+  VSAValue del = VSAValue::Dictionary{{"Command", VSAValue(10u)},
+                                      {"Identifier", VSAValue("com.example.app")},
+                                      {"ContainerClass", VSAValue(2u)}};
+  ASSERT_EQ(VSAReplyError(d.request(del)), 1u);
+  EXPECT_EQ(VSAReplyError(d.request(VSAValue::Dictionary{{"Command", VSAValue(4u)}})), 1u);
+  std::string dead = d.path("/private/var/root/Library/Caches/com.tamsk.vessad/Dead");
+  EXPECT_TRUE(!fs::exists(dead) || fs::is_empty(dead));
+  EXPECT_TRUE(!fs::exists(d.path("/tmp")) || fs::is_empty(d.path("/tmp")))
+      << "deleted app data was moved aside instead of removed";
+  EXPECT_EQ(d.stop(), 0);
+  auto verified = d.verify();
+  EXPECT_EQ(verified.status, 0) << verified.output;
+}
+
+// What death row could not remove waits in the root's /tmp: the state dump
+// and the root checker count it, with its size, so that it is seen.
+TEST(DaemonContainers, LeftoversInTmpAreCountedByStatusAndTheRootChecker) {
+  VSATestDaemon d;
+  ASSERT_TRUE(d.start());
+  std::string leftover = d.path("/tmp/" + VSAUUID::random().string());
+  fs::create_directories(leftover + "/Documents");
+  std::ofstream(leftover + "/Documents/photo") << std::string(5000, 'p');
+  std::ofstream(d.path("/tmp/unrelated")) << "not death row's";
+  auto status = d.vessactl("", {"status", "--json"});
+  auto state = VSAJSON::parse(status.output, nullptr);
+  ASSERT_TRUE(state && state->get("tmpLeftovers")) << status.output;
+  const VSAValue& left = *state->get("tmpLeftovers");
+  EXPECT_EQ(left.get("entries")->uint64Value().value_or(0), 1u);
+  EXPECT_GE(left.get("bytes")->uint64Value().value_or(0), 5000u);
+  EXPECT_EQ(d.stop(), 0);
+
+  auto verified = d.verify(true);
+  EXPECT_EQ(verified.status, 1) << verified.output;
+  auto report = VSAJSON::parse(verified.output, nullptr);
+  ASSERT_TRUE(report && report->get("counts")) << verified.output;
+  EXPECT_EQ(report->get("counts")->get("tmpLeftovers")->uint64Value().value_or(0), 1u);
+  EXPECT_GE(report->get("counts")->get("tmpLeftoverBytes")->uint64Value().value_or(0), 5000u);
+  bool named = false;
+  for (const VSAValue& f : *report->get("findings")->arrayValue())
+    named |= *f.get("kind")->stringValue() == "deathrow-leftover" &&
+             *f.get("path")->stringValue() == leftover;
+  EXPECT_TRUE(named) << verified.output;
 }
 
 }  // namespace

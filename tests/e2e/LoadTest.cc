@@ -124,18 +124,6 @@ void client(VSATestDaemon& d, int index, std::atomic<bool>& stop, Promises& prom
   }
 }
 
-// The root checker as an integrator runs it; its exit status and report.
-std::pair<int, std::string> verify(const std::string& root, bool json = false) {
-  std::string command =
-      std::string(VESSAD_PATH) + " --verify --root " + root + (json ? " --json" : "") + " 2>&1";
-  FILE* pipe = ::popen(command.c_str(), "r");
-  std::string output;
-  char buffer[4096];
-  while (size_t n = std::fread(buffer, 1, sizeof(buffer), pipe)) output.append(buffer, n);
-  int status = ::pclose(pipe);
-  return {WIFEXITED(status) ? WEXITSTATUS(status) : -1, output};
-}
-
 size_t cleanups(const VSATestDaemon& d) {
   size_t n = 0;
   for (const auto& name : d.notifications()) n += name == "com.tamsk.vessad.cleanup-complete";
@@ -178,7 +166,7 @@ TEST(DaemonCrash, KilledAtRandomUnderSixteenClientsLosesNothing) {
     stop = true;
     for (auto& t : clients) t.join();
     // Dead where it stood: whatever it left, its next start finishes.
-    auto [deadStatus, deadReport] = verify(d.root(), true);
+    auto [deadStatus, deadReport] = d.verify(true);
     ASSERT_NE(deadStatus, 2) << deadReport;
     auto parsed = VSAJSON::parse(deadReport, nullptr);
     ASSERT_TRUE(parsed && parsed->get("findings")) << deadReport;
@@ -193,7 +181,7 @@ TEST(DaemonCrash, KilledAtRandomUnderSixteenClientsLosesNothing) {
       ASSERT_EQ(*reply->get("ReplyUUID")->uuidValue(), uuid) << id;
     }
     ASSERT_EQ(d.stop(), 0);
-    auto [status, report] = verify(d.root());
+    auto [status, report] = d.verify();
     EXPECT_EQ(status, 0) << report;
     if (status == 0) ++clean;
     ASSERT_TRUE(startAndSettle(d));
@@ -303,7 +291,7 @@ TEST(DaemonSoak, MixedRequestsWhileTheDeviceLocksAndUnlocksAreAllAnswered) {
   EXPECT_EQ(failed.load(), 0);
   EXPECT_EQ(d.stop(), 0);
   EXPECT_EQ(d.daemonOutput().find("ThreadSanitizer"), std::string::npos) << d.daemonOutput();
-  auto [status, report] = verify(d.root());
+  auto [status, report] = d.verify();
   EXPECT_EQ(status, 0) << report;
   if (status != 0) {
     std::istringstream lines(d.daemonOutput());

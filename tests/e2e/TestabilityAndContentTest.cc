@@ -3,6 +3,7 @@
 // frozen inside a creation, the crash-retry test across real crashes, and
 // the commands that name content inside containers.
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 
 #include <algorithm>
@@ -226,6 +227,37 @@ TEST(DaemonContent, AssetsAndSharedContentThroughTheSocket) {
   std::ifstream in(dataPath + "/Library/shared.db");
   EXPECT_EQ(std::string(std::istreambuf_iterator<char>(in), {}), "rows");
   EXPECT_EQ(VSAReplyError(stage("shared.db", "/etc/shadow")), 11u);
+  EXPECT_EQ(d.stop(), 0);
+}
+
+// The app's data container belongs to uid 501: shared content staged to a
+// nested destination lands in directories that all belong to 501 too, so
+// the app can remove every one of them.
+TEST(DaemonContent, SharedContentMakesTheMissingDirectoriesTheContainerOwners) {
+  VSATestDaemon d;
+  d.registerSelf("com.example.installer", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
+  ASSERT_TRUE(d.start());
+  auto bundle = d.request(create("com.example.app", 1));
+  auto data = d.request(create("com.example.app"));
+  ASSERT_EQ(VSAReplyError(data), 1u);
+  std::string bundlePath = VSAReplyString(bundle, "ReplyPath");
+  std::string dataPath = VSAReplyString(data, "ReplyPath");
+  auto owner = [](const std::string& path) {
+    struct stat st {};
+    return ::lstat(path.c_str(), &st) == 0 ? st.st_uid : ~0u;
+  };
+  ASSERT_EQ(owner(dataPath), 501u);
+  fs::create_directories(bundlePath + "/Shared/fonts");
+  std::ofstream(bundlePath + "/Shared/fonts/serif") << "glyphs";
+  VSAValue body = with(with(request(26, "com.example.app"), "SourcePath", VSAValue("Shared")),
+                       "DestPath", VSAValue("Documents/a/b/c/Shared"));
+  auto staged = d.request(body);
+  ASSERT_EQ(VSAReplyError(staged), 1u);
+  EXPECT_EQ(VSAReplyString(staged, "ReplyPath"), dataPath + "/Documents/a/b/c/Shared");
+  for (const char* made :
+       {"/Documents/a", "/Documents/a/b", "/Documents/a/b/c", "/Documents/a/b/c/Shared",
+        "/Documents/a/b/c/Shared/fonts", "/Documents/a/b/c/Shared/fonts/serif"})
+    EXPECT_EQ(owner(dataPath + made), 501u) << made;
   EXPECT_EQ(d.stop(), 0);
 }
 

@@ -182,6 +182,16 @@ VSATestDaemon::Run VSATestDaemon::vessactl(const std::string& client,
   std::string exe = client.empty() ? std::string(VESSACTL_PATH) : root_ + "/usr/bin/" + client;
   std::vector<std::string> full = {exe, "--root", root_};
   full.insert(full.end(), args.begin(), args.end());
+  return run(std::move(full));
+}
+
+VSATestDaemon::Run VSATestDaemon::verify(bool json) const {
+  std::vector<std::string> full = {VESSAD_PATH, "--verify", "--root", root_};
+  if (json) full.push_back("--json");
+  return run(std::move(full));
+}
+
+VSATestDaemon::Run VSATestDaemon::run(std::vector<std::string> full) {
   int pipefd[2];
   if (pipe(pipefd) != 0) return {-1, ""};
   pid_t pid = fork();

@@ -92,6 +92,8 @@ class VSATestDaemon {
   // Runs vessactl (`client` = a registered copy's name, or "" for the
   // unregistered build output) with --root and the given arguments.
   Run vessactl(const std::string& client, std::vector<std::string> args);
+  // The root checker (`vessad --verify`) on this root, as an integrator runs it.
+  Run verify(bool json = false) const;
 
   std::vector<std::string> notifications() const;
   // Waits until the notification log holds `count` names.
@@ -100,6 +102,8 @@ class VSATestDaemon {
   std::string firstBootSemaphore() const;
 
  private:
+  static Run run(std::vector<std::string> argv);
+
   std::string root_;
   pid_t pid_ = -1;
   std::vector<std::string> prefix_;

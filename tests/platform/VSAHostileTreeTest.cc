@@ -1,17 +1,22 @@
 // Trees that their owner changes while root walks them: a directory swapped
-// for a link between the daemon's listing and its next step, links in the
-// middle of a path, trees deeper than any walk should follow.
+// for a link between the daemon's listing and its next step (near the top,
+// and deep down where the walk keeps no descriptor of the levels above),
+// links in the middle of a path, trees deeper than any descriptor budget.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <sys/xattr.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <filesystem>
 #include <fstream>
 
 #include "VSATestTempDir.h"
+#include "platform/VSADirectoryStack.h"
 #include "platform/VSAFileManager.h"
 #include "platform/VSALinuxFileSystem.h"
+#include "platform/VSAUniqueFd.h"
 
 namespace fs = std::filesystem;
 
@@ -22,9 +27,12 @@ namespace {
 // pick, made deterministic.
 class SwappingFileSystem : public VSALinuxFileSystem {
  public:
-  void arm(const std::string& victim, const std::string& outside) {
+  // `movedTo`: where the listed directory goes (by default beside itself).
+  void arm(const std::string& victim, const std::string& outside, std::string movedTo = "") {
     victim_ = victim;
     outside_ = outside;
+    movedTo_ = movedTo.empty() ? victim + ".moved" : movedTo;
+    swapped_ = false;
     struct stat st;
     ASSERT_EQ(::lstat(victim.c_str(), &st), 0);
     target_ = st.st_ino;
@@ -48,11 +56,11 @@ class SwappingFileSystem : public VSALinuxFileSystem {
   void maybeSwap(ino_t listed) {
     if (swapped_ || listed != target_) return;
     swapped_ = true;
-    fs::rename(victim_, victim_ + ".moved");
+    fs::rename(victim_, movedTo_);
     fs::create_directory_symlink(outside_, victim_);
   }
 
-  std::string victim_, outside_;
+  std::string victim_, outside_, movedTo_;
   ino_t target_ = 0;
   bool swapped_ = false;
 };
@@ -184,28 +192,135 @@ TEST_F(HostileTree, SingleFileRemovalRefusesATree) {
   EXPECT_TRUE(fm_->removeFileAtURL(container_ + "/dir/secret", &error)) << "missing is success";
 }
 
-TEST_F(HostileTree, TreesDeeperThanTheLimitAreRefusedNotFollowed) {
-  // Built with descriptors: the full path is longer than PATH_MAX.
-  int dir = ::open(container_.c_str(), O_RDONLY | O_DIRECTORY);
-  ASSERT_GE(dir, 0);
-  for (int i = 0; i < kVSAMaxWalkDepth + 20; ++i) {
-    ASSERT_EQ(::mkdirat(dir, "d", 0755), 0);
-    int next = ::openat(dir, "d", O_RDONLY | O_DIRECTORY);
-    ::close(dir);
-    ASSERT_GE(next, 0);
-    dir = next;
+// Nests `depth` directories named `name` below `top`, each holding a
+// one-byte file "f", built by descriptor (the full path may be longer than
+// PATH_MAX).
+void nest(const std::string& top, int depth, const std::string& name) {
+  VSAUniqueFd dir(::open(top.c_str(), O_RDONLY | O_DIRECTORY));
+  ASSERT_TRUE(dir);
+  for (int i = 0; i < depth; ++i) {
+    ASSERT_EQ(::mkdirat(dir.get(), name.c_str(), 0755), 0);
+    VSAUniqueFd next(::openat(dir.get(), name.c_str(), O_RDONLY | O_DIRECTORY));
+    ASSERT_TRUE(next);
+    VSAUniqueFd file(::openat(next.get(), "f", O_WRONLY | O_CREAT, 0644));
+    ASSERT_EQ(::write(file.get(), "x", 1), 1);
+    dir = std::move(next);
   }
-  ::close(dir);
+}
+// Calls `level(fd, k)` for each level k = 0..depth of such a tree.
+template <typename F>
+void forEachLevel(const std::string& top, int depth, const std::string& name, F level) {
+  VSAUniqueFd dir(::open(top.c_str(), O_RDONLY | O_DIRECTORY));
+  for (int k = 0; dir && k <= depth; ++k) {
+    level(dir.get(), k);
+    if (k < depth) dir = VSAUniqueFd(::openat(dir.get(), name.c_str(), O_RDONLY | O_DIRECTORY));
+  }
+  ASSERT_TRUE(dir) << "the tree is not whole";
+}
+size_t openDescriptors() {
+  return static_cast<size_t>(std::distance(fs::directory_iterator("/proc/self/fd"), {}));
+}
+
+// 600 levels: more than any descriptor budget, and a path far longer than
+// PATH_MAX. Every tree operation reaches the bottom and keeps few
+// descriptors open on the way.
+TEST_F(HostileTree, TreesOfAnyDepthAreWalkedSizedCopiedReOwnedAndRemoved) {
+  const int depth = 600;
+  const std::string name = "nested-dir";
+  std::string deep = container_ + "/deep", copy = container_ + "/copy";
+  fs::create_directory(deep);
+  nest(deep, depth, name);
+  size_t baseline = openDescriptors(), most = 0;
+  auto watch = [&] { most = std::max(most, openDescriptors()); };
+
   VSAErrorRef error;
-  size_t seen = 0;
-  EXPECT_FALSE(fm_->traverseDirectory(container_, &error, [&](const VSAWalkItem&, auto) {
-    ++seen;
+  int directories = 0, files = 0;
+  ASSERT_TRUE(fm_->traverseDirectory(deep, &error, [&](const VSAWalkItem&, auto phase) {
+    directories += phase == VSAFileManager::WalkPhase::Directory;
+    files += phase == VSAFileManager::WalkPhase::Item;
+    watch();
     return true;
-  }));
-  EXPECT_GT(seen, static_cast<size_t>(kVSAMaxWalkDepth));
-  EXPECT_FALSE(fm_->removeItemAtURL(container_, &error));
-  EXPECT_EQ(error->underlyingError() ? error->underlyingError()->code() : error->code(), ELOOP);
-  EXPECT_TRUE(fs::exists(container_ + "/d")) << "the part within reach stays for the caller";
+  })) << error;
+  EXPECT_EQ(directories, depth + 1);
+  EXPECT_EQ(files, depth);
+
+  uint64_t bytes = 0;
+  forEachLevel(deep, depth, name, [&](int dir, int k) {
+    struct stat st;
+    if (::fstat(dir, &st) == 0) bytes += st.st_size;
+    if (k > 0 && ::fstatat(dir, "f", &st, AT_SYMLINK_NOFOLLOW) == 0) bytes += st.st_size;
+  });
+  EXPECT_EQ(fm_->diskUsageForURL(deep), bytes);
+
+  ASSERT_TRUE(fm_->copyItemAtURL(deep, copy, &error)) << error;
+  int copied = 0;
+  forEachLevel(copy, depth, name, [&](int dir, int) {
+    struct stat st;
+    copied += ::fstatat(dir, "f", &st, AT_SYMLINK_NOFOLLOW) == 0 && st.st_size == 1;
+  });
+  EXPECT_EQ(copied, depth);
+
+  EXPECT_TRUE(fm_->standardizeOwnershipAtURL(deep, 501, 501, &error)) << error;
+  int given = 0;
+  forEachLevel(deep, depth, name, [&](int dir, int k) {
+    struct stat st;
+    given += k > 0 && ::fstatat(dir, "f", &st, AT_SYMLINK_NOFOLLOW) == 0 && st.st_uid == 501;
+  });
+  EXPECT_EQ(given, depth);
+
+  EXPECT_TRUE(fm_->standardizeACLsAtURL(deep, false, &error)) << error;
+  int listed = 0;
+  forEachLevel(deep, depth, name, [&](int dir, int k) {
+    VSAUniqueFd file(k > 0 ? ::openat(dir, "f", O_RDONLY | O_NOFOLLOW) : -1);
+    char buf[256];
+    listed += file && ::fgetxattr(file.get(), "system.posix_acl_access", buf, sizeof buf) > 0;
+  });
+  EXPECT_EQ(listed, depth);
+
+  int freed = 0;
+  for (const std::string& tree : {deep, copy}) {
+    EXPECT_TRUE(fm_->removeItemAtURL(tree, &error, [&](uint64_t) {
+      ++freed;
+      watch();
+    })) << error;
+    EXPECT_FALSE(fs::exists(tree));
+  }
+  EXPECT_EQ(freed, 2 * depth);
+  EXPECT_LE(most - baseline, kVSAWalkDescriptorBudget + 4) << "descriptors grow with the depth";
+}
+
+// Deep below the descriptor budget, a directory is swapped for a link to
+// outside once it has been listed, and moved to another parent, so that
+// the way back up through its ".." leads elsewhere: the walk finds its way
+// back by name from the top, and never through the link.
+TEST_F(HostileTree, ADeepDirectorySwappedForALinkIsNotFollowed) {
+  for (bool removal : {true, false}) {
+    SCOPED_TRACE(removal ? "removal" : "ownership");
+    std::string deep = container_ + (removal ? "/deep-removed" : "/deep-owned");
+    std::string stolen = deep + ".stolen", victim = deep;
+    fs::create_directory(deep);
+    nest(deep, 400, "d");
+    for (int i = 0; i < 350; ++i) victim += "/d";
+    swapper_->arm(victim, outside_, stolen);
+    VSAErrorRef error;
+    if (removal)
+      fm_->removeItemAtURL(deep, &error);
+    else
+      fm_->standardizeOwnershipAtURL(deep, 501, 501, &error);
+    ASSERT_TRUE(swapper_->swapped());
+    EXPECT_TRUE(fs::exists(outside_ + "/secret")) << "root removed a file outside the tree";
+    EXPECT_EQ(ownerOf(outside_), 0u) << "root gave away a directory outside the tree";
+    EXPECT_EQ(ownerOf(outside_ + "/secret"), 0u);
+    if (removal) {
+      // What was in the listed directory went, wherever it was moved; the
+      // levels above it went too, the planted link with them.
+      EXPECT_TRUE(fs::is_empty(stolen));
+      EXPECT_FALSE(fs::exists(deep));
+    } else {
+      EXPECT_EQ(ownerOf(stolen + "/d/f"), 501u);
+      EXPECT_EQ(ownerOf(deep + "/d/f"), 501u);
+    }
+  }
 }
 
 TEST_F(HostileTree, AnItemGivenToRootCannotBeReachedByItsOwner) {
