@@ -5,7 +5,7 @@ _vessactl() {
   cur=${COMP_WORDS[COMP_CWORD]}
   prev=${COMP_WORDS[COMP_CWORD-1]}
   verbs="create lookup ls show rm wipe replace regen-uuid restructure info groups cs protect
-         usage assets deathrow personas test-lock status notifications"
+         usage assets deathrow personas test-lock status notifications provision"
   classes="bundle data plugin plugin-data vpn-plugin vpn-plugin-data group framework
            relay-service daemon-data temp system system-group"
   case "$prev" in
@@ -17,7 +17,8 @@ _vessactl() {
   esac
   if [[ "$cur" == -* ]]; then
     COMPREPLY=($(compgen -W "--root --socket --file --json --timeout --help --class --persona
-                              --uuid --transient --retry --create" -- "$cur"))
+                              --uuid --transient --retry --create --mobile-user
+                              --mobile-uid --force" -- "$cur"))
   else
     COMPREPLY=($(compgen -W "$verbs" -- "$cur"))
   fi
