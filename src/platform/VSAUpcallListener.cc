@@ -253,6 +253,8 @@ bool VSAUpcallListener::receive(const std::shared_ptr<Peer>& peer) {
            [peer](const std::vector<uint8_t>& message, const std::vector<uint8_t>* memory) {
              peer->send(message, memory);
            });
-  // Anyone but the kernel is answered once (with its refusal) and let go.
-  return peer->kernel;
+  // Anyone but the kernel is answered once (with its refusal) and let go. A
+  // listener without a registry (a bare transport, as a benchmark's echo
+  // uses) tells no peers apart and keeps them all.
+  return peer->kernel || !registry_;
 }

@@ -18,7 +18,8 @@
 // packets is not read until answered. A peer reported with pid 0 (one outside
 // the daemon's pid namespace) is refused, so that pid 0 means the bridge
 // alone; a peer that is not the bridge gets the answer to its first packet
-// (a refusal) and is disconnected.
+// (a refusal) and is disconnected. Without a registry no peer is the bridge,
+// and none is disconnected for it (a bare transport).
 #pragma once
 
 #include <atomic>
