@@ -59,6 +59,49 @@ std::optional<VSAValue> decodeReply(const uint8_t* bytes, size_t length) {
   return VSAFrameCodec::decodePayload(payload.data(), payload.size(), &why);
 }
 
+// Waits (up to five seconds) until process `pid` runs a program whose path
+// holds `name`. System calls only, for forked children.
+void waitUntilRunning(pid_t pid, const char* name) {
+  char link[64], target[PATH_MAX];
+  snprintf(link, sizeof link, "/proc/%d/exe", pid);
+  for (int i = 0; i < 2500; ++i) {
+    ssize_t len = readlink(link, target, sizeof target - 1);
+    if (len > 0 && (target[len] = '\0', std::strstr(target, name))) return;
+    usleep(2000);
+  }
+}
+
+// Sends `request` on `fd` and writes what came back to `report` as a length
+// and the bytes. System calls only.
+void reportExchange(int fd, const std::vector<uint8_t>& request, int report, int timeoutMs) {
+  uint8_t reply[4096];
+  ssize_t n = exchange(fd, request, reply, sizeof reply, timeoutMs);
+  (void)!write(report, &n, sizeof n);
+  if (n > 0) (void)!write(report, reply, static_cast<size_t>(n));
+}
+
+// The next reply a connector wrote to `report`, if there was one.
+std::optional<VSAValue> readReport(int report) {
+  ssize_t n = -1;
+  if (read(report, &n, sizeof n) != sizeof n || n <= 0) return std::nullopt;
+  std::vector<uint8_t> bytes(static_cast<size_t>(n));
+  size_t got = 0;
+  while (got < bytes.size()) {
+    ssize_t r = read(report, bytes.data() + got, bytes.size() - got);
+    if (r <= 0) break;
+    got += static_cast<size_t>(r);
+  }
+  return decodeReply(bytes.data(), got);
+}
+
+// Replaces this (forked) process with the registered sleeper.
+[[noreturn]] void becomeRegisteredSleeper(const std::string& registered) {
+  char arg0[] = "registered-sleeper", arg1[] = "30";
+  char* argv[] = {arg0, arg1, nullptr};
+  execv(registered.c_str(), argv);
+  _exit(127);
+}
+
 TEST(ClientIdentity, ExecingARegisteredExecutableAfterConnectingGainsNothing) {
   VSATestDaemon d;
   // The registered client: a long-running program, so that its process is
@@ -91,52 +134,22 @@ TEST(ClientIdentity, ExecingARegisteredExecutableAfterConnectingGainsNothing) {
     ::close(report[0]);
     int fd = socket(AF_UNIX, SOCK_STREAM, 0);
     if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) _exit(2);
-    uint8_t first[4096];
-    ssize_t n = exchange(fd, request, first, sizeof first);
-    (void)!write(report[1], &n, sizeof n);
-    if (n > 0) (void)!write(report[1], first, static_cast<size_t>(n));
+    reportExchange(fd, request, report[1], 2000);
     pid_t self = getpid();
     if (fork() == 0) {
       // The child waits until its parent runs the registered executable, then
       // asks again on the parent's connection.
-      char link[64], target[PATH_MAX];
-      snprintf(link, sizeof link, "/proc/%d/exe", self);
-      for (int i = 0; i < 500; ++i) {
-        ssize_t len = readlink(link, target, sizeof target - 1);
-        if (len > 0) {
-          target[len] = '\0';
-          if (std::strstr(target, "registered-sleeper")) break;
-        }
-        usleep(10000);
-      }
-      uint8_t second[4096];
-      ssize_t m = exchange(fd, request, second, sizeof second);
-      (void)!write(report[1], &m, sizeof m);
-      if (m > 0) (void)!write(report[1], second, static_cast<size_t>(m));
+      waitUntilRunning(self, "registered-sleeper");
+      reportExchange(fd, request, report[1], 2000);
       _exit(0);
     }
     ::close(report[1]);
-    char arg0[] = "registered-sleeper", arg1[] = "30";
-    char* argv[] = {arg0, arg1, nullptr};
-    execv(registered.c_str(), argv);
-    _exit(127);
+    becomeRegisteredSleeper(registered);
   }
   ASSERT_GT(connector, 0);
   ::close(report[1]);
-  auto readReport = [&]() -> std::optional<VSAValue> {
-    ssize_t n = -1;
-    if (read(report[0], &n, sizeof n) != sizeof n || n <= 0) return std::nullopt;
-    std::vector<uint8_t> bytes(static_cast<size_t>(n));
-    size_t got = 0;
-    while (got < bytes.size()) {
-      ssize_t r = read(report[0], bytes.data() + got, bytes.size() - got);
-      if (r <= 0) break;
-      got += static_cast<size_t>(r);
-    }
-    return decodeReply(bytes.data(), got);
-  };
-  auto before = readReport();
-  auto after = readReport();
+  auto before = readReport(report[0]);
+  auto after = readReport(report[0]);
   kill(connector, SIGKILL);
   waitpid(connector, nullptr, 0);
   ::close(report[0]);
@@ -208,54 +221,25 @@ TEST_P(ExecBeforeAccept, AMobileProcessNeverBecomesAClientRegisteredForRoot) {
     if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) _exit(2);
     pid_t self = getpid();
     if (fork() == 0) {
-      char link[64], target[PATH_MAX];
-      snprintf(link, sizeof link, "/proc/%d/exe", self);
-      for (int i = 0; i < 500; ++i) {
-        ssize_t len = readlink(link, target, sizeof target - 1);
-        if (len > 0 && (target[len] = '\0', std::strstr(target, "registered-sleeper"))) break;
-        usleep(2000);
-      }
-      uint8_t reply[4096];
-      ssize_t m = exchange(fd, request, reply, sizeof reply, 15000);
-      (void)!write(report[1], &m, sizeof m);
-      if (m > 0) (void)!write(report[1], reply, static_cast<size_t>(m));
+      waitUntilRunning(self, "registered-sleeper");
+      reportExchange(fd, request, report[1], 15000);
       _exit(0);
     }
     ::close(report[1]);
-    char arg0[] = "registered-sleeper", arg1[] = "30";
-    char* argv[] = {arg0, arg1, nullptr};
-    execv(registered.c_str(), argv);
-    _exit(127);
+    becomeRegisteredSleeper(registered);
   }
   ASSERT_GT(connector, 0);
   ::close(report[1]);
   if (beforeTheDaemonRuns) {
     // The program is swapped while the connection waits in the backlog; then
     // the daemon starts and takes the socket over.
-    char link[64], target[PATH_MAX];
-    snprintf(link, sizeof link, "/proc/%d/exe", connector);
-    for (int i = 0; i < 500; ++i) {
-      ssize_t len = readlink(link, target, sizeof target - 1);
-      if (len > 0 && (target[len] = '\0', std::strstr(target, "registered-sleeper"))) break;
-      std::this_thread::sleep_for(10ms);
-    }
+    waitUntilRunning(connector, "registered-sleeper");
     std::this_thread::sleep_for(100ms);
     d.setActivationSockets({held});
     ASSERT_TRUE(d.start());
     ::close(held);
   }
-  ssize_t n = -1;
-  std::vector<uint8_t> bytes(4096);
-  std::optional<VSAValue> reply;
-  if (read(report[0], &n, sizeof n) == sizeof n && n > 0) {
-    size_t got = 0;
-    while (got < static_cast<size_t>(n)) {
-      ssize_t r = read(report[0], bytes.data() + got, static_cast<size_t>(n) - got);
-      if (r <= 0) break;
-      got += static_cast<size_t>(r);
-    }
-    reply = decodeReply(bytes.data(), got);
-  }
+  auto reply = readReport(report[0]);
   busy = false;
   load.join();
   kill(connector, SIGKILL);
