@@ -98,6 +98,20 @@ echo "(a process that is not the kernel bridge is answered with return code 5:)"
 cp "$build/vessa-upcall" "$root/tmp/not-the-kernel"
 ctl "$root/tmp/not-the-kernel" --root "$root" --signing-id com.example.demo --uid 501 --persona 1000
 
+step "Apps in their containers: vessa-launch runs each as uid 501, confined by Landlock to its own"
+launch() { "$root/usr/bin/vessa-launch" --root "$root" --group group.com.example.launch "$@"; }
+rule() { launch --signing-id "$1" --print-rules | sed -n "s/.*\"$2\": *\"\([^\"]*\)\".*/\1/p"; }
+notes=$(rule com.example.notes Home)
+shared=$(rule com.example.notes group.com.example.launch)
+echo "(vessa-launch --print-rules prints the containers and the Landlock rules as JSON: ABI $(launch --signing-id com.example.notes --print-rules | sed -n 's/.*"LandlockABI": *\([0-9]*\).*/\1/p'))"
+echo "\$ vessa-launch --signing-id com.example.notes --group group.com.example.launch -- sh -c '...'"
+launch --signing-id com.example.notes -- sh -c 'echo "my notes" > Documents/notes.txt &&
+  echo "hello from notes" > "$1/hello.txt" && echo "  notes runs as uid $(id -u) in its data container; wrote Documents/notes.txt and hello.txt in the group"' sh "$shared" || true
+echo "\$ vessa-launch --signing-id com.example.diary --group group.com.example.launch -- sh -c '...'"
+launch --signing-id com.example.diary -- sh -c 'cat "$1/Documents/notes.txt" 2>&1 | sed "s|$3|\$ROOT|; s/^/  diary reading notes: /";
+  echo "  diary reading the group: $(cat "$2/hello.txt")"' sh "$notes" "$shared" "$root" || true
+echo "(without Landlock it would not start the app at all, unless --unconfined; see vessa-launch(8))"
+
 step "User-managed assets (assets = command 28, twice: made, then found; 29 deletes one asset)"
 ctl "$installer" --root "$root" assets com.example.demo --create
 assets=$("$installer" --root "$root" assets com.example.demo --create | sed -n 's/^Path: *//p')

@@ -15,9 +15,9 @@ dpkg-deb --info "$deb" | grep -E "Package|Version|Depends"
 scratch=$(mktemp -d)
 trap 'rm -rf "$scratch"' EXIT
 dpkg-deb -x "$deb" "$scratch"
-for f in usr/sbin/vessad usr/bin/vessactl usr/bin/vessa-upcall etc/vessad/clients.d \
+for f in usr/sbin/vessad usr/bin/vessactl usr/bin/vessa-upcall usr/bin/vessa-launch etc/vessad/clients.d \
   usr/lib/systemd/system/vessad.service usr/lib/systemd/system/vessad.socket \
-  usr/share/man/man8/vessad.8 usr/share/man/man8/vessactl.8 \
+  usr/share/man/man8/vessad.8 usr/share/man/man8/vessactl.8 usr/share/man/man8/vessa-launch.8 \
   usr/share/bash-completion/completions/vessactl; do
   [[ -e "$scratch/$f" ]] || { echo "package: $f is missing"; exit 1; }
 done

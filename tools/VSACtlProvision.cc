@@ -203,11 +203,15 @@ class Provisioner {
     fs::path me(std::string(self, static_cast<size_t>(n)));
     registerClient("vessactl.plist", install(me.string(), "vessactl"), "com.tamsk.vessactl",
                    administratorEntitlements(), false);
-    for (const char* bridge : {"vessa-upcall", "vessa-launch"}) {
+    // The launcher also looks up the bundle container of the app it starts.
+    VSAValue launcher =
+        VSAValue::Dictionary{{"com.tamsk.private.Vessa.otherIdLookup", VSAValue(true)}};
+    for (auto [bridge, entitlements] :
+         {std::pair{"vessa-upcall", VSAValue::dictionary()}, std::pair{"vessa-launch", launcher}}) {
       fs::path beside = me.parent_path() / bridge;
       if (::access(beside.c_str(), X_OK) != 0) continue;
       registerClient(std::string(bridge) + ".plist", install(beside.string(), bridge),
-                     "com.tamsk.kernel.sandbox-bridge", VSAValue::dictionary(), true);
+                     "com.tamsk.kernel.sandbox-bridge", entitlements, true);
     }
   }
 

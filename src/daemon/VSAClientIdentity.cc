@@ -24,7 +24,8 @@ VSAClientIdentity::VSAClientIdentity(std::string bundleIdentifier, uint32_t uid,
       kernel_(kernel) {}
 
 VSAClientIdentityRef VSAClientIdentity::clientIdentityWithRelayConnection(
-    const VSAIPCConnection& connection, VSAUserIdentityCache& cache) {
+    const VSAIPCConnection& connection, VSAUserIdentityCache& cache,
+    VSACodeSigningMapping& mapping) {
   const VSAAuditToken& token = connection.auditToken();
   const auto& entry = connection.registryEntry();
   if (!entry) {
@@ -40,7 +41,17 @@ VSAClientIdentityRef VSAClientIdentity::clientIdentityWithRelayConnection(
       return gInstallerIdentity;
   }
   VSAClientIdentityRef identity;
-  if (!entry->entitlements.isDictionary()) {
+  if (entry->launched) {
+    if (auto user = cache.userIdentityForCurrentContextWithUID(token.uid, token.gid)) {
+      auto launched = std::make_shared<VSAClientIdentity>(
+          entry->signingIdentifier, token.uid, token.gid, token.pid, user,
+          mapping.entitlementsForIdentifier(entry->signingIdentifier)
+              .value_or(VSAValue::dictionary()),
+          true, tokenBytes, false);
+      launched->launchedApp_ = true;
+      identity = std::move(launched);
+    }
+  } else if (!entry->entitlements.isDictionary()) {
     VSALogIn(VSALogCategory::Relay, kVSALogError, __func__,
              "Missing or malformed entitlements for pid %d", token.pid);
   } else if (auto user = cache.userIdentityForCurrentContextWithUID(token.uid, token.gid)) {

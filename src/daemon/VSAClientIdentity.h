@@ -3,7 +3,10 @@
 // Immutable after creation and shared freely. A peer's identity comes from
 // its audit token and the registry entry its connection resolved when it was
 // accepted (signing identifier, entitlements, sandboxed flag); a peer without
-// a registry entry has no signing identifier and therefore no identity. One identity is cached: the
+// a registry entry has no signing identifier and therefore no identity. A
+// process the launcher started as an app is that app (its launch record):
+// sandboxed, with the entitlements the code-signing database holds for it
+// (none when it has no entry). One identity is cached: the
 // installer service's, reused while its audit token matches byte for byte.
 #pragma once
 
@@ -13,6 +16,7 @@
 #include <string>
 
 #include "base/VSAValue.h"
+#include "codesigning/VSACodeSigningMapping.h"
 #include "model/VSAUserIdentityCache.h"
 #include "platform/VSAAuditToken.h"
 #include "platform/VSAClientRegistry.h"
@@ -36,8 +40,10 @@ class VSAClientIdentity {
   // VSACurrentPersonaScope). Nothing without a registry entry, entitlements
   // or user identity. The caller has checked that the peer still runs the
   // executable the entry was resolved for.
+  // `mapping` answers the entitlements of launched apps.
   static VSAClientIdentityRef clientIdentityWithRelayConnection(const VSAIPCConnection& connection,
-                                                                VSAUserIdentityCache& cache);
+                                                                VSAUserIdentityCache& cache,
+                                                                VSACodeSigningMapping& mapping);
   static VSAClientIdentityRef privilegedClientIdentityWithUserIdentity(
       const VSAUserIdentityRef& userIdentity, bool kernel);
   static VSAClientIdentityRef anonymousPrivilegedClientIdentity(VSAUserIdentityCache& cache);
@@ -50,6 +56,9 @@ class VSAClientIdentity {
   bool isSandboxed() const { return sandboxed_; }
   const std::array<uint8_t, 32>& auditToken() const { return auditToken_; }
   bool isKernel() const { return kernel_; }
+  // Started by the launcher as an app: its entitlements are the database's,
+  // nothing the process itself could present.
+  bool isLaunchedApp() const { return launchedApp_; }
   const VSAUserIdentityRef& userIdentity() const { return userIdentity_; }
   uid_t posixUIDForContainerClass(VSAContainerClass c) const {
     return userIdentity_ ? userIdentity_->posixUIDForContainerClass(c) : uid_;
@@ -74,4 +83,5 @@ class VSAClientIdentity {
   bool sandboxed_;
   std::array<uint8_t, 32> auditToken_;
   bool kernel_;
+  bool launchedApp_ = false;
 };

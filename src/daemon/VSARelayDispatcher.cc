@@ -88,12 +88,14 @@ void VSARelayDispatcher::processRelayEvent(const VSAIPCMessageRef& message) {
     // While this request is served, the thread runs as the client's persona.
     VSACurrentPersonaScope persona(token.pid, token.startTime,
                                    message->connection()->personaRecordMemo());
-    identity = VSAClientIdentity::clientIdentityWithRelayConnection(*message->connection(),
-                                                                    *context_.userIdentityCache);
+    identity = VSAClientIdentity::clientIdentityWithRelayConnection(
+        *message->connection(), *context_.userIdentityCache, *context_.codeSigningMapping);
     VSAGrants grants = VSADeriveGrants(*entry, identity.get());
     // Command 31 may arrive while a frozen request holds what recording
     // entitlements waits for (the mapping's queue, the identifier locks).
-    if (identity && grants.admitted && command != kVSATestLockCommand) {
+    // A launched app's entitlements are read from the mapping, not presented.
+    if (identity && grants.admitted && command != kVSATestLockCommand &&
+        !identity->isLaunchedApp()) {
       VSAResultCode registered = context_.codeSigningMapping->processCallerRegisteredEntitlements(
           identity->entitlements(), identity->bundleIdentifier(), commandQueue.get());
       if (registered != VSAResult::kSuccess)

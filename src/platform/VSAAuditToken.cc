@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cstdio>
@@ -22,29 +23,59 @@ std::optional<VSAAuditToken> VSAAuditToken::fromSocket(int fd) {
   return t;
 }
 
-uint64_t VSAAuditToken::processStartTime(pid_t pid) {
-  if (pid <= 0) return 0;
+namespace {
+// Reads /proc/<pid>/<name> into `buf`; its length, or -1.
+ssize_t readProcFile(pid_t pid, const char* name, char* buf, size_t size) {
   char path[64];
-  std::snprintf(path, sizeof path, "/proc/%d/stat", pid);
+  std::snprintf(path, sizeof path, "/proc/%d/%s", pid, name);
   int fd = ::open(path, O_RDONLY | O_CLOEXEC);
-  if (fd < 0) return 0;
-  char buf[1024];
-  ssize_t n = ::read(fd, buf, sizeof buf - 1);
+  if (fd < 0) return -1;
+  ssize_t n = ::read(fd, buf, size - 1);
   ::close(fd);
-  if (n <= 0) return 0;
-  buf[n] = '\0';
+  if (n >= 0) buf[n] = '\0';
+  return n;
+}
+
+// The effective uid of the "Uid:" line of /proc/<pid>/status (the files'
+// owner is root for a process that changed its credentials).
+std::optional<uid_t> effectiveUID(pid_t pid) {
+  char buf[2048];
+  if (readProcFile(pid, "status", buf, sizeof buf) <= 0) return std::nullopt;
+  const char* line = std::strstr(buf, "\nUid:");
+  unsigned long real = 0, effective = 0;
+  if (!line || std::sscanf(line + 5, "%lu %lu", &real, &effective) != 2) return std::nullopt;
+  return static_cast<uid_t>(effective);
+}
+}  // namespace
+
+std::optional<VSAProcessStat> VSAAuditToken::processStat(pid_t pid, bool withUID) {
+  if (pid <= 0) return std::nullopt;
+  char buf[1024];
+  if (readProcFile(pid, "stat", buf, sizeof buf) <= 0) return std::nullopt;
   // The command name may hold spaces and parentheses: fields start after the last ')'.
   const char* p = std::strrchr(buf, ')');
-  if (!p) return 0;
+  if (!p) return std::nullopt;
   ++p;
-  // Field 3 (state) is the first after ')'; start time is field 22.
+  VSAProcessStat out;
+  // Field 3 (state) is the first after ')'; the parent is field 4, the start time 22.
   for (int field = 3; field <= 22; ++field) {
     while (*p == ' ') ++p;
-    if (!*p) return 0;
-    if (field == 22) return std::strtoull(p, nullptr, 10);
+    if (!*p) return std::nullopt;
+    if (field == 4) out.parent = static_cast<pid_t>(std::strtol(p, nullptr, 10));
+    if (field == 22) out.startTime = std::strtoull(p, nullptr, 10);
     while (*p && *p != ' ') ++p;
   }
-  return 0;
+  if (withUID) {
+    auto uid = effectiveUID(pid);
+    if (!uid) return std::nullopt;
+    out.uid = *uid;
+  }
+  return out;
+}
+
+uint64_t VSAAuditToken::processStartTime(pid_t pid) {
+  auto s = processStat(pid, false);
+  return s ? s->startTime : 0;
 }
 
 bool VSAAuditToken::isCurrent() const {

@@ -14,6 +14,13 @@
 #include <optional>
 #include <string>
 
+// What /proc says of a live process.
+struct VSAProcessStat {
+  pid_t parent = 0;
+  uint64_t startTime = 0;  // clock ticks since boot
+  uid_t uid = 0;           // effective user, when asked for
+};
+
 struct VSAAuditToken {
   pid_t pid = 0;
   uid_t uid = 0;
@@ -23,6 +30,8 @@ struct VSAAuditToken {
   static std::optional<VSAAuditToken> fromSocket(int fd);
   // The start time of a live process in clock ticks since boot; 0 if gone.
   static uint64_t processStartTime(pid_t pid);
+  // Parent and start time; the effective uid too when asked (one more read).
+  static std::optional<VSAProcessStat> processStat(pid_t pid, bool withUID);
   // The token still names the same, living process.
   bool isCurrent() const;
   std::array<uint8_t, 32> bytes() const;

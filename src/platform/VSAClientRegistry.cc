@@ -11,6 +11,7 @@
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
 #include "base/VSAPlist.h"
+#include "platform/VSAProcessRecords.h"
 #include "platform/VSAUserDatabase.h"
 
 VSAClientRegistry::VSAClientRegistry(VSASystemRoot root) : root_(std::move(root)) {}
@@ -160,6 +161,16 @@ std::optional<VSAClientRegistryEntry> VSAClientRegistry::entryForAuditToken(
 
 std::optional<VSAClientRegistryEntry> VSAClientRegistry::entryForPeer(
     const VSAAuditToken& token, const std::string& executable) {
+  if (auto launched = VSAProcessRecords(root_).readForProcessOrAncestor(
+          VSAProcessRecordKind::SigningIdentifier, token.pid, token.startTime)) {
+    VSAClientRegistryEntry entry;
+    entry.executable = executable;
+    entry.signingIdentifier = *launched;
+    entry.sandboxed = true;
+    entry.user = token.uid;
+    entry.launched = true;
+    return entry;
+  }
   auto entry = entryForExecutable(executable);
   if (!entry) return std::nullopt;
   if (entry->user != token.uid) {

@@ -17,6 +17,12 @@
 // program can act with its entitlements. That check is made when the entry is
 // loaded and again whenever it is matched. Such entries give no identity
 // rather than a wrong one. The directory is re-read when it changes.
+//
+// A process the launcher started as an app (a current signing-identifier
+// record, see VSAProcessRecords) is that app whatever program it runs: its
+// entry carries the recorded identifier, is sandboxed, and is marked
+// `launched`, so that its entitlements are the ones the code-signing
+// database holds for the identifier, not any registry file's.
 // Thread-safe.
 #pragma once
 
@@ -39,7 +45,8 @@ struct VSAClientRegistryEntry {
   VSAValue entitlements = VSAValue::dictionary();
   bool sandboxed = false;
   bool kernelBridge = false;
-  uid_t user = 0;  // the uid the peer must have: "User", root when none is named
+  uid_t user = 0;         // the uid the peer must have: "User", root when none is named
+  bool launched = false;  // from a launcher's record: entitlements come from the database
 };
 
 class VSAClientRegistry {

@@ -4,14 +4,13 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <cstdlib>
+
 #include "base/VSALog.h"
 #include "base/VSAPlist.h"
+#include "platform/VSAProcessRecords.h"
 
 namespace {
-// The largest process record read: "<start time> <persona id>" is at most
-// 20 + 1 + 10 digits and a newline; anything longer was not written by the
-// launcher.
-constexpr size_t kVSAProcessRecordMaxSize = 64;
 // How long a watched, kept persona list is used without a look at the file.
 constexpr auto kTrustWithoutLooking = std::chrono::seconds(1);
 
@@ -163,24 +162,17 @@ std::optional<std::vector<VSAPersonaAttributes>> VSALinuxPersonaService::readPer
 }
 
 std::string VSALinuxPersonaService::processRecordPath(pid_t pid) const {
-  return root_.resolve("/run/vessad/process-personas/" + std::to_string(pid));
+  return VSAProcessRecords(root_).path(VSAProcessRecordKind::Persona, pid);
 }
 
 std::optional<uint32_t> VSALinuxPersonaService::recordedPersonaID(pid_t pid,
                                                                   uint64_t startTime) const {
-  // A bounded, non-blocking read of a regular file whose owner is checked on
-  // the descriptor that was read, so the record read is the one checked and
-  // a FIFO or huge file in its place cannot stall the request.
-  std::vector<uint8_t> bytes;
-  struct stat st;
-  if (VSAReadRegularFile(processRecordPath(pid), kVSAProcessRecordMaxSize, &bytes, &st) != 0 ||
-      st.st_uid != 0 || bytes.empty())
+  auto value = VSAProcessRecords(root_).readForProcessOrAncestor(VSAProcessRecordKind::Persona, pid,
+                                                                 startTime);
+  if (!value || value->find_first_not_of("0123456789") != std::string::npos || value->size() > 10)
     return std::nullopt;
-  std::string text(bytes.begin(), bytes.end());
-  unsigned long long recordedStart = 0, persona = 0;
-  if (std::sscanf(text.c_str(), "%llu %llu", &recordedStart, &persona) != 2 ||
-      recordedStart != startTime || persona > UINT32_MAX)
-    return std::nullopt;
+  unsigned long long persona = std::strtoull(value->c_str(), nullptr, 10);
+  if (persona > UINT32_MAX) return std::nullopt;
   return static_cast<uint32_t>(persona);
 }
 

@@ -78,6 +78,15 @@ void VSATestDaemon::registerUpcallTool() {
              "com.tamsk.kernel.sandbox-bridge", VSAValue::dictionary(), false, true);
 }
 
+void VSATestDaemon::registerLaunchTool() {
+  fs::copy_file(VESSA_LAUNCH_PATH, root_ + "/usr/bin/vessa-launch",
+                fs::copy_options::overwrite_existing);
+  writeEntry(root_ + "/etc/vessad/clients.d/vessa-launch.plist", "/usr/bin/vessa-launch",
+             "com.tamsk.kernel.sandbox-bridge",
+             VSAValue::Dictionary{{"com.tamsk.private.Vessa.otherIdLookup", VSAValue(true)}}, false,
+             true);
+}
+
 void VSATestDaemon::registerSelfAsKernelBridge() {
   registerSelf("com.tamsk.kernel.sandbox-bridge", VSAValue::dictionary());
   writeEntry(root_ + "/etc/vessad/clients.d/e2e-tests.plist", "/usr/bin/e2e-tests",

@@ -60,6 +60,10 @@ class VSATestDaemon {
   // Installs vessa-upcall as /usr/bin/vessa-upcall, registered as the kernel
   // bridge; run it with vessactl("vessa-upcall", args).
   void registerUpcallTool();
+  // Installs vessa-launch as /usr/bin/vessa-launch, registered as the kernel
+  // bridge that may look up other identifiers' bundles, as provisioning does;
+  // run it with vessactl("vessa-launch", args).
+  void registerLaunchTool();
   std::string upcallSocketPath() const { return root_ + "/run/vessad/com.tamsk.vessad.upcall"; }
   // Registers a copy of vessactl installed as /usr/bin/<name>.
   void registerVessactl(const std::string& name, const std::string& signingIdentifier,
