@@ -1,7 +1,8 @@
 #!/usr/bin/env bash
 # Runs vessa-bench against a fresh demo device: provisions a system root,
 # registers vessa-bench as a full client and as the kernel bridge, starts
-# vessad, runs the six scenarios and stops the daemon.
+# vessad, runs the six scenarios and the app launch (vessa-launch, installed
+# by provisioning) and stops the daemon.
 #   scripts/vessa-bench.sh [DIR]
 set -euo pipefail
 cd "$(dirname "$0")/.."
@@ -39,6 +40,10 @@ echo "== Memory: ${CONTAINERS:-10000} containers cached, 100 idle connections, l
 "$bench" --root "$root" --mode memory --containers "${CONTAINERS:-10000}" --idle 100 \
   --clients 16 --requests "$(( ${SOAK:-100000} / 16 ))" ||
   echo "vessa-bench: the memory scenario had errors (see above)"
+echo
+echo "== App launch: vessa-launch of /bin/true against /bin/true started directly"
+"$build/bench/bench_launch" "$root" "$root/usr/bin/vessa-launch" "${LAUNCHES:-200}" ||
+  echo "vessa-bench: the launch scenario failed (see above)"
 # The daemon's peak memory over the whole run (for bench/run-all's table).
 peak=$(sed -n 's/^VmHWM:[[:space:]]*\([0-9]*\) kB/\1/p' "/proc/$daemon/status")
 echo
