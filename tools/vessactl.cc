@@ -121,7 +121,9 @@ void usage(FILE* out) {
                "          vessactl --root /tmp/demo Command=0 Identifier=com.example.app "
                "ContainerClass=2\n"
                "          vessactl --root /tmp/demo Command=12 Identifier=com.example.app "
-               "ContainerClass=2\n");
+               "ContainerClass=2\n"
+               "\nsee also: vessa-launch (start an app confined to its containers), vessa-upcall\n"
+               "(ask for a launching process's containers as the kernel does)\n");
 }
 
 bool parseTyped(const std::string& type, const std::string& text, VSAValue& out, std::string& why) {
