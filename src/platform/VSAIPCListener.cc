@@ -223,14 +223,19 @@ size_t VSAIPCListener::connectionCount() const {
 void VSAIPCListener::run() {
   pthread_setname_np(pthread_self(), "vessa-ipc");
   // Deadlines are checked by a periodic sweep, a fraction of the shortest one.
+  // Only while there is one: a peer (its frame or idle time-out) or paused
+  // accepting. Without, the thread sleeps until something arrives, so an idle
+  // daemon with no clients does not wake at all.
   auto interval =
       std::clamp<Clock::duration>(std::min(limits_.idleTimeout, limits_.frameTimeout) / 4,
                                   std::chrono::milliseconds(10), std::chrono::seconds(1));
   auto nextSweep = Clock::now() + interval;
   epoll_event events[64];
   for (;;) {
+    bool timed = acceptPaused_ || connectionCount() > 0;
     auto wait = std::chrono::ceil<std::chrono::milliseconds>(nextSweep - Clock::now()).count();
-    int n = epoll_wait(epollFd_, events, 64, static_cast<int>(std::max<int64_t>(wait, 0)));
+    int n =
+        epoll_wait(epollFd_, events, 64, timed ? static_cast<int>(std::max<int64_t>(wait, 0)) : -1);
     if (n < 0) {
       if (errno == EINTR) continue;
       VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin, "epoll_wait failed: %s",
@@ -280,7 +285,9 @@ void VSAIPCListener::run() {
       }
     }
     auto now = Clock::now();
-    if (now >= nextSweep) {
+    if (!timed) {
+      nextSweep = now + interval;  // the first deadline can only begin now
+    } else if (now >= nextSweep) {
       sweep(now);
       nextSweep = now + interval;
     }

@@ -13,6 +13,7 @@
 #include <chrono>
 #include <cstring>
 #include <filesystem>
+#include <fstream>
 #include <mutex>
 #include <thread>
 #include <vector>
@@ -152,6 +153,40 @@ class VSAIPCListenerLimitsTest : public ::testing::Test {
   std::mutex mutex_;
   std::vector<std::string> problems_;
 };
+
+// Voluntary context switches of this process's threads named `name`.
+long wakeUps(const char* name) {
+  long total = 0;
+  for (const auto& task : std::filesystem::directory_iterator("/proc/self/task")) {
+    std::ifstream comm(task.path() / "comm");
+    std::string threadName;
+    std::getline(comm, threadName);
+    if (threadName != name) continue;
+    std::ifstream status(task.path() / "status");
+    for (std::string line; std::getline(status, line);)
+      if (line.rfind("voluntary_ctxt_switches:", 0) == 0) total += std::stol(line.substr(24));
+  }
+  return total;
+}
+
+TEST_F(VSAIPCListenerLimitsTest, WithNoPeerTheListenerSleepsAndWithOneItsTimeOutsStillRun) {
+  VSAIPCListenerLimits limits;
+  limits.idleTimeout = 400ms;  // swept every 100 ms while a peer is there
+  start(limits);
+  std::this_thread::sleep_for(100ms);
+  long before = wakeUps("vessa-ipc");
+  std::this_thread::sleep_for(1500ms);
+  EXPECT_EQ(wakeUps("vessa-ipc") - before, 0) << "no client, no deadline: no wake-up";
+  int fd = connectRaw(path_);
+  ASSERT_GE(fd, 0);
+  EXPECT_TRUE(closedWithin(fd, 3000ms)) << "an idle peer is still dropped on time";
+  ::close(fd);
+  ASSERT_TRUE(waitForConnections(0, 1000ms));
+  std::this_thread::sleep_for(100ms);
+  before = wakeUps("vessa-ipc");
+  std::this_thread::sleep_for(1000ms);
+  EXPECT_EQ(wakeUps("vessa-ipc") - before, 0) << "asleep again once the peer is gone";
+}
 
 TEST_F(VSAIPCListenerLimitsTest, AClientThatNeverReadsDoesNotDelayOthers) {
   start();
