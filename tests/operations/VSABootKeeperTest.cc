@@ -2,7 +2,7 @@
 // orphaned class entries removed (and only they), system container
 // directories renamed after an upgrade, group reconciliation in multi-user
 // mode only, and an orphan scan that runs while a wipe replaces a container.
-// Log lines are read from a rotating log file the test opens.
+// Log lines are read from a rotating log file the test opens (VSATestLog).
 #include <gtest/gtest.h>
 
 #include <filesystem>
@@ -11,6 +11,7 @@
 
 #include "VSAContainerTestRoot.h"
 #include "VSAOldDevice.h"
+#include "VSATestLog.h"
 #include "base/VSALog.h"
 #include "base/VSATestLocks.h"
 #include "model/VSAPerUserConfiguration.h"
@@ -27,17 +28,9 @@ class Boot : public VSAContainerTestRoot {
  protected:
   void SetUp() override {
     VSAContainerTestRoot::SetUp();
-    log_ = root_ + "/test.log";
-    ASSERT_TRUE(VSALogger::shared().openRotatingLog(log_, 7));
-    VSALogger::shared().enableDiskLogging(7, 64u << 20);
+    ASSERT_TRUE(log_.open(root_ + "/test.log"));
   }
-  void TearDown() override { VSALogger::shared().closeRotatingLog(); }
-  std::string logText() {
-    VSALogger::shared().flush();
-    std::ifstream in(log_);
-    return std::string(std::istreambuf_iterator<char>(in), {});
-  }
-  bool logged(const std::string& text) { return logText().find(text) != std::string::npos; }
+  bool logged(const std::string& text) { return log_.contains(text); }
   VSABootKeeper keeper() { return VSABootKeeper(*context_->operationServices); }
   void rebootSetup() { keeper().rebootKeeperSetup(installer()->grants()); }
   void rebootCleanup() {
@@ -60,7 +53,7 @@ class Boot : public VSAContainerTestRoot {
     VSA_writeToURL(device, root_ + "/etc/vessad/device.plist", 0, nullptr);
     startContext();
   }
-  std::string log_;
+  VSATestLog log_;
 };
 
 TEST_F(Boot, BackedUpSystemContainersReplaceLiveItemsAndTheBackupGoes) {
