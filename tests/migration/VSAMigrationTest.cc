@@ -275,6 +275,22 @@ TEST_F(Migration, ClearingFailuresCarryTheirOwnResultCodeAndOddCachedValuesAreCl
   EXPECT_FALSE(info("com.example.odd", 1, kVSACachedCodeSigningInfoKey));
 }
 
+TEST_F(Migration, TheDataMigrationAnswersTheCodeOfTheStepThatFailed) {
+  VSAResultCode code = VSAResult::kSuccess;
+  ASSERT_TRUE(create(*installer(), "com.example.sys", &code, false, 12)) << code;
+  // Without the "systemusers" group no system container ACL can be made;
+  // the bundle ownership step after it still succeeds.
+  std::ofstream(root_ + "/etc/group") << "mobile:x:501:\n";
+  startContext();
+  VSACommandQueue queue;
+  code = VSAResult::kSuccess;
+  EXPECT_FALSE(context_->containerMigrator->performDataMigratorMigrationForClientConnection(
+      VSAMigrationClient{}, queue, &code));
+  EXPECT_EQ(code, VSAResult::kACLFailed);
+  EXPECT_FALSE(status()->hasMigrationOccurredForType("ACLMigration"));
+  EXPECT_TRUE(status()->hasMigrationOccurredForType("BundleMigration"));
+}
+
 TEST_F(Migration, MultiUserModeSkipsTheGroupIdMigrationAndReconciliation) {
   fs::create_directories(root_ + "/etc/vessad");
   VSA_writeToURL(VSAValue::Dictionary{{"MultiUserFlags", VSAValue(uint64_t{0x80000000u})}},
