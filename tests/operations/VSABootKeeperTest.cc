@@ -14,6 +14,7 @@
 #include "VSATestLog.h"
 #include "base/VSALog.h"
 #include "base/VSATestLocks.h"
+#include "migration/VSAMigrationStatus.h"
 #include "model/VSAPerUserConfiguration.h"
 #include "operations/VSABootKeeper.h"
 #include "operations/VSADeathRow.h"
@@ -275,6 +276,22 @@ TEST_F(Boot, AnUpgradeRenamesSystemContainersExceptWellKnownAndAnalytics) {
   EXPECT_EQ(find(kVSAAnalyticsSystemGroupIdentifier, 13)->url(), analytics->url());
   installer()->rebootKeeperSetup();  // same build: nothing moves
   EXPECT_EQ(find("com.example.sys", 12)->url(), moved->url());
+}
+
+TEST_F(Boot, AnUpgradeOfADeviceWithoutSystemContainersRecordsTheACLMigration) {
+  auto systemBase = [&](VSAContainerClass c) {
+    return *context_->globalConfiguration->globalContainerBaseURLWithContentClass(c, false);
+  };
+  ASSERT_FALSE(fs::exists(systemBase(12)));
+  ASSERT_FALSE(fs::exists(systemBase(13)));
+  VSAOldDevice::writeSystemVersion(root_, "B1");
+  installer()->rebootKeeperSetup();
+  EXPECT_TRUE(logged("No system containers requiring ACL migration"));
+  auto status = VSAMigrationStatus::initForSystemMigration(
+      *context_->globalConfiguration, root_ + "/etc/vessad/system-version.plist");
+  ASSERT_TRUE(status);
+  EXPECT_TRUE(status->hasMigrationOccurredForType("ACLMigration"));
+  EXPECT_FALSE(status->isBuildUpgrade());
 }
 
 TEST_F(Boot, GroupsAreReconciledAtBootOnlyInMultiUserMode) {
