@@ -106,6 +106,30 @@ TEST_F(Boot, BackedUpSystemContainersReplaceLiveItemsAndTheBackupGoes) {
   EXPECT_TRUE(logged("Not restoring"));
 }
 
+TEST_F(Boot, InternalBuildsKeepARestoredBackupWithoutRestoringItAgain) {
+  deviceFlags(VSAValue::Dictionary{{"HasInternalContent", VSAValue(true)}});
+  std::string backup = perUser()->systemContainerBackupDirectory();
+  fs::create_directories(backup + "/com.example.sys");
+  put(backup + "/com.example.sys/shared.txt", "backup");
+  rebootSetup();
+  auto restored = lookup("com.example.sys", 12);
+  ASSERT_TRUE(restored);
+  EXPECT_EQ(read(restored->url() + "/shared.txt"), "backup");
+  EXPECT_TRUE(fs::is_directory(library() + "/Data.inprogress"));  // kept for inspection
+  // Deleted afterwards, it stays deleted at the next boot.
+  ASSERT_EQ(stage({identity("com.example.sys", 12)}), VSAResult::kSuccess);
+  rebootSetup();
+  EXPECT_FALSE(lookup("com.example.sys", 12));
+  EXPECT_FALSE(logged("Resuming the interrupted restore"));
+  // A new backup is restored as ever.
+  fs::create_directories(backup + "/com.example.sys");
+  put(backup + "/com.example.sys/shared.txt", "newer");
+  rebootSetup();
+  restored = lookup("com.example.sys", 12);
+  ASSERT_TRUE(restored);
+  EXPECT_EQ(read(restored->url() + "/shared.txt"), "newer");
+}
+
 // Puts the user's own directory in the backup's place the moment the daemon
 // moves the backup: what the user can do while the daemon is between
 // checking the backup and moving it, made deterministic.
