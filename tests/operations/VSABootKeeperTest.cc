@@ -288,6 +288,7 @@ TEST_F(Boot, AnUpgradeRenamesSystemContainersExceptWellKnownAndAnalytics) {
   installer()->rebootKeeperSetup();  // records B1
   VSAOldDevice::writeSystemVersion(root_, "B2");
   installer()->rebootKeeperSetup();
+  EXPECT_TRUE(logged("Rolling system container directory UUIDs on disk"));
   auto find = [&](const char* id, VSAContainerClass c) {
     return installer()->createOrLookupContainerWithContainerIdentity(identity(id, c), false, false,
                                                                      true, &code);
