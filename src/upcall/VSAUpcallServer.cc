@@ -250,7 +250,8 @@ VSAUpcallServer::Outcome VSAUpcallServer::demux_server(const VSAUpcallRequest& r
     VSALogIn(VSALogCategory::Upcall, kVSALogDebug, "demux_server",
              "handling incomming request for vessa_core server");
     if (request.id == kVSAUpcallGetProcessContainersID) {
-      code = server_get_process_containers(request, memory, memorySize, &outcome.buffer);
+      code = server_get_process_containers(request, memory, memorySize, &outcome.buffer,
+                                           &outcome.memory);
       outcome.handled = true;
     }
   }
@@ -263,7 +264,8 @@ VSAUpcallServer::Outcome VSAUpcallServer::demux_server(const VSAUpcallRequest& r
 
 int32_t VSAUpcallServer::server_get_process_containers(const VSAUpcallRequest& request,
                                                        const uint8_t* memory, size_t memorySize,
-                                                       std::vector<uint8_t>* replyBuffer) {
+                                                       std::vector<uint8_t>* replyBuffer,
+                                                       VSAUniqueFd* replyMemory) {
   if (int32_t invalid = request.validate(memorySize)) return invalid;
   if (memorySize > kVSAUpcallMaxRequestSize) return kVSAUpcallTypeError;
   if (request.senderPID() != 0) {
@@ -297,6 +299,7 @@ int32_t VSAUpcallServer::server_get_process_containers(const VSAUpcallRequest& r
   run.packReply(out);
   const auto* bytes = static_cast<const uint8_t*>(sb_packbuff_get_bytes(out));
   replyBuffer->assign(bytes, bytes + sb_packbuff_get_size(out));
+  if (environment_.copyReplyMemory) *replyMemory = environment_.copyReplyMemory(*replyBuffer);
   sb_packbuff_free(out);
   return kVSAUpcallSuccess;
 }
