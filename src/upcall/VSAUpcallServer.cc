@@ -5,6 +5,7 @@
 #include <map>
 
 #include "base/VSALog.h"
+#include "base/VSAValue.h"
 #include "upcall/VSAPackBuffer.h"
 
 namespace {
@@ -91,6 +92,13 @@ int32_t readRequest(sb_packbuff* in, ProcessRequest* r) {
     }
   }
   return kVSAUpcallSuccess;
+}
+
+// Identifier -> path, as the debug lines show a set of containers.
+VSAValue pathsByIdentifier(const std::vector<std::pair<std::string, std::string>>& paths) {
+  VSAValue::Dictionary d;
+  for (const auto& [id, path] : paths) d[id] = VSAValue(path);
+  return VSAValue(std::move(d));
 }
 
 bool isDataClass(VSAContainerClass c) {
@@ -191,7 +199,12 @@ struct ContainerRun {
       logUpcall(kVSALogDebug, "UPCALL-Containers for %@(%u):", request.codeSignatureID.value_or(""),
                 request.uid);
       logUpcall(kVSALogDebug, "dataContainerURL: %@", dataContainer.value_or("(null)"));
+      logUpcall(kVSALogDebug, "tempContainerURL: %@",
+                dataContainer ? *dataContainer + "/tmp" : std::string("(null)"));
       logUpcall(kVSALogDebug, "homeDirURL: %@", home);
+      logUpcall(kVSALogDebug, "groupURLs: %@", pathsByIdentifier(groupPaths));
+      logUpcall(kVSALogDebug, "systemContainerURL: %@", systemContainer.value_or("(null)"));
+      logUpcall(kVSALogDebug, "systemGroupURLs: %@", pathsByIdentifier(systemGroupPaths));
     }
     pack(out, VS_KERN_REPLY_HOME_DIR_PATH, home);
     if (dataContainer) {
@@ -299,7 +312,22 @@ int32_t VSAUpcallServer::server_get_process_containers(const VSAUpcallRequest& r
   run.packReply(out);
   const auto* bytes = static_cast<const uint8_t*>(sb_packbuff_get_bytes(out));
   replyBuffer->assign(bytes, bytes + sb_packbuff_get_size(out));
-  if (environment_.copyReplyMemory) *replyMemory = environment_.copyReplyMemory(*replyBuffer);
+  if (environment_.copyReplyMemory) {
+    // The kernel takes over a copy of the reply; without one it is told
+    // that no reply memory came (a descriptor of size 0).
+    errno = 0;
+    *replyMemory = environment_.copyReplyMemory(*replyBuffer);
+    int copyError = errno;
+    if (*replyMemory) {
+      logUpcall(kVSALogDebug, "packbuff bytes: %p, reply bytes: %p, reply size: %u",
+                static_cast<const void*>(bytes), static_cast<const void*>(replyBuffer->data()),
+                static_cast<unsigned>(replyBuffer->size()));
+    } else {
+      logUpcall(kVSALogError, "vm_read(%p, %lu) fails: %d", static_cast<const void*>(bytes),
+                static_cast<unsigned long>(replyBuffer->size()), copyError);
+      replyBuffer->clear();
+    }
+  }
   sb_packbuff_free(out);
   return kVSAUpcallSuccess;
 }
