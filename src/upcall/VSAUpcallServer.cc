@@ -46,7 +46,12 @@ int32_t readRequest(sb_packbuff* in, ProcessRequest* r) {
         type == VS_KERN_REQUEST_PERSONA_ID) {
       uint32_t v = sb_packbuff_unpack_uint32(in, &error);
       if (error) {
-        logUpcall(kVSALogError, "failed: to unpack uint32 for %s. error: %d", itemName(type),
+        logUpcall(kVSALogError,
+                  type == VS_KERN_REQUEST_UID
+                      ? "failed: to unpack uint32 for VS_KERN_REQUEST_UID. error: %d"
+                  : type == VS_KERN_REQUEST_CONTAINER_TYPE
+                      ? "failed: to unpack uint32 for VS_KERN_REQUEST_CONTAINER_TYPE. error: %d"
+                      : "failed: to unpack uint32 for VS_KERN_REQUEST_PERSONA_ID. error: %d",
                   error);
         return kVSAUpcallFailure;
       }
@@ -114,12 +119,12 @@ struct ContainerRun {
   std::optional<std::string> dataContainer{}, systemContainer{};
   std::vector<std::pair<std::string, std::string>> groupPaths{}, systemGroupPaths{};
 
-  std::optional<std::string> make(const std::string& id, VSAContainerClass c, const char* what) {
+  // `failure`: the line logged with the result code when the container cannot be had.
+  std::optional<std::string> make(const std::string& id, VSAContainerClass c, const char* failure) {
     uint64_t code = 1;
     auto path = env.createOrLookup(user, id, c, &code);
     if (!path) {
-      logUpcall(kVSALogError, "%s Failed with error: %llu", what,
-                static_cast<unsigned long long>(code));
+      logUpcall(kVSALogError, failure, static_cast<unsigned long long>(code));
       success = false;
     }
     return path;
@@ -157,17 +162,20 @@ struct ContainerRun {
     if (id) {
       VSAContainerClass c = dataClass(*id);
       checkUID(c);
-      dataContainer = make(*id, c, "createOrLookupContainerForUser:");
+      dataContainer = make(*id, c, "createOrLookupContainerForUser: Failed with error: %llu");
     }
     if (request.systemContainerID)
       systemContainer =
-          make(*request.systemContainerID, 12, "createOrLookupContainerForUser:(system container)");
+          make(*request.systemContainerID, 12,
+               "createOrLookupContainerForUser:(system container) Failed with error: %llu");
     if (!request.groups.empty()) checkUID(7);
     for (const auto& g : request.groups)
-      if (auto path = make(g, 7, "createOrLookupGroupContainersForUser:"))
+      if (auto path = make(g, 7, "createOrLookupGroupContainersForUser: Failed with error: %llu"))
         groupPaths.emplace_back(g, *path);
     for (const auto& g : request.systemGroups)
-      if (auto path = make(g, 13, "createOrLookupContainerForUser:(system group container)"))
+      if (auto path = make(
+              g, 13,
+              "createOrLookupContainerForUser:(system group container) Failed with error: %llu"))
         systemGroupPaths.emplace_back(g, *path);
   }
 

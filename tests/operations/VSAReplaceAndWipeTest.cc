@@ -275,7 +275,17 @@ TEST_F(ReplaceAndWipe, RecoveryActsOnlyOnValidReplaceFilesWhoseOldDirectoryIsGon
   write("6.plist", VSAValue::array());
   put(replaceDirectory() + "/7.plist", "not a property list");
 
+  VSATestLog log;
+  ASSERT_TRUE(log.open(root_ + "/test.log"));
   installer()->keeperSetup();
+  // Each valid file is shown with its dictionary of the four places.
+  std::string shown = log.text();
+  size_t line = shown.find("Doing a replace of " + replaceDirectory() + "/1.plist with info: ");
+  ASSERT_NE(line, std::string::npos) << shown;
+  std::string info = shown.substr(line, shown.find("Recovering from failed replace", line) - line);
+  for (const char* key : {kVSAReplaceOperationOldURL, kVSAReplaceOperationNewURL,
+                          kVSAReplaceOperationStagingURL, kVSAReplaceOperationDestURL})
+    EXPECT_NE(info.find(key), std::string::npos) << key;
   EXPECT_EQ(read(base + "/old-missing-a/marker"), "a");
   EXPECT_FALSE(fs::exists(base + "/staging-a"));
   EXPECT_TRUE(fs::exists(base + "/staging-b"));
