@@ -42,6 +42,7 @@
 #include "base/VSAPlist.h"
 #include "base/VSAUUID.h"
 #include "base/VSAWorkQueue.h"
+#include "platform/VSADescriptorPassing.h"
 #include "platform/VSAIPCClient.h"
 #include "platform/VSAIPCListener.h"
 #include "platform/VSALinuxFileSystem.h"
@@ -235,9 +236,12 @@ Result runUpcallEcho(const Options& o) {
   if (!mkdtemp(dir.data())) return {};
   VSAUpcallListener echo(dir + "/echo", nullptr, 1u << 20);
   VSAErrorRef error;
-  if (!echo.start([](VSAUpcallPacket packet,
-                     VSAUpcallListener::Reply reply) { reply(packet.message, &packet.memory); },
-                  &error))
+  if (!echo.start(
+          [](VSAUpcallPacket packet, VSAUpcallListener::Reply reply) {
+            reply(packet.message,
+                  VSAUniqueFd(VSAMemfdWithBytes("vessa-bench-echo", packet.memory, true)));
+          },
+          &error))
     return {};
   Result r = runUpcalls(dir + "/echo", o, false);
   echo.stop();

@@ -100,9 +100,12 @@ class VSACodeSigningMapping {
   // True when there was nothing to do or everything moved.
   bool migrateDataFromLegacyEntitlementsFileToCodeSigningFile();
   // Adds `entry` for `identifier` unless the database holds one that is
-  // valid (`*kept` set then). The caller logs; false on a database failure.
+  // valid (`*kept` set then). `beforeWrite`, when given, runs once the entry
+  // is to be written and before the write (the caller's progress line). The
+  // caller logs the rest; false on a database failure.
   bool addLegacyEntryUnlessValid(const std::string& identifier, const VSACodeSigningEntry& entry,
-                                 bool* kept, VSAErrorRef* error);
+                                 bool* kept, VSAErrorRef* error,
+                                 const std::function<void()>& beforeWrite = {});
 
   // Group identifiers from an entitlements dictionary (string or array of
   // strings; duplicates removed); nothing for other shapes (logged).
@@ -122,7 +125,8 @@ class VSACodeSigningMapping {
   bool _onQueue_migrateDataFromLegacyEntitlementsFileToCodeSigningFile();
   bool _onQueue_addLegacyEntryUnlessValid(const std::string& identifier,
                                           const VSACodeSigningEntry& entry, bool* kept,
-                                          VSAErrorRef* error);
+                                          VSAErrorRef* error,
+                                          const std::function<void()>& beforeWrite);
   VSAResultCode _onQueue_processCodeSigningInfo(const std::optional<VSAValue>& info,
                                                 const std::string& identifier,
                                                 const VSAValue& options,

@@ -36,13 +36,16 @@ std::optional<std::vector<std::string>> childrenFor(const VSAValue* dict,
 
 bool VSACodeSigningMapping::addLegacyEntryUnlessValid(const std::string& identifier,
                                                       const VSACodeSigningEntry& entry, bool* kept,
-                                                      VSAErrorRef* error) {
-  return sync([&] { return _onQueue_addLegacyEntryUnlessValid(identifier, entry, kept, error); });
+                                                      VSAErrorRef* error,
+                                                      const std::function<void()>& beforeWrite) {
+  return sync([&] {
+    return _onQueue_addLegacyEntryUnlessValid(identifier, entry, kept, error, beforeWrite);
+  });
 }
 
-bool VSACodeSigningMapping::_onQueue_addLegacyEntryUnlessValid(const std::string& identifier,
-                                                               const VSACodeSigningEntry& entry,
-                                                               bool* kept, VSAErrorRef* error) {
+bool VSACodeSigningMapping::_onQueue_addLegacyEntryUnlessValid(
+    const std::string& identifier, const VSACodeSigningEntry& entry, bool* kept, VSAErrorRef* error,
+    const std::function<void()>& beforeWrite) {
   VSAErrorRef readError;
   auto current = _onQueue_entry(identifier, &readError);
   if (readError) {
@@ -51,6 +54,7 @@ bool VSACodeSigningMapping::_onQueue_addLegacyEntryUnlessValid(const std::string
   }
   *kept = current && !current->isInvalid();
   if (*kept) return true;
+  if (beforeWrite) beforeWrite();
   return codeSigningMappingDB_->addCodeSigningEntry(&entry, &identifier, error);
 }
 
@@ -84,7 +88,9 @@ bool VSACodeSigningMapping::_onQueue_migrateDataFromLegacyEntitlementsFileToCode
     entry.setRegisteredByCaller(flagFor(&byCaller, identifier));
     bool kept = false;
     VSAErrorRef addError;
-    if (!_onQueue_addLegacyEntryUnlessValid(identifier, entry, &kept, &addError)) {
+    if (!_onQueue_addLegacyEntryUnlessValid(identifier, entry, &kept, &addError, [&] {
+          logLegacy(kVSALogNotice, origin, "Migrating legacy entitlements for %@", identifier);
+        })) {
       logLegacy(kVSALogError, origin, "Failed to write migrated legacy info to DB for %@ : %@",
                 identifier, addError);
       everyIdentifierStored = false;
@@ -92,8 +98,6 @@ bool VSACodeSigningMapping::_onQueue_migrateDataFromLegacyEntitlementsFileToCode
       logLegacy(kVSALogNotice, origin,
                 "Already have code signing info for %@.  No need to migrate legacy entitlements.",
                 identifier);
-    } else {
-      logLegacy(kVSALogNotice, origin, "Migrating legacy entitlements for %@", identifier);
     }
   }
   // A file whose identifiers are not all stored stays for the next run.

@@ -6,6 +6,7 @@
 namespace {
 constexpr const char* kGroupIdMigration = "GroupIdMigration";
 constexpr const char* kCodeSigningMigration = "CodeSigningMigration";
+constexpr VSAResultCode kCacheAddFailed = 45;
 
 template <typename... A>
 void logMigration(int level, const char* origin, const char* format, const A&... args) {
@@ -65,17 +66,23 @@ std::optional<std::vector<VSAConstMetadataRef>> VSACodeSigningMigration::contain
   return containerCache_->allContainersForUserIdentity(user, c, false, false, error);
 }
 
-bool VSACodeSigningMigration::clearInfoValue(const VSAMetadata& container, const char* key) {
+VSAResultCode VSACodeSigningMigration::clearInfoValue(const VSAMetadata& container,
+                                                      const char* key) {
   VSAErrorRef error;
   auto fresh = VSAMetadata::rereadMetadataOfCachedContainer(container, *configuration_,
                                                             *userIdentityCache_, &error);
-  if (!fresh) return false;
+  if (!fresh)
+    return error ? error->resultCode(VSAResult::kMetadataUnreadable)
+                 : VSAResult::kMetadataUnreadable;
   VSAValue info =
       fresh->info() && fresh->info()->isDictionary() ? *fresh->info() : VSAValue::dictionary();
   info.remove(key);
   fresh->setInfo(std::move(info));
-  return fresh->writeMetadataToDiskWithError(*configuration_, &error) &&
-         containerCache_->addContainerMetadata(*fresh, fresh->url(), false, true, &error);
+  if (!fresh->writeMetadataToDiskWithError(*configuration_, &error))
+    return error ? error->resultCode(VSAResult::kWriteFailed) : VSAResult::kWriteFailed;
+  if (!containerCache_->addContainerMetadata(*fresh, fresh->url(), false, true, &error))
+    return kCacheAddFailed;
+  return VSAResult::kSuccess;
 }
 
 bool VSACodeSigningMigration::migrateAppGroupIdsFromDataContainersToFile() {
@@ -114,17 +121,19 @@ bool VSACodeSigningMigration::migrateAppGroupIdsFromDataContainersToFile() {
         logMigration(
             kVSALogNotice, origin,
             "Deleting app group entitlements for %@ because we already have them in mapping", id);
-      } else if (!mapping_->addLegacyEntryUnlessValid(id, entry, &kept, &addError)) {
+      } else if (!mapping_->addLegacyEntryUnlessValid(id, entry, &kept, &addError, [&] {
+                   logMigration(kVSALogNotice, origin, "Migrating app group entitlements for %@",
+                                id);
+                 })) {
         logMigration(kVSALogError, origin,
                      "Failed to write migrated group id info to DB for %@ : %@", id, addError);
         ok = false;
         continue;  // the value stays for the next run
-      } else {
-        logMigration(kVSALogNotice, origin, "Migrating app group entitlements for %@", id);
       }
-      if (!clearInfoValue(*container, kVSAGroupContainerIDsKey)) {
+      VSAResultCode cleared = clearInfoValue(*container, kVSAGroupContainerIDsKey);
+      if (cleared != VSAResult::kSuccess) {
         logMigration(kVSALogError, origin, "Failed to clear group id metadata for %@ : %llu", id,
-                     VSAResult::kWriteFailed);
+                     cleared);
         ok = false;
       }
     }
@@ -150,35 +159,44 @@ bool VSACodeSigningMigration::migrateCachedCodeSigningInfoFromBundleContainersTo
     for (const auto& container : *list) {
       const VSAValue* cached =
           container->info() ? container->info()->get(kVSACachedCodeSigningInfoKey) : nullptr;
-      if (!cached || !cached->isDictionary()) continue;
+      if (!cached) continue;
       const std::string& id = container->identifier();
-      VSAValue info = *cached;
-      if (const VSAValue* entitlements = cached->get("Entitlements")) {
-        info.set(kVSAEntitlementsKey, *entitlements);
-        info.remove("Entitlements");
-      }
-      bool kept = false;
-      VSAErrorRef addError;
-      if (!mapping_->addLegacyEntryUnlessValid(
-              id, VSACodeSigningEntry(std::move(info), dataClassForBundleClass(c)), &kept,
-              &addError)) {
-        logMigration(kVSALogError, origin,
-                     "Failed to write migrated cached cs info from bundle container to DB for %@ "
-                     ": %@",
-                     id, addError);
-        ok = false;
-        continue;
-      }
-      if (kept)
+      // A value that is no dictionary describes no signature: nothing is
+      // stored for it, and it is cleared like any other.
+      if (cached->isDictionary()) {
+        VSAValue info = *cached;
+        if (const VSAValue* entitlements = cached->get("Entitlements")) {
+          info.set(kVSAEntitlementsKey, *entitlements);
+          info.remove("Entitlements");
+        }
+        bool kept = false;
+        VSAErrorRef addError;
+        if (!mapping_->addLegacyEntryUnlessValid(
+                id, VSACodeSigningEntry(std::move(info), dataClassForBundleClass(c)), &kept,
+                &addError, [&] {
+                  logMigration(kVSALogNotice, origin, "Migrating code signing info for %@", id);
+                })) {
+          logMigration(kVSALogError, origin,
+                       "Failed to write migrated cached cs info from bundle container to DB for "
+                       "%@ : %@",
+                       id, addError);
+          ok = false;
+          continue;
+        }
+        if (kept)
+          logMigration(kVSALogNotice, origin,
+                       "Deleting cached code signing info for %@ because we already have it in "
+                       "mapping",
+                       id);
+      } else {
         logMigration(kVSALogNotice, origin,
-                     "Deleting cached code signing info for %@ because we already have it in "
-                     "mapping",
-                     id);
-      else
-        logMigration(kVSALogNotice, origin, "Migrating code signing info for %@", id);
-      if (!clearInfoValue(*container, kVSACachedCodeSigningInfoKey)) {
+                     "Clearing cached code signing info of %@ that is not a dictionary: %@", id,
+                     *cached);
+      }
+      VSAResultCode cleared = clearInfoValue(*container, kVSACachedCodeSigningInfoKey);
+      if (cleared != VSAResult::kSuccess) {
         logMigration(kVSALogError, origin, "Error setting info value for identity %@ : %llu",
-                     container->containerIdentity()->description(), VSAResult::kWriteFailed);
+                     container->containerIdentity()->description(), cleared);
         ok = false;
       }
     }

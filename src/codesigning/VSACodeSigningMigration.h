@@ -52,8 +52,9 @@ class VSACodeSigningMigration {
   bool migrateCachedCodeSigningInfoFromBundleContainersToMapping();
 
  private:
-  // Removes one info value from a container's metadata file (and its cache entry).
-  bool clearInfoValue(const VSAMetadata& container, const char* key);
+  // Removes one info value from a container's metadata file (and its cache
+  // entry); 1, or the result code of the step that failed.
+  VSAResultCode clearInfoValue(const VSAMetadata& container, const char* key);
   std::optional<std::vector<VSAConstMetadataRef>> containers(const VSAUserIdentityRef& user,
                                                              VSAContainerClass c,
                                                              VSAErrorRef* error);

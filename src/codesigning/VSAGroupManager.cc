@@ -42,7 +42,9 @@ VSAGroupManager::groupContainerIdentifiersForOwnerIdentifier(const VSAValue* own
     VSASetCode(withError, VSAResult::kInvalidArgument);
     return std::nullopt;
   }
-  VSAAllIdentifiersLockGuard lock(false, useLocking);
+  // Held for writing: the owner's groups are read while no container
+  // operation, reading or writing, is in flight.
+  VSAAllIdentifiersLockGuard lock(true, useLocking);
   try {
     const std::string& id = *owner->stringValue();
     auto ids = groupContainerClass == 13 ? mapping_->systemGroupIdentifiersForIdentifier(id)

@@ -43,7 +43,7 @@ class VSAGroupManager {
   // The group identifiers `owner` is entitled to: system groups
   // ("systemgroup." prefix) for class 13, application groups otherwise. An
   // owner without entitlements has none (an empty list). With `useLocking`
-  // the all-identifiers lock is held for reading meanwhile.
+  // the all-identifiers lock is held for writing meanwhile.
   std::optional<std::vector<std::string>> groupContainerIdentifiersForOwnerIdentifier(
       const VSAValue* owner, VSAContainerClass groupContainerClass, bool useLocking,
       VSAResultCode* withError);

@@ -140,6 +140,10 @@ void VSAClientConnection::performBuildUpgradeStepIfNeeded() {
       *context_.globalConfiguration,
       context_.systemRoot.resolve("/etc/vessad/system-version.plist"));
   if (!status || !status->isBuildUpgrade()) return;
+  // Whether the system class directories exist is asked before the renaming
+  // below lists (and so creates) them: a device that never had system
+  // containers needs no ACL migration.
+  context_.containerMigrator->_checkIfDeviceMayNeedSystemContainerACLMigration(*status);
   VSABootKeeper(services_)._regenerateAllSystemContainerPaths(grants_);
   VSAErrorRef error;
   if (!context_.containerMigrator->performSynchronousBuildUpgradeMigration(*status, &error))

@@ -53,7 +53,8 @@ int VSADaemon::run() {
   // instead of failing.
   upcallListener_ = VSAKernelUpcall::listenerFor(*context_);
   if (VSAErrorRef error; !upcallListener_->bind(&error))
-    VSALogIn(VSALogCategory::Upcall, kVSALogError, "main", "bootstrap_check_in: %@", error);
+    VSALogIn(VSALogCategory::Upcall, kVSALogError, "main", "bootstrap_check_in: %s",
+             error ? error->message() : std::string("unknown error"));
   context_->listenerQueue->async([this, initTransaction = std::move(initTransaction)]() mutable {
     initialize();
     initialized_ = true;

@@ -48,7 +48,8 @@ void VSAHandleReplaceContainer(const VSAValue& request, VSAValue&, VSAClientConn
   auto oldIdentity = args.namedContainerIdentity(
       {"OldIdentifier", "OldContainerClass", "OldContainerUUID", "OldPersonaUniqueString"});
   if (!oldIdentity) return;
-  auto newIdentity = args.concreteContainerIdentity(
+  // A new identity without its UUID is the replace's to refuse (code 11).
+  auto newIdentity = args.namedContainerIdentity(
       {"NewIdentifier", "NewContainerClass", "NewContainerUUID", "NewPersonaUniqueString"});
   if (!newIdentity) return;
   connection.replaceContainerIdentity(oldIdentity, newIdentity, false, true, result);

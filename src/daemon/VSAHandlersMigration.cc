@@ -7,7 +7,7 @@
 void VSAHandleDataMigration(const VSAValue&, VSAValue&, VSAClientConnection& connection,
                             VSAResultCode* result) {
   if (!connection.performDataMigratorMigrationForClientConnection(result))
-    VSALog(kVSALogError, "VSAHandleDataMigration", "Failed to perform data migration : %llu",
+    VSALog(kVSALogError, "VSAHandleDataMigration", "Failed to perform data migration : %@",
            *result);
 }
 
@@ -15,5 +15,5 @@ void VSAHandlePerUserDataMigration(const VSAValue&, VSAValue&, VSAClientConnecti
                                    VSAResultCode* result) {
   if (!connection.performPerUserDataMigrationForClientConnection(result))
     VSALog(kVSALogError, "VSAHandlePerUserDataMigration",
-           "Failed to perform per-user data migration : %llu", *result);
+           "Failed to perform per-user data migration : %@", *result);
 }

@@ -3,6 +3,7 @@
 #include "base/VSALog.h"
 #include "base/VSATestLocks.h"
 #include "daemon/VSAClientConnection.h"
+#include "platform/VSADescriptorPassing.h"
 
 VSAUpcallEnvironment VSAKernelUpcall::environmentFor(VSADaemonContext& context) {
   VSAUpcallEnvironment env;
@@ -31,6 +32,9 @@ VSAUpcallEnvironment VSAKernelUpcall::environmentFor(VSADaemonContext& context) 
       return std::nullopt;
     }
     return m->url();
+  };
+  env.copyReplyMemory = [](const std::vector<uint8_t>& bytes) {
+    return VSAUniqueFd(VSAMemfdWithBytes("vessa-upcall-reply", bytes, true));
   };
   return env;
 }
@@ -86,7 +90,5 @@ void VSAKernelUpcall::serve(VSAUpcallPacket packet, const VSAUpcallListener::Rep
                   packet.memory.size() == *packet.memorySize;
   uint64_t size = memoryOK ? *packet.memorySize : UINT64_MAX;
   auto outcome = server_.demux_server(request, packet.memory.data(), size);
-  const std::vector<uint8_t>* memory =
-      outcome.reply.returnCode == kVSAUpcallSuccess ? &outcome.buffer : nullptr;
-  reply(outcome.reply.bytes(), memory);
+  reply(outcome.reply.bytes(), std::move(outcome.memory));
 }

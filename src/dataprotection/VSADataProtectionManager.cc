@@ -338,8 +338,10 @@ void VSADataProtectionManager::recordProtectionClass(const VSAMetadataRef& metad
       *metadata, *env_->configuration, *env_->userIdentityCache, &readError);
   if (!current) {
     VSALog(kVSALogError, "_startDataProtectionChangeOperation",
-           "Failed to set protection class info for %@ at %@ to %d : %@", metadata->identifier(),
-           metadata->url(), protectionClass, readError);
+           "Failed to set protection class info for %@ at %@ to %d : %llu", metadata->identifier(),
+           metadata->url(), protectionClass,
+           readError ? readError->resultCode(VSAResult::kMetadataUnreadable)
+                     : VSAResult::kMetadataUnreadable);
     return;
   }
   auto updated = std::make_shared<VSAMetadata>(*current);

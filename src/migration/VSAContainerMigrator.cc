@@ -237,22 +237,27 @@ bool VSAContainerMigrator::performDataMigratorMigrationForClientConnection(
     logMigrator(kVSALogNotice, origin, "Performing Data Migration on %@",
                 status->currentBuildVersion());
     bool ok = true;
+    // The error of the step that failed (the later one when both did) is
+    // what the client is answered with.
+    VSAErrorRef failure;
     VSAErrorRef error;
     if (!_performInternalACLMigrationWithError(*status, &error)) {
       logMigrator(kVSALogError, origin, "Failed to migrate ACLs on system containers : %@", error);
+      failure = error;
       ok = false;
     }
     error = nullptr;
     if (!_performBundleContainerOwnershipMigrationWithError(*status, &error)) {
       logMigrator(kVSALogError, origin,
                   "Failed to migrate bundle containers to system location : %@", error);
+      failure = error;
       ok = false;
     }
     if (hooks_.codeSigningMigration && !hooks_.codeSigningMigration(commandQueue, *status))
       ok = false;
     if (!ok)
       VSASetCode(withError,
-                 error ? error->resultCode(VSAResult::kWriteFailed) : VSAResult::kWriteFailed);
+                 failure ? failure->resultCode(VSAResult::kWriteFailed) : VSAResult::kWriteFailed);
     return ok;
   });
 }

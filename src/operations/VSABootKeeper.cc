@@ -29,6 +29,8 @@ void VSABootKeeper::rebootKeeperSetup(const VSAOperationGrants& grants) {
 
 void VSABootKeeper::_regenerateAllSystemContainerPaths(const VSAOperationGrants& grants) {
   const char* origin = "_regenerateAllSystemContainerPaths";
+  VSALogIn(VSALogCategory::Startup, kVSALogNotice, origin,
+           "Rolling system container directory UUIDs on disk");
   VSAContainerMaintenance maintenance(services_);
   for (VSAContainerClass c : {12, 13}) {
     VSAErrorRef error;

@@ -301,9 +301,12 @@ bool VSAReplaceOperation::_recoverFromReplaceOperationsWithError(VSAErrorRef* er
   for (const auto& item : *items) {
     auto info = VSAReplaceFile::_readAndValidateReplaceFileAtUrl(fm, item.path, nullptr);
     if (info) {
-      VSALog(kVSALogDebug, fn,
-             "Doing a replace of %@ with info: old %@, new %@, staging %@, dest %@", item.path,
-             info->oldURL, info->newURL, info->stagingURL, info->destURL);
+      VSAValue shown =
+          VSAValue::Dictionary{{kVSAReplaceOperationOldURL, VSAValue(info->oldURL)},
+                               {kVSAReplaceOperationNewURL, VSAValue(info->newURL)},
+                               {kVSAReplaceOperationStagingURL, VSAValue(info->stagingURL)},
+                               {kVSAReplaceOperationDestURL, VSAValue(info->destURL)}};
+      VSALog(kVSALogDebug, fn, "Doing a replace of %@ with info: %@", item.path, shown);
       if (!fm.itemExistsAtURL(info->oldURL) && !fm.itemExistsAtURL(info->stagingURL)) {
         VSALog(kVSALogError, fn, "Nothing to recover: neither %@ nor %@ exists", info->oldURL,
                info->stagingURL);

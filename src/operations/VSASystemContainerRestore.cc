@@ -35,10 +35,12 @@ void VSASystemContainerRestore::moveSystemContainersIntoPlace() {
   if (systemMoved) {
     logRestore(kVSALogNotice, kOrigin, "Installing system containers");
     installAll(system, 12, "Couldn't find any system containers at %@: %@");
+    markRestored(system);
   }
   if (groupMoved) {
     logRestore(kVSALogNotice, kOrigin, "Installing system group containers");
     installAll(group, 13, "Couldn't find any system shared containers at %@: %@");
+    markRestored(group);
   }
   if (services_.configuration->isInternalImage()) return;  // kept for inspection
   for (const std::string& base : {perUser->systemContainerBackupBaseDirectory(), *holding}) {
@@ -67,15 +69,24 @@ bool VSASystemContainerRestore::moveToInProgress(const std::string& backup,
                                                  const char* moveFailure) {
   auto& fm = *services_.fileManager;
   struct stat st {};
+  std::string restored = restoredMarker(inProgress);
   if (fm.fileSystem().lstat(backup, &st) != 0) {
     // A restore a crash interrupted: its in-progress directory is all that
-    // is left of the backup, so it is restored rather than thrown away.
-    if (fm.fileSystem().lstat(inProgress, &st) != 0 || !acceptBackup(inProgress, inProgress))
+    // is left of the backup, so it is restored rather than thrown away. One
+    // that completed (kept by internal builds) is not restored again.
+    if (fm.fileSystem().lstat(inProgress, &st) != 0 || fm.fileSystem().lstat(restored, &st) == 0 ||
+        !acceptBackup(inProgress, inProgress))
       return false;
     logRestore(kVSALogNotice, kOrigin, "Resuming the interrupted restore of %@", inProgress);
     return true;
   }
   VSAErrorRef error;
+  // The marker goes first: a new backup in the in-progress directory must
+  // never pass for a completed restore.
+  if (!fm.removeItemAtURL(restored, &error)) {
+    logRestore(kVSALogError, kOrigin, "Failed to remove %@: %@", restored, error);
+    return false;
+  }
   if (!fm.removeItemAtURL(inProgress, &error))
     logRestore(kVSALogError, kOrigin, "Failed to remove existing inprogress system containers: %@",
                error);
@@ -116,6 +127,18 @@ bool VSASystemContainerRestore::acceptBackup(const std::string& inProgress,
     return false;
   }
   return true;
+}
+
+std::string VSASystemContainerRestore::restoredMarker(const std::string& inProgress) {
+  return inProgress + ".restored";
+}
+
+void VSASystemContainerRestore::markRestored(const std::string& inProgress) {
+  VSAErrorRef error;
+  if (!services_.fileManager->writeFileAtomicallyAtURL(restoredMarker(inProgress), {}, 0600,
+                                                       std::nullopt, &error))
+    logRestore(kVSALogError, kOrigin, "Failed to record the completed restore of %@: %@",
+               inProgress, error);
 }
 
 void VSASystemContainerRestore::installAll(const std::string& inProgress, VSAContainerClass c,

@@ -7,7 +7,9 @@
 // daemon's own "SystemContainerRestore" directory (root's, mode 0700) as
 // "Data.inprogress" or "Shared.inprogress" (an older in-progress copy, left
 // by a crash, is removed first; without a new backup, an in-progress
-// directory left by a crash is restored instead of being lost). Only there is
+// directory left by a crash is restored instead of being lost, while one
+// whose restore completed, marked "<inprogress>.restored", is left as it
+// is). Only there is
 // it checked: a backup that is not a directory owned by root and writable by
 // root only is not restored and is removed; an accepted one is given to root
 // whole. Then every entry is restored: the live container is created or
@@ -48,6 +50,11 @@ class VSASystemContainerRestore {
   // be restored; gives it to root when so, removes it when not.
   bool acceptBackup(const std::string& inProgress, const std::string& shownAs);
   void installAll(const std::string& inProgress, VSAContainerClass c, const char* listFailure);
+  // "<inProgress>.restored", written once every entry of `inProgress` was
+  // restored: an in-progress directory beside it is a completed restore
+  // (kept by internal builds), not one a crash interrupted.
+  static std::string restoredMarker(const std::string& inProgress);
+  void markRestored(const std::string& inProgress);
 
   const VSAOperationServices& services_;
   const VSAOperationGrants& grants_;

@@ -251,7 +251,7 @@ bool VSAFileManager::removeItemAtURL(const std::string& path, VSAErrorRef* error
 bool VSAFileManager::removeFileAtURL(const std::string& path, VSAErrorRef* error) {
   int rc = fs_->unlink(path);
   if (rc == 0 || rc == ENOENT) return true;
-  VSASetError(error, VSAFileManagerFail(rc, "removeFileAtURL", "unlink of %@ failed: %s", path,
+  VSASetError(error, VSAFileManagerFail(rc, "removeFileAtURL", "unlink of %s failed: %s", path,
                                         std::strerror(rc)));
   return false;
 }

@@ -65,14 +65,9 @@ struct VSAUpcallListener::Peer {
       if (memfd >= 0) ::close(memfd);
     if (fd >= 0) ::close(fd);
   }
-  void send(const std::vector<uint8_t>& message, const std::vector<uint8_t>* memory) {
-    int memfd = memory ? VSAMemfdWithBytes("vessa-upcall-reply", *memory, true) : -1;
-    if (memory && memfd < 0)
-      VSALogIn(VSALogCategory::Upcall, kVSALogError, kOrigin,
-               "Could not copy the reply buffer (%zu bytes): %s", memory->size(),
-               std::strerror(errno));
+  void send(const std::vector<uint8_t>& message, VSAUniqueFd memory) {
     std::lock_guard lock(outMutex);
-    out.emplace_back(message, memfd);
+    out.emplace_back(message, memory.release());
     // Behind replies already waiting, it waits too; the I/O thread writes
     // them out once the socket has room, so the kernel gets every answer.
     if (!_lock_flush()) waker->wake();
@@ -249,10 +244,9 @@ bool VSAUpcallListener::receive(const std::shared_ptr<Peer>& peer) {
   packet.auditToken = peer->token;
   packet.fromKernel = peer->kernel;
   ++peer->inFlight;
-  handler_(std::move(packet),
-           [peer](const std::vector<uint8_t>& message, const std::vector<uint8_t>* memory) {
-             peer->send(message, memory);
-           });
+  handler_(std::move(packet), [peer](const std::vector<uint8_t>& message, VSAUniqueFd memory) {
+    peer->send(message, std::move(memory));
+  });
   // Anyone but the kernel is answered once (with its refusal) and let go. A
   // listener without a registry (a bare transport, as a benchmark's echo
   // uses) tells no peers apart and keeps them all.

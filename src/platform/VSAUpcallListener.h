@@ -1,8 +1,8 @@
 // The kernel upcall's transport: a Unix SOCK_SEQPACKET socket
 // (`<root>/run/vessad/com.tamsk.vessad.upcall`, mode 0600). Each packet is
 // one request message; its out-of-line memory arrives as one memfd in
-// SCM_RIGHTS. The reply is one packet, with the reply memory as a sealed
-// memfd when there is any.
+// SCM_RIGHTS. The reply is one packet, with the reply memory (a memfd the
+// handler made) when there is any.
 //
 // An I/O thread accepts peers and receives packets. Each peer's identity is
 // fixed when it connects (SO_PEERCRED and its start time); a peer whose
@@ -34,6 +34,7 @@
 #include "base/VSAError.h"
 #include "platform/VSAAuditToken.h"
 #include "platform/VSAClientRegistry.h"
+#include "platform/VSAUniqueFd.h"
 
 struct VSAUpcallPacket {
   std::vector<uint8_t> message;        // the packet's bytes (longer than expected: truncated)
@@ -46,8 +47,8 @@ struct VSAUpcallPacket {
 
 class VSAUpcallListener {
  public:
-  using Reply =
-      std::function<void(const std::vector<uint8_t>& message, const std::vector<uint8_t>* memory)>;
+  // Sends `message` with `memory` (a memfd, given over) attached when valid.
+  using Reply = std::function<void(const std::vector<uint8_t>& message, VSAUniqueFd memory)>;
   using Handler = std::function<void(VSAUpcallPacket packet, Reply reply)>;
   static constexpr size_t kMaxPeers = 32;
   static constexpr int kMaxInFlight = 16;

@@ -5,6 +5,7 @@
 #include <map>
 
 #include "base/VSALog.h"
+#include "base/VSAValue.h"
 #include "upcall/VSAPackBuffer.h"
 
 namespace {
@@ -45,7 +46,12 @@ int32_t readRequest(sb_packbuff* in, ProcessRequest* r) {
         type == VS_KERN_REQUEST_PERSONA_ID) {
       uint32_t v = sb_packbuff_unpack_uint32(in, &error);
       if (error) {
-        logUpcall(kVSALogError, "failed: to unpack uint32 for %s. error: %d", itemName(type),
+        logUpcall(kVSALogError,
+                  type == VS_KERN_REQUEST_UID
+                      ? "failed: to unpack uint32 for VS_KERN_REQUEST_UID. error: %d"
+                  : type == VS_KERN_REQUEST_CONTAINER_TYPE
+                      ? "failed: to unpack uint32 for VS_KERN_REQUEST_CONTAINER_TYPE. error: %d"
+                      : "failed: to unpack uint32 for VS_KERN_REQUEST_PERSONA_ID. error: %d",
                   error);
         return kVSAUpcallFailure;
       }
@@ -93,6 +99,13 @@ int32_t readRequest(sb_packbuff* in, ProcessRequest* r) {
   return kVSAUpcallSuccess;
 }
 
+// Identifier -> path, as the debug lines show a set of containers.
+VSAValue pathsByIdentifier(const std::vector<std::pair<std::string, std::string>>& paths) {
+  VSAValue::Dictionary d;
+  for (const auto& [id, path] : paths) d[id] = VSAValue(path);
+  return VSAValue(std::move(d));
+}
+
 bool isDataClass(VSAContainerClass c) {
   return c == 2 || c == 4 || c == 6 || c == 7 || c == 9 || c == 10 || c == 11;
 }
@@ -106,12 +119,12 @@ struct ContainerRun {
   std::optional<std::string> dataContainer{}, systemContainer{};
   std::vector<std::pair<std::string, std::string>> groupPaths{}, systemGroupPaths{};
 
-  std::optional<std::string> make(const std::string& id, VSAContainerClass c, const char* what) {
+  // `failure`: the line logged with the result code when the container cannot be had.
+  std::optional<std::string> make(const std::string& id, VSAContainerClass c, const char* failure) {
     uint64_t code = 1;
     auto path = env.createOrLookup(user, id, c, &code);
     if (!path) {
-      logUpcall(kVSALogError, "%s Failed with error: %llu", what,
-                static_cast<unsigned long long>(code));
+      logUpcall(kVSALogError, failure, static_cast<unsigned long long>(code));
       success = false;
     }
     return path;
@@ -149,17 +162,20 @@ struct ContainerRun {
     if (id) {
       VSAContainerClass c = dataClass(*id);
       checkUID(c);
-      dataContainer = make(*id, c, "createOrLookupContainerForUser:");
+      dataContainer = make(*id, c, "createOrLookupContainerForUser: Failed with error: %llu");
     }
     if (request.systemContainerID)
       systemContainer =
-          make(*request.systemContainerID, 12, "createOrLookupContainerForUser:(system container)");
+          make(*request.systemContainerID, 12,
+               "createOrLookupContainerForUser:(system container) Failed with error: %llu");
     if (!request.groups.empty()) checkUID(7);
     for (const auto& g : request.groups)
-      if (auto path = make(g, 7, "createOrLookupGroupContainersForUser:"))
+      if (auto path = make(g, 7, "createOrLookupGroupContainersForUser: Failed with error: %llu"))
         groupPaths.emplace_back(g, *path);
     for (const auto& g : request.systemGroups)
-      if (auto path = make(g, 13, "createOrLookupContainerForUser:(system group container)"))
+      if (auto path = make(
+              g, 13,
+              "createOrLookupContainerForUser:(system group container) Failed with error: %llu"))
         systemGroupPaths.emplace_back(g, *path);
   }
 
@@ -191,7 +207,12 @@ struct ContainerRun {
       logUpcall(kVSALogDebug, "UPCALL-Containers for %@(%u):", request.codeSignatureID.value_or(""),
                 request.uid);
       logUpcall(kVSALogDebug, "dataContainerURL: %@", dataContainer.value_or("(null)"));
+      logUpcall(kVSALogDebug, "tempContainerURL: %@",
+                dataContainer ? *dataContainer + "/tmp" : std::string("(null)"));
       logUpcall(kVSALogDebug, "homeDirURL: %@", home);
+      logUpcall(kVSALogDebug, "groupURLs: %@", pathsByIdentifier(groupPaths));
+      logUpcall(kVSALogDebug, "systemContainerURL: %@", systemContainer.value_or("(null)"));
+      logUpcall(kVSALogDebug, "systemGroupURLs: %@", pathsByIdentifier(systemGroupPaths));
     }
     pack(out, VS_KERN_REPLY_HOME_DIR_PATH, home);
     if (dataContainer) {
@@ -250,7 +271,8 @@ VSAUpcallServer::Outcome VSAUpcallServer::demux_server(const VSAUpcallRequest& r
     VSALogIn(VSALogCategory::Upcall, kVSALogDebug, "demux_server",
              "handling incomming request for vessa_core server");
     if (request.id == kVSAUpcallGetProcessContainersID) {
-      code = server_get_process_containers(request, memory, memorySize, &outcome.buffer);
+      code = server_get_process_containers(request, memory, memorySize, &outcome.buffer,
+                                           &outcome.memory);
       outcome.handled = true;
     }
   }
@@ -263,7 +285,8 @@ VSAUpcallServer::Outcome VSAUpcallServer::demux_server(const VSAUpcallRequest& r
 
 int32_t VSAUpcallServer::server_get_process_containers(const VSAUpcallRequest& request,
                                                        const uint8_t* memory, size_t memorySize,
-                                                       std::vector<uint8_t>* replyBuffer) {
+                                                       std::vector<uint8_t>* replyBuffer,
+                                                       VSAUniqueFd* replyMemory) {
   if (int32_t invalid = request.validate(memorySize)) return invalid;
   if (memorySize > kVSAUpcallMaxRequestSize) return kVSAUpcallTypeError;
   if (request.senderPID() != 0) {
@@ -297,6 +320,22 @@ int32_t VSAUpcallServer::server_get_process_containers(const VSAUpcallRequest& r
   run.packReply(out);
   const auto* bytes = static_cast<const uint8_t*>(sb_packbuff_get_bytes(out));
   replyBuffer->assign(bytes, bytes + sb_packbuff_get_size(out));
+  if (environment_.copyReplyMemory) {
+    // The kernel takes over a copy of the reply; without one it is told
+    // that no reply memory came (a descriptor of size 0).
+    errno = 0;
+    *replyMemory = environment_.copyReplyMemory(*replyBuffer);
+    int copyError = errno;
+    if (*replyMemory) {
+      logUpcall(kVSALogDebug, "packbuff bytes: %p, reply bytes: %p, reply size: %u",
+                static_cast<const void*>(bytes), static_cast<const void*>(replyBuffer->data()),
+                static_cast<unsigned>(replyBuffer->size()));
+    } else {
+      logUpcall(kVSALogError, "vm_read(%p, %lu) fails: %d", static_cast<const void*>(bytes),
+                static_cast<unsigned long>(replyBuffer->size()), copyError);
+      replyBuffer->clear();
+    }
+  }
   sb_packbuff_free(out);
   return kVSAUpcallSuccess;
 }

@@ -26,6 +26,7 @@
 #include "model/VSAContainerClass.h"
 #include "model/VSAUserIdentityCache.h"
 #include "platform/VSAPersonaService.h"
+#include "platform/VSAUniqueFd.h"
 #include "upcall/VSAUpcallMessage.h"
 
 // Request item value types.
@@ -74,6 +75,10 @@ struct VSAUpcallEnvironment {
                                            const std::string& identifier,
                                            VSAContainerClass containerClass, uint64_t* code)>
       createOrLookup;
+  // Copies the reply pack buffer into the memory the kernel takes over (a
+  // sealed memfd); an invalid descriptor, with errno set, when it cannot.
+  // Unset: the reply goes without memory of its own.
+  std::function<VSAUniqueFd(const std::vector<uint8_t>& bytes)> copyReplyMemory;
 };
 
 class VSAUpcallServer {
@@ -84,12 +89,14 @@ class VSAUpcallServer {
   struct Outcome {
     VSAUpcallReply reply;
     std::vector<uint8_t> buffer;  // the reply pack buffer's bytes (served replies)
+    VSAUniqueFd memory;           // their copy for the kernel, when one was made
     bool handled = false;
   };
   // `memory` is the request pack buffer as received (any bytes).
   Outcome demux_server(const VSAUpcallRequest& request, const uint8_t* memory, size_t memorySize);
   int32_t server_get_process_containers(const VSAUpcallRequest& request, const uint8_t* memory,
-                                        size_t memorySize, std::vector<uint8_t>* replyBuffer);
+                                        size_t memorySize, std::vector<uint8_t>* replyBuffer,
+                                        VSAUniqueFd* replyMemory);
 
  private:
   VSAUpcallEnvironment environment_;

@@ -103,6 +103,24 @@ TEST(VSATestLocks, TheCommandAcquiresOncePerLockAndChecksNumbers) {
   EXPECT_EQ(VSALockTableSnapshot().allReaderWriterState, 0);
 }
 
+// Turning everything off also forgets what the command held, so the
+// command's next enable takes the lock again and its next disable never
+// releases a lock that is no longer held (which would end the process).
+TEST(VSATestLocks, TurningEverythingOffLeavesTheCommandNothingToReleaseTwice) {
+  VSATestLocks locks;
+  ASSERT_EQ(locks.setLockFromCommand(3, true), VSAResult::kSuccess);
+  ASSERT_EQ(locks.setLockFromCommand(7, false), VSAResult::kSuccess);
+  EXPECT_FALSE(locks.enabled());
+  EXPECT_EQ(locks.countForLock(3), 0);
+  EXPECT_EQ(locks.setLockFromCommand(3, false), VSAResult::kSuccess);  // nothing held
+  EXPECT_EQ(locks.countForLock(3), 0);
+  EXPECT_EQ(locks.setLockFromCommand(3, true), VSAResult::kSuccess);
+  EXPECT_TRUE(locks.enabled());
+  EXPECT_EQ(locks.countForLock(3), 1);
+  EXPECT_EQ(locks.setLockFromCommand(3, false), VSAResult::kSuccess);
+  EXPECT_FALSE(locks.enabled());
+}
+
 // An operation frozen at lock 3 holds its identifier lock, so lock 0 cannot
 // be had until it goes on; neither the release that lets it go on, nor
 // turning the feature off, may wait for that.

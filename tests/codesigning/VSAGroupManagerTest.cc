@@ -5,8 +5,10 @@
 
 #include <filesystem>
 #include <fstream>
+#include <future>
 
 #include "VSAContainerTestRoot.h"
+#include "base/VSALocks.h"
 #include "base/VSAPlist.h"
 
 namespace fs = std::filesystem;
@@ -162,6 +164,33 @@ TEST_F(Groups, AClientGetsAnOwnersGroupsOnlyWithAGrant) {
       installer()->groupContainerIdentifiersForOwnerIdentifier("com.example.none", 7, &code);
   ASSERT_TRUE(none);
   EXPECT_TRUE(none->empty());
+}
+
+TEST_F(Groups, AnOwnersGroupsAreListedUnderTheAllIdentifiersWriteLock) {
+  using namespace std::chrono_literals;
+  VSACommandQueue q;
+  ASSERT_EQ(reg("com.example.a", appGroups(strings({"group.example.a1"})), q), 1u);
+  VSAValue owner("com.example.a");
+  auto list = [&](bool useLocking) {
+    return std::async(std::launch::async, [&, useLocking] {
+      VSAResultCode code = VSAResult::kSuccess;
+      return context_->groupManager->groupContainerIdentifiersForOwnerIdentifier(&owner, 7,
+                                                                                 useLocking, &code);
+    });
+  };
+  // A reader of all identifiers (a look-up in progress) holds the listing back.
+  lock_all_identifiers_read();
+  auto waiting = list(true);
+  EXPECT_EQ(waiting.wait_for(300ms), std::future_status::timeout);
+  // Without locking the caller's own hold is enough.
+  auto unlocked = list(false);
+  ASSERT_EQ(unlocked.wait_for(10s), std::future_status::ready);
+  EXPECT_EQ(unlocked.get()->size(), 1u);
+  unlock_all_identifiers();
+  ASSERT_EQ(waiting.wait_for(10s), std::future_status::ready);
+  auto ids = waiting.get();
+  ASSERT_TRUE(ids);
+  EXPECT_EQ(*ids, std::vector<std::string>{"group.example.a1"});
 }
 
 }  // namespace

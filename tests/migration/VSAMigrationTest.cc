@@ -11,6 +11,8 @@
 
 #include "VSAContainerTestRoot.h"
 #include "VSAOldDevice.h"
+#include "VSATestDatabaseFaults.h"
+#include "VSATestLog.h"
 #include "codesigning/VSACodeSigningMigration.h"
 #include "daemon/VSARootChecker.h"
 #include "migration/VSAContainerMigrator.h"
@@ -202,6 +204,91 @@ TEST_F(Migration, TheCodeSigningPassMovesEveryLegacySourceOnceAndKeepsValidEntri
   ASSERT_TRUE(codeSigningPass());
   EXPECT_TRUE(entry(VSAOldDevice::kGrouped)->isEqual(*before));
   expectMigrated();
+}
+
+TEST_F(Migration, EachMigratedIdentifierIsAnnouncedBeforeItsDatabaseWrite) {
+  VSAOldDevice::build(*context_, *installer(), user_);
+  std::string database = library() + "/containers.sqlite3";
+  context_.reset();
+  ASSERT_EQ(
+      VSARefuseEntryWritesAt(
+          database, {VSAOldDevice::kGrouped, VSAOldDevice::kLegacy, VSAOldDevice::kCached}, true),
+      "");
+  startContext();
+  VSATestLog log;
+  ASSERT_TRUE(log.open(root_ + "/test.log"));
+  EXPECT_FALSE(codeSigningPass());
+  // Every write is refused; the line that says what is being migrated came first.
+  for (auto [announcement, failure] : std::vector<std::pair<std::string, std::string>>{
+           {"Migrating app group entitlements for com.example.grouped",
+            "Failed to write migrated group id info to DB for com.example.grouped"},
+           {"Migrating legacy entitlements for com.example.legacy",
+            "Failed to write migrated legacy info to DB for com.example.legacy"},
+           {"Migrating code signing info for com.example.cached",
+            "Failed to write migrated cached cs info from bundle container to DB for "
+            "com.example.cached"}}) {
+    size_t announced = log.position(announcement), refused = log.position(failure);
+    ASSERT_NE(refused, std::string::npos) << failure;
+    ASSERT_NE(announced, std::string::npos) << announcement;
+    EXPECT_LT(announced, refused) << announcement;
+  }
+  // Nothing was lost: every source stays for the next pass.
+  EXPECT_FALSE(entry(VSAOldDevice::kLegacy));
+  EXPECT_TRUE(fs::exists(library() + "/vsa_entitlements.plist"));
+  EXPECT_TRUE(info(VSAOldDevice::kCached, 1, kVSACachedCodeSigningInfoKey));
+  EXPECT_TRUE(info(VSAOldDevice::kGrouped, 2, kVSAGroupContainerIDsKey));
+}
+
+TEST_F(Migration, ClearingFailuresCarryTheirOwnResultCodeAndOddCachedValuesAreCleared) {
+  VSAOldDevice::build(*context_, *installer(), user_);
+  VSAResultCode code = VSAResult::kSuccess;
+  auto odd = create(*installer(), "com.example.odd", &code, false, 1);
+  ASSERT_TRUE(odd) << code;
+  VSAValue notADictionary("not a dictionary");
+  VSAValue key(kVSACachedCodeSigningInfoKey);
+  ASSERT_TRUE(
+      installer()->setInfoValue(&notADictionary, &key, identity("com.example.odd", 1), true, &code))
+      << code;
+  // Two containers whose metadata file goes bad behind the cache's back.
+  auto cached = lookup(VSAOldDevice::kCached, 1);
+  auto grouped = lookup(VSAOldDevice::kGrouped, 2);
+  ASSERT_TRUE(cached && grouped);
+  for (const auto& m : {cached, grouped})
+    put(m->url() + "/" + kVSAMetadataFileName, "not a property list");
+  code = VSAResult::kSuccess;
+  VSAValue anyKey("any");
+  EXPECT_FALSE(
+      installer()->infoValueForKey(&anyKey, identity(VSAOldDevice::kCached, 1), true, &code));
+  VSAResultCode unreadable = code;  // what reading that metadata answers
+  ASSERT_NE(unreadable, VSAResult::kSuccess);
+  ASSERT_NE(unreadable, VSAResult::kWriteFailed);
+  VSATestLog log;
+  ASSERT_TRUE(log.open(root_ + "/test.log"));
+  EXPECT_FALSE(codeSigningPass());
+  std::string u = std::to_string(unreadable);
+  EXPECT_TRUE(log.contains("Failed to clear group id metadata for com.example.grouped : " + u))
+      << log.text();
+  EXPECT_TRUE(log.contains("Error setting info value for identity " +
+                           cached->containerIdentity()->description() + " : " + u));
+  // The value that was no dictionary left no entry and is gone.
+  EXPECT_FALSE(entry("com.example.odd"));
+  EXPECT_FALSE(info("com.example.odd", 1, kVSACachedCodeSigningInfoKey));
+}
+
+TEST_F(Migration, TheDataMigrationAnswersTheCodeOfTheStepThatFailed) {
+  VSAResultCode code = VSAResult::kSuccess;
+  ASSERT_TRUE(create(*installer(), "com.example.sys", &code, false, 12)) << code;
+  // Without the "systemusers" group no system container ACL can be made;
+  // the bundle ownership step after it still succeeds.
+  std::ofstream(root_ + "/etc/group") << "mobile:x:501:\n";
+  startContext();
+  VSACommandQueue queue;
+  code = VSAResult::kSuccess;
+  EXPECT_FALSE(context_->containerMigrator->performDataMigratorMigrationForClientConnection(
+      VSAMigrationClient{}, queue, &code));
+  EXPECT_EQ(code, VSAResult::kACLFailed);
+  EXPECT_FALSE(status()->hasMigrationOccurredForType("ACLMigration"));
+  EXPECT_TRUE(status()->hasMigrationOccurredForType("BundleMigration"));
 }
 
 TEST_F(Migration, MultiUserModeSkipsTheGroupIdMigrationAndReconciliation) {

@@ -2,7 +2,7 @@
 // orphaned class entries removed (and only they), system container
 // directories renamed after an upgrade, group reconciliation in multi-user
 // mode only, and an orphan scan that runs while a wipe replaces a container.
-// Log lines are read from a rotating log file the test opens.
+// Log lines are read from a rotating log file the test opens (VSATestLog).
 #include <gtest/gtest.h>
 
 #include <filesystem>
@@ -11,8 +11,10 @@
 
 #include "VSAContainerTestRoot.h"
 #include "VSAOldDevice.h"
+#include "VSATestLog.h"
 #include "base/VSALog.h"
 #include "base/VSATestLocks.h"
+#include "migration/VSAMigrationStatus.h"
 #include "model/VSAPerUserConfiguration.h"
 #include "operations/VSABootKeeper.h"
 #include "operations/VSADeathRow.h"
@@ -27,17 +29,9 @@ class Boot : public VSAContainerTestRoot {
  protected:
   void SetUp() override {
     VSAContainerTestRoot::SetUp();
-    log_ = root_ + "/test.log";
-    ASSERT_TRUE(VSALogger::shared().openRotatingLog(log_, 7));
-    VSALogger::shared().enableDiskLogging(7, 64u << 20);
+    ASSERT_TRUE(log_.open(root_ + "/test.log"));
   }
-  void TearDown() override { VSALogger::shared().closeRotatingLog(); }
-  std::string logText() {
-    VSALogger::shared().flush();
-    std::ifstream in(log_);
-    return std::string(std::istreambuf_iterator<char>(in), {});
-  }
-  bool logged(const std::string& text) { return logText().find(text) != std::string::npos; }
+  bool logged(const std::string& text) { return log_.contains(text); }
   VSABootKeeper keeper() { return VSABootKeeper(*context_->operationServices); }
   void rebootSetup() { keeper().rebootKeeperSetup(installer()->grants()); }
   void rebootCleanup() {
@@ -60,7 +54,7 @@ class Boot : public VSAContainerTestRoot {
     VSA_writeToURL(device, root_ + "/etc/vessad/device.plist", 0, nullptr);
     startContext();
   }
-  std::string log_;
+  VSATestLog log_;
 };
 
 TEST_F(Boot, BackedUpSystemContainersReplaceLiveItemsAndTheBackupGoes) {
@@ -110,6 +104,30 @@ TEST_F(Boot, BackedUpSystemContainersReplaceLiveItemsAndTheBackupGoes) {
   rebootSetup();
   EXPECT_EQ(read(live->url() + "/shared.txt"), "resumed");
   EXPECT_TRUE(logged("Not restoring"));
+}
+
+TEST_F(Boot, InternalBuildsKeepARestoredBackupWithoutRestoringItAgain) {
+  deviceFlags(VSAValue::Dictionary{{"HasInternalContent", VSAValue(true)}});
+  std::string backup = perUser()->systemContainerBackupDirectory();
+  fs::create_directories(backup + "/com.example.sys");
+  put(backup + "/com.example.sys/shared.txt", "backup");
+  rebootSetup();
+  auto restored = lookup("com.example.sys", 12);
+  ASSERT_TRUE(restored);
+  EXPECT_EQ(read(restored->url() + "/shared.txt"), "backup");
+  EXPECT_TRUE(fs::is_directory(library() + "/Data.inprogress"));  // kept for inspection
+  // Deleted afterwards, it stays deleted at the next boot.
+  ASSERT_EQ(stage({identity("com.example.sys", 12)}), VSAResult::kSuccess);
+  rebootSetup();
+  EXPECT_FALSE(lookup("com.example.sys", 12));
+  EXPECT_FALSE(logged("Resuming the interrupted restore"));
+  // A new backup is restored as ever.
+  fs::create_directories(backup + "/com.example.sys");
+  put(backup + "/com.example.sys/shared.txt", "newer");
+  rebootSetup();
+  restored = lookup("com.example.sys", 12);
+  ASSERT_TRUE(restored);
+  EXPECT_EQ(read(restored->url() + "/shared.txt"), "newer");
 }
 
 // Puts the user's own directory in the backup's place the moment the daemon
@@ -270,6 +288,7 @@ TEST_F(Boot, AnUpgradeRenamesSystemContainersExceptWellKnownAndAnalytics) {
   installer()->rebootKeeperSetup();  // records B1
   VSAOldDevice::writeSystemVersion(root_, "B2");
   installer()->rebootKeeperSetup();
+  EXPECT_TRUE(logged("Rolling system container directory UUIDs on disk"));
   auto find = [&](const char* id, VSAContainerClass c) {
     return installer()->createOrLookupContainerWithContainerIdentity(identity(id, c), false, false,
                                                                      true, &code);
@@ -282,6 +301,22 @@ TEST_F(Boot, AnUpgradeRenamesSystemContainersExceptWellKnownAndAnalytics) {
   EXPECT_EQ(find(kVSAAnalyticsSystemGroupIdentifier, 13)->url(), analytics->url());
   installer()->rebootKeeperSetup();  // same build: nothing moves
   EXPECT_EQ(find("com.example.sys", 12)->url(), moved->url());
+}
+
+TEST_F(Boot, AnUpgradeOfADeviceWithoutSystemContainersRecordsTheACLMigration) {
+  auto systemBase = [&](VSAContainerClass c) {
+    return *context_->globalConfiguration->globalContainerBaseURLWithContentClass(c, false);
+  };
+  ASSERT_FALSE(fs::exists(systemBase(12)));
+  ASSERT_FALSE(fs::exists(systemBase(13)));
+  VSAOldDevice::writeSystemVersion(root_, "B1");
+  installer()->rebootKeeperSetup();
+  EXPECT_TRUE(logged("No system containers requiring ACL migration"));
+  auto status = VSAMigrationStatus::initForSystemMigration(
+      *context_->globalConfiguration, root_ + "/etc/vessad/system-version.plist");
+  ASSERT_TRUE(status);
+  EXPECT_TRUE(status->hasMigrationOccurredForType("ACLMigration"));
+  EXPECT_FALSE(status->isBuildUpgrade());
 }
 
 TEST_F(Boot, GroupsAreReconciledAtBootOnlyInMultiUserMode) {

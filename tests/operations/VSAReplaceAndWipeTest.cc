@@ -8,7 +8,9 @@
 #include <fstream>
 
 #include "VSAContainerTestRoot.h"
+#include "VSATestLog.h"
 #include "base/VSAPlist.h"
+#include "daemon/VSACommandHandlers.h"
 #include "operations/VSAReplaceFile.h"
 
 namespace fs = std::filesystem;
@@ -74,6 +76,28 @@ TEST_F(ReplaceAndWipe, ArgumentsThatCannotWorkFailBeforeAnythingMoves) {
     EXPECT_TRUE(fs::is_directory(a->url()));
     EXPECT_TRUE(fs::is_directory(b->url()));
   }
+}
+
+TEST_F(ReplaceAndWipe, AReplaceRequestWithoutANewUUIDIsRefusedByTheReplaceItself) {
+  auto c = installer();
+  VSAResultCode code;
+  auto a = create(*c, "com.example.a", &code);
+  auto b = create(*c, "com.example.b", &code);
+  ASSERT_TRUE(a && b) << code;
+  VSAValue request = VSAValue::Dictionary{
+      {"Command", VSAValue(uint64_t{2})},           {"OldIdentifier", VSAValue("com.example.a")},
+      {"OldContainerClass", VSAValue(uint64_t{2})}, {"OldContainerUUID", VSAValue(a->uuid())},
+      {"NewIdentifier", VSAValue("com.example.b")}, {"NewContainerClass", VSAValue(uint64_t{2})}};
+  VSATestLog log;
+  ASSERT_TRUE(log.open(root_ + "/test.log"));
+  VSAValue reply = VSAValue::dictionary();
+  code = VSAResult::kSuccess;
+  VSAHandleReplaceContainer(request, reply, *c, &code);
+  EXPECT_EQ(code, VSAResult::kInvalidArgument);
+  EXPECT_TRUE(log.contains("Can't act on an invalid object: newUUID: (null), Class: 2"))
+      << log.text();
+  EXPECT_EQ(entries(replaceDirectory()), 0u);
+  EXPECT_TRUE(fs::is_directory(a->url()) && fs::is_directory(b->url()));
 }
 
 TEST_F(ReplaceAndWipe, AReplaceMovesTheNewContainerInAndTheOldOneToDeathRow) {
@@ -251,7 +275,17 @@ TEST_F(ReplaceAndWipe, RecoveryActsOnlyOnValidReplaceFilesWhoseOldDirectoryIsGon
   write("6.plist", VSAValue::array());
   put(replaceDirectory() + "/7.plist", "not a property list");
 
+  VSATestLog log;
+  ASSERT_TRUE(log.open(root_ + "/test.log"));
   installer()->keeperSetup();
+  // Each valid file is shown with its dictionary of the four places.
+  std::string shown = log.text();
+  size_t line = shown.find("Doing a replace of " + replaceDirectory() + "/1.plist with info: ");
+  ASSERT_NE(line, std::string::npos) << shown;
+  std::string info = shown.substr(line, shown.find("Recovering from failed replace", line) - line);
+  for (const char* key : {kVSAReplaceOperationOldURL, kVSAReplaceOperationNewURL,
+                          kVSAReplaceOperationStagingURL, kVSAReplaceOperationDestURL})
+    EXPECT_NE(info.find(key), std::string::npos) << key;
   EXPECT_EQ(read(base + "/old-missing-a/marker"), "a");
   EXPECT_FALSE(fs::exists(base + "/staging-a"));
   EXPECT_TRUE(fs::exists(base + "/staging-b"));

@@ -3,9 +3,12 @@
 // foreign and unknown requests.
 #include <gtest/gtest.h>
 
+#include <cerrno>
+#include <cstring>
 #include <filesystem>
 
 #include "VSAContainerTestRoot.h"
+#include "VSATestLog.h"
 #include "daemon/VSAKernelUpcall.h"
 #include "upcall/VSAPackBuffer.h"
 #include "upcall/VSAUpcallPayload.h"
@@ -135,6 +138,55 @@ TEST_F(Upcall, AContainerThatCannotBeMadeClearsTheFlagAndStopsPacking) {
   // Nothing is packed once the flag is down, but the flag itself.
   EXPECT_EQ(order, std::vector<uint16_t>{0});
   EXPECT_FALSE(fs::exists(classDirectory(7) + "/../escape"));
+}
+
+TEST_F(Upcall, TheContainersAreLoggedAndAReplyWhoseCopyFailedCarriesNoMemory) {
+  auto p = app("com.example.app");
+  p.groups = {"group.example.one"};
+  p.systemContainerID = "com.example.app.system";
+  p.systemGroups = {"systemgroup.com.example.shared"};
+  auto memory = *p.pack();
+  VSATestLog log;
+  ASSERT_TRUE(log.open(root_ + "/test.log"));
+  auto served = server_->demux_server(requestFor(memory), memory.data(), memory.size());
+  ASSERT_EQ(served.reply.returnCode, 0);
+  EXPECT_TRUE(served.memory);
+  EXPECT_GT(served.reply.replySize, 0u);
+  auto a = VSAUpcallAnswer::read(served.buffer);
+  ASSERT_TRUE(a.dataContainer && a.systemContainer);
+  std::string text = log.text();
+  for (const std::string& line :
+       {std::string("UPCALL-Containers for com.example.app(501):"),
+        "dataContainerURL: " + *a.dataContainer, "tempContainerURL: " + *a.temporaryDirectory,
+        "homeDirURL: " + *a.home, std::string("groupURLs: "),
+        "systemContainerURL: " + *a.systemContainer, std::string("systemGroupURLs: "),
+        std::string("packbuff bytes: ")})
+    EXPECT_NE(text.find(line), std::string::npos) << line;
+  EXPECT_NE(text.find(a.groups[0].second, text.find("groupURLs: ")), std::string::npos);
+  EXPECT_NE(text.find(a.systemGroups[0].second, text.find("systemGroupURLs: ")), std::string::npos);
+
+  // The kernel's copy cannot be made: the reply says so with a size of 0.
+  auto env = VSAKernelUpcall::environmentFor(*context_);
+  env.copyReplyMemory = [](const std::vector<uint8_t>&) {
+    errno = EMFILE;
+    return VSAUniqueFd();
+  };
+  VSAUpcallServer failing(std::move(env));
+  auto unsent = failing.demux_server(requestFor(memory), memory.data(), memory.size());
+  EXPECT_EQ(unsent.reply.returnCode, 0);
+  EXPECT_FALSE(unsent.memory);
+  EXPECT_EQ(unsent.reply.replySize, 0u);
+  auto bytes = unsent.reply.bytes();
+  ASSERT_EQ(bytes.size(), 56u);
+  auto sizeAt = [&](size_t offset) {
+    uint32_t v;
+    std::memcpy(&v, bytes.data() + offset, 4);
+    return v;
+  };
+  EXPECT_EQ(sizeAt(40), 0u);  // the descriptor's size
+  EXPECT_EQ(sizeAt(52), 0u);  // the reply size
+  EXPECT_TRUE(log.contains("fails: " + std::to_string(EMFILE))) << log.text();
+  EXPECT_TRUE(log.contains("vm_read("));
 }
 
 TEST_F(Upcall, BadForeignAndUnknownRequestsGetTheirReturnCodes) {
