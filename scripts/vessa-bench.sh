@@ -44,6 +44,17 @@ echo
 echo "== App launch: vessa-launch of /bin/true against /bin/true started directly"
 "$build/bench/bench_launch" "$root" "$root/usr/bin/vessa-launch" "${LAUNCHES:-200}" ||
   echo "vessa-bench: the launch scenario failed (see above)"
+# How often the daemon wakes with nothing to do: every thread's voluntary
+# context switches over a few seconds with no client, per minute.
+wakeups() { cat /proc/"$daemon"/task/*/status | awk '/^voluntary_ctxt_switches/ { n += $2 } END { print n }'; }
+sleep 1
+idle_seconds=${IDLE_SECONDS:-10}
+before=$(wakeups); sleep "$idle_seconds"; after=$(wakeups)
+per_minute=$(( (after - before) * 60 / idle_seconds ))
+echo
+echo "== Idle: vessad woke $((after - before)) times in ${idle_seconds} s with no client ($per_minute per minute)"
+[[ -n "${VSA_BENCH_TABLE:-}" ]] &&
+  printf 'IDLE\tvessad wake-ups per minute with no client\t%s\n' "$per_minute" >>"$VSA_BENCH_TABLE"
 # The daemon's peak memory over the whole run (for bench/run-all's table).
 peak=$(sed -n 's/^VmHWM:[[:space:]]*\([0-9]*\) kB/\1/p' "/proc/$daemon/status")
 echo
