@@ -3,12 +3,13 @@
 #include <spdlog/sinks/rotating_file_sink.h>
 #include <spdlog/spdlog.h>
 #include <sys/stat.h>
-#include <systemd/sd-journal.h>
 #include <unistd.h>
 
 #include <chrono>
 #include <cstdio>
 #include <ctime>
+
+#include "base/VSASystemdLibrary.h"
 
 std::atomic<int> gVSALogWriterLevel{kVSALogNotice};
 
@@ -127,10 +128,13 @@ const char* levelName(int level) {
 
 void VSALogger::writeUnified(VSALogCategory category, int level, const char* origin,
                              const std::string& m) {
-  if (journald_ && !forceStderr_) {
-    sd_journal_send("MESSAGE=%s: %s", origin, m.c_str(), "PRIORITY=%d", level < 0 ? 0 : level,
-                    "SYSLOG_IDENTIFIER=vessad", "VESSA_SUBSYSTEM=%s", subsystemName(category),
-                    "VESSA_CATEGORY=%s", categoryName(category), "CODE_FUNC=%s", origin, nullptr);
+  const VSASystemdLibrary* systemd =
+      journald_ && !forceStderr_ ? VSASystemdLibrary::get() : nullptr;
+  if (systemd) {
+    systemd->journalSend("MESSAGE=%s: %s", origin, m.c_str(), "PRIORITY=%d", level < 0 ? 0 : level,
+                         "SYSLOG_IDENTIFIER=vessad", "VESSA_SUBSYSTEM=%s", subsystemName(category),
+                         "VESSA_CATEGORY=%s", categoryName(category), "CODE_FUNC=%s", origin,
+                         nullptr);
     return;
   }
   auto now = std::chrono::system_clock::now();

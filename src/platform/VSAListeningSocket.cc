@@ -3,12 +3,14 @@
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
-#include <systemd/sd-daemon.h>
+#include <systemd/sd-daemon.h>  // SD_LISTEN_FDS_START only
 #include <unistd.h>
 
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
+
+#include "base/VSASystemdLibrary.h"
 
 int VSABindListeningSocket(int fd, const std::string& path, mode_t mode, int backlog) {
   std::string temporary = path + "." + std::to_string(::getpid()) + ".new";
@@ -28,8 +30,10 @@ int VSABindListeningSocket(int fd, const std::string& path, mode_t mode, int bac
 }
 
 int VSAActivatedListeningSocket(int type, const std::string& path) {
-  int count = sd_listen_fds(0);  // the environment stays: each listener looks
+  const VSASystemdLibrary* systemd = VSASystemdLibrary::get();
+  if (!systemd) return -1;
+  int count = systemd->listenFds(0);  // the environment stays: each listener looks
   for (int fd = SD_LISTEN_FDS_START; fd < SD_LISTEN_FDS_START + count; ++fd)
-    if (sd_is_socket_unix(fd, type, 1, path.c_str(), 0) > 0) return fd;
+    if (systemd->isSocketUnix(fd, type, 1, path.c_str(), 0) > 0) return fd;
   return -1;
 }

@@ -1,13 +1,18 @@
 #include "platform/VSAServiceManager.h"
 
-#include <systemd/sd-daemon.h>
+#include "base/VSASystemdLibrary.h"
+
+namespace {
+// Readiness and status for the service manager; nothing without libsystemd.
+void notify(const std::string& state) {
+  if (const auto* systemd = VSASystemdLibrary::get()) systemd->notify(0, state.c_str());
+}
+}  // namespace
 
 void VSAServiceManager::notifyReady(const std::string& status) {
-  sd_notify(0, ("READY=1\nSTATUS=" + status).c_str());
+  notify("READY=1\nSTATUS=" + status);
 }
 
-void VSAServiceManager::notifyStatus(const std::string& status) {
-  sd_notify(0, ("STATUS=" + status).c_str());
-}
+void VSAServiceManager::notifyStatus(const std::string& status) { notify("STATUS=" + status); }
 
-void VSAServiceManager::notifyStopping() { sd_notify(0, "STOPPING=1\nSTATUS=Stopping"); }
+void VSAServiceManager::notifyStopping() { notify("STOPPING=1\nSTATUS=Stopping"); }
