@@ -3,6 +3,7 @@
 #include <cstdlib>
 #include <map>
 
+#include "base/VSAError.h"
 #include "base/VSAJSON.h"
 #include "base/VSAUUID.h"
 
@@ -128,35 +129,8 @@ const char* VSACtlVerbs::className(uint64_t containerClass) {
 }
 
 const char* VSACtlVerbs::meaningOfCode(uint64_t code) {
-  static const std::map<uint64_t, const char*> meanings = {
-      {1, "success"},
-      {11, "invalid argument"},
-      {12, "metadata file unreadable"},
-      {18, "no identifier"},
-      {20, "container class out of range"},
-      {21, "container not found"},
-      {24, "info value not set"},
-      {28, "could not be deleted"},
-      {29, "invalid update file"},
-      {34, "a file could not be written"},
-      {35, "invalid replace file"},
-      {36, "a file could not be removed"},
-      {38, "value out of range"},
-      {41, "could not move to death row"},
-      {48, "could not move the directory to its new UUID name"},
-      {49, "invalid or retired command"},
-      {55, "client not entitled"},
-      {61, "device locked"},
-      {63, "access control list failed"},
-      {66, "code-signing database failure"},
-      {67, "not in the code-signing database"},
-      {68, "code-signing database changed unexpectedly"},
-      {73, "allocation failed"},
-      {75, "invalid user identity"},
-      {76, "persona not allowed or unknown"},
-  };
-  auto it = meanings.find(code);
-  return it == meanings.end() ? "unknown result code" : it->second;
+  const char* meaning = VSAResult::meaning(code);
+  return meaning ? meaning : "unknown result code";
 }
 
 std::string VSACtlVerbs::help(const VSACtlVerb& verb) {

@@ -16,33 +16,76 @@
 
 using VSAResultCode = uint64_t;
 
-// Codes whose meaning other parts rely on. The values are part of the client
-// protocol and must never be renumbered.
+// Every result code: its name here, its number on the wire (part of the
+// client protocol: never renumbered) and what it means, in one list that the
+// constants and the table of meanings (vessactl, logs) are both made from.
+#define VSA_RESULT_CODES(X)                                                          \
+  X(kSuccess, 1, "success")                                                          \
+  X(kTransientRemovalFailed, 5, "a transient container could not be removed")        \
+  X(kStagingCreateFailed, 7, "the staging directory could not be made")              \
+  X(kStagingMoveFailed, 8, "a new container could not be moved into place")          \
+  X(kStagingRemovalFailed, 9, "a staging directory could not be removed")            \
+  X(kNotAUUID, 10, "not a UUID")                                                     \
+  X(kInvalidArgument, 11, "invalid argument")                                        \
+  X(kMetadataUnreadable, 12, "metadata file unreadable")                             \
+  X(kMoveToStagingFailed, 14, "the old container could not be moved to staging")     \
+  X(kMoveToDestinationFailed, 15, "the new container could not be moved into place") \
+  X(kMissingIdentifier, 18, "no identifier")                                         \
+  X(kInvalidClass, 20, "container class out of range")                               \
+  X(kContainerNotFound, 21, "container not found")                                   \
+  X(kSameContainer, 22, "a container cannot replace itself")                         \
+  X(kDifferentClasses, 23, "the containers are of different classes")                \
+  X(kInfoValueNotSet, 24, "info value not set")                                      \
+  X(kAlreadyExists, 27, "already exists")                                            \
+  X(kDeleteFailed, 28, "could not be deleted")                                       \
+  X(kInvalidUpdateFile, 29, "invalid update file")                                   \
+  X(kInvalidReplaceInfo, 33, "invalid replace information")                          \
+  X(kWriteFailed, 34, "a file could not be written")                                 \
+  X(kInvalidReplaceFile, 35, "invalid replace file")                                 \
+  X(kRemoveFailed, 36, "a file could not be removed")                                \
+  X(kOutOfRange, 38, "value out of range")                                           \
+  X(kExceptionInTransaction, 40, "an exception ended the operation")                 \
+  X(kDeathRowMoveFailed, 41, "could not move to death row")                          \
+  X(kCacheRebuildFailed, 43, "a class of containers could not be read")              \
+  X(kCacheInconsistent, 44, "a cached container has no metadata file")               \
+  X(kCacheAddFailed, 45, "the container could not be cached")                        \
+  X(kCacheRemoveFailed, 46, "the container could not be removed from the cache")     \
+  X(kCacheEntryWithoutURL, 47, "a cached container has no path")                     \
+  X(kMoveToNewUUIDFailed, 48, "could not move the directory to its new UUID name")   \
+  X(kInvalidCommand, 49, "invalid or retired command")                               \
+  X(kNotEntitled, 55, "client not entitled")                                         \
+  X(kDeviceLocked, 61, "device locked")                                              \
+  X(kACLFailed, 63, "access control list failed")                                    \
+  X(kDatabaseFailed, 66, "code-signing database failure")                            \
+  X(kNotFoundInDatabase, 67, "not in the code-signing database")                     \
+  X(kUnexpectedChangeCount, 68, "code-signing database changed unexpectedly")        \
+  X(kAllocationFailed, 73, "allocation failed")                                      \
+  X(kInvalidUserIdentityPlist, 75, "invalid user identity")                          \
+  X(kInvalidPersona, 76, "persona not allowed or unknown")                           \
+  X(kQueueExhausted, 77, "the command queue gave up")
+
 namespace VSAResult {
-constexpr VSAResultCode kSuccess = 1;
-constexpr VSAResultCode kInvalidArgument = 11;
-constexpr VSAResultCode kMetadataUnreadable = 12;
-constexpr VSAResultCode kMissingIdentifier = 18;
-constexpr VSAResultCode kInvalidClass = 20;
-constexpr VSAResultCode kContainerNotFound = 21;
-constexpr VSAResultCode kInvalidUpdateFile = 29;
-constexpr VSAResultCode kWriteFailed = 34;
-constexpr VSAResultCode kInvalidReplaceFile = 35;
-constexpr VSAResultCode kRemoveFailed = 36;
-constexpr VSAResultCode kOutOfRange = 38;
-constexpr VSAResultCode kExceptionInTransaction = 40;
-constexpr VSAResultCode kDeathRowMoveFailed = 41;
-constexpr VSAResultCode kInvalidCommand = 49;
-constexpr VSAResultCode kNotEntitled = 55;
-constexpr VSAResultCode kDeviceLocked = 61;
-constexpr VSAResultCode kACLFailed = 63;
-constexpr VSAResultCode kDatabaseFailed = 66;
-constexpr VSAResultCode kNotFoundInDatabase = 67;
-constexpr VSAResultCode kUnexpectedChangeCount = 68;
-constexpr VSAResultCode kAllocationFailed = 73;
-constexpr VSAResultCode kInvalidUserIdentityPlist = 75;
-constexpr VSAResultCode kInvalidPersona = 76;
-constexpr VSAResultCode kQueueExhausted = 77;
+#define VSA_RESULT_CONSTANT(name, value, meaning) constexpr VSAResultCode name = value;
+VSA_RESULT_CODES(VSA_RESULT_CONSTANT)
+#undef VSA_RESULT_CONSTANT
+
+struct Description {
+  VSAResultCode code;
+  const char* name;
+  const char* meaning;
+};
+// Every code, in increasing order.
+inline constexpr Description kAll[] = {
+#define VSA_RESULT_DESCRIPTION(name, value, meaning) {value, #name, meaning},
+    VSA_RESULT_CODES(VSA_RESULT_DESCRIPTION)
+#undef VSA_RESULT_DESCRIPTION
+};
+// What `code` means; null for a number that is no result code.
+inline const char* meaning(VSAResultCode code) {
+  for (const Description& d : kAll)
+    if (d.code == code) return d.meaning;
+  return nullptr;
+}
 }  // namespace VSAResult
 
 inline constexpr const char* kVSAErrorDomain = "VSAErrorDomain";

@@ -6,7 +6,6 @@
 namespace {
 constexpr const char* kGroupIdMigration = "GroupIdMigration";
 constexpr const char* kCodeSigningMigration = "CodeSigningMigration";
-constexpr VSAResultCode kCacheAddFailed = 45;
 
 template <typename... A>
 void logMigration(int level, const char* origin, const char* format, const A&... args) {
@@ -81,7 +80,7 @@ VSAResultCode VSACodeSigningMigration::clearInfoValue(const VSAMetadata& contain
   if (!fresh->writeMetadataToDiskWithError(*configuration_, &error))
     return error ? error->resultCode(VSAResult::kWriteFailed) : VSAResult::kWriteFailed;
   if (!containerCache_->addContainerMetadata(*fresh, fresh->url(), false, true, &error))
-    return kCacheAddFailed;
+    return VSAResult::kCacheAddFailed;
   return VSAResult::kSuccess;
 }
 

@@ -9,7 +9,6 @@
 
 namespace {
 constexpr const char* kOrigin = "VSAGroupManager";
-constexpr VSAResultCode kException = 40;
 
 template <typename... A>
 void logGroups(int level, const char* format, const A&... args) {
@@ -53,7 +52,7 @@ VSAGroupManager::groupContainerIdentifiersForOwnerIdentifier(const VSAValue* own
   } catch (const std::exception& e) {
     VSALogIn(VSALogCategory::CodeSignMapping, kVSALogError, fn, "Got exception: %@ : %@",
              "std::exception", e.what());
-    VSASetCode(withError, kException);
+    VSASetCode(withError, VSAResult::kExceptionInTransaction);
     return std::nullopt;
   }
 }

@@ -16,7 +16,6 @@ constexpr const char* kBundleMigration = "BundleMigration";
 constexpr const char* kSubdirectoryMigration = "SubdirectoryMigration";
 constexpr int kKeptLogFiles = 3;  // the rotating log writer's count
 constexpr VSAResultCode kStatusUnreadable = VSAResult::kMetadataUnreadable;
-constexpr VSAResultCode kException = 40;
 
 template <typename... A>
 void logMigrator(int level, const char* origin, const char* format, const A&... args) {
@@ -51,7 +50,7 @@ bool guarded(const char* origin, VSAResultCode* cell, Body body) {
     return body();
   } catch (const std::exception& e) {
     logMigrator(kVSALogError, origin, "Got exception: %@ : %@", "std::exception", e.what());
-    VSASetCode(cell, kException);
+    VSASetCode(cell, VSAResult::kExceptionInTransaction);
     return false;
   }
 }

@@ -25,7 +25,7 @@ VSAErrorRef cacheError(VSAResultCode code, const char* format, const A&... args)
 }
 
 VSAErrorRef rebuildError(const VSAUserIdentityRef& user, VSAContainerClass c, bool transient) {
-  return cacheError(43, "Cache: [%@]-%@%@: Failed to rebuild",
+  return cacheError(VSAResult::kCacheRebuildFailed, "Cache: [%@]-%@%@: Failed to rebuild",
                     user ? user->identifier() : std::string(), shortName(c),
                     transientTag(transient));
 }
@@ -83,7 +83,8 @@ VSAContainerCache::ClassMap* VSAContainerCache::_lock_getCache(const VSAUserIden
   auto& config = *deps_.configuration;
   auto dir = config.containerDirectoryURLForUserIdentity(user, c, transient);
   if (!dir) {
-    VSASetError(error, cacheError(43, "Cache: %@%@: no directory for class %llu", key,
+    VSASetError(error, cacheError(VSAResult::kCacheRebuildFailed,
+                                  "Cache: %@%@: no directory for class %llu", key,
                                   transientTag(transient), c));
     return nullptr;
   }
@@ -99,8 +100,9 @@ VSAContainerCache::ClassMap* VSAContainerCache::_lock_getCache(const VSAUserIden
     // A map without a container that is there would let the next creation
     // make it a second time: a read the system failed fails the rebuild.
     if (!m && VSAMetadata::isTransientReadFailure(readError)) {
-      VSASetError(error, cacheError(43, "Cache: %@%@: could not read %@: %@", key,
-                                    transientTag(transient), item.path, readError));
+      VSASetError(error,
+                  cacheError(VSAResult::kCacheRebuildFailed, "Cache: %@%@: could not read %@: %@",
+                             key, transientTag(transient), item.path, readError));
       return nullptr;
     }
     if (!m) continue;
@@ -156,8 +158,8 @@ VSAMetadataRef VSAContainerCache::_lock_metadataFromSandbox(const VSAContainerId
 bool VSAContainerCache::checkFound(const VSAMetadata& m, const std::string& key, bool transient,
                                    VSAErrorRef* error) {
   if (m.url().empty()) {
-    VSASetError(error,
-                cacheError(47, "Cache: %@%@: nil URL from %@", key, transientTag(transient), m));
+    VSASetError(error, cacheError(VSAResult::kCacheEntryWithoutURL, "Cache: %@%@: nil URL from %@",
+                                  key, transientTag(transient), m));
     return false;
   }
   std::string metadataFile = VSAPathJoin(m.url(), kVSAMetadataFileName);
@@ -166,14 +168,16 @@ bool VSAContainerCache::checkFound(const VSAMetadata& m, const std::string& key,
   if (!fm.itemDoesNotExistAtURL(metadataFile)) {
     // The disk could not say (an I/O error): dropping the entry would let the
     // next creation make a second container, so it stays and this look-up fails.
-    VSASetError(error, cacheError(44, "Cache: %@%@: cannot check the metadata at: %@ for id: %@",
-                                  key, transientTag(transient), m.url(), m.identifier()));
+    VSASetError(error, cacheError(VSAResult::kCacheInconsistent,
+                                  "Cache: %@%@: cannot check the metadata at: %@ for id: %@", key,
+                                  transientTag(transient), m.url(), m.identifier()));
     return false;
   }
   {
     VSASetError(
         error,
-        cacheError(44, "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu", key,
+        cacheError(VSAResult::kCacheInconsistent,
+                   "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu", key,
                    transientTag(transient), m.url(), m.identifier(), m.containerClass()));
     VSAErrorRef removeError;
     if (!removeContainerForUserIdentity(m.userIdentity(), m.containerClass(), m.identifier(),

@@ -8,11 +8,7 @@
 #include "base/VSATestLocks.h"
 #include "model/VSAConcreteContainerIdentity.h"
 
-namespace {
-constexpr VSAResultCode kDeleteFailed = 28;
-constexpr VSAResultCode kCacheRemovalFailed = 46;
-
-}  // namespace
+namespace {}  // namespace
 
 std::shared_ptr<VSACommandStageForDelete>
 VSACommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
@@ -91,7 +87,7 @@ bool VSACommandStageForDelete::stage(const VSAContainerIdentity& identity, VSACo
     if (!config.fileManager().removeItemAtURL(container->url(), &error)) {
       VSALog(kVSALogError, "fromQueue", "Failed to delete container at %@: %@", container->url(),
              error);
-      *code = kDeleteFailed;
+      *code = VSAResult::kDeleteFailed;
       return true;  // keep the cache entry; go on with the next container
     }
   }
@@ -101,7 +97,7 @@ bool VSACommandStageForDelete::stage(const VSAContainerIdentity& identity, VSACo
     VSALog(kVSALogError, "fromQueue",
            "Failed to remove from cache id: %@, class: %ld, transient: %d", container->identifier(),
            static_cast<long>(container->containerClass()), transient);
-    *code = kCacheRemovalFailed;
+    *code = VSAResult::kCacheRemoveFailed;
     return false;
   }
   return true;
@@ -111,8 +107,8 @@ bool VSACommandStageForDelete::fromQueue(VSACommandQueue& queue, VSAResultCode* 
   VSAResultCode code = VSAResult::kSuccess;
   if (!environment_ || !environment_->cache || !environment_->configuration) {
     VSALog(kVSALogFault, "fromQueue", "Stage-for-delete command made without its environment");
-    if (onError_) onError_(kDeleteFailed);
-    VSASetCode(executeWithError, kDeleteFailed);
+    if (onError_) onError_(VSAResult::kDeleteFailed);
+    VSASetCode(executeWithError, VSAResult::kDeleteFailed);
     return false;
   }
   try {
@@ -121,7 +117,7 @@ bool VSACommandStageForDelete::fromQueue(VSACommandQueue& queue, VSAResultCode* 
       if (identity && !stage(*identity, queue, &code)) break;
   } catch (const std::exception& e) {
     VSALog(kVSALogError, "fromQueue", "Got exception: %@ : %@", "std::exception", e.what());
-    code = kDeleteFailed;
+    code = VSAResult::kDeleteFailed;
   }
   if (code == VSAResult::kSuccess) return true;
   if (onError_) onError_(code);

@@ -14,7 +14,6 @@
 #include "platform/VSAUniqueFd.h"
 
 namespace {
-constexpr VSAResultCode kCacheAddFailed = 45;
 
 bool fail(const char* origin, VSAResultCode code, VSAResultCode* cell, const std::string& message) {
   VSALog(kVSALogError, origin, "%@", message);
@@ -86,7 +85,7 @@ bool VSAContainerContent::recordAssetsDirectory(VSAMetadata& container, VSAResul
   }
   if (!services_.containerCache->addContainerMetadata(*fresh, fresh->url(), fresh->transient(),
                                                       true, &error))
-    return fail("recordAssetsDirectory", kCacheAddFailed, withError,
+    return fail("recordAssetsDirectory", VSAResult::kCacheAddFailed, withError,
                 VSAFormat("Failed to add to cache: %@", *fresh));
   return true;
 }

@@ -5,9 +5,7 @@
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
 
-namespace {
-constexpr VSAResultCode kStagingCreateFailed = 7;
-}
+namespace {}
 
 int32_t VSAContainerDirectories::_dataProtectionClassForContainerMetadata(
     const VSAMetadata& metadata) {
@@ -67,9 +65,9 @@ bool VSAContainerDirectories::_createSubDirectories(const std::string& url,
     if (!fm.createDirectoryAtURL(path, true, mode, owner, static_cast<uint32_t>(itemClass),
                                  &underlying, group) ||
         (system && !fm.setSystemContainerDirectoryACLAtURL(path, &underlying))) {
-      auto e = VSA_ERROR_UNDERLYING(underlying->resultCode(kStagingCreateFailed), underlying,
-                                    "Failed to create sub-dir for %@ at %@ (protClass: %d)", name,
-                                    url, itemClass);
+      auto e = VSA_ERROR_UNDERLYING(
+          underlying->resultCode(VSAResult::kStagingCreateFailed), underlying,
+          "Failed to create sub-dir for %@ at %@ (protClass: %d)", name, url, itemClass);
       VSALog(kVSALogError, __func__, "%@", e->message());
       VSASetError(error, e);
       return false;

@@ -14,12 +14,6 @@
 
 namespace {
 const char* const kOrigin = "createOrLookupContainerWithContainerIdentity";
-constexpr VSAResultCode kTransientRemovalFailed = 5;
-constexpr VSAResultCode kStagingCreateFailed = 7;
-constexpr VSAResultCode kStagingMoveFailed = 8;
-constexpr VSAResultCode kStagingRemovalFailed = 9;
-constexpr VSAResultCode kException = 40;
-constexpr VSAResultCode kCacheAddFailed = 45;
 
 VSAErrorRef failure(VSAResultCode code, VSAErrorRef underlying, std::string message) {
   auto e = VSAError::make(code, std::move(underlying), kOrigin, __LINE__, "%@", message);
@@ -112,7 +106,7 @@ struct CreateSteps {
     if (!VSAContainerDirectories(services)._createTopLevelContainerDirectory(
             staging, c, user->posixUIDForContainerClass(c), user->posixGIDForContainerClass(c),
             &underlying)) {
-      *error = failure(kStagingCreateFailed, underlying,
+      *error = failure(VSAResult::kStagingCreateFailed, underlying,
                        VSAFormat("Failed to create staging dir at %@ : %@", staging, underlying));
       // The directory may exist although a later step of its creation (its
       // protection class, its owner) failed; its name is fresh, so it is ours.
@@ -131,7 +125,7 @@ struct CreateSteps {
   void discard(const std::string& directory, VSAErrorRef* error) {
     VSAErrorRef cleanup;
     if (!services.deathRow->_moveItemAtURLToDeathRow(directory, true, true, &cleanup))
-      *error = failure(kStagingRemovalFailed, *error,
+      *error = failure(VSAResult::kStagingRemovalFailed, *error,
                        VSAFormat("Failed to remove staging dir: %@", directory));
   }
 
@@ -158,7 +152,7 @@ struct CreateSteps {
     VSAErrorRef underlying;
     VSATestLocks::shared().waitOnLock(kVSATestLockCreate);
     if (!base || !services.fileManager->moveItemAtURL(staging, live, &underlying)) {
-      *error = failure(kStagingMoveFailed, underlying,
+      *error = failure(VSAResult::kStagingMoveFailed, underlying,
                        VSAFormat("Failed to move staging dir: %@ to live dir: %@", staging, live));
       return nullptr;
     }
@@ -170,7 +164,7 @@ struct CreateSteps {
     metadata->setTransient(transient);
     if (!services.containerCache->addContainerMetadata(*metadata, live, transient, true,
                                                        &underlying)) {
-      *error = failure(kCacheAddFailed, underlying,
+      *error = failure(VSAResult::kCacheAddFailed, underlying,
                        VSAFormat("Failed to add to cache : %@, url: %@, transient: %d", *metadata,
                                  live, transient));
       // The container is complete on disk but unknown to the cache; the caller
@@ -227,7 +221,7 @@ VSAMetadataRef VSAContainerLookup::createOrLookupContainerWithContainerIdentity(
         VSAErrorRef moveError;
         if (found &&
             !services_.deathRow->_moveItemAtURLToDeathRow(found->url(), true, true, &moveError)) {
-          error = failure(kTransientRemovalFailed, moveError,
+          error = failure(VSAResult::kTransientRemovalFailed, moveError,
                           VSAFormat("Failed to remove transient container at %@", found->url()));
         } else {
           if (found)
@@ -239,12 +233,12 @@ VSAMetadataRef VSAContainerLookup::createOrLookupContainerWithContainerIdentity(
     }
   } catch (const std::exception& e) {
     if (services_.configuration->isInternalImage()) std::terminate();
-    error = failure(kException, nullptr,
+    error = failure(VSAResult::kExceptionInTransaction, nullptr,
                     VSAFormat("Got exception: %@ : %@", "std::exception", e.what()));
     found = nullptr;
   }
   if (error) {
-    VSASetCode(withError, error->resultCode(kStagingCreateFailed));
+    VSASetCode(withError, error->resultCode(VSAResult::kStagingCreateFailed));
     return nullptr;
   }
   return found;

@@ -11,10 +11,6 @@
 #include "operations/VSAContainerLookup.h"
 
 namespace {
-constexpr VSAResultCode kInfoValueNotSet = 24;
-constexpr VSAResultCode kException = 40;
-constexpr VSAResultCode kCacheAddFailed = 45;
-constexpr VSAResultCode kMoveToNewUUIDFailed = 48;
 
 bool fail(const char* origin, VSAResultCode code, VSAResultCode* cell, const std::string& message,
           int level = kVSALogError) {
@@ -32,7 +28,8 @@ auto guarded(const char* origin, bool internal, VSAResultCode* cell, Body body)
     return body();
   } catch (const std::exception& e) {
     if (internal) std::terminate();
-    fail(origin, kException, cell, VSAFormat("Got exception: %@ : %@", "std::exception", e.what()));
+    fail(origin, VSAResult::kExceptionInTransaction, cell,
+         VSAFormat("Got exception: %@ : %@", "std::exception", e.what()));
     return {};
   }
 }
@@ -109,11 +106,11 @@ bool VSAContainerMaintenance::regenerateDirectoryUUIDWithContainerIdentity(
     std::string moved = VSAPathJoin(VSADirectoryName(m->url()), VSAUUID::random().string());
     VSAErrorRef error;
     if (!services_.fileManager->moveItemAtURL(m->url(), moved, &error))
-      return fail(origin, kMoveToNewUUIDFailed, withError,
+      return fail(origin, VSAResult::kMoveToNewUUIDFailed, withError,
                   VSAFormat("Failed to move dir: %@ to new UUID dir: %@", m->url(), moved));
     m->setUrl(moved);
     if (!services_.containerCache->addContainerMetadata(*m, moved, m->transient(), true, &error))
-      return fail(origin, kCacheAddFailed, withError,
+      return fail(origin, VSAResult::kCacheAddFailed, withError,
                   VSAFormat("Failed to add to cache: %@, url: %@, transient: %d", *m, moved,
                             m->transient()));
     return true;
@@ -156,7 +153,7 @@ std::optional<VSAValue> VSAContainerMaintenance::infoValueForKey(
         if (!m || !(m = reread(*m, origin, withError))) return std::nullopt;
         const VSAValue* value = m->info() ? m->info()->get(*key->stringValue()) : nullptr;
         if (!value) {
-          fail(origin, kInfoValueNotSet, withError,
+          fail(origin, VSAResult::kInfoValueNotSet, withError,
                VSAFormat("Didn't find info value for key: %@", *key->stringValue()), kVSALogDebug);
           return std::nullopt;
         }
@@ -196,7 +193,7 @@ bool VSAContainerMaintenance::setInfoValue(const VSAValue* value, const VSAValue
       return false;
     }
     if (!services_.containerCache->addContainerMetadata(*m, m->url(), m->transient(), true, &error))
-      return fail(origin, kCacheAddFailed, withError,
+      return fail(origin, VSAResult::kCacheAddFailed, withError,
                   VSAFormat("Failed to add to cache: %@, url: %@, transient: %d", *m, m->url(),
                             m->transient()));
     return true;

@@ -8,7 +8,6 @@
 #include "base/VSAUUID.h"
 
 namespace {
-constexpr VSAResultCode kDeleteFailed = 28;
 // Tries to move one item into a fresh death-row directory that a concurrent
 // emptying may remove first.
 constexpr int kMoveAttempts = 5;
@@ -128,7 +127,7 @@ VSAResultCode VSADeathRow::emptyDeathRow() {
   if (!items) {
     if (isMissing(error)) return VSAResult::kSuccess;
     VSALog(kVSALogError, fn, "Failed to get items for deletion: %@ : %@", deathrow, error);
-    return kDeleteFailed;
+    return VSAResult::kDeleteFailed;
   }
   VSAResultCode code = VSAResult::kSuccess;
   VSAProgressLog progress(VSALogCategory::Unspecified, fn, "Emptying death row", items->size(),
@@ -137,7 +136,7 @@ VSAResultCode VSADeathRow::emptyDeathRow() {
   for (const auto& item : *items) {
     if (!_removeItemOrMoveToTempAtURL(item.path, &error, freed)) {
       VSALog(kVSALogError, fn, "Failed to destroy item at: %@", item.path);
-      code = kDeleteFailed;
+      code = VSAResult::kDeleteFailed;
     }
     progress.advance();
   }

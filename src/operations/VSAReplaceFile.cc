@@ -5,7 +5,6 @@
 #include "base/VSAPlist.h"
 
 namespace {
-constexpr VSAResultCode kInvalidReplaceInfo = 33;
 
 std::string orNull(const std::optional<std::string>& s) { return s ? *s : "(null)"; }
 
@@ -30,7 +29,7 @@ bool VSAReplaceFile::_writeToDiskReplaceAt(VSAFileManager& fm, const std::string
                                            VSAErrorRef* error) {
   const char* fn = "_writeToDiskReplaceAt";
   if (!old || !withNew || !usingStaging || !toDestination) {
-    VSASetError(error, fail(kInvalidReplaceInfo, fn, __LINE__,
+    VSASetError(error, fail(VSAResult::kInvalidReplaceInfo, fn, __LINE__,
                             VSAFormat("Invalid Replace File Info: old: %@, new: %@, staging: %@, "
                                       "dest: %@",
                                       orNull(old), orNull(withNew), orNull(usingStaging),

@@ -12,15 +12,6 @@
 
 namespace {
 const char* const kOrigin = "replaceContainerIdentity";
-constexpr VSAResultCode kNotAUUID = 10;
-constexpr VSAResultCode kMoveToStagingFailed = 14;
-constexpr VSAResultCode kMoveToDestinationFailed = 15;
-constexpr VSAResultCode kSameContainer = 22;
-constexpr VSAResultCode kDifferentClasses = 23;
-constexpr VSAResultCode kAlreadyExists = 27;
-constexpr VSAResultCode kException = 40;
-constexpr VSAResultCode kCacheAddFailed = 45;
-constexpr VSAResultCode kCacheRemoveFailed = 46;
 
 std::string describe(const VSAContainerIdentityRef& identity) {
   return identity ? identity->description() : std::string("(null)");
@@ -67,10 +58,10 @@ struct ReplaceRun {
       return fail(VSAResult::kContainerNotFound,
                   VSAFormat("No Container with identity: %@", newIdentity.description()));
     if (oldContainer->url() == newContainer->url())
-      return fail(kSameContainer,
+      return fail(VSAResult::kSameContainer,
                   VSAFormat("Can't replace the same container at %@", oldContainer->url()));
     if (!VSAUUID::parse(VSALastPathComponent(oldContainer->url())))
-      return fail(kNotAUUID,
+      return fail(VSAResult::kNotAUUID,
                   VSAFormat("Invalid URL (last path component not UUID): %@", oldContainer->url()));
     return true;
   }
@@ -86,14 +77,14 @@ struct ReplaceRun {
         newIdentity.userIdentity(), newIdentity.containerClass(), resultTransient);
     destURL = VSAPathJoin(base.value_or(""), uuidOf(newIdentity)->string());
     if (!base || services.fileManager->itemExistsAtURL(destURL))
-      return fail(kAlreadyExists, VSAFormat("Container already exists at %@", destURL));
+      return fail(VSAResult::kAlreadyExists, VSAFormat("Container already exists at %@", destURL));
     if (resultTransient) return true;
     // The new container's own entry and the old one's are given up by the
     // exchange; any other holder of the identifier would be a twin.
     auto holder = services.containerCache->containerForContainerIdentity(newIdentity, false, false,
                                                                          false, nullptr);
     if (holder && holder->url() != newContainer->url() && holder->url() != oldContainer->url())
-      return fail(kAlreadyExists,
+      return fail(VSAResult::kAlreadyExists,
                   VSAFormat("Container with identifier: %@, class: %ld, transient: %d already "
                             "exists",
                             newIdentity.identifier(),
@@ -136,8 +127,8 @@ struct ReplaceRun {
     auto& cache = *services.containerCache;
     VSAErrorRef error;
     if (!fm.moveItemAtURL(oldContainer->url(), stagingURL, &error))
-      return fail(kMoveToStagingFailed, VSAFormat("Failed to move old %@ to staging %@",
-                                                  oldContainer->url(), stagingURL));
+      return fail(VSAResult::kMoveToStagingFailed, VSAFormat("Failed to move old %@ to staging %@",
+                                                             oldContainer->url(), stagingURL));
     movedAside = true;
     if (!cache.removeContainerForUserIdentity(
             oldContainer->userIdentity(), oldContainer->containerClass(),
@@ -150,7 +141,7 @@ struct ReplaceRun {
              oldContainer->identifier());
     VSATestLocks::shared().waitOnLock(kVSATestLockReplace);
     if (!fm.moveItemAtURL(newContainer->url(), destURL, &error))
-      return fail(kMoveToDestinationFailed,
+      return fail(VSAResult::kMoveToDestinationFailed,
                   VSAFormat("Failed to replace: %@ with: %@ at: %@", oldContainer->url(),
                             newContainer->url(), destURL));
     placed = true;
@@ -158,7 +149,7 @@ struct ReplaceRun {
   }
 
   bool cacheRemovalFailed(const VSAMetadata& m) {
-    return fail(kCacheRemoveFailed,
+    return fail(VSAResult::kCacheRemoveFailed,
                 VSAFormat("Failed to remove from cache id: %@, class: %ld, transient: %d",
                           m.identifier(), static_cast<long>(m.containerClass()), m.transient()));
   }
@@ -174,8 +165,9 @@ struct ReplaceRun {
     result.setUrl(destURL);
     result.setTransient(resultTransient);
     if (!cache.addContainerMetadata(result, destURL, resultTransient, true, nullptr))
-      return fail(kCacheAddFailed, VSAFormat("Failed to add to cache: %@, url: %@, transient: %d",
-                                             result, destURL, resultTransient));
+      return fail(VSAResult::kCacheAddFailed,
+                  VSAFormat("Failed to add to cache: %@, url: %@, transient: %d", result, destURL,
+                            resultTransient));
     return true;
   }
 
@@ -221,7 +213,7 @@ struct ReplaceRun {
         restoreOld("Recovering from failed replace by moving: %@ to %@");
     } catch (const std::exception& e) {
       VSALog(kVSALogError, kOrigin, "Got exception: %@ : %@", "std::exception", e.what());
-      if (code == VSAResult::kSuccess) code = kException;
+      if (code == VSAResult::kSuccess) code = VSAResult::kExceptionInTransaction;
       if (movedAside && !placed) restoreOld("Recovering from exception by moving: %@ to %@");
     }
     finish();
@@ -243,7 +235,7 @@ bool invalidArguments(const VSAContainerIdentityRef& oldIdentity,
                   VSAFormat("Can't act on an invalid object: newUUID: %@, Class: %ld",
                             newUUID ? newUUID->string() : std::string("(null)"), newClass));
   if (oldIdentity->containerClass() != newIdentity->containerClass())
-    return refuse(kDifferentClasses,
+    return refuse(VSAResult::kDifferentClasses,
                   VSAFormat("Can't replace containers of different class types: %ld and %ld",
                             static_cast<long>(oldIdentity->containerClass()), newClass));
   if (preserveOldUUID && !uuidOf(*oldIdentity))
