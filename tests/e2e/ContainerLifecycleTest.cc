@@ -39,23 +39,6 @@ void enterPersona(const VSATestDaemon& d, uint32_t personaID) {
       << VSAAuditToken::processStartTime(getpid()) << " " << personaID << "\n";
 }
 
-void writePersonas(const VSATestDaemon& d, const std::string& enterpriseApp) {
-  VSAValue personas = VSAValue::Array{
-      VSAValue::Dictionary{{"PersonaID", VSAValue(1000u)},
-                           {"Kind", VSAValue("personal")},
-                           {"UniqueString", VSAValue("PERSONAL-1000")}},
-      VSAValue::Dictionary{
-          {"PersonaID", VSAValue(1001u)},
-          {"Kind", VSAValue("enterprise")},
-          {"UniqueString", VSAValue("WORK-1001")},
-          {"LayoutPath", VSAValue("/private/var/enterprise/1001")},
-          {"BundleIdentifiers", VSAValue(VSAValue::Array{VSAValue(enterpriseApp)})}}};
-  fs::create_directories(d.path("/private/var/enterprise/1001"));
-  auto bytes = VSAPlist::serialize(personas, VSAPlist::Format::XML, nullptr);
-  std::ofstream(d.path("/etc/vessad/personas.plist"), std::ios::binary)
-      .write(reinterpret_cast<const char*>(bytes->data()), bytes->size());
-}
-
 TEST(DaemonContainers, CreateLookUpDeleteAndEmptyDeathRow) {
   VSATestDaemon d;
   d.registerSelf(
@@ -141,7 +124,7 @@ TEST(DaemonContainers, LookupEntitlementMatrixForCommandZero) {
 
 TEST(DaemonContainers, SandboxTokensOnlyForEnterpriseContainers) {
   VSATestDaemon d;
-  writePersonas(d, "com.example.work");
+  d.writePersonas("com.example.work");
   d.registerSelf("com.example.work", VSAValue::Dictionary{{kAllowed, VSAValue(true)}}, true);
   ASSERT_TRUE(d.start());
   auto personal = d.request(createRequest("com.example.work"));
@@ -163,7 +146,7 @@ TEST(DaemonContainers, SandboxTokensOnlyForEnterpriseContainers) {
 
 TEST(DaemonContainers, GroupContainersOfAnOwnerCarryTokensOnlyInEnterprisePersonas) {
   VSATestDaemon d;
-  writePersonas(d, "com.example.work");
+  d.writePersonas("com.example.work");
   d.registerSelf("com.example.work",
                  VSAValue::Dictionary{{kAllowed, VSAValue(true)},
                                       {"com.tamsk.security.application-groups",

@@ -15,7 +15,6 @@
 #include "VSALaunchOptions.h"
 #include "VSALauncher.h"
 #include "base/VSAJSON.h"
-#include "base/VSAPlist.h"
 #include "e2e/VSATestDaemon.h"
 #include "platform/VSALandlock.h"
 
@@ -196,20 +195,8 @@ TEST_F(LaunchedApps, APlugInGetsItsPlugInDataContainer) {
 }
 
 TEST_F(LaunchedApps, AnEnterpriseAppIsConfinedToItsPersonasContainers) {
-  VSAValue personas = VSAValue::Array{
-      VSAValue::Dictionary{{"PersonaID", VSAValue(1000u)},
-                           {"Kind", VSAValue("personal")},
-                           {"UniqueString", VSAValue("PERSONAL-1000")}},
-      VSAValue::Dictionary{{"PersonaID", VSAValue(1001u)},
-                           {"Kind", VSAValue("enterprise")},
-                           {"UniqueString", VSAValue("WORK-1001")},
-                           {"LayoutPath", VSAValue("/private/var/enterprise/1001")},
-                           {"BundleIdentifiers", VSAValue(VSAValue::Array{VSAValue("com.work")})}}};
-  fs::create_directories(d.path("/private/var/enterprise/1001"));
+  d.writePersonas("com.work");
   ::chown(d.path("/private/var/enterprise/1001").c_str(), 501, 501);
-  auto bytes = VSAPlist::serialize(personas, VSAPlist::Format::XML, nullptr);
-  std::ofstream(d.path("/etc/vessad/personas.plist"), std::ios::binary)
-      .write(reinterpret_cast<const char*>(bytes->data()), bytes->size());
   std::string client = installInBundle("com.work");
   std::string work = text(rules("com.work", {"--persona", "1001"}), "Home");
   std::string personal = text(rules("com.work"), "Home");

@@ -78,6 +78,23 @@ void VSATestDaemon::registerUpcallTool() {
              "com.tamsk.kernel.sandbox-bridge", VSAValue::dictionary(), false, true);
 }
 
+void VSATestDaemon::writePersonas(const std::string& enterpriseApp) const {
+  VSAValue personas = VSAValue::Array{
+      VSAValue::Dictionary{{"PersonaID", VSAValue(1000u)},
+                           {"Kind", VSAValue("personal")},
+                           {"UniqueString", VSAValue("PERSONAL-1000")}},
+      VSAValue::Dictionary{
+          {"PersonaID", VSAValue(1001u)},
+          {"Kind", VSAValue("enterprise")},
+          {"UniqueString", VSAValue("WORK-1001")},
+          {"LayoutPath", VSAValue("/private/var/enterprise/1001")},
+          {"BundleIdentifiers", VSAValue(VSAValue::Array{VSAValue(enterpriseApp)})}}};
+  fs::create_directories(path("/private/var/enterprise/1001"));
+  auto bytes = VSAPlist::serialize(personas, VSAPlist::Format::XML, nullptr);
+  std::ofstream(path("/etc/vessad/personas.plist"), std::ios::binary)
+      .write(reinterpret_cast<const char*>(bytes->data()), bytes->size());
+}
+
 void VSATestDaemon::registerLaunchTool() {
   fs::copy_file(VESSA_LAUNCH_PATH, root_ + "/usr/bin/vessa-launch",
                 fs::copy_options::overwrite_existing);

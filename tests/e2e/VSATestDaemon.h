@@ -69,6 +69,11 @@ class VSATestDaemon {
   void registerVessactl(const std::string& name, const std::string& signingIdentifier,
                         const VSAValue& entitlements);
 
+  // Writes the device's persona list: the personal persona 1000
+  // ("PERSONAL-1000") and the enterprise persona 1001 ("WORK-1001", laid out
+  // in /private/var/enterprise/1001) that lists `enterpriseApp`.
+  void writePersonas(const std::string& enterpriseApp) const;
+
   // Runs vessad through `prefix` (for example a program that starts it in a
   // namespace of its own) from the next start on.
   void setLaunchPrefix(std::vector<std::string> prefix) { prefix_ = std::move(prefix); }
