@@ -88,8 +88,10 @@ bool VSACodeSigningMapping::_onQueue_migrateDataFromLegacyEntitlementsFileToCode
     entry.setRegisteredByCaller(flagFor(&byCaller, identifier));
     bool kept = false;
     VSAErrorRef addError;
+    // A named copy for the lambda: clang 14 cannot capture a structured binding.
+    const std::string& migrating = identifier;
     if (!_onQueue_addLegacyEntryUnlessValid(identifier, entry, &kept, &addError, [&] {
-          logLegacy(kVSALogNotice, origin, "Migrating legacy entitlements for %@", identifier);
+          logLegacy(kVSALogNotice, origin, "Migrating legacy entitlements for %@", migrating);
         })) {
       logLegacy(kVSALogError, origin, "Failed to write migrated legacy info to DB for %@ : %@",
                 identifier, addError);
