@@ -42,7 +42,7 @@ class OldBundleWalk {
       if (!moveClass(from.get(), to.get(), entry.name, VSAPathJoin(old, entry.name))) return false;
       if (left_ == before) fs_.unlinkAt(from.get(), entry.name, true);
     }
-    if (left_ == 0) fs_.rmdir(old);
+    if (left_ == 0) VSARemoveDirectoryWithoutLinks(fs_, old);
     return true;
   }
 

@@ -93,8 +93,9 @@ bool VSASystemContainerRestore::moveToInProgress(const std::string& backup,
   // The backup lies in the user's home, where the user can put anything at
   // its name at any moment: whatever is there is first taken out of the
   // user's reach (one rename, never a copy) and only then looked at, so the
-  // directory checked is the directory restored.
-  if (int rc = fm.fileSystem().rename(backup, inProgress)) {
+  // directory checked is the directory restored. Its parents are taken without
+  // following a link, so a swapped parent cannot bring in another directory.
+  if (int rc = VSARenameWithoutLinks(fm.fileSystem(), backup, inProgress)) {
     logRestore(kVSALogError, kOrigin, moveFailure,
                VSAError::posix(rc, "moveToInProgress", __LINE__,
                                VSAFormat("%@ -> %@: %s", backup, inProgress, std::strerror(rc))));

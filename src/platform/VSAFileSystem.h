@@ -181,3 +181,10 @@ class VSAFileSystem {
   static constexpr int kImmutableFlag = 0x00000010;
   static const char* opName(Op op);
 };
+
+// Path calls for items in places others can change (a user's home): each
+// parent directory is opened without following a link anywhere on its path
+// and the item is named relative to it, so a parent swapped for a link
+// cannot send the call elsewhere. 0 or an errno.
+int VSARenameWithoutLinks(VSAFileSystem& fs, const std::string& from, const std::string& to);
+int VSARemoveDirectoryWithoutLinks(VSAFileSystem& fs, const std::string& path);

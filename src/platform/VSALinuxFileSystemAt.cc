@@ -360,3 +360,19 @@ int VSALinuxFileSystem::setxattrAt(int dir, const std::string& name, const std::
     return err(::setxattr(path.c_str(), attribute.c_str(), value.data(), value.size(), 0));
   return err(::lsetxattr(path.c_str(), attribute.c_str(), value.data(), value.size(), 0));
 }
+
+int VSARenameWithoutLinks(VSAFileSystem& fs, const std::string& from, const std::string& to) {
+  int fromDir = -1, toDir = -1;
+  if (int rc = fs.openDirectory(VSADirectoryName(from), &fromDir)) return rc;
+  VSAUniqueFd fromOwned(fromDir);
+  if (int rc = fs.openDirectory(VSADirectoryName(to), &toDir)) return rc;
+  VSAUniqueFd toOwned(toDir);
+  return fs.renameAt(fromDir, VSALastPathComponent(from), toDir, VSALastPathComponent(to));
+}
+
+int VSARemoveDirectoryWithoutLinks(VSAFileSystem& fs, const std::string& path) {
+  int dir = -1;
+  if (int rc = fs.openDirectory(VSADirectoryName(path), &dir)) return rc;
+  VSAUniqueFd owned(dir);
+  return fs.unlinkAt(dir, VSALastPathComponent(path), true);
+}

@@ -149,6 +149,12 @@ class BackupSwappingFileSystem : public VSAFaultInjectingFileSystem {
     swapIfBackup(from);
     return VSAFaultInjectingFileSystem::renameWithoutSync(from, to);
   }
+  int renameAt(int fromDir, const std::string& fromName, int toDir,
+               const std::string& toName) override {
+    if (!backup_.empty() && fromName == fs::path(backup_).filename().string())
+      swapIfBackup(backup_);
+    return VSAFaultInjectingFileSystem::renameAt(fromDir, fromName, toDir, toName);
+  }
 
  private:
   void swapIfBackup(const std::string& from) {
@@ -160,6 +166,31 @@ class BackupSwappingFileSystem : public VSAFaultInjectingFileSystem {
   std::string backup_, planted_;
   bool swapped_ = false;
 };
+
+TEST_F(Boot, ABackupWhoseParentIsALinkBringsInNothingFromWhereItPoints) {
+  VSAResultCode code;
+  auto live = create(*installer(), "com.example.sys", &code, false, 12);
+  ASSERT_TRUE(live) << code;
+  put(live->url() + "/shared.txt", "live");
+  // The user turns the backup's parent into a link to a place holding a
+  // root-owned directory of the backup's name.
+  std::string backup = perUser()->systemContainerBackupDirectory();
+  std::string parent = fs::path(backup).parent_path().string();
+  std::string elsewhere = root_ + "/elsewhere";
+  fs::create_directories(elsewhere + "/" + fs::path(backup).filename().string() +
+                         "/com.example.sys");
+  put(elsewhere + "/" + fs::path(backup).filename().string() + "/com.example.sys/shared.txt",
+      "root's, elsewhere");
+  fs::remove_all(parent);
+  fs::create_directories(fs::path(parent).parent_path());
+  fs::create_directory_symlink(elsewhere, parent);
+  rebootSetup();
+  EXPECT_EQ(read(live->url() + "/shared.txt"), "live");
+  EXPECT_TRUE(fs::exists(elsewhere + "/" + fs::path(backup).filename().string() +
+                         "/com.example.sys/shared.txt"))
+      << "the directory the link points to stays where it is";
+  EXPECT_FALSE(fs::exists(library() + "/Data.inprogress"));
+}
 
 TEST_F(Boot, ABackupSwappedBeforeItIsMovedIsNotRestoredAndRestoredItemsAreRoots) {
   VSAResultCode code;
