@@ -1,7 +1,5 @@
 #include "base/VSALog.h"
 
-#include <spdlog/sinks/rotating_file_sink.h>
-#include <spdlog/spdlog.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -9,6 +7,7 @@
 #include <cstdio>
 #include <ctime>
 
+#include "base/VSALogFile.h"
 #include "base/VSASystemdLibrary.h"
 
 std::atomic<int> gVSALogWriterLevel{kVSALogNotice};
@@ -61,37 +60,10 @@ const char* VSALogger::categoryName(VSALogCategory category) {
   return "unspecified";
 }
 
-bool VSALogger::openRotatingLog(const std::string& path, int writerLevel) {
-  std::lock_guard lock(mutex_);
-  try {
-    auto sink = std::make_shared<spdlog::sinks::rotating_file_sink_mt>(path, 102400, 3);
-    file_ = std::make_shared<spdlog::logger>("com.tamsk.vessad", sink);
-    file_->set_pattern("%Y-%m-%d %H:%M:%S.%e %v");
-    file_->set_level(spdlog::level::trace);
-    file_->flush_on(spdlog::level::trace);
-  } catch (const std::exception&) {
-    file_.reset();
-    return false;
-  }
-  if (writerLevel > level()) setLevel(writerLevel);
-  return true;
-}
-
 void VSALogger::enableDiskLogging(int diskLevel, size_t sizeLimit) {
   std::lock_guard lock(mutex_);
   if (!file_) return;
-  // Re-create the sink with the requested size limit on the same file.
-  auto old =
-      std::dynamic_pointer_cast<spdlog::sinks::rotating_file_sink_mt>(file_->sinks().front());
-  if (old) {
-    try {
-      auto sink =
-          std::make_shared<spdlog::sinks::rotating_file_sink_mt>(old->filename(), sizeLimit, 3);
-      file_->sinks().front() = sink;
-      file_->set_pattern("%Y-%m-%d %H:%M:%S.%e %v");
-    } catch (const std::exception&) {
-    }
-  }
+  file_->setSizeLimit(sizeLimit);
   diskEnabled_ = true;
   diskMaxLevel_ = diskLevel >= 4 ? kVSALogDebug : kVSALogNotice;
 }
@@ -152,8 +124,8 @@ void VSALogger::write(VSALogCategory category, int level, const char* origin,
   writeUnified(category, level, origin, message);
   std::lock_guard lock(mutex_);
   if (file_ && diskEnabled_ && level <= diskMaxLevel_) {
-    file_->info("{} [{}] <{}> {}: {}", getpid(), categoryName(category), levelName(level), origin,
-                message);
+    file_->writeLine(VSAFormat("%d [%s] <%s> %s: %s", getpid(), categoryName(category),
+                               levelName(level), origin, message));
   }
 }
 

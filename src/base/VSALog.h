@@ -21,9 +21,7 @@
 
 #include "base/VSAFormat.h"
 
-namespace spdlog {
-class logger;
-}
+class VSALogFile;
 
 enum VSALogLevel : int {
   kVSALogFault = 2,
@@ -58,6 +56,7 @@ class VSALogger {
   static VSALogger& shared();
 
   // Opens (creating) the rotating log file; false when it cannot be opened.
+  // (Defined in VSALogFile.cc.)
   bool openRotatingLog(const std::string& path, int writerLevel);
   // Turns on writing to the rotating file with a disk level and size limit.
   void enableDiskLogging(int diskLevel, size_t sizeLimit);
@@ -82,7 +81,7 @@ class VSALogger {
   void writeUnified(VSALogCategory category, int level, const char* origin, const std::string& m);
 
   std::mutex mutex_;
-  std::shared_ptr<spdlog::logger> file_;
+  std::unique_ptr<VSALogFile> file_;
   bool diskEnabled_ = false;
   int diskMaxLevel_ = kVSALogNotice;
   bool journald_ = false;
