@@ -5,21 +5,42 @@
 
 #include <climits>
 #include <cstdlib>
-#include <fstream>
-#include <sstream>
+#include <string_view>
 #include <vector>
 
 #include "base/VSALog.h"
+#include "base/VSAPlist.h"
 
 VSAUserDatabase::VSAUserDatabase(VSASystemRoot root) : root_(std::move(root)) {}
 
 namespace {
-std::vector<std::string> fields(const std::string& line) {
+// A device's account files are a few lines; a larger one is not read.
+constexpr size_t kVSAMaxAccountFileSize = 1 << 20;
+
+std::vector<std::string> fields(std::string_view line) {
   std::vector<std::string> out;
-  std::stringstream ss(line);
-  std::string f;
-  while (std::getline(ss, f, ':')) out.push_back(f);
-  if (!line.empty() && line.back() == ':') out.push_back("");
+  for (size_t start = 0;;) {
+    size_t colon = line.find(':', start);
+    out.emplace_back(line.substr(start, colon - start));
+    if (colon == std::string_view::npos) break;
+    start = colon + 1;
+  }
+  return out;
+}
+
+// The lines of one of the root's account files, split into fields; none when
+// it cannot be read (a link, not a regular file, too large).
+std::vector<std::vector<std::string>> records(const std::string& path) {
+  std::vector<uint8_t> bytes;
+  std::vector<std::vector<std::string>> out;
+  if (VSAReadRegularFile(path, kVSAMaxAccountFileSize, &bytes) != 0) return out;
+  std::string_view text(reinterpret_cast<const char*>(bytes.data()), bytes.size());
+  while (!text.empty()) {
+    size_t end = text.find('\n');
+    std::string_view line = text.substr(0, end);
+    if (!line.empty()) out.push_back(fields(line));
+    text.remove_prefix(end == std::string_view::npos ? text.size() : end + 1);
+  }
   return out;
 }
 
@@ -40,10 +61,7 @@ std::optional<VSAUserAccount> VSAUserDatabase::find(const std::string* name,
     if (rc != 0 || !result) return std::nullopt;
     return VSAUserAccount{pw.pw_name, pw.pw_uid, pw.pw_gid, pw.pw_dir ? pw.pw_dir : ""};
   }
-  std::ifstream in(root_.resolve("/etc/passwd"));
-  std::string line;
-  while (std::getline(in, line)) {
-    auto f = fields(line);
+  for (const auto& f : records(root_.resolve("/etc/passwd"))) {
     unsigned long u, g;
     if (f.size() < 7 || !parseID(f[2], u) || !parseID(f[3], g)) continue;
     if ((name && f[0] == *name) || (uid && u == *uid))
@@ -69,10 +87,7 @@ std::optional<gid_t> VSAUserDatabase::groupNamed(const std::string& name) const 
       return std::nullopt;
     return gr.gr_gid;
   }
-  std::ifstream in(root_.resolve("/etc/group"));
-  std::string line;
-  while (std::getline(in, line)) {
-    auto f = fields(line);
+  for (const auto& f : records(root_.resolve("/etc/group"))) {
     unsigned long g;
     if (f.size() >= 3 && f[0] == name && parseID(f[2], g)) return static_cast<gid_t>(g);
   }

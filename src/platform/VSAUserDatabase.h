@@ -3,7 +3,8 @@
 // For the root "/" it is the host's (NSS: getpwnam/getpwuid); for any other
 // root it is `<root>/etc/passwd` and `<root>/etc/group`, read on each query
 // (they are small and rarely read). Home directories are device paths in the
-// database and are returned resolved below the root. Thread-safe.
+// database and are returned resolved below the root. The files are read
+// bounded and never through a symbolic link. Thread-safe.
 #pragma once
 
 #include <sys/types.h>
