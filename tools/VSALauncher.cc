@@ -2,7 +2,9 @@
 
 #include <fcntl.h>
 #include <grp.h>
+#include <sched.h>
 #include <signal.h>
+#include <sys/mman.h>
 #include <sys/prctl.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -71,7 +73,7 @@ bool VSALauncher::resolvePersona(std::string* why) {
   return false;
 }
 
-bool VSALauncher::askForContainers(std::string* step, std::string* why) {
+bool VSALauncher::askForContainers(VSAUpcallClient& client, std::string* step, std::string* why) {
   VSAUpcallProcess process;
   process.codeSignatureID = options_.signingIdentifier;
   process.uid = uid_;
@@ -86,12 +88,10 @@ bool VSALauncher::askForContainers(std::string* step, std::string* why) {
   VSAUpcallRequest request;
   request.id = kVSAUpcallGetProcessContainersID;
   request.descriptorSize = request.requestSize = static_cast<uint32_t>(memory->size());
-  VSAUpcallClient client;
   std::vector<uint8_t> replyBytes;
   std::optional<std::vector<uint8_t>> replyMemory;
-  if (!client.connect(root_.upcallSocketPath(), why) ||
-      !client.call(request.bytes(), &*memory, &replyBytes, &replyMemory, why))
-    return false;
+  if (!client.isConnected()) return *why = "cannot connect to the daemon's upcall socket", false;
+  if (!client.call(request.bytes(), &*memory, &replyBytes, &replyMemory, why)) return false;
   auto reply = VSAUpcallReply::parse(replyBytes.data(), replyBytes.size());
   if (!reply) return *why = "the daemon's reply is not an upcall reply", false;
   if (reply->returnCode != 0)
@@ -112,15 +112,20 @@ bool VSALauncher::askForContainers(std::string* step, std::string* why) {
   return true;
 }
 
-void VSALauncher::lookUpBundle() {
-  VSAIPCClient client;
+std::optional<uint64_t> VSALauncher::askForBundle(VSAIPCClient& client) const {
   VSAErrorRef error;
   VSAValue request(VSAValue::Dictionary{{"Command", VSAValue(uint64_t{0})},
                                         {"Identifier", VSAValue(options_.signingIdentifier)},
                                         {"ContainerClass", VSAValue(kBundleClass)}});
+  if (!client.connect(root_.socketPath(), &error)) return std::nullopt;
+  return client.send(std::move(request), &error);
+}
+
+void VSALauncher::receiveBundle(VSAIPCClient& client, std::optional<uint64_t> messageID) {
+  VSAErrorRef error;
   std::optional<VSAValue> reply;
-  if (client.connect(root_.socketPath(), &error))
-    reply = client.sendRequest(request, std::chrono::seconds(10), &error);
+  if (messageID) reply = client.waitForReply(*messageID, std::chrono::seconds(10), &error);
+  client.close();
   const VSAValue* path = reply ? reply->get("ReplyPath") : nullptr;
   if (path && path->isString()) {
     containers_.bundleContainer = *path->stringValue();
@@ -177,10 +182,20 @@ int VSALauncher::run() {
   if (::geteuid() != 0)
     return fail("start", "must run as root (it records the app's process for the daemon)");
   std::string step = "user", why;
+  // The daemon identifies a peer as it accepts the connection, and answers
+  // the upcall and the bundle look-up on different threads: both
+  // connections are made, and the look-up sent, before the launcher reads
+  // the device's users and personas, which the upcall needs.
+  VSAUpcallClient upcallClient;
+  std::string upcallWhy;
+  (void)upcallClient.connect(root_.upcallSocketPath(), &upcallWhy);
+  VSAIPCClient bundleClient;
+  auto bundleRequest = askForBundle(bundleClient);
   if (!resolveUser(&why)) return fail(step, why);
   if (!resolvePersona(&why)) return fail("persona", why);
-  if (!askForContainers(&step, &why)) return fail(step, why);
-  lookUpBundle();
+  if (!upcallClient.isConnected()) return fail("upcall", upcallWhy);
+  if (!askForContainers(upcallClient, &step, &why)) return fail(step, why);
+  receiveBundle(bundleClient, bundleRequest);
   VSALaunchRules rules(containers_, options_.allowRead, options_.allowWrite);
   abi_ = landlock_.abiVersion();
   if (options_.printRules) {
@@ -194,89 +209,155 @@ int VSALauncher::run() {
   return status;
 }
 
-void VSALauncher::becomeApp(int ruleset, int goFd) {
-  char go = 0;
-  ssize_t n;
-  while ((n = ::read(goFd, &go, 1)) < 0 && errno == EINTR) {
+namespace {
+// What the child needs between clone and exec, all made beforehand: it
+// shares the launcher's memory and may not allocate.
+struct VSALaunchChild {
+  const VSAOwnProcessRecord* records[2];
+  uid_t uid;
+  gid_t gid;
+  int ruleset;
+  bool unconfined;
+  VSALandlock* landlock;
+  const char* home;
+  char* const* argv;
+  char* const* envp;
+  const char* prefix;  // "vessa-launch: <signing identifier>: "
+};
+
+void say(const char* text) {
+  for (size_t length = std::strlen(text); length > 0;) {
+    ssize_t n = ::write(2, text, length);
+    if (n <= 0) return;
+    text += n;
+    length -= static_cast<size_t>(n);
   }
-  if (n != 1) _exit(kVSALaunchFailed);  // the launcher could not record this process
-  ::close(goFd);
-  auto die = [&](const char* step) {
-    std::fprintf(stderr, "vessa-launch: %s: %s: %s\n", options_.signingIdentifier.c_str(), step,
-                 std::strerror(errno));
-    _exit(kVSALaunchFailed);
-  };
-  if (::setgroups(1, &gid_) != 0 || ::setgid(gid_) != 0) die("taking the app's group");
-  if (::setuid(uid_) != 0) die("taking the app's user");
-  if (::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0) die("no_new_privs");
-  if (ruleset >= 0) {
-    if (int e = landlock_.restrictSelf(ruleset)) {
-      errno = -e;
-      if (!options_.unconfined) die("Landlock: restricting the app");
-      std::fprintf(stderr, "vessa-launch: Landlock refused (%s); running UNCONFINED\n",
-                   std::strerror(errno));
-    }
-    ::close(ruleset);
-  }
-  ::setenv("HOME", containers_.dataContainer.c_str(), 1);
-  ::setenv("TMPDIR", containers_.temporaryDirectory.c_str(), 1);
-  if (::chdir(containers_.dataContainer.c_str()) != 0) die("changing to the data container");
-  std::vector<char*> argv;
-  for (auto& a : options_.program) argv.push_back(a.data());
-  argv.push_back(nullptr);
-  ::execvp(argv[0], argv.data());
-  int e = errno;
-  std::fprintf(stderr, "vessa-launch: %s: %s\n", argv[0], std::strerror(e));
-  _exit(e == ENOENT ? kVSALaunchNotFound : kVSALaunchCannotExecute);
 }
 
+[[noreturn]] void childFails(const VSALaunchChild& c, const char* step, int error, int status) {
+  say(c.prefix);
+  say(step);
+  say(": ");
+  say(std::strerror(error));
+  say("\n");
+  _exit(status);
+}
+
+// The child: records itself for the daemon while it is still root, then
+// takes the app's user, no_new_privs and the ruleset, and execs. Signals the
+// launcher passes on keep their default action here.
+int becomeApp(void* argument) {
+  const auto& c = *static_cast<const VSALaunchChild*>(argument);
+  struct sigaction byDefault = {};
+  byDefault.sa_handler = SIG_DFL;
+  sigset_t passed;
+  sigemptyset(&passed);
+  for (int s : {SIGINT, SIGTERM, SIGHUP}) {
+    ::sigaction(s, &byDefault, nullptr);
+    sigaddset(&passed, s);
+  }
+  ::sigprocmask(SIG_UNBLOCK, &passed, nullptr);
+  for (const VSAOwnProcessRecord* record : c.records)
+    if (int e = record->writeForSelf())
+      childFails(c, "records: recording the process for the daemon", e, kVSALaunchFailed);
+  if (::setgroups(1, &c.gid) != 0 || ::setgid(c.gid) != 0)
+    childFails(c, "taking the app's group", errno, kVSALaunchFailed);
+  if (::setuid(c.uid) != 0) childFails(c, "taking the app's user", errno, kVSALaunchFailed);
+  if (::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0)
+    childFails(c, "no_new_privs", errno, kVSALaunchFailed);
+  if (c.ruleset >= 0) {
+    if (int e = c.landlock->restrictSelf(c.ruleset)) {
+      if (!c.unconfined) childFails(c, "Landlock: restricting the app", -e, kVSALaunchFailed);
+      say(c.prefix);
+      say("Landlock refused; running UNCONFINED\n");
+    }
+  }
+  if (::chdir(c.home) != 0)
+    childFails(c, "changing to the data container", errno, kVSALaunchFailed);
+  ::execvpe(c.argv[0], c.argv, c.envp);
+  int e = errno;
+  childFails(c, c.argv[0], e, e == ENOENT ? kVSALaunchNotFound : kVSALaunchCannotExecute);
+}
+
+// The caller's environment with HOME and TMPDIR set for the app.
+std::vector<std::string> appEnvironment(const VSALaunchContainers& containers) {
+  std::vector<std::string> out;
+  for (char** e = environ; *e; ++e)
+    if (std::strncmp(*e, "HOME=", 5) != 0 && std::strncmp(*e, "TMPDIR=", 7) != 0)
+      out.emplace_back(*e);
+  out.push_back("HOME=" + containers.dataContainer);
+  out.push_back("TMPDIR=" + containers.temporaryDirectory);
+  return out;
+}
+
+std::vector<char*> pointers(std::vector<std::string>& strings) {
+  std::vector<char*> out;
+  for (auto& s : strings) out.push_back(s.data());
+  out.push_back(nullptr);
+  return out;
+}
+
+constexpr size_t kVSAChildStackSize = 256 * 1024;
+}  // namespace
+
 int VSALauncher::startAndWait(int ruleset) {
-  int go[2];
-  if (::pipe2(go, O_CLOEXEC) != 0) return fail("start", std::strerror(errno));
+  VSAProcessRecords records(root_);
+  VSAOwnProcessRecord persona, signing;
+  int e = persona.prepare(records, VSAProcessRecordKind::Persona, std::to_string(personaID_));
+  if (!e)
+    e = signing.prepare(records, VSAProcessRecordKind::SigningIdentifier,
+                        options_.signingIdentifier);
+  if (e)
+    return fail("records",
+                std::string("recording the process for the daemon: ") + std::strerror(e));
+  std::vector<std::string> arguments = options_.program, environment = appEnvironment(containers_);
+  std::vector<char*> argv = pointers(arguments), envp = pointers(environment);
+  std::string prefix = "vessa-launch: " + options_.signingIdentifier + ": ";
+  VSALaunchChild child{{&persona, &signing},
+                       uid_,
+                       gid_,
+                       ruleset,
+                       options_.unconfined,
+                       &landlock_,
+                       containers_.dataContainer.c_str(),
+                       argv.data(),
+                       envp.data(),
+                       prefix.c_str()};
+  void* stack = ::mmap(nullptr, kVSAChildStackSize, PROT_READ | PROT_WRITE,
+                       MAP_PRIVATE | MAP_ANONYMOUS | MAP_STACK, -1, 0);
+  if (stack == MAP_FAILED) return fail("start", std::strerror(errno));
+  // The signals passed on are held until the child's pid is known, so that
+  // none is lost in between; the child takes them with their default action.
   struct sigaction forward = {};
   forward.sa_handler = passOn;
   sigemptyset(&forward.sa_mask);
-  for (int s : {SIGINT, SIGTERM, SIGHUP}) ::sigaction(s, &forward, nullptr);
-  std::fflush(nullptr);
-  pid_t pid = ::fork();
-  if (pid < 0) return fail("start", std::strerror(errno));
-  if (pid == 0) {
-    ::close(go[1]);
-    becomeApp(ruleset, go[0]);
+  sigset_t passed, before;
+  sigemptyset(&passed);
+  for (int s : {SIGINT, SIGTERM, SIGHUP}) {
+    ::sigaction(s, &forward, nullptr);
+    sigaddset(&passed, s);
   }
-  gChild = pid;
-  ::close(go[0]);
-  VSAUniqueFd goFd(go[1]);
-  uint64_t startTime = VSAAuditToken::processStartTime(pid);
-  VSAProcessRecords records(root_);
-  int e = startTime ? records.write(VSAProcessRecordKind::Persona, pid, startTime,
-                                    std::to_string(personaID_))
-                    : ESRCH;
-  if (!e)
-    e = records.write(VSAProcessRecordKind::SigningIdentifier, pid, startTime,
-                      options_.signingIdentifier);
-  if (e || ::write(goFd.get(), "g", 1) != 1) {
-    int status;
-    goFd.reset();
-    ::kill(pid, SIGKILL);
-    ::waitpid(pid, &status, 0);
-    removeRecords(pid, startTime);
-    return fail("records", std::string("recording the process for the daemon: ") +
-                               std::strerror(e ? e : errno));
+  ::sigprocmask(SIG_BLOCK, &passed, &before);
+  // CLONE_VM | CLONE_VFORK: no copy of the launcher's memory is made, and
+  // the launcher goes on once the child has exec'd (or failed).
+  pid_t pid = ::clone(becomeApp, static_cast<char*>(stack) + kVSAChildStackSize,
+                      CLONE_VM | CLONE_VFORK | SIGCHLD, &child);
+  int cloneError = errno;
+  ::munmap(stack, kVSAChildStackSize);
+  if (pid > 0) gChild = pid;
+  ::sigprocmask(SIG_SETMASK, &before, nullptr);
+  if (pid < 0) return fail("start", std::strerror(cloneError));
+  // The records go before the child is reaped, while its pid is still its own.
+  siginfo_t ended;
+  while (::waitid(P_PID, static_cast<id_t>(pid), &ended, WEXITED | WNOWAIT) < 0 && errno == EINTR) {
   }
-  goFd.reset();
+  persona.removeForUnreapedChild(pid);
+  signing.removeForUnreapedChild(pid);
   int status = 0;
   while (::waitpid(pid, &status, 0) < 0 && errno == EINTR) {
   }
   gChild = 0;
-  removeRecords(pid, startTime);
   if (WIFEXITED(status)) return WEXITSTATUS(status);
   if (WIFSIGNALED(status)) return 128 + WTERMSIG(status);
   return kVSALaunchFailed;
-}
-
-void VSALauncher::removeRecords(pid_t pid, uint64_t startTime) const {
-  VSAProcessRecords records(root_);
-  records.remove(VSAProcessRecordKind::Persona, pid, startTime);
-  records.remove(VSAProcessRecordKind::SigningIdentifier, pid, startTime);
 }

@@ -161,8 +161,13 @@ std::optional<VSAClientRegistryEntry> VSAClientRegistry::entryForAuditToken(
 
 std::optional<VSAClientRegistryEntry> VSAClientRegistry::entryForPeer(
     const VSAAuditToken& token, const std::string& executable) {
-  if (auto launched = VSAProcessRecords(root_).readForProcessOrAncestor(
-          VSAProcessRecordKind::SigningIdentifier, token.pid, token.startTime)) {
+  // Only a peer that is not root can be a launched app: the launcher's child
+  // records itself while still root and connects only once it is the app.
+  std::optional<std::string> launched;
+  if (token.uid != 0)
+    launched = VSAProcessRecords(root_).readForProcessOrAncestor(
+        VSAProcessRecordKind::SigningIdentifier, token.pid, token.startTime);
+  if (launched) {
     VSAClientRegistryEntry entry;
     entry.executable = executable;
     entry.signingIdentifier = *launched;

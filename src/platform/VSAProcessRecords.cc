@@ -1,6 +1,9 @@
 #include "platform/VSAProcessRecords.h"
 
+#include <fcntl.h>
+#include <linux/openat2.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -78,17 +81,86 @@ std::optional<std::string> VSAProcessRecords::readForProcessOrAncestor(VSAProces
   return std::nullopt;
 }
 
+int VSAProcessRecords::openDirectory(VSAProcessRecordKind kind, VSAUniqueFd* out) const {
+  struct open_how how {};
+  how.flags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
+  how.resolve = RESOLVE_NO_SYMLINKS;
+  auto open = [&] {
+    out->reset(static_cast<int>(
+        ::syscall(SYS_openat2, AT_FDCWD, directory(kind).c_str(), &how, sizeof how)));
+    return *out ? 0 : errno;
+  };
+  // The directory is made by the first launch after a boot; every later
+  // launch opens it at once.
+  int e = open();
+  if (e != ENOENT) return e;
+  if ((e = VSAMakeDirectories(directory(kind), 0755))) return e;
+  return open();
+}
+
+namespace {
+// Appends the decimal digits of `n` at `out`; returns the end.
+char* appendNumber(char* out, uint64_t n) {
+  char digits[20];
+  int count = 0;
+  do digits[count++] = static_cast<char>('0' + n % 10);
+  while ((n /= 10) != 0);
+  while (count > 0) *out++ = digits[--count];
+  return out;
+}
+}  // namespace
+
+int VSAProcessRecords::writeAt(int directory, pid_t pid, uint64_t startTime, const char* value) {
+  char name[24], temporary[40], text[kVSAMaxRecordSize + 1];
+  *appendNumber(name, static_cast<uint64_t>(pid)) = '\0';
+  char* end = appendNumber(temporary, static_cast<uint64_t>(pid));
+  const char suffix[] = ".recording";
+  for (char c : suffix) *end++ = c;  // the terminating NUL included
+  end = appendNumber(text, startTime);
+  *end++ = ' ';
+  for (size_t i = 0; value[i]; ++i) {
+    if (i >= kVSAMaxRecordedValue) return EINVAL;
+    *end++ = value[i];
+  }
+  *end++ = '\n';
+  int fd =
+      ::openat(directory, temporary, O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0644);
+  if (fd < 0) return errno;
+  size_t length = static_cast<size_t>(end - text);
+  int e = 0;
+  if (::fchmod(fd, 0644) != 0) e = errno;  // whatever the umask
+  if (!e && ::write(fd, text, length) != static_cast<ssize_t>(length)) e = errno ? errno : EIO;
+  if (::close(fd) != 0 && !e) e = errno;
+  if (!e && ::renameat(directory, temporary, directory, name) != 0) e = errno;
+  if (e) ::unlinkat(directory, temporary, 0);
+  return e;
+}
+
 int VSAProcessRecords::write(VSAProcessRecordKind kind, pid_t pid, uint64_t startTime,
                              const std::string& value) const {
   if (!isRecordableValue(value)) return EINVAL;
-  if (int e = VSAMakeDirectories(directory(kind), 0755)) return e;
-  std::string text = std::to_string(startTime) + " " + value + "\n";
-  VSAErrorRef error;
-  // The records live in /run: they need not outlive a power loss, only be whole.
-  if (!VSAWriteFileAtomically(path(kind, pid), std::vector<uint8_t>(text.begin(), text.end()), 0644,
-                              &error, false))
-    return error && error->domain() == kVSAPOSIXErrorDomain ? static_cast<int>(error->code()) : EIO;
-  return 0;
+  VSAUniqueFd directory;
+  if (int e = openDirectory(kind, &directory)) return e;
+  return writeAt(directory.get(), pid, startTime, value.c_str());
+}
+
+int VSAOwnProcessRecord::prepare(const VSAProcessRecords& records, VSAProcessRecordKind kind,
+                                 const std::string& value) {
+  if (!VSAProcessRecords::isRecordableValue(value)) return EINVAL;
+  value_ = value;
+  return records.openDirectory(kind, &directory_);
+}
+
+int VSAOwnProcessRecord::writeForSelf() const {
+  if (!directory_) return EBADF;
+  pid_t self = ::getpid();
+  uint64_t startTime = VSAAuditToken::processStartTime(self);
+  if (!startTime) return ESRCH;
+  return VSAProcessRecords::writeAt(directory_.get(), self, startTime, value_.c_str());
+}
+
+void VSAOwnProcessRecord::removeForUnreapedChild(pid_t child) const {
+  if (directory_) ::unlinkat(directory_.get(), std::to_string(child).c_str(), 0);
 }
 
 void VSAProcessRecords::remove(VSAProcessRecordKind kind, pid_t pid, uint64_t startTime) const {

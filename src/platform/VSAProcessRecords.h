@@ -20,6 +20,7 @@
 
 #include "platform/VSAAuditToken.h"
 #include "platform/VSASystemRoot.h"
+#include "platform/VSAUniqueFd.h"
 
 enum class VSAProcessRecordKind { Persona, SigningIdentifier };
 
@@ -41,6 +42,7 @@ class VSAProcessRecords {
                                                       uint64_t startTime) const;
   // Records `value` (one word: no white space, at most 255 bytes) for the
   // process; creates the directory (root's, 0755) when missing. 0 or an errno.
+  // (The launcher's child records itself: VSAOwnProcessRecord.)
   int write(VSAProcessRecordKind kind, pid_t pid, uint64_t startTime,
             const std::string& value) const;
   // Removes the record of `pid` if it still names the process started at
@@ -50,6 +52,33 @@ class VSAProcessRecords {
   // A value a record can hold.
   static bool isRecordableValue(const std::string& value);
 
+  // The kind's directory, opened without following a link and made (root's,
+  // 0755) when missing; 0 or an errno.
+  int openDirectory(VSAProcessRecordKind kind, VSAUniqueFd* directory) const;
+  // Writes the record into an opened directory: "<pid>.recording" written
+  // whole, then renamed to "<pid>". Allocates nothing, so that a process can
+  // record itself between clone and exec. 0 or an errno.
+  static int writeAt(int directory, pid_t pid, uint64_t startTime, const char* value);
+
  private:
   VSASystemRoot root_;
+};
+
+// A record a process writes for itself between clone and exec, where it
+// shares its parent's memory and may not allocate: the directory and the
+// value are prepared first, the process adds its own pid and start time.
+class VSAOwnProcessRecord {
+ public:
+  // 0 or an errno (EINVAL: a value no record can hold).
+  int prepare(const VSAProcessRecords& records, VSAProcessRecordKind kind,
+              const std::string& value);
+  // Records the calling process. Allocates nothing; 0 or an errno.
+  int writeForSelf() const;
+  // Removes the record of `child`, which has ended but is not reaped yet:
+  // until it is, no other process can hold its pid.
+  void removeForUnreapedChild(pid_t child) const;
+
+ private:
+  VSAUniqueFd directory_;
+  std::string value_;
 };

@@ -15,6 +15,7 @@ class VSAUpcallClient {
   VSAUpcallClient& operator=(const VSAUpcallClient&) = delete;
 
   bool connect(const std::string& socketPath, std::string* why);
+  bool isConnected() const { return fd_ >= 0; }
   // `memory` travels as a memfd when given. The reply's memory, when it
   // carried one, lands in `replyMemory`.
   bool call(const std::vector<uint8_t>& message, const std::vector<uint8_t>* memory,

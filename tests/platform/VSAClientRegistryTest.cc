@@ -13,6 +13,7 @@
 #include "base/VSAPlist.h"
 #include "platform/VSAClientRegistry.h"
 #include "platform/VSAIPCConnection.h"
+#include "platform/VSAProcessRecords.h"
 
 namespace {
 
@@ -105,6 +106,24 @@ TEST_F(VSAClientRegistryTest, AnEntryNamingAUserIdentifiesOnlyThatUID) {
   // A user that cannot be resolved, or a value of the wrong type, refuses the entry.
   EXPECT_FALSE(registry.entryForPeer(root, host("/usr/bin/unknown")));
   EXPECT_FALSE(registry.entryForPeer(root, host("/usr/bin/malformed")));
+}
+
+TEST_F(VSAClientRegistryTest, ALaunchRecordIdentifiesOnlyAPeerThatIsNotRoot) {
+  install("anyone", "/usr/bin/anyone");
+  VSAClientRegistry registry{VSASystemRoot(root_)};
+  auto root = tokenWithUID(0), mobile = tokenWithUID(501);
+  ASSERT_EQ(VSAProcessRecords(VSASystemRoot(root_))
+                .write(VSAProcessRecordKind::SigningIdentifier, root.pid, root.startTime,
+                       "com.example.app"),
+            0);
+  auto app = registry.entryForPeer(mobile, host("/usr/bin/anyone"));
+  ASSERT_TRUE(app);
+  EXPECT_TRUE(app->launched);
+  EXPECT_EQ(app->signingIdentifier, "com.example.app");
+  auto rooted = registry.entryForPeer(root, host("/usr/bin/anyone"));
+  ASSERT_TRUE(rooted) << "root keeps the identity of the program it runs";
+  EXPECT_FALSE(rooted->launched);
+  EXPECT_EQ(rooted->signingIdentifier, "com.example.anyone");
 }
 
 TEST_F(VSAClientRegistryTest, AConnectionPinsItsPeersEntryOnlyForTheRightUser) {
