@@ -82,19 +82,29 @@ int main(int argc, char** argv) {
     VSABenchRecord("app launch: vessa-launch failed in the loop", "none", 0, 1);
     return 1;
   }
+  // Each launch is paired with the wrapper run just before it: the median of
+  // those differences is what the launch adds, and does not move with the
+  // machine's speed drifting over the run the way two separate medians do.
+  std::vector<double> added, addedOverProgram;
+  for (int i = 0; i < runs; ++i) {
+    added.push_back(b[i] - w[i]);
+    addedOverProgram.push_back(b[i] - a[i]);
+  }
   double da = percentile(a, 0.5), db = percentile(b, 0.5), dw = percentile(w, 0.5);
+  double overProgram = percentile(addedOverProgram, 0.5), overFloor = percentile(added, 0.5);
   std::printf("runs: %d each, interleaved\n", runs);
   std::printf("/bin/true directly:        median %.3f ms  p99 %.3f ms\n", da, percentile(a, 0.99));
   std::printf("timeout 600 /bin/true:      median %.3f ms  p99 %.3f ms\n", dw, percentile(w, 0.99));
   std::printf("vessa-launch -- /bin/true: median %.3f ms  p99 %.3f ms\n", db, percentile(b, 0.99));
   std::printf(
-      "added by the launch: median %+.3f ms over the program, %+.3f ms over the floor "
-      "(budget %.1f ms)\n",
-      db - da, db - dw, kBudgetMs);
+      "added by the launch (median of paired differences): %+.3f ms over the program, "
+      "%+.3f ms over the floor, p99 %+.3f ms (budget %.1f ms at the median)\n",
+      overProgram, overFloor, percentile(added, 0.99), kBudgetMs);
   char measure[96];
-  std::snprintf(measure, sizeof measure, "app launch (+%.2f ms median)", db - da);
-  VSABenchRecord(measure, "the program started directly", da / db, 0);
-  std::snprintf(measure, sizeof measure, "app launch over a wrapper (+%.2f ms)", db - dw);
-  VSABenchRecord(measure, "timeout: fork, exec, wait, signals", dw / db, dw / (dw + kBudgetMs));
+  std::snprintf(measure, sizeof measure, "app launch (+%.2f ms median)", overProgram);
+  VSABenchRecord(measure, "the program started directly", da / (da + overProgram), 0);
+  std::snprintf(measure, sizeof measure, "app launch over a wrapper (+%.2f ms)", overFloor);
+  VSABenchRecord(measure, "timeout: fork, exec, wait, signals", dw / (dw + overFloor),
+                 dw / (dw + kBudgetMs));
   return 0;
 }

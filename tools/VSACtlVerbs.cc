@@ -100,7 +100,9 @@ const std::vector<VSACtlVerb>& VSACtlVerbs::all() {
       {"restructure", "ID [--class C] [--persona P]", "make the default sub-directories again"},
       {"info", "get|set|unset ID KEY [VALUE] [--class C]", "a metadata info value"},
       {"groups", "OWNER [--class group|system-group]", "the group containers of an owner"},
-      {"cs", "get ID | set ID JSON", "code-signing information of an identifier"},
+      {"cs", "get ID | set ID JSON [OPTIONS]",
+       "code-signing information of an identifier (OPTIONS: a JSON object of registration "
+       "options, e.g. {\"com.tamsk.Vessa.DataContainerClass\": 2})"},
       {"protect", "ID CLASS [--retry]",
        "set a data container's protection class (1-4; --retry: wait for an unlock)"},
       {"usage", "ID [--class C] [--persona P]", "a container's size on disk"},
@@ -214,17 +216,22 @@ std::optional<VSAValue> VSACtlVerbs::request(const std::string& verb,
   if (verb == "cs") {
     if (!pos.empty() && pos[0] == "get" && need(2))
       return VSAValue::Dictionary{{"Command", VSAValue(19u)}, {"Identifier", VSAValue(pos[1])}};
-    if (!pos.empty() && pos[0] == "set" && need(3)) {
+    if (!pos.empty() && pos[0] == "set" && (pos.size() == 4 || need(3))) {
       std::string why;
       auto info = VSAJSON::parse(pos[2], &why);
       if (!info || !info->isDictionary()) {
         *error = "code-signing information must be a JSON object" + (why.empty() ? "" : ": " + why);
         return std::nullopt;
       }
+      auto options = pos.size() > 3 ? VSAJSON::parse(pos[3], &why) : VSAValue::dictionary();
+      if (!options || !options->isDictionary()) {
+        *error = "registration options must be a JSON object" + (why.empty() ? "" : ": " + why);
+        return std::nullopt;
+      }
       return VSAValue::Dictionary{{"Command", VSAValue(18u)},
                                   {"Identifier", VSAValue(pos[1])},
                                   {"CodeSigningInfo", *info},
-                                  {"OptionsDictionary", VSAValue::dictionary()}};
+                                  {"OptionsDictionary", *options}};
     }
     if (error->empty()) *error = "cs takes get ID or set ID JSON";
     return std::nullopt;

@@ -187,11 +187,22 @@ TEST_F(LaunchedApps, AConfinedAppIsServedAsItselfAndReachesNoDaemonState) {
             std::string::npos);
 }
 
-TEST_F(LaunchedApps, APlugInGetsItsPlugInDataContainer) {
+TEST_F(LaunchedApps, APlugInGetsItsPlugInDataContainerByFlagOrByRegistration) {
   std::string home = text(rules("com.example.widget", {"--plugin"}), "Home");
   EXPECT_EQ(home, adminPath({"lookup", "com.example.widget", "--class", "plugin-data"}));
   auto run = launch("com.example.widget", {"--plugin"}, "echo \"home=$HOME\"\n");
   expectLines(run.output, {"home=" + home});
+
+  // Registered as a plug-in by its installer (vessactl cs set's options), it
+  // gets the same container without the flag.
+  ASSERT_EQ(d.vessactl("admin", {"cs", "set", "com.example.gadget", "{}",
+                                 "{\"com.tamsk.Vessa.DataContainerClass\": 4}"})
+                .status,
+            0);
+  std::string gadgetHome = text(rules("com.example.gadget"), "Home");
+  EXPECT_EQ(gadgetHome, adminPath({"lookup", "com.example.gadget", "--class", "plugin-data"}));
+  EXPECT_NE(d.vessactl("admin", {"cs", "set", "com.example.gadget", "{}", "[4]"}).status, 0)
+      << "options that are not an object are refused";
 }
 
 TEST_F(LaunchedApps, AnEnterpriseAppIsConfinedToItsPersonasContainers) {
