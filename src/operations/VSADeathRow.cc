@@ -11,6 +11,8 @@ namespace {
 // Tries to move one item into a fresh death-row directory that a concurrent
 // emptying may remove first.
 constexpr int kMoveAttempts = 5;
+// Removals of one death-row entry before it is moved aside to /tmp.
+constexpr int kRemoveAttempts = 3;
 
 bool isMissing(const VSAErrorRef& e) {
   return e && e->domain() == kVSAPOSIXErrorDomain && e->code() == ENOENT;
@@ -148,7 +150,14 @@ bool VSADeathRow::_removeItemOrMoveToTempAtURL(const std::string& url, VSAErrorR
   const char* fn = "_removeItemOrMoveToTempAtURL";
   VSAFileManager& fm = configuration_->fileManager();
   VSAErrorRef removeError;
-  if (fm.removeItemAtURL(url, &removeError, observer)) return true;
+  // A move into death row makes its fresh directory first and then renames
+  // the item into it: an entry listed while still empty can gain its item
+  // while it is removed, and its last rmdir then fails. The item is whole
+  // by the next attempt, which removes it.
+  for (int attempt = 0; attempt < kRemoveAttempts; ++attempt) {
+    removeError = nullptr;
+    if (fm.removeItemAtURL(url, &removeError, observer)) return true;
+  }
   VSALog(kVSALogDebug, fn, "Couldn't remove, so moving item to /tmp: %@ : %@", url, removeError);
   std::string tmp = temporaryDirectory(*configuration_);
   if (fm.itemDoesNotExistAtURL(tmp))

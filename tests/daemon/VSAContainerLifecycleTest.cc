@@ -393,14 +393,23 @@ TEST_F(Lifecycle, ACacheThatCannotDropAStagedContainerStopsTheCommandWith46) {
   EXPECT_TRUE(fs::exists(second->url() + "/" + kVSAMetadataFileName));  // never reached
 }
 
-TEST_F(Lifecycle, DeathRowEntriesThatResistRemovalEndInTmp) {
+TEST_F(Lifecycle, DeathRowEntriesThatKeepResistingRemovalEndInTmp) {
   std::string deathrow = context_->globalConfiguration->deathrowDirectory();
   for (const char* name : {"a", "b", "c"}) {
     fs::create_directories(deathrow + "/" + name);
     std::ofstream(deathrow + "/" + name + "/file") << name;
   }
+  // One refusal: the entry is removed at the next attempt.
   faults_->failNth(Op::Rmdir, 1, EBUSY);
   EXPECT_EQ(emptyDeathRow(), VSAResult::kSuccess);
+  EXPECT_EQ(entries(deathrow), 0u);
+  EXPECT_EQ(entries(root_ + "/tmp"), 0u);
+  // An entry that keeps resisting is moved aside.
+  fs::create_directories(deathrow + "/d");
+  std::ofstream(deathrow + "/d/file") << "d";
+  faults_->failAll(Op::Rmdir, EBUSY);
+  EXPECT_EQ(emptyDeathRow(), VSAResult::kSuccess);
+  faults_->reset();
   EXPECT_EQ(entries(deathrow), 0u);
   EXPECT_EQ(entries(root_ + "/tmp"), 1u);
   // Moving something that is not there succeeds and starts nothing.

@@ -279,3 +279,25 @@ TEST_F(ContainerContent, TheRetryTestCountsItsCrashesAcrossStarts) {
 }
 
 }  // namespace
+
+// A move into death row makes a fresh directory, then renames the item into
+// it: an emptying that listed the directory still empty sees the item arrive
+// while it removes. The entry is removed whole, not moved aside to /tmp.
+TEST_F(ContainerContent, ADeathRowEntryThatGainsItsItemWhileRemovedIsRemovedNotMovedAside) {
+  std::string entry = deathRow() + "/temp.abcdef";
+  fs::create_directories(entry);
+  put(entry + "/first", "x");
+  bool arrived = false;
+  auto itemArrives = [&](uint64_t) {
+    if (arrived) return;
+    arrived = true;
+    fs::create_directories(entry + "/container/Documents");
+    put(entry + "/container/Documents/file", "y");
+  };
+  VSAErrorRef error;
+  EXPECT_TRUE(context_->deathRow->_removeItemOrMoveToTempAtURL(entry, &error, itemArrives));
+  EXPECT_TRUE(arrived);
+  EXPECT_FALSE(fs::exists(entry));
+  EXPECT_TRUE(VSADeathRow::leftoversInTemp(*context_->globalConfiguration).empty())
+      << "nothing was moved aside";
+}
