@@ -30,6 +30,7 @@ VSADaemon::VSADaemon(Options options)
       VSANamedSemaphore::nameForRoot(kVSAFirstBootSemaphore, context_->systemRoot);
   if (options_.afterBoot) VSANamedSemaphore::remove(firstBootSemaphore_);
   VSALogger::shared().setLevel(options_.logLevel);
+  idleExitSeconds_ = options_.idleExitSeconds;
 }
 
 // A dump under way reads this daemon's objects: it ends first.
@@ -82,6 +83,7 @@ int VSADaemon::run() {
       listener_.reset();
     }
   }
+  checkIdleExitIsPossible();
   VSAWorkQueue::runMain();
   {
     std::lock_guard lock(listenerMutex_);

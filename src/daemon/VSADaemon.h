@@ -34,6 +34,9 @@ class VSADaemon {
     std::string root = "/";
     int logLevel = 5;
     bool afterBoot = false;  // forget the first-boot marker: this start follows a boot
+    // Under socket activation: leave after this many seconds with no client,
+    // transaction or background work (0: never).
+    int idleExitSeconds = 0;
   };
 
   explicit VSADaemon(Options options);
@@ -46,6 +49,15 @@ class VSADaemon {
   // Queues a state dump; returns at once. Any thread.
   void requestStateDump();
   VSADaemonContext& context() { return *context_; }
+  // The idle period, 0 when the daemon does not leave when idle (not asked
+  // for, or its sockets are its own: nothing would start it again).
+  int idleExitSeconds() const { return idleExitSeconds_; }
+  // Called once an idle period (by the signal thread): when nothing has
+  // happened for a whole period and nothing is under way, holds both
+  // sockets, looks once more, and stops the daemon (run() returns 0);
+  // answers whether it did. Connections that arrive from then on wait in
+  // the sockets' backlogs, which the service manager keeps, for the next start.
+  bool exitIfIdle();
 
  private:
   void initialize();
@@ -55,6 +67,10 @@ class VSADaemon {
   void drainForShutdown();
   VSAIPCListener::Route routeRequest(const VSAValue& body);
   void writePidFile();
+  // Nothing under way; `activity` receives a count that moves with any work.
+  bool isIdle(uint64_t* activity);
+  void holdAccepting(bool hold);
+  void checkIdleExitIsPossible();
 
   Options options_;
   std::unique_ptr<VSADaemonContext> context_;
@@ -78,6 +94,9 @@ class VSADaemon {
   std::atomic<bool> initialized_{false};   // the subsystems are set; a dump may read them
   VSAWorkQueue::Ref stateQueue_;           // runs state dumps, one at a time
   std::atomic<uint64_t> dumpGeneration_{0};
+  std::atomic<int> idleExitSeconds_{0};
+  bool wasIdle_ = false;  // at the previous idle check (signal thread only)
+  uint64_t lastActivity_ = 0;
   // Guards listener_: a signal may ask for a stop while run() sets it up.
   std::mutex listenerMutex_;
 };

@@ -27,6 +27,8 @@ class VSAKernelUpcall {
   // A listener for this daemon's upcall socket, not yet serving.
   static std::unique_ptr<VSAUpcallListener> listenerFor(VSADaemonContext& context);
   void stop();
+  // The listener serving the socket; null before start() and after stop().
+  VSAUpcallListener* listener() const { return listener_.get(); }
 
   // The environment the server works in, over `context` (tests use it directly).
   static VSAUpcallEnvironment environmentFor(VSADaemonContext& context);

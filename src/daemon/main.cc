@@ -1,6 +1,6 @@
 // vessad: the container-keeping daemon.
 //
-//   vessad [--root DIR] [--log-level N] [--stderr] [--after-boot]
+//   vessad [--root DIR] [--log-level N] [--stderr] [--after-boot] [--idle-exit SECONDS]
 //   vessad --verify [--root DIR] [--json]     check a root offline (exit 0/1/2)
 //
 // SIGTERM and SIGINT stop it cleanly once open transactions have ended;
@@ -8,6 +8,8 @@
 #include <signal.h>
 #include <sys/stat.h>
 
+#include <algorithm>
+#include <cerrno>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -25,12 +27,17 @@ namespace {
 void usage(FILE* out) {
   std::fprintf(out,
                "usage: vessad [--root DIR] [--log-level N] [--stderr] [--after-boot]\n"
+               "              [--idle-exit SECONDS]\n"
                "  --root DIR      system root standing for the device's \"/\" (default /)\n"
                "  --log-level N   writer level: 3 error, 5 notice (default), 6 info, 7 debug\n"
                "  --stderr        send the unified log to stderr even when journald runs\n"
                "  --after-boot    start as the first daemon after a device boot (runs the\n"
                "                  first-boot setup and cleanup: upgrade migration, transient\n"
                "                  directories); the device's own boot does this by itself\n"
+               "  --idle-exit S   under socket activation (both sockets passed by the service\n"
+               "                  manager), leave after S to 2S seconds with no client,\n"
+               "                  transaction or background work; the next request or upcall\n"
+               "                  starts the daemon again (without activation: ignored)\n"
                "\n"
                "       vessad --verify [--root DIR] [--json]\n"
                "  checks the root while no daemon serves it, changing nothing: every class\n"
@@ -76,6 +83,8 @@ int main(int argc, char** argv) {
       verifyRoot = true;
     } else if (a == "--json") {
       json = true;
+    } else if (a == "--idle-exit" && i + 1 < argc) {
+      options.idleExitSeconds = std::max(0, std::atoi(argv[++i]));
     } else if (a == "--after-boot") {
       options.afterBoot = true;
     } else if (a == "--stderr") {
@@ -112,7 +121,21 @@ int main(int argc, char** argv) {
   VSADaemon daemon(options);
   std::thread([&daemon, set] {
     int sig = 0;
-    while (sigwait(&set, &sig) == 0 && sig == SIGUSR1) daemon.requestStateDump();
+    for (;;) {
+      // With an idle period, the wait ends once a period to look for idleness.
+      if (int period = daemon.idleExitSeconds(); period > 0) {
+        timespec timeout{period, 0};
+        sig = sigtimedwait(&set, nullptr, &timeout);
+        if (sig < 0) {
+          if (errno == EAGAIN && daemon.exitIfIdle()) return;
+          continue;
+        }
+      } else if (sigwait(&set, &sig) != 0) {
+        break;
+      }
+      if (sig != SIGUSR1) break;
+      daemon.requestStateDump();
+    }
     VSALogIn(VSALogCategory::Daemon, kVSALogNotice, "main", "Received signal %d", sig);
     daemon.requestStop();
   }).detach();

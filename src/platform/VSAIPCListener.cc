@@ -91,6 +91,7 @@ bool VSAIPCListener::isValidMessageID(const VSAValue& id) {
 bool VSAIPCListener::listen(VSAErrorRef* error) {
   if (int activated = VSAActivatedListeningSocket(SOCK_STREAM, socketPath_); activated >= 0) {
     listenFd_ = activated;  // socket activation: systemd owns the file
+    inherited_ = true;
   } else {
     sockaddr_un addr;
     if (!fillAddress(socketPath_, addr)) {
@@ -163,6 +164,27 @@ void VSAIPCListener::_onThread_stopAccepting() {
   accepting_ = false;
   std::lock_guard lock(peersMutex_);
   for (auto& [fd, peer] : peers_) peer->connection->setReading(false);
+}
+
+void VSAIPCListener::_onThread_holdAccepting(bool hold) {
+  if (acceptHeld_ == hold) return;
+  acceptHeld_ = hold;
+  // While accepting is paused for want of descriptors, the sweep puts the
+  // socket back once neither pause nor hold is in force.
+  if (listenFd_ < 0 || acceptPaused_) return;
+  epoll_event ev{};
+  ev.events = EPOLLIN;
+  ev.data.fd = listenFd_;
+  epoll_ctl(epollFd_, hold ? EPOLL_CTL_DEL : EPOLL_CTL_ADD, listenFd_, &ev);
+}
+
+void VSAIPCListener::holdAccepting(bool hold) {
+  std::unique_lock lock(controlMutex_);
+  if (!thread_.joinable() || threadExited_) return;
+  holdRequested_ = hold;
+  uint64_t one = 1;
+  (void)!::write(stopFd_, &one, sizeof one);
+  controlChanged_.wait(lock, [&] { return held_ == hold || threadExited_; });
 }
 
 void VSAIPCListener::stopAccepting() {
@@ -266,6 +288,14 @@ void VSAIPCListener::run() {
           _onThread_stopAccepting();
           lock.lock();
           acceptingStopped_ = true;
+          controlChanged_.notify_all();
+        }
+        if (holdRequested_ != held_) {
+          bool hold = holdRequested_;
+          lock.unlock();
+          _onThread_holdAccepting(hold);
+          lock.lock();
+          held_ = hold;
           controlChanged_.notify_all();
         }
       } else if (fd == resumer_->fd) {
@@ -570,7 +600,7 @@ void VSAIPCListener::sweep(Clock::time_point now) {
     epoll_event ev{};
     ev.events = EPOLLIN;
     ev.data.fd = listenFd_;
-    epoll_ctl(epollFd_, EPOLL_CTL_ADD, listenFd_, &ev);
+    if (!acceptHeld_) epoll_ctl(epollFd_, EPOLL_CTL_ADD, listenFd_, &ev);
     acceptPaused_ = false;
   }
   std::vector<std::pair<int, const char*>> expired;
@@ -621,7 +651,7 @@ void VSAIPCListener::deliver(const VSAIPCConnectionRef& connection, std::optiona
     // Peers that connected meanwhile are accepted, and their programs pinned,
     // before this thread is taken up by the request: the longer a connection
     // waits in the backlog, the longer its process has to exec another program.
-    if (accepting_ && !acceptPaused_ && listenFd_ >= 0) acceptPeers();
+    if (accepting_ && !acceptPaused_ && !acceptHeld_ && listenFd_ >= 0) acceptPeers();
     if (queue->runIfIdle(block)) return;
   }
   queue->async(std::move(block));

@@ -106,6 +106,12 @@ class VSAIPCListener {
   // stopAccepting() and closes every connection.
   void stop();
   size_t connectionCount() const;
+  // Holds new connections back (they wait in the socket's backlog) or lets
+  // them in again. Returns once the I/O thread has done it: every connection
+  // accepted before a hold is then counted by connectionCount().
+  void holdAccepting(bool hold);
+  // The socket came from a service manager, which keeps it when the daemon ends.
+  bool socketIsInherited() const { return inherited_; }
   // A "MessageID" a reply can carry back: an integer or a short string.
   static bool isValidMessageID(const VSAValue& id);
 
@@ -141,6 +147,7 @@ class VSAIPCListener {
   // Closes the listening socket and stops reading requests; on the I/O thread
   // once it runs.
   void _onThread_stopAccepting();
+  void _onThread_holdAccepting(bool hold);
 
   std::string socketPath_;
   VSAWorkQueue::Ref queue_;
@@ -165,6 +172,8 @@ class VSAIPCListener {
   bool acceptingStopped_ = false;
   bool stopRequested_ = false;
   bool threadExited_ = false;
+  bool holdRequested_ = false;
+  bool held_ = false;
   mutable std::mutex peersMutex_;
   std::map<int, std::unique_ptr<Peer>> peers_;
   std::map<ProcessKey, size_t> connectionsPerProcess_;
@@ -174,6 +183,8 @@ class VSAIPCListener {
   // Accepting pauses briefly when even the reserve descriptor is gone.
   Clock::time_point acceptPausedUntil_{};
   bool acceptPaused_ = false;
+  bool acceptHeld_ = false;  // I/O thread only: holdAccepting(true) is in force
+  bool inherited_ = false;
   // Rate-limited refusal log (I/O thread only).
   Clock::time_point lastRefusalLog_{};
   size_t refusalsSinceLog_ = 0;

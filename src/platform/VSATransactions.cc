@@ -4,6 +4,7 @@ VSATransactions::Token VSATransactions::open() {
   {
     std::lock_guard lock(state_->mutex);
     ++state_->open;
+    ++state_->opened;
   }
   return Token(static_cast<void*>(state_.get()), [state = state_](void*) {
     std::lock_guard lock(state->mutex);
@@ -14,6 +15,11 @@ VSATransactions::Token VSATransactions::open() {
 int VSATransactions::openCount() const {
   std::lock_guard lock(state_->mutex);
   return state_->open;
+}
+
+uint64_t VSATransactions::openedCount() const {
+  std::lock_guard lock(state_->mutex);
+  return state_->opened;
 }
 
 bool VSATransactions::waitUntilIdle(std::chrono::milliseconds timeout) {

@@ -9,6 +9,7 @@
 
 #include <chrono>
 #include <condition_variable>
+#include <cstdint>
 #include <memory>
 #include <mutex>
 
@@ -18,6 +19,8 @@ class VSATransactions {
 
   Token open();
   int openCount() const;
+  // How many were ever opened: it moves whenever anything was done.
+  uint64_t openedCount() const;
   // False when `timeout` passed with transactions still open.
   bool waitUntilIdle(std::chrono::milliseconds timeout);
 
@@ -26,6 +29,7 @@ class VSATransactions {
     std::mutex mutex;
     std::condition_variable cv;
     int open = 0;
+    uint64_t opened = 0;
   };
   std::shared_ptr<State> state_ = std::make_shared<State>();
 };

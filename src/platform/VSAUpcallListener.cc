@@ -141,11 +141,23 @@ bool VSAUpcallListener::start(Handler handler, VSAErrorRef* error) {
   return true;
 }
 
+void VSAUpcallListener::holdAccepting(bool hold) {
+  if (!thread_.joinable()) return;
+  {
+    std::lock_guard lock(holdMutex_);
+    holdRequested_ = hold;
+  }
+  if (waker_) waker_->wake();
+  std::unique_lock lock(holdMutex_);
+  while (held_ != hold && !stopping_) holdChanged_.wait_for(lock, std::chrono::milliseconds(100));
+}
+
 void VSAUpcallListener::stop() {
   stopping_ = true;
   if (waker_) waker_->wake();
   if (thread_.joinable()) thread_.join();
   peers_.clear();
+  peerCount_ = 0;
   if (listenFd_ >= 0) {
     // No stale socket for the next start's waiters; one systemd holds stays.
     if (ownsSocketFile_) ::unlink(path_.c_str());
@@ -157,7 +169,17 @@ void VSAUpcallListener::stop() {
 
 void VSAUpcallListener::run() {
   while (!stopping_) {
-    std::vector<struct pollfd> fds = {{waker_->fd, POLLIN, 0}, {listenFd_, POLLIN, 0}};
+    bool hold;
+    {
+      std::lock_guard lock(holdMutex_);
+      hold = holdRequested_;
+      if (held_ != hold) {
+        held_ = hold;
+        holdChanged_.notify_all();
+      }
+    }
+    // A held socket is left out of the poll (a negative descriptor is ignored).
+    std::vector<struct pollfd> fds = {{waker_->fd, POLLIN, 0}, {hold ? -1 : listenFd_, POLLIN, 0}};
     std::vector<std::shared_ptr<Peer>> polled;
     for (const auto& p : peers_) {
       short events = p->hasPendingReplies() ? POLLOUT : 0;
@@ -183,6 +205,7 @@ void VSAUpcallListener::run() {
       // Replies still queued keep a dropped peer alive until they are sent.
       if (!receive(polled[i])) std::erase(peers_, polled[i]);
     }
+    peerCount_ = peers_.size();
   }
 }
 
@@ -208,6 +231,8 @@ void VSAUpcallListener::acceptPeer() {
   VSALogIn(VSALogCategory::Upcall, kVSALogDebug, kOrigin, "Upcall peer %@ (kernel: %d)",
            token->description(), peer->kernel);
   peers_.push_back(std::move(peer));
+  peerCount_ = peers_.size();
+  ++accepted_;
 }
 
 bool VSAUpcallListener::receive(const std::shared_ptr<Peer>& peer) {

@@ -23,6 +23,7 @@
 #pragma once
 
 #include <atomic>
+#include <condition_variable>
 #include <functional>
 #include <memory>
 #include <mutex>
@@ -66,6 +67,15 @@ class VSAUpcallListener {
   bool start(Handler handler, VSAErrorRef* error);
   void stop();
   const std::string& socketPath() const { return path_; }
+  // Holds new peers back (they wait in the socket's backlog) or lets them in
+  // again; returns once the I/O thread has done it, so that every peer
+  // accepted before a hold is counted by peerCount().
+  void holdAccepting(bool hold);
+  // Peers connected now, and peers ever accepted.
+  size_t peerCount() const { return peerCount_; }
+  uint64_t acceptedCount() const { return accepted_; }
+  // The socket came from a service manager, which keeps it when the daemon ends.
+  bool socketIsInherited() const { return listenFd_ >= 0 && !ownsSocketFile_; }
 
  private:
   struct Peer;
@@ -84,4 +94,10 @@ class VSAUpcallListener {
   std::atomic<bool> stopping_{false};
   std::thread thread_;
   std::vector<std::shared_ptr<Peer>> peers_;
+  std::atomic<size_t> peerCount_{0};
+  std::atomic<uint64_t> accepted_{0};
+  std::mutex holdMutex_;
+  std::condition_variable holdChanged_;
+  bool holdRequested_ = false;
+  bool held_ = false;  // the I/O thread's answer to holdRequested_
 };

@@ -3,6 +3,7 @@
 // comes when SIGTERM begins the stop; a socket the manager holds is taken
 // over (socket activation); the unit files pass systemd's own check.
 #include <gtest/gtest.h>
+#include <poll.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -20,6 +21,7 @@
 #include <vector>
 
 #include "e2e/VSATestDaemon.h"
+#include "platform/VSAIPCClient.h"
 #include "platform/VSAUpcallClient.h"
 #include "upcall/VSAUpcallMessage.h"
 #include "upcall/VSAUpcallPayload.h"
@@ -206,6 +208,70 @@ TEST(DaemonServiceManager, BothSocketsTheManagerHoldsAreTakenOver) {
   EXPECT_TRUE(std::filesystem::exists(d.upcallSocketPath())) << "the manager's file stays";
   ::close(requests);
   ::close(upcalls);
+}
+
+// With an idle period under socket activation, a daemon with nothing to do
+// leaves (status 0) while the manager keeps both sockets: a client that stays
+// connected keeps it, a request made after it left waits in the backlog and
+// is answered by the next start, and what was made before is all there.
+TEST(DaemonServiceManager, AnIdleDaemonLeavesAndTheNextStartAnswersWhatWaited) {
+  VSATestDaemon d;
+  d.registerSelf("com.example.installer",
+                 VSAValue::Dictionary{{"com.tamsk.private.Vessa.allowed", VSAValue(true)}});
+  int requests = listeningSocket(SOCK_STREAM, d.socketPath());
+  int upcalls = listeningSocket(SOCK_SEQPACKET, d.upcallSocketPath());
+  ASSERT_GE(requests, 0);
+  ASSERT_GE(upcalls, 0);
+  d.setActivationSockets({requests, upcalls});
+  const std::vector<std::string> idle = {"--idle-exit", "1"};
+  ASSERT_TRUE(d.start(true, idle));
+  auto lookup = [](bool create) {
+    return VSAValue::Dictionary{{"Command", VSAValue(0u)},
+                                {"Identifier", VSAValue("com.example.kept")},
+                                {"ContainerClass", VSAValue(2u)},
+                                {"CreateIfNecessary", VSAValue(create)}};
+  };
+  auto made = d.request(lookup(true));
+  ASSERT_EQ(VSAReplyError(made), 1u);
+  auto uuid = made->get("ReplyUUID")->uuidValue();
+  int status = 0;
+  {
+    VSAIPCClient stays;
+    VSAErrorRef error;
+    ASSERT_TRUE(stays.connect(d.socketPath(), &error));
+    EXPECT_FALSE(d.waitForExit(4s, &status)) << "a connected client keeps the daemon";
+  }
+  ASSERT_TRUE(d.waitForExit(10s, &status)) << "idle, it leaves";
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+  EXPECT_NE(d.daemonOutput().find("Idle for 1 seconds with no client"), std::string::npos);
+
+  // The manager's part: a connection waits on the socket it holds, and the
+  // socket turning readable starts the daemon again.
+  VSAIPCClient late;
+  VSAErrorRef error;
+  ASSERT_TRUE(late.connect(d.socketPath(), &error));
+  auto id = late.send(lookup(false), &error);
+  ASSERT_TRUE(id);
+  pollfd readable{requests, POLLIN, 0};
+  ASSERT_EQ(::poll(&readable, 1, 5000), 1);
+  ASSERT_TRUE(d.start(false, idle));
+  auto reply = late.waitForReply(*id, 20s, &error);
+  ASSERT_EQ(VSAReplyError(reply), 1u) << "answered by the next start";
+  EXPECT_EQ(reply->get("ReplyUUID")->uuidValue(), uuid) << "the container made before is kept";
+  EXPECT_EQ(d.stop(), 0);
+  ::close(requests);
+  ::close(upcalls);
+}
+
+// Without the manager's sockets there would be nothing to start it again:
+// the idle period is ignored.
+TEST(DaemonServiceManager, ADaemonWithItsOwnSocketsStaysWhenIdle) {
+  VSATestDaemon d;
+  ASSERT_TRUE(d.start(true, {"--idle-exit", "1"}));
+  int status = 0;
+  EXPECT_FALSE(d.waitForExit(3s, &status));
+  EXPECT_NE(d.daemonOutput().find("Staying when idle"), std::string::npos);
+  EXPECT_EQ(d.stop(), 0);
 }
 
 TEST(DaemonServiceManager, TheUnitFilesPassSystemdsCheck) {
