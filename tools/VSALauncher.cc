@@ -338,10 +338,15 @@ int VSALauncher::startAndWait(int ruleset) {
     sigaddset(&passed, s);
   }
   ::sigprocmask(SIG_BLOCK, &passed, &before);
+#ifndef VESSA_SANITIZED
   // CLONE_VM | CLONE_VFORK: no copy of the launcher's memory is made, and
   // the launcher goes on once the child has exec'd (or failed).
   pid_t pid = ::clone(becomeApp, static_cast<char*>(stack) + kVSAChildStackSize,
                       CLONE_VM | CLONE_VFORK | SIGCHLD, &child);
+#else
+  pid_t pid = ::fork();
+  if (pid == 0) _exit(becomeApp(&child));
+#endif
   int cloneError = errno;
   ::munmap(stack, kVSAChildStackSize);
   if (pid > 0) gChild = pid;
