@@ -1,6 +1,7 @@
 #!/usr/bin/env bash
 # Installs the Debian packages vessad needs. Idempotent and quiet when
 # everything is already present. Runs as root, or through sudo.
+#   scripts/setup.sh [--bench]   (--bench: also gnuplot, for bench/run-all's picture)
 set -euo pipefail
 
 packages=(
@@ -8,6 +9,7 @@ packages=(
   libsqlite3-dev libplist-dev libacl1-dev libspdlog-dev libfmt-dev libsystemd-dev
   uuid-dev libssl-dev libgtest-dev libgmock-dev libbenchmark-dev acl e2fsprogs time
 )
+[[ "${1:-}" == "--bench" ]] && packages+=(gnuplot-nox)
 
 missing=()
 for p in "${packages[@]}"; do
