@@ -16,8 +16,8 @@
 
 #include <algorithm>
 #include <chrono>
-#include <functional>
 #include <cstdio>
+#include <functional>
 #include <string>
 #include <vector>
 
@@ -85,7 +85,8 @@ void launchTogether(const std::function<std::vector<std::string>(const std::stri
                     const std::vector<std::string>& wrapped, int rounds) {
   constexpr int kApps = 16;
   std::vector<std::vector<std::string>> apps, wrappers(kApps, wrapped);
-  for (int i = 0; i < kApps; ++i) apps.push_back(launchOf("com.example.bench-launch." + std::to_string(i)));
+  for (int i = 0; i < kApps; ++i)
+    apps.push_back(launchOf("com.example.bench-launch." + std::to_string(i)));
   timedTogether(apps);  // makes their containers
   std::vector<double> l, w;
   for (int r = 0; r < rounds; ++r) {
@@ -97,9 +98,10 @@ void launchTogether(const std::function<std::vector<std::string>(const std::stri
     return;
   }
   double dl = percentile(l, 0.5), dw = percentile(w, 0.5);
-  std::printf("16 at once, %d rounds: wrappers median %.3f ms p99 %.3f ms; launches median %.3f ms "
-              "p99 %.3f ms; added %+.3f ms at the median\n",
-              rounds, dw, percentile(w, 0.99), dl, percentile(l, 0.99), dl - dw);
+  std::printf(
+      "16 at once, %d rounds: wrappers median %.3f ms p99 %.3f ms; launches median %.3f ms "
+      "p99 %.3f ms; added %+.3f ms at the median\n",
+      rounds, dw, percentile(w, 0.99), dl, percentile(l, 0.99), dl - dw);
   char measure[96];
   std::snprintf(measure, sizeof measure, "16 app launches at once (+%.2f ms median)", dl - dw);
   VSABenchRecord(measure, "16 wrappers at once", dw / dl, 0);
@@ -114,8 +116,9 @@ int main(int argc, char** argv) {
   int runs = std::max(1, std::atoi(argv[3]));
   std::vector<std::string> direct = {"/bin/true"};
   auto launchOf = [&](const std::string& app) {
-    return std::vector<std::string>{launcher, "--root", root, "--signing-id", app, "--group",
-                                    "group.example.bench-launch", "--", "/bin/true"};
+    return std::vector<std::string>{
+        launcher, "--root",   root, "--signing-id", app, "--group", "group.example.bench-launch",
+        "--",     "/bin/true"};
   };
   std::vector<std::string> launched = launchOf("com.example.bench-launch");
   if (timed(launched) < 0) {  // makes the containers; says why it fails
