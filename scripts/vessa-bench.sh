@@ -44,9 +44,12 @@ echo
 echo "== App launch: vessa-launch of /bin/true against /bin/true started directly"
 # The app is installed as an installer leaves one: its bundle container made
 # and its code signing registered with its data container class.
-"$root/usr/bin/demo-installer" --root "$root" create com.example.bench-launch --class bundle >/dev/null
-"$root/usr/bin/demo-installer" --root "$root" cs set com.example.bench-launch '{}' \
-  '{"com.tamsk.Vessa.DataContainerClass": 2}' >/dev/null
+# (com.example.bench-launch, and the sixteen launched at once.)
+for app in com.example.bench-launch com.example.bench-launch.{0..15}; do
+  "$root/usr/bin/demo-installer" --root "$root" create "$app" --class bundle >/dev/null
+  "$root/usr/bin/demo-installer" --root "$root" cs set "$app" '{}' \
+    '{"com.tamsk.Vessa.DataContainerClass": 2}' >/dev/null
+done
 "$build/bench/bench_launch" "$root" "$root/usr/bin/vessa-launch" "${LAUNCHES:-200}" ||
   echo "vessa-bench: the launch scenario failed (see above)"
 # How often the daemon wakes with nothing to do: every thread's voluntary
