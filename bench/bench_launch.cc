@@ -103,7 +103,7 @@ void launchTogether(const std::function<std::vector<std::string>(const std::stri
       "p99 %.3f ms; added %+.3f ms at the median\n",
       rounds, dw, percentile(w, 0.99), dl, percentile(l, 0.99), dl - dw);
   char measure[96];
-  std::snprintf(measure, sizeof measure, "16 app launches at once (+%.2f ms median)", dl - dw);
+  std::snprintf(measure, sizeof measure, "16 app launches at once (%+.2f ms median)", dl - dw);
   VSABenchRecord(measure, "16 wrappers at once", dw / dl, 0);
 }
 
@@ -156,9 +156,9 @@ int main(int argc, char** argv) {
       "%+.3f ms over the floor, p99 %+.3f ms (budget %.1f ms at the median)\n",
       overProgram, overFloor, percentile(added, 0.99), kBudgetMs);
   char measure[96];
-  std::snprintf(measure, sizeof measure, "app launch (+%.2f ms median)", overProgram);
+  std::snprintf(measure, sizeof measure, "app launch (%+.2f ms median)", overProgram);
   VSABenchRecord(measure, "the program started directly", da / (da + overProgram), 0);
-  std::snprintf(measure, sizeof measure, "app launch over a wrapper (+%.2f ms)", overFloor);
+  std::snprintf(measure, sizeof measure, "app launch over a wrapper (%+.2f ms)", overFloor);
   VSABenchRecord(measure, "timeout: fork, exec, wait, signals", dw / (dw + overFloor),
                  dw / (dw + kBudgetMs));
   launchTogether(launchOf, wrapped, std::max(1, runs / 10));
