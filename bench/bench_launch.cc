@@ -26,24 +26,6 @@
 namespace {
 constexpr double kBudgetMs = 2.0;
 
-// Wall time of one run of argv, in milliseconds; negative when it failed.
-double timed(const std::vector<std::string>& args) {
-  std::vector<char*> argv;
-  for (const auto& a : args) argv.push_back(const_cast<char*>(a.c_str()));
-  argv.push_back(nullptr);
-  auto begin = std::chrono::steady_clock::now();
-  pid_t pid = fork();
-  if (pid == 0) {
-    execv(argv[0], argv.data());
-    _exit(127);
-  }
-  int status = 0;
-  waitpid(pid, &status, 0);
-  auto end = std::chrono::steady_clock::now();
-  if (!WIFEXITED(status) || WEXITSTATUS(status) != 0) return -1;
-  return std::chrono::duration<double, std::milli>(end - begin).count();
-}
-
 // Starts every command at once; the wall time of each, in milliseconds
 // (negative for one that failed).
 std::vector<double> timedTogether(const std::vector<std::vector<std::string>>& commands) {
@@ -71,6 +53,9 @@ std::vector<double> timedTogether(const std::vector<std::vector<std::string>>& c
   }
   return times;
 }
+
+// Wall time of one run of argv, in milliseconds; negative when it failed.
+double timed(const std::vector<std::string>& args) { return timedTogether({args})[0]; }
 
 double percentile(std::vector<double> v, double p) {
   std::sort(v.begin(), v.end());
