@@ -125,7 +125,8 @@ int main(int argc, char** argv) {
   auto cache = VSAUserIdentityCache::create(
       {std::make_shared<VSALinuxPersonaService>(sysroot), users, 501, 501, true, nullptr});
   VSACodeSigningMapping mapping(cache, config,
-                                std::make_unique<VSASQLiteDB>(config->libraryDirectory()));
+                                std::make_unique<VSASQLiteDB>(config->libraryDirectory()),
+                                std::make_shared<VSALocks>());
   VSACommandQueue queue;
   auto t3 = Clock::now();
   for (int i = 0; i < count; ++i) {

@@ -57,12 +57,36 @@ struct Device {
   }
   ~Device() { fs::remove_all(root); }
 
+  // The cache reads data containers only: no code-signing records and no
+  // well-known names are asked for.
+  struct NoCodeSigning : VSACodeSigningQueries {
+    std::optional<VSAValue> entitlementsForIdentifier(const std::string&) override {
+      return std::nullopt;
+    }
+    bool identifierHasSystemContainer(const std::string&) override { return false; }
+    std::optional<std::string> parentIdentifierForChildIdentifier(const std::string&) override {
+      return std::nullopt;
+    }
+  } noCodeSigning;
+  struct NoWellknown : VSAWellknownContainers {
+    std::optional<std::string> wellknownContainerForId(const std::string&,
+                                                       VSAContainerClass) const override {
+      return std::nullopt;
+    }
+    bool isLookupWhitelistedFromCodeSignIdentifier(const std::string&, VSAContainerClass,
+                                                   const std::string&) const override {
+      return false;
+    }
+  } noWellknown;
+  static std::shared_ptr<VSATestLocks> testLocks() {
+    return std::make_shared<VSATestLocks>(std::make_shared<VSALocks>());
+  }
+
   std::shared_ptr<VSAContainerCache> freshCache() {
     return VSAContainerCache::create({identities, config,
                                       std::make_shared<VSASandboxService>(VSASystemRoot(root)),
                                       std::make_shared<VSANotificationCenter>(VSASystemRoot(root)),
-                                      [](const std::string&) { return std::nullopt; },
-                                      [](const std::string&, VSAContainerClass) { return false; }});
+                                      testLocks(), &noCodeSigning, &noWellknown});
   }
 };
 

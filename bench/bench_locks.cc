@@ -4,6 +4,8 @@
 #include "VSABenchRatio.h"
 #include "base/VSALocks.h"
 
+static VSALocks table;
+
 static void BM_SharedMutexReadLockUnlock(benchmark::State& state) {
   std::shared_mutex m;
   for (auto _ : state) {
@@ -16,16 +18,16 @@ BENCHMARK(BM_SharedMutexReadLockUnlock);
 static void BM_IdentifierReadLockUnlock(benchmark::State& state) {
   VSAValue key("8F0C7E3A-5B1D-4C9E-A2F4-6D3B1E0C9A7F");
   for (auto _ : state) {
-    lock_identifier_read(key);
-    unlock_identifier(key);
+    table.lock_identifier_read(key);
+    table.unlock_identifier(key);
   }
 }
 BENCHMARK(BM_IdentifierReadLockUnlock);
 
 static void BM_AllIdentifiersReadLockUnlock(benchmark::State& state) {
   for (auto _ : state) {
-    lock_all_identifiers_read();
-    unlock_all_identifiers();
+    table.lock_all_identifiers_read();
+    table.unlock_all_identifiers();
   }
 }
 BENCHMARK(BM_AllIdentifiersReadLockUnlock);

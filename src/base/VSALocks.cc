@@ -143,9 +143,6 @@ struct LockTable {
   alignas(8) uint32_t identifierWriterCount = 0;
 };
 
-// Never destroyed: lock calls may come from threads still running at exit.
-LockTable& gVSALocks = *new LockTable();
-
 [[noreturn]] void assertionFailed(const char* function, const char* condition) {
   VSALogIn(VSALogCategory::Locking, kVSALogFault, function, "Assertion failed: %s", condition);
   VSALogger::shared().flush();
@@ -180,28 +177,28 @@ void noteGranted(LockRecord* record, bool writing) {
 }
 
 // Idle list upkeep, under the table's mutex.
-void unlinkIdle(LockRecord* r) {
-  (r->idlePrev ? r->idlePrev->idleNext : gVSALocks.idleOldest) = r->idleNext;
-  (r->idleNext ? r->idleNext->idlePrev : gVSALocks.idleNewest) = r->idlePrev;
-  --gVSALocks.idleCount;
+void unlinkIdle(LockTable& t, LockRecord* r) {
+  (r->idlePrev ? r->idlePrev->idleNext : t.idleOldest) = r->idleNext;
+  (r->idleNext ? r->idleNext->idlePrev : t.idleNewest) = r->idlePrev;
+  --t.idleCount;
 }
 
-void linkIdle(LockRecord* r) {
+void linkIdle(LockTable& t, LockRecord* r) {
   r->idleNext = nullptr;
-  r->idlePrev = gVSALocks.idleNewest;
-  (gVSALocks.idleNewest ? gVSALocks.idleNewest->idleNext : gVSALocks.idleOldest) = r;
-  gVSALocks.idleNewest = r;
-  ++gVSALocks.idleCount;
+  r->idlePrev = t.idleNewest;
+  (t.idleNewest ? t.idleNewest->idleNext : t.idleOldest) = r;
+  t.idleNewest = r;
+  ++t.idleCount;
 }
 
 // Destroys the oldest idle records beyond the kept number. A record is only
 // ever reused for its own key, so a key's lock is one lock object for its
 // whole life (which is what lock-order checkers expect).
-void trimIdle() {
-  while (gVSALocks.idleCount > kIdleRecords) {
-    LockRecord* r = gVSALocks.idleOldest;
-    unlinkIdle(r);
-    gVSALocks.identifierToLockMap->erase(r);
+void trimIdle(LockTable& t) {
+  while (t.idleCount > kIdleRecords) {
+    LockRecord* r = t.idleOldest;
+    unlinkIdle(t, r);
+    t.identifierToLockMap->erase(r);
     pthread_rwlock_destroy(&r->lock);
     delete r;
   }
@@ -209,14 +206,14 @@ void trimIdle() {
 
 // The record for `key`: found in use or idle, or created. Called under the
 // table's mutex.
-LockRecord* recordForKey(const std::string& key) {
-  if (!gVSALocks.identifierToLockMap) gVSALocks.identifierToLockMap = new LockMap();
+LockRecord* recordForKey(LockTable& t, const std::string& key) {
+  if (!t.identifierToLockMap) t.identifierToLockMap = new LockMap();
   uint64_t hash = hashKey(key);
-  LockRecord* lockPtr = gVSALocks.identifierToLockMap->find(key, hash);
+  LockRecord* lockPtr = t.identifierToLockMap->find(key, hash);
   if (lockPtr) {
     if (lockPtr->refCount == 0) {
-      unlinkIdle(lockPtr);
-      ++gVSALocks.recordsInUse;
+      unlinkIdle(t, lockPtr);
+      ++t.recordsInUse;
     }
     return lockPtr;
   }
@@ -226,25 +223,23 @@ LockRecord* recordForKey(const std::string& key) {
   lockPtr->lockState = 0;
   lockPtr->key.assign(key);
   lockPtr->hash = hash;
-  gVSALocks.identifierToLockMap->insert(lockPtr);
-  ++gVSALocks.recordsInUse;
+  t.identifierToLockMap->insert(lockPtr);
+  ++t.recordsInUse;
   return lockPtr;
 }
 
-void take_one_lock(const std::string& key, bool writing) {
+void take_one_lock(LockTable& t, const std::string& key, bool writing) {
   VSALogIn(VSALogCategory::Locking, kVSALogDebug, "take_one_lock", "Waiting to lock %@ for %s", key,
            mode(writing));
-  pthread_mutex_lock(&gVSALocks.mutex);
+  pthread_mutex_lock(&t.mutex);
   if (writing) {
-    while (gVSALocks.allReaderWriterState != 0)
-      gVSALocks.identifierWriterCondition.wait(&gVSALocks.mutex);
-    ++gVSALocks.identifierWriterCount;
+    while (t.allReaderWriterState != 0) t.identifierWriterCondition.wait(&t.mutex);
+    ++t.identifierWriterCount;
   } else {
-    while (gVSALocks.allReaderWriterState == -1)
-      gVSALocks.identifierReaderCondition.wait(&gVSALocks.mutex);
-    ++gVSALocks.identifierReaderCount;
+    while (t.allReaderWriterState == -1) t.identifierReaderCondition.wait(&t.mutex);
+    ++t.identifierReaderCount;
   }
-  LockRecord* lockPtr = recordForKey(key);
+  LockRecord* lockPtr = recordForKey(t, key);
   ++lockPtr->refCount;
   // The key's lock is free (or shared with readers) most of the time: take it
   // here without blocking. Otherwise wait for it outside the table's mutex and
@@ -252,45 +247,45 @@ void take_one_lock(const std::string& key, bool writing) {
   int taken =
       writing ? pthread_rwlock_trywrlock(&lockPtr->lock) : pthread_rwlock_tryrdlock(&lockPtr->lock);
   if (taken != 0) {
-    pthread_mutex_unlock(&gVSALocks.mutex);
+    pthread_mutex_unlock(&t.mutex);
     if (writing) {
       pthread_rwlock_wrlock(&lockPtr->lock);
     } else {
       pthread_rwlock_rdlock(&lockPtr->lock);
     }
-    pthread_mutex_lock(&gVSALocks.mutex);
+    pthread_mutex_lock(&t.mutex);
   }
   noteGranted(lockPtr, writing);
-  pthread_mutex_unlock(&gVSALocks.mutex);
+  pthread_mutex_unlock(&t.mutex);
   VSALogIn(VSALogCategory::Locking, kVSALogDebug, "take_one_lock", "Got lock on identifier %@",
            key);
 }
 
-bool allCountersZero() {
-  return gVSALocks.identifierWriterCount == 0 && gVSALocks.identifierReaderCount == 0 &&
-         gVSALocks.allReaderWriterState == 0;
+bool allCountersZero(LockTable& t) {
+  return t.identifierWriterCount == 0 && t.identifierReaderCount == 0 &&
+         t.allReaderWriterState == 0;
 }
 
-void unlock_one_lock(const std::string& key) {
-  pthread_mutex_lock(&gVSALocks.mutex);
-  VSA_LOCK_ASSERT(gVSALocks.identifierToLockMap);
-  LockRecord* lockPtr = gVSALocks.identifierToLockMap->find(key, hashKey(key));
+void unlock_one_lock(LockTable& t, const std::string& key) {
+  pthread_mutex_lock(&t.mutex);
+  VSA_LOCK_ASSERT(t.identifierToLockMap);
+  LockRecord* lockPtr = t.identifierToLockMap->find(key, hashKey(key));
   VSA_LOCK_ASSERT(lockPtr);
   VSA_LOCK_ASSERT(lockPtr->lockState != 0);
   if (lockPtr->lockState != -1) {
     --lockPtr->lockState;
-    VSA_LOCK_ASSERT(gVSALocks.allReaderWriterState >= 0);
-    VSA_LOCK_ASSERT(gVSALocks.identifierReaderCount > 0);
-    --gVSALocks.identifierReaderCount;
-    if (allCountersZero()) gVSALocks.globalWriterCondition.signal();
+    VSA_LOCK_ASSERT(t.allReaderWriterState >= 0);
+    VSA_LOCK_ASSERT(t.identifierReaderCount > 0);
+    --t.identifierReaderCount;
+    if (allCountersZero(t)) t.globalWriterCondition.signal();
   } else {
     lockPtr->lockState = 0;
-    VSA_LOCK_ASSERT(gVSALocks.allReaderWriterState == 0);
-    VSA_LOCK_ASSERT(gVSALocks.identifierWriterCount > 0);
-    --gVSALocks.identifierWriterCount;
-    if (allCountersZero()) gVSALocks.globalWriterCondition.signal();
-    if (gVSALocks.identifierWriterCount == 0 && gVSALocks.allReaderWriterState != -1)
-      gVSALocks.globalReaderCondition.broadcast();
+    VSA_LOCK_ASSERT(t.allReaderWriterState == 0);
+    VSA_LOCK_ASSERT(t.identifierWriterCount > 0);
+    --t.identifierWriterCount;
+    if (allCountersZero(t)) t.globalWriterCondition.signal();
+    if (t.identifierWriterCount == 0 && t.allReaderWriterState != -1)
+      t.globalReaderCondition.broadcast();
   }
   --lockPtr->refCount;
   pthread_rwlock_unlock(&lockPtr->lock);
@@ -301,11 +296,11 @@ void unlock_one_lock(const std::string& key) {
     VSA_LOCK_ASSERT(0 == lockPtr->lockState);
     // Nobody holds or waits for the key: its record goes idle (and the
     // oldest idle one is destroyed when there are too many).
-    --gVSALocks.recordsInUse;
-    linkIdle(lockPtr);
-    trimIdle();
+    --t.recordsInUse;
+    linkIdle(t, lockPtr);
+    trimIdle(t);
   }
-  pthread_mutex_unlock(&gVSALocks.mutex);
+  pthread_mutex_unlock(&t.mutex);
 }
 
 // The distinct keys of `param` in the order they are to be taken
@@ -326,94 +321,121 @@ std::vector<std::string> orderedKeys(const VSAValue& param, bool descending, con
   return keys;
 }
 
-void _lock_identifier(const VSAValue& param, bool writing) {
-  if (const std::string* key = param.stringValue()) return take_one_lock(*key, writing);
+void _lock_identifier(LockTable& t, const VSAValue& param, bool writing) {
+  if (const std::string* key = param.stringValue()) return take_one_lock(t, *key, writing);
   for (const std::string& key : orderedKeys(param, false, "_lock_identifier"))
-    take_one_lock(key, writing);
+    take_one_lock(t, key, writing);
 }
 
-void _lock_all_identifiers(bool writing) {
+void _lock_all_identifiers(LockTable& t, bool writing) {
   VSALogIn(VSALogCategory::Locking, kVSALogDebug, "_lock_all_identifiers",
            "Waiting to lock all identifiers for %s", mode(writing));
-  pthread_mutex_lock(&gVSALocks.mutex);
+  pthread_mutex_lock(&t.mutex);
   if (writing) {
-    while (!allCountersZero()) gVSALocks.globalWriterCondition.wait(&gVSALocks.mutex);
-    gVSALocks.allReaderWriterState = -1;
+    while (!allCountersZero(t)) t.globalWriterCondition.wait(&t.mutex);
+    t.allReaderWriterState = -1;
   } else {
-    while (gVSALocks.identifierWriterCount != 0 || gVSALocks.allReaderWriterState == -1)
-      gVSALocks.globalReaderCondition.wait(&gVSALocks.mutex);
-    ++gVSALocks.allReaderWriterState;
+    while (t.identifierWriterCount != 0 || t.allReaderWriterState == -1)
+      t.globalReaderCondition.wait(&t.mutex);
+    ++t.allReaderWriterState;
   }
   VSALogIn(VSALogCategory::Locking, kVSALogDebug, "_lock_all_identifiers",
            "Locked all identifiers for %s", mode(writing));
-  pthread_mutex_unlock(&gVSALocks.mutex);
+  pthread_mutex_unlock(&t.mutex);
 }
 
 }  // namespace
 
-void lock_identifier_read(const VSAValue& param) { _lock_identifier(param, false); }
-void lock_identifier_write(const VSAValue& param) { _lock_identifier(param, true); }
+// The table's records live as long as the table: a record is freed when it
+// leaves the idle list, and whatever is left (idle records) goes with the table.
+struct VSALocks::Table : LockTable {
+  ~Table() {
+    for (LockRecord* r = idleOldest; r;) {
+      LockRecord* next = r->idleNext;
+      pthread_rwlock_destroy(&r->lock);
+      delete r;
+      r = next;
+    }
+    delete identifierToLockMap;
+  }
+};
 
-void unlock_identifier(const VSAValue& param) {
-  if (const std::string* key = param.stringValue()) return unlock_one_lock(*key);
-  for (const std::string& key : orderedKeys(param, true, "unlock_identifier")) unlock_one_lock(key);
+VSALocks::VSALocks() : table_(std::make_unique<Table>()) {}
+
+VSALocks::~VSALocks() = default;
+
+void VSALocks::lock_identifier_read(const VSAValue& param) {
+  _lock_identifier(*table_, param, false);
+}
+void VSALocks::lock_identifier_write(const VSAValue& param) {
+  _lock_identifier(*table_, param, true);
 }
 
-void lock_all_identifiers_read() { _lock_all_identifiers(false); }
-void lock_all_identifiers_write() { _lock_all_identifiers(true); }
+void VSALocks::unlock_identifier(const VSAValue& param) {
+  LockTable& t = *table_;
+  if (const std::string* key = param.stringValue()) return unlock_one_lock(t, *key);
+  for (const std::string& key : orderedKeys(param, true, "unlock_identifier"))
+    unlock_one_lock(t, key);
+}
 
-void unlock_all_identifiers() {
-  pthread_mutex_lock(&gVSALocks.mutex);
-  if (gVSALocks.allReaderWriterState != -1) {
-    VSA_LOCK_ASSERT(gVSALocks.allReaderWriterState > 0);
-    --gVSALocks.allReaderWriterState;
-    if (gVSALocks.allReaderWriterState == 0) gVSALocks.identifierWriterCondition.broadcast();
-    if (allCountersZero()) gVSALocks.globalWriterCondition.signal();
+void VSALocks::lock_all_identifiers_read() { _lock_all_identifiers(*table_, false); }
+void VSALocks::lock_all_identifiers_write() { _lock_all_identifiers(*table_, true); }
+
+void VSALocks::unlock_all_identifiers() {
+  LockTable& t = *table_;
+  pthread_mutex_lock(&t.mutex);
+  if (t.allReaderWriterState != -1) {
+    VSA_LOCK_ASSERT(t.allReaderWriterState > 0);
+    --t.allReaderWriterState;
+    if (t.allReaderWriterState == 0) t.identifierWriterCondition.broadcast();
+    if (allCountersZero(t)) t.globalWriterCondition.signal();
   } else {
-    gVSALocks.allReaderWriterState = 0;
-    gVSALocks.globalWriterCondition.signal();
-    gVSALocks.globalReaderCondition.broadcast();
-    gVSALocks.identifierWriterCondition.broadcast();
-    gVSALocks.identifierReaderCondition.broadcast();
+    t.allReaderWriterState = 0;
+    t.globalWriterCondition.signal();
+    t.globalReaderCondition.broadcast();
+    t.identifierWriterCondition.broadcast();
+    t.identifierReaderCondition.broadcast();
   }
-  pthread_mutex_unlock(&gVSALocks.mutex);
+  pthread_mutex_unlock(&t.mutex);
   VSALogIn(VSALogCategory::Locking, kVSALogDebug, "unlock_all_identifiers",
            "Unlocked all identifiers");
 }
 
-VSALockTableState VSALockTableSnapshot() {
-  pthread_mutex_lock(&gVSALocks.mutex);
-  VSALockTableState s{gVSALocks.recordsInUse, gVSALocks.identifierReaderCount,
-                      gVSALocks.identifierWriterCount, gVSALocks.allReaderWriterState,
-                      gVSALocks.idleCount};
-  pthread_mutex_unlock(&gVSALocks.mutex);
+VSALockTableState VSALocks::snapshot() const {
+  LockTable& t = *table_;
+  pthread_mutex_lock(&t.mutex);
+  VSALockTableState s{t.recordsInUse, t.identifierReaderCount, t.identifierWriterCount,
+                      t.allReaderWriterState, t.idleCount};
+  pthread_mutex_unlock(&t.mutex);
   return s;
 }
 
-VSAIdentifierLockGuard::VSAIdentifierLockGuard(VSAValue keys, bool writing, bool useLocking)
-    : keys_(std::move(keys)), held_(useLocking) {
+VSAIdentifierLockGuard::VSAIdentifierLockGuard(VSALocks& locks, VSAValue keys, bool writing,
+                                               bool useLocking)
+    : locks_(locks), keys_(std::move(keys)), held_(useLocking) {
   if (!held_) return;
   if (writing) {
-    lock_identifier_write(keys_);
+    locks_.lock_identifier_write(keys_);
   } else {
-    lock_identifier_read(keys_);
+    locks_.lock_identifier_read(keys_);
   }
 }
 
 VSAIdentifierLockGuard::~VSAIdentifierLockGuard() {
-  if (held_) unlock_identifier(keys_);
+  if (held_) locks_.unlock_identifier(keys_);
 }
 
-VSAAllIdentifiersLockGuard::VSAAllIdentifiersLockGuard(bool writing, bool useLocking)
-    : held_(useLocking) {
+VSAAllIdentifiersLockGuard::VSAAllIdentifiersLockGuard(VSALocks& locks, bool writing,
+                                                       bool useLocking)
+    : locks_(locks), held_(useLocking) {
   if (!held_) return;
   if (writing) {
-    lock_all_identifiers_write();
+    locks_.lock_all_identifiers_write();
   } else {
-    lock_all_identifiers_read();
+    locks_.lock_all_identifiers_read();
   }
 }
 
 VSAAllIdentifiersLockGuard::~VSAAllIdentifiersLockGuard() {
-  if (held_) unlock_all_identifiers();
+  if (held_) locks_.unlock_all_identifiers();
 }

@@ -1,4 +1,4 @@
-// The lock table: reader/writer locks per container key plus one
+// VSALocks, the lock table: reader/writer locks per container key plus one
 // reader/writer lock over all keys.
 //
 // Keys are container UUID strings (upper-case text form). A call takes one
@@ -21,20 +21,18 @@
 // that is not locked, a broken counter) aborts the daemon with the failed
 // condition's text. Thread-safe; per-key waits happen outside the table's
 // mutex. Prefer the RAII guards below, which release on every path.
+//
+// One table per daemon instance (the daemon context owns it and hands it to
+// every module that locks), so several daemons in one process never share a
+// lock. Whoever locks keeps the table alive until it has unlocked.
 #pragma once
 
 #include <cstddef>
+#include <memory>
 #include <string>
 #include <vector>
 
 #include "base/VSAValue.h"
-
-void lock_identifier_read(const VSAValue& param);
-void lock_identifier_write(const VSAValue& param);
-void unlock_identifier(const VSAValue& param);
-void lock_all_identifiers_read();
-void lock_all_identifiers_write();
-void unlock_all_identifiers();
 
 // Introspection for tests and diagnostics.
 struct VSALockTableState {
@@ -44,17 +42,38 @@ struct VSALockTableState {
   int32_t allReaderWriterState;
   size_t idleRecords;  // records of released keys kept for their next use
 };
-VSALockTableState VSALockTableSnapshot();
+
+class VSALocks {
+ public:
+  VSALocks();
+  ~VSALocks();
+  VSALocks(const VSALocks&) = delete;
+  VSALocks& operator=(const VSALocks&) = delete;
+
+  void lock_identifier_read(const VSAValue& param);
+  void lock_identifier_write(const VSAValue& param);
+  void unlock_identifier(const VSAValue& param);
+  void lock_all_identifiers_read();
+  void lock_all_identifiers_write();
+  void unlock_all_identifiers();
+
+  VSALockTableState snapshot() const;
+
+ private:
+  struct Table;
+  std::unique_ptr<Table> table_;
+};
 
 // Holds identifier locks for a scope. With useLocking false it takes nothing.
 class VSAIdentifierLockGuard {
  public:
-  VSAIdentifierLockGuard(VSAValue keys, bool writing, bool useLocking = true);
+  VSAIdentifierLockGuard(VSALocks& locks, VSAValue keys, bool writing, bool useLocking = true);
   ~VSAIdentifierLockGuard();
   VSAIdentifierLockGuard(const VSAIdentifierLockGuard&) = delete;
   VSAIdentifierLockGuard& operator=(const VSAIdentifierLockGuard&) = delete;
 
  private:
+  VSALocks& locks_;
   VSAValue keys_;
   bool held_;
 };
@@ -62,11 +81,12 @@ class VSAIdentifierLockGuard {
 // Holds the all-identifiers lock for a scope. With useLocking false it takes nothing.
 class VSAAllIdentifiersLockGuard {
  public:
-  VSAAllIdentifiersLockGuard(bool writing, bool useLocking = true);
+  VSAAllIdentifiersLockGuard(VSALocks& locks, bool writing, bool useLocking = true);
   ~VSAAllIdentifiersLockGuard();
   VSAAllIdentifiersLockGuard(const VSAAllIdentifiersLockGuard&) = delete;
   VSAAllIdentifiersLockGuard& operator=(const VSAAllIdentifiersLockGuard&) = delete;
 
  private:
+  VSALocks& locks_;
   bool held_;
 };

@@ -16,13 +16,9 @@ void logTest(const char* origin, std::string_view format, auto... args) {
 bool hasGate(uint64_t lock) { return lock >= 2 && lock < kVSATestLockCount; }
 }  // namespace
 
-VSATestLocks& VSATestLocks::shared() {
-  static VSATestLocks* locks = new VSATestLocks();  // lives as long as the process
-  return *locks;
-}
-
-VSATestLocks::VSATestLocks()
-    : stateQueue_(VSAWorkQueue::create("com.tamsk.vessad.VSATestLocks.stateQueue")),
+VSATestLocks::VSATestLocks(std::shared_ptr<VSALocks> locks)
+    : locks_(std::move(locks)),
+      stateQueue_(VSAWorkQueue::create("com.tamsk.vessad.VSATestLocks.stateQueue")),
       takerQueue_(VSAWorkQueue::create("com.tamsk.vessad.VSATestLocks.takerQueue")) {
   for (uint64_t lock = 2; lock < kVSATestLockCount; ++lock) {
     gates_[lock].queue = VSAWorkQueue::create("com.tamsk.vessad.VSATestLocks.lockQueue",
@@ -109,16 +105,16 @@ std::shared_future<void> VSATestLocks::take(uint64_t lock) {
     // held by an operation frozen at another test lock: only the taker waits.
     auto done = std::make_shared<std::promise<void>>();
     std::shared_future<void> taken = done->get_future().share();
-    takerQueue_->async([lock, done, &holding = holdings_[lock]] {
+    takerQueue_->async([lock, done, &holding = holdings_[lock], &locks = *locks_] {
       if (lock == 0)
-        lock_all_identifiers_write();
+        locks.lock_all_identifiers_write();
       else
-        lock_all_identifiers_read();
+        locks.lock_all_identifiers_read();
       {
         std::lock_guard guard(holding.mutex);
         if (holding.owed > 0) {
           --holding.owed;
-          unlock_all_identifiers();
+          locks.unlock_all_identifiers();
         } else {
           ++holding.held;
         }
@@ -143,7 +139,7 @@ void VSATestLocks::release(uint64_t lock) {
   std::lock_guard guard(holding.mutex);
   if (holding.held > 0) {
     --holding.held;
-    unlock_all_identifiers();
+    locks_->unlock_all_identifiers();
   } else {
     ++holding.owed;
   }

@@ -23,7 +23,7 @@
 //
 // Releasing never waits for anyone. With the feature off, waitOnLock() returns
 // at once. A release that would make a count negative ends the process.
-// Thread-safe; process-wide.
+// Thread-safe; one per daemon instance, over that daemon's lock table.
 #pragma once
 
 #include <array>
@@ -35,6 +35,7 @@
 #include <semaphore>
 
 #include "base/VSAError.h"
+#include "base/VSALocks.h"
 #include "base/VSAWorkQueue.h"
 
 inline constexpr uint64_t kVSATestLockCount = 7;
@@ -46,8 +47,7 @@ inline constexpr uint64_t kVSATestLockCacheRebuild = 6;
 
 class VSATestLocks {
  public:
-  static VSATestLocks& shared();
-  VSATestLocks();
+  explicit VSATestLocks(std::shared_ptr<VSALocks> locks);
   ~VSATestLocks();
   VSATestLocks(const VSATestLocks&) = delete;
   VSATestLocks& operator=(const VSATestLocks&) = delete;
@@ -87,6 +87,7 @@ class VSATestLocks {
   std::shared_future<void> take(uint64_t lock);
   void release(uint64_t lock);
 
+  std::shared_ptr<VSALocks> locks_;
   std::atomic<bool> enabled_{false};
   VSAWorkQueue::Ref stateQueue_;
   std::array<int64_t, kVSATestLockCount> counts_{};  // on the state queue

@@ -24,11 +24,13 @@ bool flagOption(const VSAValue& options, const char* key) {
 
 VSACodeSigningMapping::VSACodeSigningMapping(
     std::shared_ptr<VSAUserIdentityCache> userIdentityCache,
-    std::shared_ptr<VSAGlobalConfiguration> configuration, std::unique_ptr<VSASQLiteDB> mappingDB)
+    std::shared_ptr<VSAGlobalConfiguration> configuration, std::unique_ptr<VSASQLiteDB> mappingDB,
+    std::shared_ptr<VSALocks> locks)
     : userIdentityCache_(std::move(userIdentityCache)),
       configuration_(std::move(configuration)),
       queue_(VSAWorkQueue::create("com.tamsk.Vessa.EntitlementQueue")),
-      codeSigningMappingDB_(std::move(mappingDB)) {
+      codeSigningMappingDB_(std::move(mappingDB)),
+      locks_(std::move(locks)) {
   queue_->sync([this] { _onQueue_migrateFromMappingFileToDBIfNecessary(); });
 }
 

@@ -17,12 +17,16 @@
 #include <unordered_map>
 #include <vector>
 
+#include "base/VSALocks.h"
 #include "base/VSAValue.h"
 #include "base/VSAWorkQueue.h"
 #include "codesigning/VSASQLiteDB.h"
+#include "model/VSACodeSigningQueries.h"
 #include "model/VSAGlobalConfiguration.h"
 #include "model/VSAUserIdentityCache.h"
+#include "operations/VSACodeSigningChanges.h"
 #include "operations/VSACommandQueue.h"
+#include "operations/VSAGroupQueries.h"
 #include "operations/VSAStageForDeleteEnvironment.h"
 
 inline constexpr const char* kVSAEntitlementsKey = "com.tamsk.Vessa.Entitlements";
@@ -38,19 +42,17 @@ inline constexpr const char* kVSAEntitlementSystemGroupContainers =
     "com.tamsk.security.system-group-containers";
 inline constexpr const char* kVSAEntitlementSystemContainer = "com.tamsk.security.system-container";
 
-enum VSAGroupType : int { kVSAGroupTypeApplication = 0, kVSAGroupTypeSystem = 1 };
-
 // A counted multiset of group identifiers.
 using VSAReferenceCounts = std::map<std::string, int>;
 
-class VSACodeSigningMapping {
+class VSACodeSigningMapping : public VSACodeSigningQueries, public VSACodeSigningChanges {
  public:
   // initWithUserIdentityCache:queue:mappingDB: — also moves a legacy mapping
   // file ("vsa_code_signing_info.plist" in the library directory) into the
   // database, on the mapping's queue.
   VSACodeSigningMapping(std::shared_ptr<VSAUserIdentityCache> userIdentityCache,
                         std::shared_ptr<VSAGlobalConfiguration> configuration,
-                        std::unique_ptr<VSASQLiteDB> mappingDB);
+                        std::unique_ptr<VSASQLiteDB> mappingDB, std::shared_ptr<VSALocks> locks);
 
   // Registers (or, without `info`, forgets) an identifier's code-signing info.
   VSAResultCode processCodeSigningInfo(const std::optional<VSAValue>& info,
@@ -61,7 +63,7 @@ class VSACodeSigningMapping {
                                                     VSACommandQueue* commandQueue);
   // For clients: nothing for placeholder, advance-copy or invalid entries.
   std::optional<VSAValue> getCodeSigningInfoForIdentifier(const std::string& identifier);
-  std::optional<VSAValue> entitlementsForIdentifier(const std::string& identifier);
+  std::optional<VSAValue> entitlementsForIdentifier(const std::string& identifier) override;
   std::optional<std::vector<std::string>> appGroupIdentifiersForIdentifier(const std::string& id);
   std::optional<std::vector<std::string>> systemGroupIdentifiersForIdentifier(
       const std::string& id);
@@ -71,20 +73,20 @@ class VSACodeSigningMapping {
     return systemGroupIds(id, &entitlements, true);
   }
   VSAContainerClass dataContainerTypeForIdentifier(const std::string& identifier);
-  bool identifierHasSystemContainer(const std::string& identifier);
+  bool identifierHasSystemContainer(const std::string& identifier) override;
   bool identifierHasCallerRegisteredEntitlements(const std::string& identifier);
   std::optional<VSACodeSigningEntry> codeSigningEntryForIdentifier(const std::string& identifier,
                                                                    VSAErrorRef* error);
-  std::optional<std::string> parentIdentifierForChildIdentifier(const std::string& child);
+  std::optional<std::string> parentIdentifierForChildIdentifier(const std::string& child) override;
   std::optional<std::vector<std::string>> childBundleIdentifiersForParentIdentifier(
       const std::string& parent);
   std::optional<std::vector<std::string>> identifiersWithError(VSAErrorRef* error);
   bool invalidateCodeSigningInfoForIdentifier(const std::string& identifier, VSAErrorRef* error);
   bool invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier,
-                                                            VSAErrorRef* error);
-  void removeCodeSigningDictionariesForIdentifierAndItsChildren(const std::string& identifier,
-                                                                VSACommandQueue* commandQueue);
-  bool removeAllAdvanceCopiesWithError(VSAErrorRef* error);
+                                                            VSAErrorRef* error) override;
+  void removeCodeSigningDictionariesForIdentifierAndItsChildren(
+      const std::string& identifier, VSACommandQueue* commandQueue) override;
+  bool removeAllAdvanceCopiesWithError(VSAErrorRef* error) override;
   // Invalidates the records of apps (and their plug-ins) that no longer have
   // a bundle container; caller-registered entries and plug-ins with a parent
   // are left alone. 1 when every step succeeded.
@@ -113,6 +115,8 @@ class VSACodeSigningMapping {
       const std::string& identifier, const VSAValue* entitlements, const char* groupKey);
 
   VSAWorkQueue& queue() { return *queue_; }
+  // The daemon's lock table, which passes over the mapping take.
+  VSALocks& locks() const { return *locks_; }
   // What the deletions this mapping queues run with (set once the container
   // cache exists).
   void setStageForDeleteEnvironment(
@@ -173,6 +177,7 @@ class VSACodeSigningMapping {
   std::shared_ptr<VSAGlobalConfiguration> configuration_;
   VSAWorkQueue::Ref queue_;
   std::unique_ptr<VSASQLiteDB> codeSigningMappingDB_;
+  std::shared_ptr<VSALocks> locks_;
   std::shared_ptr<const VSAStageForDeleteEnvironment> stageEnvironment_;
   // Callers' entitlements found recorded (or just recorded), with the
   // database's change count at that moment: while nothing has been written

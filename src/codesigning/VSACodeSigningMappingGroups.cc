@@ -245,7 +245,7 @@ bool VSACodeSigningMapping::removeAllAdvanceCopiesWithError(VSAErrorRef* error) 
 }
 
 VSAResultCode VSACodeSigningMapping::invalidateCodeSigningInfoForAppsWithoutBundleContainer() {
-  VSAAllIdentifiersLockGuard lock(true);
+  VSAAllIdentifiersLockGuard lock(*locks_, true);
   VSAResultCode result = VSAResult::kSuccess;
   VSAErrorRef error;
   auto identifiers = identifiersWithError(&error);

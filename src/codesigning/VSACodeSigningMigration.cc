@@ -43,7 +43,7 @@ VSACodeSigningMigration::VSACodeSigningMigration(
 
 bool VSACodeSigningMigration::performAllCodeSigningMigrationAndReconciliationWithCommandQueue(
     VSACommandQueue& commandQueue) {
-  VSAAllIdentifiersLockGuard lock(true);
+  VSAAllIdentifiersLockGuard lock(mapping_->locks(), true);
   bool multiUser = deviceProperties_->multiUserFlagsTopBitSet();
   bool ok = true;
   if (!multiUser) ok = migrateAppGroupIdsFromDataContainersToFile() && ok;

@@ -43,7 +43,7 @@ VSAGroupManager::groupContainerIdentifiersForOwnerIdentifier(const VSAValue* own
   }
   // Held for writing: the owner's groups are read while no container
   // operation, reading or writing, is in flight.
-  VSAAllIdentifiersLockGuard lock(true, useLocking);
+  VSAAllIdentifiersLockGuard lock(*stageEnvironment_->locks, true, useLocking);
   try {
     const std::string& id = *owner->stringValue();
     auto ids = groupContainerClass == 13 ? mapping_->systemGroupIdentifiersForIdentifier(id)

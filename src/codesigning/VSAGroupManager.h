@@ -25,9 +25,10 @@
 #include "model/VSAGlobalConfiguration.h"
 #include "model/VSAUserIdentityCache.h"
 #include "operations/VSACommandQueue.h"
+#include "operations/VSAGroupQueries.h"
 #include "operations/VSAStageForDeleteEnvironment.h"
 
-class VSAGroupManager {
+class VSAGroupManager : public VSAGroupQueries {
  public:
   // initWithUserIdentityCache:
   VSAGroupManager(std::shared_ptr<VSAUserIdentityCache> userIdentityCache,
@@ -46,11 +47,11 @@ class VSAGroupManager {
   // the all-identifiers lock is held for writing meanwhile.
   std::optional<std::vector<std::string>> groupContainerIdentifiersForOwnerIdentifier(
       const VSAValue* owner, VSAContainerClass groupContainerClass, bool useLocking,
-      VSAResultCode* withError);
+      VSAResultCode* withError) override;
   // Queues the deletion of every group container of `groupType` (0 or 1)
   // that no identifier references, for every user that has a base directory
   // (type 0) or the default user (type 1).
-  void reconcileGroupContainersOfType(int groupType, VSACommandQueue& commandQueue);
+  void reconcileGroupContainersOfType(int groupType, VSACommandQueue& commandQueue) override;
   void _cleanupUnreferencedGroupContainersForUserIdentity(const VSAUserIdentityRef& user,
                                                           VSAContainerClass containerClass,
                                                           const VSAReferenceCounts& referenceCounts,

@@ -20,8 +20,9 @@
 
 #include "base/VSAValue.h"
 #include "model/VSAContainerClass.h"
+#include "model/VSAWellknownContainers.h"
 
-class VSAWhitelist {
+class VSAWhitelist : public VSAWellknownContainers {
  public:
   // "Any" in the client tables.
   static constexpr const char* kAnyMarker = "*";
@@ -37,20 +38,17 @@ class VSAWhitelist {
   static std::shared_ptr<VSAWhitelist> load(const std::string& configPath, bool internalBuild);
   static VSAValue builtInTables();
 
-  bool isLookupWhitelistedFromCodeSignIdentifier(const std::string& client,
-                                                 VSAContainerClass forContainerClass,
-                                                 const std::string& containerIdentifier) const;
+  bool isLookupWhitelistedFromCodeSignIdentifier(
+      const std::string& client, VSAContainerClass forContainerClass,
+      const std::string& containerIdentifier) const override;
   const std::set<std::string>& wellknownSystemContainers() const { return system_; }
   const std::set<std::string>& wellknownSystemGroupContainers() const { return systemGroups_; }
   bool systemContainerIdIsWellknown(const std::string& id) const { return system_.count(id) > 0; }
   bool systemGroupContainerIdIsWellknown(const std::string& id) const {
     return systemGroups_.count(id) > 0;
   }
-  std::optional<std::string> wellknownContainerForId(const std::string& id,
-                                                     VSAContainerClass containerClass) const;
-  bool containerIdIsWellknown(const std::string& id, VSAContainerClass containerClass) const {
-    return wellknownContainerForId(id, containerClass).has_value();
-  }
+  std::optional<std::string> wellknownContainerForId(
+      const std::string& id, VSAContainerClass containerClass) const override;
 
  private:
   // nullopt = any identifier.

@@ -107,7 +107,7 @@ VSAIPCListener::Route VSADaemon::routeRequest(const VSAValue& body) {
     testLocksInUse_ = true;
     return {testLockQueue_, false};
   }
-  bool mayFreeze = testLocksInUse_ || VSATestLocks::shared().enabled();
+  bool mayFreeze = testLocksInUse_ || context_->testLocks->enabled();
   return {nullptr, !mayFreeze};
 }
 
@@ -152,14 +152,14 @@ void VSADaemon::drainForShutdown() {
   // A request frozen at a test lock would hold its transaction open forever,
   // and one frozen on an I/O thread would hold up the stops below. Turned off
   // again after them, in case a test-lock command came in meanwhile.
-  VSATestLocks::shared().setEnabled(false);
+  context_->testLocks->setEnabled(false);
   {
     std::lock_guard lock(listenerMutex_);
     if (listener_) listener_->stopAccepting();
     // Upcalls already received are still answered: their replies hold the peer.
     if (upcall_) upcall_->stop();
   }
-  VSATestLocks::shared().setEnabled(false);
+  context_->testLocks->setEnabled(false);
   if (!context_->transactions->waitUntilIdle(std::chrono::seconds(30)))
     VSALogIn(VSALogCategory::Daemon, kVSALogError, "main",
              "Giving up on %d open transactions after 30 seconds",

@@ -51,6 +51,7 @@ void VSAHandleTestLock(const VSAValue& request, VSAValue&, VSAClientConnection& 
     VSASetCode(result, VSAResult::kOutOfRange);
     return;
   }
-  VSAResultCode code = VSATestLocks::shared().setLockFromCommand(*lock, args.boolValue("Enable"));
+  VSAResultCode code =
+      connection.context().testLocks->setLockFromCommand(*lock, args.boolValue("Enable"));
   if (code != VSAResult::kSuccess) VSASetCode(result, code);
 }

@@ -65,7 +65,7 @@ bool VSAKernelUpcall::start(std::unique_ptr<VSAUpcallListener> bound) {
         // Served right here while the queues are idle: no hand-off to a pool
         // thread. Not while test locks may freeze it, so that a frozen upcall
         // holds up only the pool thread it waits on.
-        if (!VSATestLocks::shared().enabled() && queue_->runIfIdle(block)) return;
+        if (!context_.testLocks->enabled() && queue_->runIfIdle(block)) return;
         queue_->async(std::move(block));
       },
       &error);

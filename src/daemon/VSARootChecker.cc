@@ -121,13 +121,10 @@ void VSARootChecker::checkEntry(const VSAUserIdentityRef& user, VSAContainerClas
                                 const std::string& directory, const std::string& name) {
   std::string path = VSAPathJoin(directory, name);
   auto& fs = *context_->fileSystem;
-  auto whitelist = context_->whitelist;
   struct stat st;
   bool isDirectory = fs.lstat(path, &st) == 0 && S_ISDIR(st.st_mode);
-  if (!isDirectory || !VSAContainerCache::containerURLIsValidForContainerClass(
-                          path, c, [whitelist](const std::string& id, VSAContainerClass k) {
-                            return whitelist->containerIdIsWellknown(id, k);
-                          })) {
+  if (!isDirectory ||
+      !VSAContainerCache::containerURLIsValidForContainerClass(path, c, *context_->whitelist)) {
     ++counts_["orphans"];
     add("orphan", path, "not a container's name or not a directory", kNextBoot);
     return;

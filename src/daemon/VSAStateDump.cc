@@ -106,7 +106,7 @@ uint64_t VSAStateDump::entriesIn(const std::string& directory) {
 }
 
 VSAValue VSAStateDump::testLocks() {
-  auto& locks = VSATestLocks::shared();
+  auto& locks = *context_.testLocks;
   VSAValue held = VSAValue::array();
   for (uint64_t lock = 0; lock < kVSATestLockCount; ++lock)
     if (int64_t count = locks.countForLock(lock))

@@ -128,8 +128,8 @@ bool VSADataProtectionChangeOperation::_runChangeOperationNeedToRetry(bool* need
     return true;
   };
   // Readers of this container may go on; writers wait for the walk.
-  VSAIdentifierLockGuard guard(VSAValue(metadata_->uuid().string()), false);
-  VSATestLocks::shared().waitOnLock(kVSATestLockProtectionChange);
+  VSAIdentifierLockGuard guard(*env_->locks, VSAValue(metadata_->uuid().string()), false);
+  env_->testLocks->waitOnLock(kVSATestLockProtectionChange);
   VSAErrorRef walkError;
   bool walked = fm.traverseDirectory(metadata_->url(), &walkError, visit);
   if (lockedFailure) {

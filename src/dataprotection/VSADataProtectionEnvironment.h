@@ -3,8 +3,10 @@
 // persisted update back into a container, the lock-state queue that runs
 // retries at the next unlock, the daemon's transactions (a pending retry
 // keeps the daemon busy), the termination service (an app whose container
-// waits for an unlock stays terminated) and the entitlements of an
-// identifier. Filled once by the daemon context; tests fill their own.
+// waits for an unlock stays terminated), the lock table and test locks, and
+// the code-signing records that hold an identifier's entitlements. Filled
+// once by the daemon context, which keeps `codeSigning` alive as long as the
+// environment; tests fill their own.
 #pragma once
 
 #include <functional>
@@ -12,8 +14,11 @@
 #include <optional>
 #include <string>
 
+#include "base/VSALocks.h"
+#include "base/VSATestLocks.h"
 #include "base/VSAValue.h"
 #include "base/VSAWorkQueue.h"
+#include "model/VSACodeSigningQueries.h"
 #include "model/VSAContainerCache.h"
 #include "model/VSAGlobalConfiguration.h"
 #include "model/VSAUserIdentityCache.h"
@@ -28,5 +33,7 @@ struct VSADataProtectionEnvironment {
   // Suspended while the device is locked.
   VSAWorkQueue::Ref lockStateQueue;
   std::shared_ptr<VSAApplicationTerminationService> terminationService;  // may be null
-  std::function<std::optional<VSAValue>(const std::string&)> entitlementsForIdentifier;
+  std::shared_ptr<VSALocks> locks;
+  std::shared_ptr<VSATestLocks> testLocks;
+  VSACodeSigningQueries* codeSigning = nullptr;  // never null once filled
 };

@@ -80,8 +80,7 @@ int32_t VSADataProtectionManager::currentProtectionClassOfMetadata(const VSAMeta
 
 int32_t VSADataProtectionManager::intendedDataProtectionClassBasedOnEntitlementsForIdentifier(
     const std::string& identifier) {
-  auto entitlements = env_->entitlementsForIdentifier ? env_->entitlementsForIdentifier(identifier)
-                                                      : std::optional<VSAValue>();
+  auto entitlements = env_->codeSigning->entitlementsForIdentifier(identifier);
   if (!entitlements) return 0;
   const std::string* name = nullptr;
   for (const char* key : kEntitlementKeys) {
@@ -329,7 +328,7 @@ void VSADataProtectionManager::runRetry(const std::string& key) {
 
 void VSADataProtectionManager::recordProtectionClass(const VSAMetadataRef& metadata,
                                                      int32_t protectionClass) {
-  VSAIdentifierLockGuard guard(VSAValue(metadata->uuid().string()), true);
+  VSAIdentifierLockGuard guard(*env_->locks, VSAValue(metadata->uuid().string()), true);
   // The change may have waited for an unlock for hours: what the metadata
   // says now is read again under the lock, so that nothing written since is
   // put back to what it was when the request came.

@@ -33,6 +33,7 @@
 #include "dataprotection/VSADataProtectionChangeOperation.h"
 #include "dataprotection/VSADataProtectionEnvironment.h"
 #include "model/VSAContainerIdentity.h"
+#include "operations/VSADataProtectionQueries.h"
 
 // Replies a manager keeps for changes waiting for an unlock, by default.
 inline constexpr size_t kVSAMaxPendingProtectionReplies = 1024;
@@ -44,7 +45,7 @@ inline constexpr VSAResultCode kVSAProtectionChangeSupersededResult = VSAResult:
 // replies were waiting: accepted, persisted, and run at the next unlock.
 inline constexpr VSAResultCode kVSAProtectionChangeAnsweredEarlyResult = VSAResult::kSuccess;
 
-class VSADataProtectionManager {
+class VSADataProtectionManager : public VSADataProtectionQueries {
  public:
   using Completion = std::function<void(VSAResultCode)>;
 
@@ -55,7 +56,7 @@ class VSADataProtectionManager {
 
   // The class an identifier's entitlements ask for (0: none or unknown).
   int32_t intendedDataProtectionClassBasedOnEntitlementsForIdentifier(
-      const std::string& identifier);
+      const std::string& identifier) override;
   void setDataProtectionOnDataContainerForContainerIdentity(const VSAContainerIdentity& identity,
                                                             int32_t dataProtectionClass,
                                                             bool isSecondOrThirdPartyApp,
@@ -63,7 +64,7 @@ class VSADataProtectionManager {
                                                             Completion withCompletion);
   // Starts the operation of every readable update file; damaged files are
   // reported and skipped. False only when the directory cannot be listed.
-  bool restartPendingDataProtectionOperationsWithError(VSAErrorRef* error);
+  bool restartPendingDataProtectionOperationsWithError(VSAErrorRef* error) override;
   void _startDataProtectionChangeOperation(const VSADataProtectionChangeOperation::Ref& operation,
                                            Completion withCompletion);
 

@@ -57,8 +57,8 @@ bool guarded(const char* origin, VSAResultCode* cell, Body body) {
 }  // namespace
 
 std::unique_ptr<VSAMigrationStatus> VSAContainerMigrator::systemStatus() {
-  return VSAMigrationStatus::initForSystemMigration(*hooks_.configuration,
-                                                    hooks_.systemVersionPath);
+  return VSAMigrationStatus::initForSystemMigration(*dependencies_.configuration,
+                                                    dependencies_.systemVersionPath);
 }
 
 bool VSAContainerMigrator::performSynchronousBuildUpgradeMigration(VSAMigrationStatus& status,
@@ -76,10 +76,10 @@ bool VSAContainerMigrator::performSynchronousBuildUpgradeMigration(VSAMigrationS
 
 void VSAContainerMigrator::migrateLogFiles(const std::string& build) {
   const char* origin = "performSynchronousBuildUpgradeMigration";
-  auto& config = *hooks_.configuration;
+  auto& config = *dependencies_.configuration;
   auto& fm = config.fileManager();
   auto perUser = config.getPerUserConfigurationForUserIdentity(
-      hooks_.userIdentityCache->defaultUserIdentity());
+      dependencies_.userIdentityCache->defaultUserIdentity());
   if (!perUser) return;
   std::string old = perUser->oldLoggingPath();
   if (fm.itemDoesNotExistAtURL(old)) return;  // nothing of an old release: silent
@@ -109,12 +109,12 @@ void VSAContainerMigrator::migrateLogFiles(const std::string& build) {
 // VSAOldBundleLocation.h); anything planted there stays behind.
 bool VSAContainerMigrator::migrateOldBundleLocation(VSAErrorRef* error) {
   const char* origin = "performSynchronousBuildUpgradeMigration";
-  auto& fm = hooks_.configuration->fileManager();
-  const std::string& old = hooks_.oldBundleLocation;
+  auto& fm = dependencies_.configuration->fileManager();
+  const std::string& old = dependencies_.oldBundleLocation;
   if (old.empty() || !fm.itemExistsAtURL(old)) return true;
   logMigrator(kVSALogNotice, origin, "Moving bundle containers from user to system location");
-  if (!VSAMoveOldBundleLocation(fm.fileSystem(), old, hooks_.configuration->bundleDirectory(),
-                                error)) {
+  if (!VSAMoveOldBundleLocation(fm.fileSystem(), old,
+                                dependencies_.configuration->bundleDirectory(), error)) {
     logMigrator(kVSALogError, origin,
                 "Failed to migrate to new bundle containers location : %@.  This is terrible.",
                 error ? *error : nullptr);
@@ -126,7 +126,7 @@ bool VSAContainerMigrator::migrateOldBundleLocation(VSAErrorRef* error) {
 void VSAContainerMigrator::_checkIfDeviceMayNeedSystemContainerACLMigration(
     VSAMigrationStatus& status) {
   if (status.hasMigrationOccurredForType(kACLMigration)) return;
-  auto& config = *hooks_.configuration;
+  auto& config = *dependencies_.configuration;
   auto& fm = config.fileManager();
   for (VSAContainerClass c : {12, 13})
     if (fm.itemExistsAtURL(config.globalContainerBaseURLWithContentClass(c, false).value_or("")))
@@ -139,7 +139,7 @@ void VSAContainerMigrator::_checkIfDeviceMayNeedSystemContainerACLMigration(
 bool VSAContainerMigrator::_performInternalACLMigrationWithError(VSAMigrationStatus& status,
                                                                  VSAErrorRef* error) {
   if (status.hasMigrationOccurredForType(kACLMigration)) return true;
-  auto& config = *hooks_.configuration;
+  auto& config = *dependencies_.configuration;
   auto& fm = config.fileManager();
   bool ok = true;
   for (VSAContainerClass c : {12, 13}) {
@@ -160,8 +160,9 @@ bool VSAContainerMigrator::_performBundleContainerOwnershipMigrationWithError(
   if (status.hasMigrationOccurredForType(kBundleMigration)) return true;
   const char* origin = "_performBundleContainerOwnershipMigrationWithError";
   logMigrator(kVSALogNotice, origin, "Changing ownership of bundle container content.");
-  std::string bundles = hooks_.configuration->bundleDirectory();
-  if (!hooks_.configuration->fileManager().standardizeOwnershipAtURL(bundles, 33, 33, error)) {
+  std::string bundles = dependencies_.configuration->bundleDirectory();
+  if (!dependencies_.configuration->fileManager().standardizeOwnershipAtURL(bundles, 33, 33,
+                                                                            error)) {
     logMigrator(kVSALogError, origin, "Failed to change owner of %@: %@", bundles,
                 error ? *error : nullptr);
     return false;
@@ -171,12 +172,12 @@ bool VSAContainerMigrator::_performBundleContainerOwnershipMigrationWithError(
 
 bool VSAContainerMigrator::_performWhitelistMigrationWithError(VSAErrorRef* error) {
   const char* origin = "_performWhitelistMigrationWithError";
-  auto user = hooks_.userIdentityCache->defaultUserIdentity();
-  auto& cache = *hooks_.containerCache;
-  auto& fm = hooks_.configuration->fileManager();
+  auto user = dependencies_.userIdentityCache->defaultUserIdentity();
+  auto& cache = *dependencies_.containerCache;
+  auto& fm = dependencies_.configuration->fileManager();
   bool ok = true;
   for (VSAContainerClass c : {12, 13}) {
-    auto dir = hooks_.configuration->containerDirectoryURLForUserIdentity(user, c, false);
+    auto dir = dependencies_.configuration->containerDirectoryURLForUserIdentity(user, c, false);
     auto all = cache.allContainersForUserIdentity(user, c, false, false, error);
     if (!dir || !all) {
       logMigrator(kVSALogError, origin,
@@ -186,9 +187,7 @@ bool VSAContainerMigrator::_performWhitelistMigrationWithError(VSAErrorRef* erro
       continue;
     }
     for (const auto& m : *all) {
-      auto name = hooks_.wellknownContainerForId
-                      ? hooks_.wellknownContainerForId(m->identifier(), c)
-                      : std::nullopt;
+      auto name = dependencies_.wellknown.wellknownContainerForId(m->identifier(), c);
       if (!name) continue;
       std::string target = VSAPathJoin(*dir, *name);
       if (m->url() == target) continue;
@@ -252,7 +251,9 @@ bool VSAContainerMigrator::performDataMigratorMigrationForClientConnection(
       failure = error;
       ok = false;
     }
-    if (hooks_.codeSigningMigration && !hooks_.codeSigningMigration(commandQueue, *status))
+    if (!dependencies_.codeSigningMigration
+             .performAllCodeSigningMigrationAndReconciliationWithCommandQueue(commandQueue,
+                                                                              *status))
       ok = false;
     if (!ok)
       VSASetCode(withError,
@@ -265,12 +266,13 @@ bool VSAContainerMigrator::performPerUserDataMigrationForClientConnection(
     const VSAMigrationClient& client, VSAResultCode* withError) {
   const char* origin = "performPerUserDataMigrationForClientConnection";
   return guarded(origin, withError, [&] {
-    auto mobile = hooks_.userIdentityCache->defaultUserIdentity();
+    auto mobile = dependencies_.userIdentityCache->defaultUserIdentity();
     logMigrator(kVSALogNotice, origin,
                 "Container data migration requested by %@ for current mobile user: %u",
                 client.bundleIdentifier, mobile ? mobile->posixUID() : 0u);
-    auto status = VSAMigrationStatus::initForMobileUserMigration(
-        *hooks_.configuration, *hooks_.userIdentityCache, hooks_.systemVersionPath);
+    auto status = VSAMigrationStatus::initForMobileUserMigration(*dependencies_.configuration,
+                                                                 *dependencies_.userIdentityCache,
+                                                                 dependencies_.systemVersionPath);
     if (!status) {
       VSASetCode(withError, kStatusUnreadable);
       return false;
@@ -278,13 +280,13 @@ bool VSAContainerMigrator::performPerUserDataMigrationForClientConnection(
     bool ok = true;
     if (!status->hasMigrationOccurredForType(kSubdirectoryMigration)) {
       bool all = true;
-      hooks_.userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
+      dependencies_.userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
           [&](const VSAUserIdentityRef& user) {
             all = subdirectoryMigration(user, client, status->currentBuildVersion()) && all;
           });
       ok = all && status->setMigrationCompleteForType(kSubdirectoryMigration);
     }
-    hooks_.userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
+    dependencies_.userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
         [&](const VSAUserIdentityRef& user) {
           ok = dataProtectionMigration(user, client, status->currentBuildVersion()) && ok;
         });
@@ -303,7 +305,8 @@ bool VSAContainerMigrator::subdirectoryMigration(const VSAUserIdentityRef& user,
   bool ok = true;
   for (VSAContainerClass c : {2, 4, 6, 7, 9, 10, 11}) {
     VSAErrorRef error;
-    auto all = hooks_.containerCache->allContainersForUserIdentity(user, c, false, false, &error);
+    auto all =
+        dependencies_.containerCache->allContainersForUserIdentity(user, c, false, false, &error);
     if (!all) {
       logMigrator(kVSALogError, origin,
                   "Failed to fetch list of containers for userIdentity: %@, class %ld : %@",
@@ -341,7 +344,8 @@ bool VSAContainerMigrator::dataProtectionMigration(const VSAUserIdentityRef& use
   bool ok = true;
   for (VSAContainerClass c : {2, 4, 6}) {
     VSAErrorRef error;
-    auto all = hooks_.containerCache->allContainersForUserIdentity(user, c, false, false, &error);
+    auto all =
+        dependencies_.containerCache->allContainersForUserIdentity(user, c, false, false, &error);
     if (!all) {
       logMigrator(kVSALogError, origin,
                   "Failed to fetch list of data containers for userIdentity: %@, class: %ld: %@",
@@ -374,8 +378,8 @@ VSAMetadataRef VSAContainerMigrator::_bundleContainerForDataContainer(const VSAM
     return nullptr;
   }
   std::string app = data.identifier();
-  if (data.containerClass() == 4 && hooks_.parentIdentifier)
-    if (auto parent = hooks_.parentIdentifier(app)) {
+  if (data.containerClass() == 4)
+    if (auto parent = dependencies_.codeSigning.parentIdentifierForChildIdentifier(app)) {
       app = *parent;
       bundleClass = 1;
     }
@@ -386,7 +390,7 @@ VSAMetadataRef VSAContainerMigrator::_bundleContainerForDataContainer(const VSAM
     VSASetError(error, VSA_ERROR(code, "Could not create container identity from [%@]", app));
     return nullptr;
   }
-  auto bundle = hooks_.containerCache->containerForContainerIdentity(*identity);
+  auto bundle = dependencies_.containerCache->containerForContainerIdentity(*identity);
   if (!bundle)
     VSASetError(error, VSA_ERROR(VSAResult::kContainerNotFound,
                                  "Parent Container for: \"%@\" Not Found", app));
@@ -402,22 +406,23 @@ void VSAContainerMigrator::_setDataProtectionIfNecessaryOnContainer(
                 "Error looking up bundle container for %@ : %@", container.identifier(), error);
     return;
   }
-  int32_t wanted = hooks_.intendedDataProtectionClass
-                       ? hooks_.intendedDataProtectionClass(bundle->identifier())
-                       : 0;
+  int32_t wanted =
+      dependencies_.dataProtection.intendedDataProtectionClassBasedOnEntitlementsForIdentifier(
+          bundle->identifier());
   if (wanted != 0 && client.setDataProtection) client.setDataProtection(container, wanted);
 }
 
 void VSAContainerMigrator::removeDeprecatedContainers(const VSAMigrationClient& client) {
   const char* origin = "performPerUserDataMigrationForClientConnection";
   std::vector<uint8_t> bytes;
-  auto& fs = hooks_.configuration->fileManager().fileSystem();
-  bool read = !hooks_.deprecatedContainersPath.empty() &&
-              fs.readFile(hooks_.deprecatedContainersPath, &bytes, kVSAMigrationStatusMaxSize) == 0;
+  auto& fs = dependencies_.configuration->fileManager().fileSystem();
+  bool read =
+      !dependencies_.deprecatedContainersPath.empty() &&
+      fs.readFile(dependencies_.deprecatedContainersPath, &bytes, kVSAMigrationStatusMaxSize) == 0;
   auto list = read ? VSAPlist::parse(bytes, nullptr) : std::nullopt;
   const VSAValue::Array* entries = list ? list->arrayValue() : nullptr;
   if (!entries) return;
-  auto user = hooks_.userIdentityCache->defaultUserIdentity();
+  auto user = dependencies_.userIdentityCache->defaultUserIdentity();
   for (const VSAValue& entry : *entries) {
     const VSAValue* id = entry.get("Identifier");
     const VSAValue* cls = entry.get("ContainerClass");
@@ -434,7 +439,8 @@ void VSAContainerMigrator::removeDeprecatedContainers(const VSAMigrationClient& 
                   static_cast<unsigned long long>(c), name);
       continue;
     }
-    if (!hooks_.containerCache->containerForContainerIdentity(*identity)) continue;  // gone already
+    if (!dependencies_.containerCache->containerForContainerIdentity(*identity))
+      continue;  // gone already
     code = VSAResult::kSuccess;
     if (!client.deleteContainer(identity, &code))
       logMigrator(kVSALogError, origin, "Could not delete deprecated container [%llu:%@]: %llu",

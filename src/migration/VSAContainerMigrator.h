@@ -21,9 +21,10 @@
 //
 // Every step is safe to run again after an interruption: moves are renames
 // that a re-run continues, and a type is recorded only after its step
-// completed. What the migrator needs from code signing, data protection and
-// the container operations comes in as functions (see VSAMigrationHooks), so
-// that it stays below those modules.
+// completed. What the migrator needs from code signing, the whitelist and
+// data protection comes in through their interfaces (see
+// VSAMigratorDependencies), so that it stays below those modules; what it
+// does on behalf of a client comes with the request (VSAMigrationClient).
 #pragma once
 
 #include <functional>
@@ -32,30 +33,34 @@
 #include <string>
 
 #include "base/VSAError.h"
+#include "migration/VSACodeSigningMigrationPass.h"
 #include "migration/VSAMigrationStatus.h"
+#include "model/VSACodeSigningQueries.h"
 #include "model/VSAContainerCache.h"
 #include "model/VSAContainerIdentity.h"
+#include "model/VSAWellknownContainers.h"
 #include "operations/VSACommandQueue.h"
+#include "operations/VSADataProtectionQueries.h"
 
 inline constexpr const char* kVSADeprecatedContainersFileName = "deprecated-containers.plist";
 
-struct VSAMigrationHooks {
+// Whoever fills this keeps the objects the references name alive as long as
+// the migrator (the daemon context owns them all).
+struct VSAMigratorDependencies {
   std::shared_ptr<VSAGlobalConfiguration> configuration;
   std::shared_ptr<VSAUserIdentityCache> userIdentityCache;
   std::shared_ptr<VSAContainerCache> containerCache;
   std::string systemVersionPath;
   std::string oldBundleLocation;         // the root's "/private/var/mobile/Containers/Bundle"
   std::string deprecatedContainersPath;  // the root's etc/vessad/deprecated-containers.plist
-  // Whitelist: the directory name of a well-known system (group) container.
-  std::function<std::optional<std::string>(const std::string& identifier, VSAContainerClass)>
-      wellknownContainerForId;
-  // The legacy code-signing migrations and reconciliation, recording their
-  // markers in `status`.
-  std::function<bool(VSACommandQueue& queue, VSAMigrationStatus& status)> codeSigningMigration;
+  // Whitelist: the directory names of well-known system (group) containers.
+  const VSAWellknownContainers& wellknown;
   // The parent app of a plug-in, when known.
-  std::function<std::optional<std::string>(const std::string& child)> parentIdentifier;
+  VSACodeSigningQueries& codeSigning;
   // The protection class an app's entitlements ask for (0: none).
-  std::function<int32_t(const std::string& identifier)> intendedDataProtectionClass;
+  VSADataProtectionQueries& dataProtection;
+  // The legacy code-signing migrations and reconciliation.
+  VSACodeSigningMigrationPass& codeSigningMigration;
 };
 
 // What a per-user migration does on behalf of its client.
@@ -69,7 +74,8 @@ struct VSAMigrationClient {
 
 class VSAContainerMigrator {
  public:
-  explicit VSAContainerMigrator(VSAMigrationHooks hooks) : hooks_(std::move(hooks)) {}
+  explicit VSAContainerMigrator(VSAMigratorDependencies dependencies)
+      : dependencies_(std::move(dependencies)) {}
 
   bool performSynchronousBuildUpgradeMigration(VSAMigrationStatus& status, VSAErrorRef* error);
   bool performDataMigratorMigrationForClientConnection(const VSAMigrationClient& client,
@@ -98,5 +104,5 @@ class VSAContainerMigrator {
   void removeDeprecatedContainers(const VSAMigrationClient& client);
   std::unique_ptr<VSAMigrationStatus> systemStatus();
 
-  VSAMigrationHooks hooks_;
+  VSAMigratorDependencies dependencies_;
 };

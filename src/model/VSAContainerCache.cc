@@ -46,11 +46,10 @@ std::string VSAContainerCache::cacheKeyForUserIdentity(const VSAUserIdentityRef&
 }
 
 bool VSAContainerCache::containerURLIsValidForContainerClass(
-    const std::string& url, VSAContainerClass c,
-    const std::function<bool(const std::string&, VSAContainerClass)>& isWellknown) {
+    const std::string& url, VSAContainerClass c, const VSAWellknownContainers& wellknown) {
   std::string_view name = VSALastPathComponentView(url);
   if (VSAUUID::parse(name)) return true;
-  return (c == 12 || c == 13) && isWellknown && isWellknown(std::string(name), c);
+  return (c == 12 || c == 13) && wellknown.containerIdIsWellknown(std::string(name), c);
 }
 
 bool VSAContainerCache::hasClassMap(const VSAUserIdentityRef& user, VSAContainerClass c,
@@ -79,7 +78,7 @@ VSAContainerCache::ClassMap* VSAContainerCache::_lock_getCache(const VSAUserIden
   VSALogIn(VSALogCategory::Cache, kVSALogNotice, kOrigin, "Rebuilding container class cache: %@%@",
            key, transientTag(transient));
   VSASignpostInterval interval(VSALogCategory::Cache, "RebuildingCache");
-  VSATestLocks::shared().waitOnLock(kVSATestLockCacheRebuild);
+  deps_.testLocks->waitOnLock(kVSATestLockCacheRebuild);
   auto& config = *deps_.configuration;
   auto dir = config.containerDirectoryURLForUserIdentity(user, c, transient);
   if (!dir) {
@@ -93,7 +92,7 @@ VSAContainerCache::ClassMap* VSAContainerCache::_lock_getCache(const VSAUserIden
   ClassMap map;
   map.reserve(items->size());
   for (const auto& item : *items) {
-    if (!containerURLIsValidForContainerClass(item.path, c, deps_.isWellknown)) continue;
+    if (!containerURLIsValidForContainerClass(item.path, c, *deps_.wellknown)) continue;
     VSAErrorRef readError;
     auto m = VSAMetadata::readAndValidateMetadataAtUrl(item.path, user, true, config,
                                                        *deps_.userIdentityCache, &readError);
@@ -353,8 +352,9 @@ bool VSAContainerCache::shouldRegisterSandboxMappingWithUserIdentity(const VSAUs
   bool decision, multi = false;
   std::string app = identifier;
   if (c == 2 || c == 4 || c == 6 || c == 9 || c == 10 || c == 11) {
-    if ((c == 4 || c == 6) && deps_.parentIdentifierForChild)
-      if (auto parent = deps_.parentIdentifierForChild(identifier)) app = *parent;
+    if (c == 4 || c == 6)
+      if (auto parent = deps_.codeSigning->parentIdentifierForChildIdentifier(identifier))
+        app = *parent;
     auto set = deps_.userIdentityCache->userIdentitiesForBundleIdentifier(app);
     auto personal = deps_.userIdentityCache->userIdentityForPersonalPersona();
     multi = set.size() >= 2 && set.count(personal) > 0;

@@ -8,8 +8,9 @@
 // (a class is never built twice; other lookups wait). Found containers are
 // checked on disk after the lock is released; a container whose metadata
 // vanished is reported once (44) and dropped. Lookups hand out copies.
-// The whitelist and the code-signing mapping are reached through the two
-// functions of Dependencies, which keeps this module below them.
+// The well-known container table and the code-signing records are reached
+// through their interfaces, which keeps this module below them; whoever
+// fills Dependencies keeps both alive as long as the cache.
 #pragma once
 
 #include <functional>
@@ -21,10 +22,13 @@
 #include <unordered_map>
 #include <vector>
 
+#include "base/VSATestLocks.h"
+#include "model/VSACodeSigningQueries.h"
 #include "model/VSAContainerIdentity.h"
 #include "model/VSAGlobalConfiguration.h"
 #include "model/VSAMetadata.h"
 #include "model/VSAUserIdentityCache.h"
+#include "model/VSAWellknownContainers.h"
 #include "platform/VSANotificationCenter.h"
 #include "platform/VSASandboxService.h"
 
@@ -36,10 +40,11 @@ class VSAContainerCache : public VSAUserIdentityCacheObserver,
     std::shared_ptr<VSAGlobalConfiguration> configuration;
     std::shared_ptr<VSASandboxService> sandbox;
     std::shared_ptr<VSANotificationCenter> notifications;
-    // The parent app of a plug-in (code-signing mapping).
-    std::function<std::optional<std::string>(const std::string&)> parentIdentifierForChild;
-    // Well-known system (12) and system group (13) container identifiers.
-    std::function<bool(const std::string&, VSAContainerClass)> isWellknown;
+    std::shared_ptr<VSATestLocks> testLocks;
+    // The parent app of a plug-in. Never null.
+    VSACodeSigningQueries* codeSigning = nullptr;
+    // Well-known system (12) and system group (13) container identifiers. Never null.
+    const VSAWellknownContainers* wellknown = nullptr;
   };
 
   // Makes the cache and registers it as an observer of the user identity cache.
@@ -73,9 +78,9 @@ class VSAContainerCache : public VSAUserIdentityCacheObserver,
                                                  VSAContainerClass containerClass,
                                                  const std::optional<std::string>& url);
 
-  static bool containerURLIsValidForContainerClass(
-      const std::string& url, VSAContainerClass containerClass,
-      const std::function<bool(const std::string&, VSAContainerClass)>& isWellknown);
+  static bool containerURLIsValidForContainerClass(const std::string& url,
+                                                   VSAContainerClass containerClass,
+                                                   const VSAWellknownContainers& wellknown);
   static std::string cacheKeyForUserIdentity(const VSAUserIdentityRef& user,
                                              VSAContainerClass containerClass);
   // Whether the class map has been built (tests and diagnostics).

@@ -18,11 +18,9 @@
 // complete so that start-up posts its notifications.
 void VSABootKeeper::rebootKeeperSetup(const VSAOperationGrants& grants) {
   VSASystemContainerRestore(services_, grants).moveSystemContainersIntoPlace();
-  if (!services_.deviceProperties->multiUserFlagsTopBitSet() ||
-      !services_.reconcileApplicationGroups)
-    return;
+  if (!services_.deviceProperties->multiUserFlagsTopBitSet()) return;
   VSACommandQueue queue;
-  services_.reconcileApplicationGroups(queue);
+  services_.groups.reconcileGroupContainersOfType(kVSAGroupTypeApplication, queue);
   VSAResultCode ignored = VSAResult::kSuccess;
   queue.executeAllUntilExhaustedOrError(&ignored);
 }
@@ -43,9 +41,9 @@ void VSABootKeeper::_regenerateAllSystemContainerPaths(const VSAOperationGrants&
     }
     for (const auto& m : *all) {
       const std::string& id = m->identifier();
-      bool wellKnown =
-          services_.wellknownContainerForId && services_.wellknownContainerForId(id, c);
-      if (id.empty() || wellKnown || id == kVSAAnalyticsSystemGroupIdentifier) continue;
+      if (id.empty() || services_.wellknown.containerIdIsWellknown(id, c) ||
+          id == kVSAAnalyticsSystemGroupIdentifier)
+        continue;
       VSAResultCode code = VSAResult::kSuccess;
       if (!maintenance.regenerateDirectoryUUIDWithContainerIdentity(m->containerIdentity(), &code))
         VSALogIn(VSALogCategory::Startup, kVSALogError, origin,
@@ -61,7 +59,7 @@ void VSABootKeeper::keeperSetup() {
     VSALogIn(VSALogCategory::Startup, kVSALogError, __func__,
              "Failed recovering from replace operations: %@", error);
   error = nullptr;
-  if (!services_.restartPendingDataProtectionOperations(&error))
+  if (!services_.dataProtection.restartPendingDataProtectionOperationsWithError(&error))
     VSALogIn(VSALogCategory::Startup, kVSALogError, __func__,
              "Failed restarting pending data protection operations: %@", error);
   // Only internal builds start crash-retry tests; elsewhere a journal is never acted on.
@@ -151,13 +149,9 @@ void VSABootKeeper::rebootKeeperCleanupWithCompletion(std::function<void()> comp
 
 bool VSABootKeeper::_isOrphanedEntry(const std::string& url, VSAContainerClass c, bool* valid) {
   auto& fm = *services_.fileManager;
-  auto isWellknown = [&](const std::string& name, VSAContainerClass cls) {
-    return services_.wellknownContainerForId &&
-           services_.wellknownContainerForId(name, cls).has_value();
-  };
   // A live container (most entries) costs one status call: its metadata
   // file exists, so the entry does too.
-  *valid = VSAContainerCache::containerURLIsValidForContainerClass(url, c, isWellknown);
+  *valid = VSAContainerCache::containerURLIsValidForContainerClass(url, c, services_.wellknown);
   if (*valid && fm.itemExistsAtURL(VSAPathJoin(url, kVSAMetadataFileName))) return false;
   if (fm.itemDoesNotExistAtURL(url)) {
     VSALogIn(VSALogCategory::Startup, kVSALogDebug, "_cleanupOrphanedDataForDirectories",
@@ -185,7 +179,7 @@ void VSABootKeeper::_cleanupOrphanedDataForDirectories(const std::vector<std::st
   // it between its two renames. Under the lock for reading no such
   // operation is half done, so each suspect is judged again there and
   // moved before the lock goes.
-  VSAAllIdentifiersLockGuard lock(false);
+  VSAAllIdentifiersLockGuard lock(*services_.locks, false);
   std::vector<std::string> orphans;
   for (const auto& url : suspects) {
     if (!_isOrphanedEntry(url, c, &valid)) continue;
@@ -211,7 +205,7 @@ void VSABootKeeper::_cleanupOrphanedDataForDirectories(const std::vector<std::st
 
 void VSABootKeeper::_cleanupOprhanedCodeSigningMappingData() {
   VSAErrorRef error;
-  if (services_.removeAllAdvanceCopies && !services_.removeAllAdvanceCopies(&error))
+  if (!services_.codeSigningChanges.removeAllAdvanceCopiesWithError(&error))
     VSALogIn(VSALogCategory::Startup, kVSALogError, __func__,
              "Could not remove advance copies of code sign data: %@", error);
 }
@@ -254,7 +248,7 @@ void VSABootKeeper::keeperCleanupWithCompletion(std::function<void()> completion
       VSALogIn(VSALogCategory::Startup, kVSALogError, "keeperCleanupWithCompletion",
                "Keeping %@ for the recovery of an unfinished replace", url);
   auto deathRow = services_.deathRow;
-  VSADeathRow::_sharedBackgroundQueue()->async(
+  deathRow->_sharedBackgroundQueue()->async(
       [deathRow, staged = std::move(staged), token, completion = std::move(completion)] {
         for (const auto& item : staged) {
           VSAErrorRef error;

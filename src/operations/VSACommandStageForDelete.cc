@@ -76,10 +76,10 @@ bool VSACommandStageForDelete::stage(const VSAContainerIdentity& identity, VSACo
       VSAPathJoin(config.deathrowDirectory(), VSALastPathComponent(container->url()));
   // A transient copy of a bundle goes while its permanent container stays,
   // and the permanent one still needs the identifier's code-signing records.
-  if (VSAContainerClassIsBundle(container->containerClass()) && environment_->removeCodeSigning &&
-      !hasPermanentTwin(*container))
-    environment_->removeCodeSigning(container->identifier(), queue);
-  VSATestLocks::shared().waitOnLock(kVSATestLockStageForDelete);
+  if (VSAContainerClassIsBundle(container->containerClass()) && !hasPermanentTwin(*container))
+    environment_->codeSigning->removeCodeSigningDictionariesForIdentifierAndItsChildren(
+        container->identifier(), &queue);
+  environment_->testLocks->waitOnLock(kVSATestLockStageForDelete);
   VSAErrorRef error;
   if (!config.fileManager().moveItemAtURL(container->url(), destination, &error)) {
     VSALog(kVSALogDebug, "fromQueue", "Couldn't stage for deletion from %@ to %@: %@",
@@ -105,14 +105,15 @@ bool VSACommandStageForDelete::stage(const VSAContainerIdentity& identity, VSACo
 
 bool VSACommandStageForDelete::fromQueue(VSACommandQueue& queue, VSAResultCode* executeWithError) {
   VSAResultCode code = VSAResult::kSuccess;
-  if (!environment_ || !environment_->cache || !environment_->configuration) {
+  if (!environment_ || !environment_->cache || !environment_->configuration ||
+      !environment_->locks || !environment_->testLocks || !environment_->codeSigning) {
     VSALog(kVSALogFault, "fromQueue", "Stage-for-delete command made without its environment");
     if (onError_) onError_(VSAResult::kDeleteFailed);
     VSASetCode(executeWithError, VSAResult::kDeleteFailed);
     return false;
   }
   try {
-    VSAAllIdentifiersLockGuard lock(true, useLocking_);
+    VSAAllIdentifiersLockGuard lock(*environment_->locks, true, useLocking_);
     for (const auto& identity : identities_)
       if (identity && !stage(*identity, queue, &code)) break;
   } catch (const std::exception& e) {

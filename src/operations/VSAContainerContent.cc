@@ -96,7 +96,7 @@ std::optional<std::string> VSAContainerContent::userManagedAssetsPathWithContain
   const char* origin = "userManagedAssetsPathWithContainerIdentity";
   auto found = find(identity, withError);
   if (!found) return std::nullopt;
-  VSAIdentifierLockGuard lock(VSAValue(found->uuid().string()), true);
+  VSAIdentifierLockGuard lock(*services_.locks, VSAValue(found->uuid().string()), true);
   auto container = recheck(*found, withError);
   if (!container) return std::nullopt;
   std::string directory = assetsDirectory(*container);
@@ -136,7 +136,7 @@ bool VSAContainerContent::deleteUserManagedAssetWithContainerIdentity(
                 VSAFormat("Invalid relative path: %@", VSAClientStringForLog(relativePath)));
   auto found = find(identity, withError);
   if (!found) return false;
-  VSAIdentifierLockGuard lock(VSAValue(found->uuid().string()), true);
+  VSAIdentifierLockGuard lock(*services_.locks, VSAValue(found->uuid().string()), true);
   auto container = recheck(*found, withError);
   if (!container) return false;
   std::string base = assetsDirectory(*container);
@@ -183,7 +183,8 @@ std::optional<std::string> VSAContainerContent::stageSharedContentForIdentifier(
   auto bundleFound = find(bundleIdentity, withError);
   auto dataFound = bundleFound ? find(dataIdentity, withError) : nullptr;
   if (!dataFound) return std::nullopt;
-  VSAIdentifierLockGuard lock(VSAValue(VSAValue::Array{VSAValue(bundleFound->uuid().string()),
+  VSAIdentifierLockGuard lock(*services_.locks,
+                              VSAValue(VSAValue::Array{VSAValue(bundleFound->uuid().string()),
                                                        VSAValue(dataFound->uuid().string())}),
                               true);
   auto bundle = recheck(*bundleFound, withError);

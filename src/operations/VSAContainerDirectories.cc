@@ -14,9 +14,8 @@ int32_t VSAContainerDirectories::_dataProtectionClassForContainerMetadata(
       metadata.info() ? metadata.info()->get(kVSAContentProtectionClassInfoKey) : nullptr;
   if (recorded && recorded->isInteger())
     return static_cast<int32_t>(recorded->int64Value().value_or(0));
-  return services_.intendedDataProtectionClass
-             ? services_.intendedDataProtectionClass(metadata.identifier())
-             : 0;
+  return services_.dataProtection.intendedDataProtectionClassBasedOnEntitlementsForIdentifier(
+      metadata.identifier());
 }
 
 bool VSAContainerDirectories::_createTopLevelContainerDirectory(const std::string& url,

@@ -24,20 +24,21 @@ VSAErrorRef failure(VSAResultCode code, VSAErrorRef underlying, std::string mess
 // Holds the all-identifiers lock in one mode at a time, released on every path.
 class GlobalLock {
  public:
-  explicit GlobalLock(bool useLocking) : useLocking_(useLocking) {}
+  GlobalLock(VSALocks& locks, bool useLocking) : locks_(locks), useLocking_(useLocking) {}
   ~GlobalLock() { release(); }
   void acquire(bool writing) {
     if (!useLocking_) return;
     release();
-    writing ? lock_all_identifiers_write() : lock_all_identifiers_read();
+    writing ? locks_.lock_all_identifiers_write() : locks_.lock_all_identifiers_read();
     held_ = true;
   }
   void release() {
-    if (held_) unlock_all_identifiers();
+    if (held_) locks_.unlock_all_identifiers();
     held_ = false;
   }
 
  private:
+  VSALocks& locks_;
   bool useLocking_;
   bool held_ = false;
 };
@@ -55,7 +56,7 @@ struct CreateSteps {
   bool transient;
 
   bool whitelisted(const std::string& client, VSAContainerClass c, const std::string& id) {
-    return services.isLookupWhitelisted && services.isLookupWhitelisted(client, c, id);
+    return services.wellknown.isLookupWhitelistedFromCodeSignIdentifier(client, c, id);
   }
 
   // May the client reach this container?
@@ -73,8 +74,7 @@ struct CreateSteps {
                                bundle, static_cast<long>(c), id));
     if (c == 12 && !grants.allowOtherIdLookup && !grants.unrestricted && !entitledLookup) {
       bool passes = whitelisted(bundle, 12, id) ||
-                    (services.identifierHasSystemContainer &&
-                     services.identifierHasSystemContainer(id) && id == bundle);
+                    (id == bundle && services.codeSigning.identifierHasSystemContainer(id));
       if (!passes)
         return failure(
             VSAResult::kNotEntitled, nullptr,
@@ -86,9 +86,7 @@ struct CreateSteps {
   std::string liveName(const std::string& uuidName) {
     VSAContainerClass c = identity.containerClass();
     if (c == 12 || c == 13)
-      if (auto name = services.wellknownContainerForId
-                          ? services.wellknownContainerForId(identity.identifier(), c)
-                          : std::nullopt)
+      if (auto name = services.wellknown.wellknownContainerForId(identity.identifier(), c))
         return *name;
     return uuidName;
   }
@@ -150,7 +148,7 @@ struct CreateSteps {
     auto base = config.containerDirectoryURLForUserIdentity(identity.userIdentity(), c, transient);
     std::string live = VSAPathJoin(base.value_or(""), liveName(name));
     VSAErrorRef underlying;
-    VSATestLocks::shared().waitOnLock(kVSATestLockCreate);
+    services.testLocks->waitOnLock(kVSATestLockCreate);
     if (!base || !services.fileManager->moveItemAtURL(staging, live, &underlying)) {
       *error = failure(VSAResult::kStagingMoveFailed, underlying,
                        VSAFormat("Failed to move staging dir: %@ to live dir: %@", staging, live));
@@ -195,7 +193,7 @@ VSAMetadataRef VSAContainerLookup::createOrLookupContainerWithContainerIdentity(
   CreateSteps steps{services_, grants_, *identity, transient};
   VSAErrorRef error = steps.checkAccess();
   VSAMetadataRef found;
-  GlobalLock lock(useLocking);
+  GlobalLock lock(*services_.locks, useLocking);
   try {
     if (!error && !transient) {
       lock.acquire(false);
@@ -248,7 +246,7 @@ std::optional<std::vector<VSAConstMetadataRef>> VSAContainerLookup::containersWi
     VSAContainerClass containerClass, bool transient, VSAResultCode* withError) {
   VSAUserIdentityRef user = grants_.clientUserIdentity;
   if (!user) user = services_.userIdentityCache->defaultUserIdentity();
-  VSAAllIdentifiersLockGuard lock(false);
+  VSAAllIdentifiersLockGuard lock(*services_.locks, false);
   VSAErrorRef error;
   auto all = services_.containerCache->allContainersForUserIdentity(user, containerClass, transient,
                                                                     false, &error);
@@ -276,7 +274,7 @@ VSAMetadataRef VSAContainerLookup::metadataWithContainerIdentity(
       createOrLookupContainerWithContainerIdentity(identity, false, false, true, withError);
   if (!found) return nullptr;
   // Re-read under the identifier lock so that a concurrent info change is seen whole.
-  VSAIdentifierLockGuard lock(VSAValue(found->uuid().string()), false);
+  VSAIdentifierLockGuard lock(*services_.locks, VSAValue(found->uuid().string()), false);
   VSAErrorRef error;
   auto fresh = VSAMetadata::rereadMetadataOfCachedContainer(*found, *services_.configuration,
                                                             *services_.userIdentityCache, &error);
@@ -311,7 +309,7 @@ std::optional<uint64_t> VSAContainerLookup::diskUsageWithContainerIdentity(
       createOrLookupContainerWithContainerIdentity(identity, false, false, true, withError);
   if (!found) return std::nullopt;
   // The container keeps its place while it is measured.
-  VSAIdentifierLockGuard lock(VSAValue(found->uuid().string()), false);
+  VSAIdentifierLockGuard lock(*services_.locks, VSAValue(found->uuid().string()), false);
   auto& fm = *services_.fileManager;
   if (services_.deviceProperties->isFeatureEnabled("fast_container_sizing"))
     return fm.fastDiskUsageForURL(found->url());

@@ -94,7 +94,7 @@ VSAMetadataRef VSAContainerMaintenance::reread(const VSAMetadata& cached, const 
 bool VSAContainerMaintenance::regenerateDirectoryUUIDWithContainerIdentity(
     const VSAContainerIdentityRef& identity, VSAResultCode* withError) {
   const char* origin = "regenerateDirectoryUUIDWithContainerIdentity";
-  VSAAllIdentifiersLockGuard lock(true);
+  VSAAllIdentifiersLockGuard lock(*services_.locks, true);
   return guarded(origin, services_.configuration->isInternalImage(), withError, [&] {
     auto m = find(identity, origin, withError);
     if (!m) return false;
@@ -122,7 +122,7 @@ bool VSAContainerMaintenance::recreateDefaultStructureWithContainerIdentity(
   const char* origin = "recreateDefaultStructureWithContainerIdentity";
   auto key = lockKey(identity, origin, withError);
   if (!key) return false;
-  VSAIdentifierLockGuard lock(VSAValue(*key), true);
+  VSAIdentifierLockGuard lock(*services_.locks, VSAValue(*key), true);
   return guarded(origin, services_.configuration->isInternalImage(), withError, [&] {
     auto m = findLocked(identity, key, origin, withError);
     if (!m) return false;
@@ -145,7 +145,7 @@ std::optional<VSAValue> VSAContainerMaintenance::infoValueForKey(
   if (!isStringKey(key, origin, withError)) return std::nullopt;
   std::optional<std::string> lockName;
   if (useLocking && !(lockName = lockKey(identity, origin, withError))) return std::nullopt;
-  VSAIdentifierLockGuard lock(VSAValue(lockName.value_or("")), false, useLocking);
+  VSAIdentifierLockGuard lock(*services_.locks, VSAValue(lockName.value_or("")), false, useLocking);
   return guarded(
       origin, services_.configuration->isInternalImage(), withError,
       [&]() -> std::optional<VSAValue> {
@@ -168,7 +168,7 @@ bool VSAContainerMaintenance::setInfoValue(const VSAValue* value, const VSAValue
   if (!isStringKey(forKey, origin, withError)) return false;
   std::optional<std::string> lockName;
   if (useLocking && !(lockName = lockKey(identity, origin, withError))) return false;
-  VSAIdentifierLockGuard lock(VSAValue(lockName.value_or("")), true, useLocking);
+  VSAIdentifierLockGuard lock(*services_.locks, VSAValue(lockName.value_or("")), true, useLocking);
   return guarded(origin, services_.configuration->isInternalImage(), withError, [&] {
     auto cached = findLocked(identity, lockName, origin, withError);
     if (!cached) return false;

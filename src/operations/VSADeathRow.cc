@@ -20,15 +20,11 @@ bool isMissing(const VSAErrorRef& e) {
 }  // namespace
 
 VSADeathRow::VSADeathRow(std::shared_ptr<VSAGlobalConfiguration> configuration,
-                         std::shared_ptr<VSATransactions> transactions)
-    : configuration_(std::move(configuration)), transactions_(std::move(transactions)) {}
-
-VSAWorkQueue::Ref VSADeathRow::_sharedBackgroundQueue() {
-  static VSAWorkQueue::Ref queue =
-      VSAWorkQueue::create("com.tamsk.vessad.background", VSAWorkQueue::Kind::Serial,
-                           VSAWorkQueue::global(VSAWorkQueue::Priority::Background));
-  return queue;
-}
+                         std::shared_ptr<VSATransactions> transactions,
+                         VSAWorkQueue::Ref backgroundQueue)
+    : configuration_(std::move(configuration)),
+      transactions_(std::move(transactions)),
+      backgroundQueue_(std::move(backgroundQueue)) {}
 
 bool VSADeathRow::_moveItemAtURLToDeathRow(const std::string& url, bool isDir,
                                            bool startDeletionThread, VSAErrorRef* error,

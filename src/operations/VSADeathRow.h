@@ -2,8 +2,9 @@
 //
 // Moving an item there is one rename (into a fresh "temp.XXXXXX" directory,
 // so items of the same name stay apart) and cannot half-happen. Emptying
-// runs on the process-wide serial background queue
-// "com.tamsk.vessad.background", so two emptyings never overlap, inside a
+// runs on the daemon's serial background queue
+// "com.tamsk.vessad.background" (given by the daemon context, which makes
+// one per daemon instance), so two emptyings never overlap, inside a
 // transaction that keeps the daemon alive until it has run. An entry that
 // cannot be removed is moved to the root's /tmp so that it never blocks the
 // others. Thread-safe; holds no identifier lock (nothing on death row is
@@ -26,9 +27,10 @@ class VSADeathRow : public std::enable_shared_from_this<VSADeathRow> {
   using Completion = std::function<void(VSAResultCode)>;
 
   VSADeathRow(std::shared_ptr<VSAGlobalConfiguration> configuration,
-              std::shared_ptr<VSATransactions> transactions);
+              std::shared_ptr<VSATransactions> transactions, VSAWorkQueue::Ref backgroundQueue);
 
-  static VSAWorkQueue::Ref _sharedBackgroundQueue();
+  // "com.tamsk.vessad.background": where emptying and other slow cleanups run.
+  const VSAWorkQueue::Ref& _sharedBackgroundQueue() const { return backgroundQueue_; }
 
   // A missing item is success and starts nothing; other failures are 41.
   // `durable` false leaves the rename unsynced: for items whose move is
@@ -63,4 +65,5 @@ class VSADeathRow : public std::enable_shared_from_this<VSADeathRow> {
 
   std::shared_ptr<VSAGlobalConfiguration> configuration_;
   std::shared_ptr<VSATransactions> transactions_;
+  VSAWorkQueue::Ref backgroundQueue_;
 };

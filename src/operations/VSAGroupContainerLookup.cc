@@ -28,7 +28,9 @@ VSAGroupContainerLookup::groupContainerIdentifiersForOwnerIdentifier(const std::
     VSASetCode(withError, VSAResult::kNotEntitled);
     return std::nullopt;
   }
-  auto ids = services_.groupContainerIdentifiersForOwner(owner, groupClass, withError);
+  VSAValue ownerValue(owner);
+  auto ids = services_.groups.groupContainerIdentifiersForOwnerIdentifier(&ownerValue, groupClass,
+                                                                          true, withError);
   if (!ids) return std::nullopt;
   if (!mayAskForOwner)
     std::erase_if(*ids, [&](const std::string& id) { return listed->count(id) == 0; });

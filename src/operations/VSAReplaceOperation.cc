@@ -135,11 +135,11 @@ struct ReplaceRun {
             oldContainer->identifier(), oldContainer->transient(), &error))
       return cacheRemovalFailed(*oldContainer);
     VSAErrorRef invalidateError;
-    if (!services.invalidateCodeSigningInfoForIdentifierAndItsChildren(oldContainer->identifier(),
-                                                                       &invalidateError))
+    if (!services.codeSigningChanges.invalidateCodeSigningInfoForIdentifierAndItsChildren(
+            oldContainer->identifier(), &invalidateError))
       VSALog(kVSALogError, kOrigin, "Failed to invalidate code signing info for %@",
              oldContainer->identifier());
-    VSATestLocks::shared().waitOnLock(kVSATestLockReplace);
+    services.testLocks->waitOnLock(kVSATestLockReplace);
     if (!fm.moveItemAtURL(newContainer->url(), destURL, &error))
       return fail(VSAResult::kMoveToDestinationFailed,
                   VSAFormat("Failed to replace: %@ with: %@ at: %@", oldContainer->url(),
@@ -262,7 +262,7 @@ bool VSAReplaceOperation::replaceContainerIdentity(
          describe(withContainerIdentity), preserveOldUUID);
   VSAResultCode code;
   {
-    VSAAllIdentifiersLockGuard lock(true);
+    VSAAllIdentifiersLockGuard lock(*services_.locks, true);
     ReplaceRun run{services_, *oldIdentity, *withContainerIdentity, preserveOldUUID,
                    startDeletionThread};
     run.run();

@@ -16,27 +16,30 @@ namespace {
 
 using namespace std::chrono_literals;
 
+// The table the tests lock (a daemon's context owns one like it).
+VSALocks table;
+
 enum class Hold { IdRead, IdWrite, OtherRead, OtherWrite, AllRead, AllWrite };
 
 void take(Hold h) {
   switch (h) {
     case Hold::IdRead:
-      lock_identifier_read(VSAValue("A"));
+      table.lock_identifier_read(VSAValue("A"));
       break;
     case Hold::IdWrite:
-      lock_identifier_write(VSAValue("A"));
+      table.lock_identifier_write(VSAValue("A"));
       break;
     case Hold::OtherRead:
-      lock_identifier_read(VSAValue("B"));
+      table.lock_identifier_read(VSAValue("B"));
       break;
     case Hold::OtherWrite:
-      lock_identifier_write(VSAValue("B"));
+      table.lock_identifier_write(VSAValue("B"));
       break;
     case Hold::AllRead:
-      lock_all_identifiers_read();
+      table.lock_all_identifiers_read();
       break;
     case Hold::AllWrite:
-      lock_all_identifiers_write();
+      table.lock_all_identifiers_write();
       break;
   }
 }
@@ -45,15 +48,15 @@ void release(Hold h) {
   switch (h) {
     case Hold::IdRead:
     case Hold::IdWrite:
-      unlock_identifier(VSAValue("A"));
+      table.unlock_identifier(VSAValue("A"));
       break;
     case Hold::OtherRead:
     case Hold::OtherWrite:
-      unlock_identifier(VSAValue("B"));
+      table.unlock_identifier(VSAValue("B"));
       break;
     case Hold::AllRead:
     case Hold::AllWrite:
-      unlock_all_identifiers();
+      table.unlock_all_identifiers();
       break;
   }
 }
@@ -107,7 +110,7 @@ TEST(VSALocks, CompatibilityTable) {
     EXPECT_EQ(grantedWhileHeld(c.held, c.requested), c.granted)
         << "requested " << int(c.requested) << " while holding " << int(c.held);
   }
-  VSALockTableState s = VSALockTableSnapshot();
+  VSALockTableState s = table.snapshot();
   EXPECT_EQ(s.recordCount, 0u);
   EXPECT_EQ(s.identifierReaderCount, 0u);
   EXPECT_EQ(s.identifierWriterCount, 0u);
@@ -120,8 +123,8 @@ TEST(VSALocks, ArraysAreTakenAscendingOnceAndReleasedDescending) {
   testing::internal::CaptureStderr();
   {
     VSAIdentifierLockGuard guard(
-        VSAValue(VSAValue::Array{VSAValue("B"), VSAValue("A"), VSAValue("B")}), true);
-    EXPECT_EQ(VSALockTableSnapshot().identifierWriterCount, 2u) << "duplicates are taken once";
+        table, VSAValue(VSAValue::Array{VSAValue("B"), VSAValue("A"), VSAValue("B")}), true);
+    EXPECT_EQ(table.snapshot().identifierWriterCount, 2u) << "duplicates are taken once";
   }
   std::string log = testing::internal::GetCapturedStderr();
   VSALogger::shared().setLevel(kVSALogNotice);
@@ -132,7 +135,7 @@ TEST(VSALocks, ArraysAreTakenAscendingOnceAndReleasedDescending) {
   EXPECT_LT(gotA, gotB);
   EXPECT_LT(freeB, freeA);
   EXPECT_NE(log.find("Destroying lock for identifier A"), std::string::npos);
-  EXPECT_EQ(VSALockTableSnapshot().recordCount, 0u) << "the map is empty after the last release";
+  EXPECT_EQ(table.snapshot().recordCount, 0u) << "the map is empty after the last release";
 }
 
 TEST(VSALocks, OppositeOrderArraysFromManyThreadsNeverDeadlock) {
@@ -157,18 +160,18 @@ TEST(VSALocks, OppositeOrderArraysFromManyThreadsNeverDeadlock) {
         if (t % 2) std::reverse(arr.begin(), arr.end());
         switch (rng() % 10) {
           case 0: {
-            VSAAllIdentifiersLockGuard all(true);
+            VSAAllIdentifiersLockGuard all(table, true);
             ++critical;
             break;
           }
           case 1: {
-            VSAAllIdentifiersLockGuard all(false);
-            VSAIdentifierLockGuard ids(VSAValue(arr), false);
+            VSAAllIdentifiersLockGuard all(table, false);
+            VSAIdentifierLockGuard ids(table, VSAValue(arr), false);
             ++critical;
             break;
           }
           default: {
-            VSAIdentifierLockGuard ids(VSAValue(arr), rng() % 2);
+            VSAIdentifierLockGuard ids(table, VSAValue(arr), rng() % 2);
             ++critical;
           }
         }
@@ -179,16 +182,16 @@ TEST(VSALocks, OppositeOrderArraysFromManyThreadsNeverDeadlock) {
   finished = true;
   watchdog.join();
   EXPECT_EQ(critical.load(), 8 * 2000);
-  EXPECT_EQ(VSALockTableSnapshot().recordCount, 0u);
+  EXPECT_EQ(table.snapshot().recordCount, 0u);
 }
 
 TEST(VSALocks, WaitingGlobalWriterDoesNotHoldBackIdentifierTraffic) {
-  lock_identifier_read(VSAValue("A"));
+  table.lock_identifier_read(VSAValue("A"));
   std::atomic<bool> writerIn{false};
   std::thread writer([&] {
-    lock_all_identifiers_write();
+    table.lock_all_identifiers_write();
     writerIn = true;
-    unlock_all_identifiers();
+    table.unlock_all_identifiers();
   });
   std::this_thread::sleep_for(20ms);
   EXPECT_FALSE(writerIn);
@@ -197,10 +200,10 @@ TEST(VSALocks, WaitingGlobalWriterDoesNotHoldBackIdentifierTraffic) {
     auto fut = std::async(std::launch::async, f);
     return fut.wait_for(1s) == std::future_status::ready;
   };
-  EXPECT_TRUE(quick([] { VSAIdentifierLockGuard g(VSAValue("B"), false); }));
-  EXPECT_TRUE(quick([] { VSAIdentifierLockGuard g(VSAValue("C"), true); }));
+  EXPECT_TRUE(quick([] { VSAIdentifierLockGuard g(table, VSAValue("B"), false); }));
+  EXPECT_TRUE(quick([] { VSAIdentifierLockGuard g(table, VSAValue("C"), true); }));
   EXPECT_FALSE(writerIn);
-  unlock_identifier(VSAValue("A"));
+  table.unlock_identifier(VSAValue("A"));
   writer.join();
   EXPECT_TRUE(writerIn);
 }
@@ -217,7 +220,7 @@ TEST(VSALocks, OneKeyUnderMixedTrafficKeepsWritersAlone) {
       std::mt19937 rng(t + 100);
       for (int i = 0; i < 3000; ++i) {
         bool writing = rng() % 4 == 0;
-        VSAIdentifierLockGuard g(VSAValue("K"), writing);
+        VSAIdentifierLockGuard g(table, VSAValue("K"), writing);
         if (writing) {
           if (writers.fetch_add(1) != 0 || readers.load() != 0) ++violations;
           ++writes;
@@ -235,7 +238,7 @@ TEST(VSALocks, OneKeyUnderMixedTrafficKeepsWritersAlone) {
   for (auto& th : threads) th.join();
   EXPECT_EQ(violations.load(), 0);
   EXPECT_GT(writes.load(), 0);
-  VSALockTableState s = VSALockTableSnapshot();
+  VSALockTableState s = table.snapshot();
   EXPECT_EQ(s.recordCount, 0u);
   EXPECT_EQ(s.identifierReaderCount, 0u);
   EXPECT_EQ(s.identifierWriterCount, 0u);
@@ -243,26 +246,55 @@ TEST(VSALocks, OneKeyUnderMixedTrafficKeepsWritersAlone) {
 
 TEST(VSALocks, GuardsWithoutLockingTakeNothing) {
   {
-    VSAAllIdentifiersLockGuard all(true, false);
-    VSAIdentifierLockGuard ids(VSAValue("A"), true, false);
-    EXPECT_EQ(VSALockTableSnapshot().recordCount, 0u);
-    EXPECT_EQ(VSALockTableSnapshot().allReaderWriterState, 0);
+    VSAAllIdentifiersLockGuard all(table, true, false);
+    VSAIdentifierLockGuard ids(table, VSAValue("A"), true, false);
+    EXPECT_EQ(table.snapshot().recordCount, 0u);
+    EXPECT_EQ(table.snapshot().allReaderWriterState, 0);
   }
-  EXPECT_EQ(VSALockTableSnapshot().allReaderWriterState, 0);
+  EXPECT_EQ(table.snapshot().allReaderWriterState, 0);
+}
+
+// Each daemon instance has its own table: what one holds never stops the
+// other, even for the same key, and each counts only its own holders.
+TEST(VSALocks, TwoTablesNeverShareALock) {
+  VSALocks other;
+  auto takeInOther = [&other](bool all) {
+    return std::async(std::launch::async, [&other, all] {
+      VSAAllIdentifiersLockGuard everything(other, true, all);
+      VSAIdentifierLockGuard key(other, VSAValue("SHARED-KEY"), true, !all);
+      return other.snapshot();
+    });
+  };
+  // One table's writer of a key does not hold up the other's writer of that key...
+  table.lock_identifier_write(VSAValue("SHARED-KEY"));
+  auto keyWriter = takeInOther(false);
+  ASSERT_EQ(keyWriter.wait_for(5s), std::future_status::ready) << "a key lock crossed tables";
+  EXPECT_EQ(keyWriter.get().identifierWriterCount, 1u);
+  table.unlock_identifier(VSAValue("SHARED-KEY"));
+  // ...and its all-identifiers writer does not hold up the other's.
+  table.lock_all_identifiers_write();
+  auto allWriter = takeInOther(true);
+  ASSERT_EQ(allWriter.wait_for(5s), std::future_status::ready) << "the global lock crossed tables";
+  EXPECT_EQ(allWriter.get().allReaderWriterState, -1);
+  EXPECT_EQ(table.snapshot().allReaderWriterState, -1);
+  table.unlock_all_identifiers();
+  EXPECT_EQ(other.snapshot().recordCount, 0u);
+  EXPECT_EQ(table.snapshot().recordCount, 0u);
 }
 
 TEST(VSALocksDeathTest, NonStringKeyAborts) {
   GTEST_FLAG_SET(death_test_style, "threadsafe");
-  EXPECT_DEATH(lock_identifier_read(VSAValue(42)), "Unknown parameter type!");
-  EXPECT_DEATH(lock_identifier_write(VSAValue(VSAValue::Array{VSAValue("A"), VSAValue(1)})),
+  EXPECT_DEATH(table.lock_identifier_read(VSAValue(42)), "Unknown parameter type!");
+  EXPECT_DEATH(table.lock_identifier_write(VSAValue(VSAValue::Array{VSAValue("A"), VSAValue(1)})),
                "Unknown parameter type!");
-  EXPECT_DEATH(unlock_identifier(VSAValue(VSAValue::Dictionary{})), "Unknown parameter type!");
+  EXPECT_DEATH(table.unlock_identifier(VSAValue(VSAValue::Dictionary{})),
+               "Unknown parameter type!");
 }
 
 TEST(VSALocksDeathTest, UnbalancedUnlockAborts) {
   GTEST_FLAG_SET(death_test_style, "threadsafe");
-  EXPECT_DEATH(unlock_identifier(VSAValue("never-locked")), "Assertion failed");
-  EXPECT_DEATH(unlock_all_identifiers(), "Assertion failed: gVSALocks.allReaderWriterState > 0");
+  EXPECT_DEATH(table.unlock_identifier(VSAValue("never-locked")), "Assertion failed");
+  EXPECT_DEATH(table.unlock_all_identifiers(), "Assertion failed: t.allReaderWriterState > 0");
 }
 
 }  // namespace
@@ -276,24 +308,25 @@ TEST(VSALocks, ManyKeysSurviveGrowthAndScrambledRelease) {
   for (int i = 0; i < 60; ++i) keys.push_back(VSAUUID::random().string());
   VSAValue::Array all;
   for (auto& k : keys) all.push_back(VSAValue(k));
-  lock_identifier_write(VSAValue(all));
-  EXPECT_EQ(VSALockTableSnapshot().recordCount, 60u);
+  table.lock_identifier_write(VSAValue(all));
+  EXPECT_EQ(table.snapshot().recordCount, 60u);
   std::mt19937 rng(7);
   std::shuffle(keys.begin(), keys.end(), rng);
   for (size_t i = 0; i < keys.size(); ++i) {
-    unlock_identifier(VSAValue(keys[i]));
+    table.unlock_identifier(VSAValue(keys[i]));
     if (i % 7 == 0 && i + 1 < keys.size()) {
       // A key still held must still exclude a writer.
       VSAValue next(keys[i + 1]);
-      auto fut = std::async(std::launch::async, [next] { VSAIdentifierLockGuard g(next, true); });
+      auto fut =
+          std::async(std::launch::async, [next] { VSAIdentifierLockGuard g(table, next, true); });
       EXPECT_EQ(fut.wait_for(30ms), std::future_status::timeout) << i;
-      unlock_identifier(VSAValue(keys[i + 1]));
+      table.unlock_identifier(VSAValue(keys[i + 1]));
       fut.get();
-      lock_identifier_write(VSAValue(keys[i + 1]));
+      table.lock_identifier_write(VSAValue(keys[i + 1]));
     }
   }
-  EXPECT_EQ(VSALockTableSnapshot().recordCount, 0u);
-  EXPECT_EQ(VSALockTableSnapshot().identifierWriterCount, 0u);
+  EXPECT_EQ(table.snapshot().recordCount, 0u);
+  EXPECT_EQ(table.snapshot().identifierWriterCount, 0u);
 }
 
 // Released keys keep their records for the next use, a bounded number of
@@ -302,10 +335,10 @@ TEST(VSALocks, KeptRecordsAreBoundedAndStillExclude) {
   std::vector<std::string> keys;
   for (int i = 0; i < 200; ++i) keys.push_back(VSAUUID::random().string());
   for (auto& k : keys) {
-    lock_identifier_read(VSAValue(k));
-    unlock_identifier(VSAValue(k));
+    table.lock_identifier_read(VSAValue(k));
+    table.unlock_identifier(VSAValue(k));
   }
-  VSALockTableState s = VSALockTableSnapshot();
+  VSALockTableState s = table.snapshot();
   EXPECT_EQ(s.recordCount, 0u);
   EXPECT_GT(s.idleRecords, 0u);
   EXPECT_LE(s.idleRecords, 64u);
@@ -313,14 +346,15 @@ TEST(VSALocks, KeptRecordsAreBoundedAndStillExclude) {
   // while a reader holds them, and both let it in afterwards.
   for (const std::string& k : {keys.front(), keys.back()}) {
     VSAValue key(k);
-    lock_identifier_read(key);
-    EXPECT_EQ(VSALockTableSnapshot().recordCount, 1u);
-    auto fut = std::async(std::launch::async, [key] { VSAIdentifierLockGuard g(key, true); });
+    table.lock_identifier_read(key);
+    EXPECT_EQ(table.snapshot().recordCount, 1u);
+    auto fut =
+        std::async(std::launch::async, [key] { VSAIdentifierLockGuard g(table, key, true); });
     EXPECT_EQ(fut.wait_for(30ms), std::future_status::timeout) << k;
-    unlock_identifier(key);
+    table.unlock_identifier(key);
     fut.get();
   }
-  s = VSALockTableSnapshot();
+  s = table.snapshot();
   EXPECT_EQ(s.recordCount, 0u);
   EXPECT_EQ(s.identifierReaderCount + s.identifierWriterCount, 0u);
   EXPECT_LE(s.idleRecords, 64u);

@@ -20,7 +20,9 @@ std::future<void> waiter(VSATestLocks& locks, uint64_t lock) {
 }
 
 TEST(VSATestLocks, AHeldLockStopsItsWaitersUntilReleasedAndOnlyWhenEnabled) {
-  VSATestLocks locks;
+  auto shared = std::make_shared<VSALocks>();
+  [[maybe_unused]] VSALocks& table = *shared;
+  VSATestLocks locks(shared);
   // Off: counts do not matter.
   locks.acquireLock(3);
   EXPECT_EQ(waiter(locks, 3).wait_for(5s), std::future_status::ready);
@@ -48,27 +50,32 @@ TEST(VSATestLocks, AHeldLockStopsItsWaitersUntilReleasedAndOnlyWhenEnabled) {
 }
 
 TEST(VSATestLocks, LocksZeroAndOneHoldTheAllIdentifiersLock) {
-  VSATestLocks locks;
+  auto shared = std::make_shared<VSALocks>();
+  [[maybe_unused]] VSALocks& table = *shared;
+  VSATestLocks locks(shared);
   locks.setEnabled(true);
   locks.acquireLock(0);
-  EXPECT_EQ(VSALockTableSnapshot().allReaderWriterState, -1);  // writing
+  EXPECT_EQ(table.snapshot().allReaderWriterState, -1);  // writing
   // An identifier writer waits until the test lock goes.
-  auto writer = std::async(std::launch::async,
-                           [] { VSAIdentifierLockGuard guard(VSAValue("TESTLOCK-KEY"), true); });
+  auto writer = std::async(std::launch::async, [&table] {
+    VSAIdentifierLockGuard guard(table, VSAValue("TESTLOCK-KEY"), true);
+  });
   EXPECT_EQ(writer.wait_for(200ms), std::future_status::timeout);
   locks.releaseLock(0);
   EXPECT_EQ(writer.wait_for(5s), std::future_status::ready);
   locks.acquireLock(1);
-  EXPECT_EQ(VSALockTableSnapshot().allReaderWriterState, 1);  // reading
+  EXPECT_EQ(table.snapshot().allReaderWriterState, 1);  // reading
   {
-    VSAIdentifierLockGuard reader(VSAValue("TESTLOCK-KEY"), false);  // readers pass
+    VSAIdentifierLockGuard reader(table, VSAValue("TESTLOCK-KEY"), false);  // readers pass
   }
   locks.releaseAllLocks();
-  EXPECT_EQ(VSALockTableSnapshot().allReaderWriterState, 0);
+  EXPECT_EQ(table.snapshot().allReaderWriterState, 0);
 }
 
 TEST(VSATestLocks, TheCommandAcquiresOncePerLockAndChecksNumbers) {
-  VSATestLocks locks;
+  auto shared = std::make_shared<VSALocks>();
+  [[maybe_unused]] VSALocks& table = *shared;
+  VSATestLocks locks(shared);
   EXPECT_EQ(locks.setLockFromCommand(7, true), VSAResult::kOutOfRange);
   EXPECT_EQ(locks.setLockFromCommand(8, false), VSAResult::kOutOfRange);
   EXPECT_EQ(locks.setLockFromCommand(UINT64_MAX, true), VSAResult::kOutOfRange);
@@ -100,14 +107,16 @@ TEST(VSATestLocks, TheCommandAcquiresOncePerLockAndChecksNumbers) {
   EXPECT_EQ(locks.setLockFromCommand(7, false), VSAResult::kSuccess);
   EXPECT_FALSE(locks.enabled());
   EXPECT_EQ(locks.countForLock(3), 0);
-  EXPECT_EQ(VSALockTableSnapshot().allReaderWriterState, 0);
+  EXPECT_EQ(table.snapshot().allReaderWriterState, 0);
 }
 
 // Turning everything off also forgets what the command held, so the
 // command's next enable takes the lock again and its next disable never
 // releases a lock that is no longer held (which would end the process).
 TEST(VSATestLocks, TurningEverythingOffLeavesTheCommandNothingToReleaseTwice) {
-  VSATestLocks locks;
+  auto shared = std::make_shared<VSALocks>();
+  [[maybe_unused]] VSALocks& table = *shared;
+  VSATestLocks locks(shared);
   ASSERT_EQ(locks.setLockFromCommand(3, true), VSAResult::kSuccess);
   ASSERT_EQ(locks.setLockFromCommand(7, false), VSAResult::kSuccess);
   EXPECT_FALSE(locks.enabled());
@@ -125,10 +134,12 @@ TEST(VSATestLocks, TurningEverythingOffLeavesTheCommandNothingToReleaseTwice) {
 // be had until it goes on; neither the release that lets it go on, nor
 // turning the feature off, may wait for that.
 TEST(VSATestLocks, ReleasesNeverWaitBehindALockZeroThatCannotBeHadYet) {
-  VSATestLocks locks;
+  auto shared = std::make_shared<VSALocks>();
+  [[maybe_unused]] VSALocks& table = *shared;
+  VSATestLocks locks(shared);
   ASSERT_EQ(locks.setLockFromCommand(3, true), VSAResult::kSuccess);
-  auto frozen = std::async(std::launch::async, [&locks] {
-    VSAIdentifierLockGuard guard(VSAValue("FROZEN-KEY"), true);
+  auto frozen = std::async(std::launch::async, [&locks, &table] {
+    VSAIdentifierLockGuard guard(table, VSAValue("FROZEN-KEY"), true);
     locks.waitOnLock(3);
   });
   EXPECT_EQ(frozen.wait_for(200ms), std::future_status::timeout);
@@ -138,16 +149,16 @@ TEST(VSATestLocks, ReleasesNeverWaitBehindALockZeroThatCannotBeHadYet) {
   ASSERT_EQ(release.wait_for(5s), std::future_status::ready);
   EXPECT_EQ(frozen.wait_for(5s), std::future_status::ready);
   EXPECT_EQ(lockZero.wait_for(5s), std::future_status::ready);
-  EXPECT_EQ(VSALockTableSnapshot().allReaderWriterState, -1);
+  EXPECT_EQ(table.snapshot().allReaderWriterState, -1);
 
   ASSERT_EQ(locks.setLockFromCommand(0, false), VSAResult::kSuccess);
-  EXPECT_EQ(VSALockTableSnapshot().allReaderWriterState, 0);
+  EXPECT_EQ(table.snapshot().allReaderWriterState, 0);
 
   // Lock 1 asked for behind an operation frozen at lock 4, then everything
   // turned off before it was had: the taker lets it go as soon as it has it.
   ASSERT_EQ(locks.setLockFromCommand(4, true), VSAResult::kSuccess);
-  auto held = std::async(std::launch::async, [&locks] {
-    VSAIdentifierLockGuard guard(VSAValue("FROZEN-KEY"), true);
+  auto held = std::async(std::launch::async, [&locks, &table] {
+    VSAIdentifierLockGuard guard(table, VSAValue("FROZEN-KEY"), true);
     locks.waitOnLock(4);
   });
   EXPECT_EQ(held.wait_for(200ms), std::future_status::timeout);
@@ -158,14 +169,16 @@ TEST(VSATestLocks, ReleasesNeverWaitBehindALockZeroThatCannotBeHadYet) {
   EXPECT_EQ(held.wait_for(5s), std::future_status::ready);
   EXPECT_EQ(lockOne.wait_for(5s), std::future_status::ready);
   EXPECT_EQ(locks.countForLock(1), 0);
-  EXPECT_EQ(VSALockTableSnapshot().allReaderWriterState, 0);
+  EXPECT_EQ(table.snapshot().allReaderWriterState, 0);
 }
 
 TEST(VSATestLocksDeathTest, AnUnbalancedReleaseEndsTheProcess) {
   GTEST_FLAG_SET(death_test_style, "threadsafe");
   EXPECT_DEATH(
       {
-        VSATestLocks locks;
+        auto shared = std::make_shared<VSALocks>();
+        [[maybe_unused]] VSALocks& table = *shared;
+        VSATestLocks locks(shared);
         locks.acquireLock(4);
         locks.releaseLock(4);
         locks.releaseLock(4);

@@ -3,6 +3,7 @@
 #include <filesystem>
 #include <fstream>
 
+#include "VSAFakeCodeSigning.h"
 #include "VSATestTempDir.h"
 #include "base/VSAPlist.h"
 #include "codesigning/VSACodeSigningMapping.h"
@@ -36,17 +37,18 @@ class Mapping : public ::testing::Test {
     if (legacy) VSA_writeToURL(*legacy, legacyPath_, 0, nullptr);
     mapping_.reset();
     mapping_ = std::make_unique<VSACodeSigningMapping>(
-        cache, config, std::make_unique<VSASQLiteDB>(config->libraryDirectory()));
+        cache, config, std::make_unique<VSASQLiteDB>(config->libraryDirectory()), locks_);
     config_ = config;
     personal_ = cache->userIdentityForPersonalPersona();
-    containers_ =
-        VSAContainerCache::create({cache, config, std::make_shared<VSASandboxService>(root),
-                                   std::make_shared<VSANotificationCenter>(root),
-                                   [](const std::string&) { return std::nullopt; },
-                                   [](const std::string&, VSAContainerClass) { return false; }});
+    containers_ = VSAContainerCache::create(
+        {cache, config, std::make_shared<VSASandboxService>(root),
+         std::make_shared<VSANotificationCenter>(root), testLocks_, &noRecords_, &noWellknown_});
     auto environment = std::make_shared<VSAStageForDeleteEnvironment>();
     environment->cache = containers_;
     environment->configuration = config;
+    environment->locks = locks_;
+    environment->testLocks = testLocks_;
+    environment->codeSigning = mapping_.get();
     mapping_->setStageForDeleteEnvironment(environment);
   }
 
@@ -88,6 +90,10 @@ class Mapping : public ::testing::Test {
   }
 
   VSATestTempDir temp_{"vessa-mapping"};
+  std::shared_ptr<VSALocks> locks_ = std::make_shared<VSALocks>();
+  std::shared_ptr<VSATestLocks> testLocks_ = std::make_shared<VSATestLocks>(locks_);
+  VSAFakeCodeSigningQueries noRecords_;
+  VSAFakeWellknownContainers noWellknown_;
   std::string root_, legacyPath_;
   std::shared_ptr<VSAGlobalConfiguration> config_;
   std::shared_ptr<VSAContainerCache> containers_;
@@ -178,12 +184,8 @@ TEST_F(Mapping, AStagedBundleTakesItsCodeSigningRecordsAlong) {
   ASSERT_EQ(reg("com.bundled", info(VSAValue::dictionary()), q), 1u);
   auto identity =
       VSAContainerIdentity::containerIdentityWithUserIdentity(personal_, "com.bundled", 1, nullptr);
-  auto environment = std::make_shared<VSAStageForDeleteEnvironment>();
-  environment->cache = containers_;
-  environment->configuration = config_;
-  environment->removeCodeSigning = [this](const std::string& id, VSACommandQueue& queue) {
-    mapping_->removeCodeSigningDictionariesForIdentifierAndItsChildren(id, &queue);
-  };
+  auto environment = std::make_shared<VSAStageForDeleteEnvironment>(
+      VSAStageForDeleteEnvironment{containers_, config_, locks_, testLocks_, mapping_.get()});
   q.insertCommand(VSACommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
       environment, {identity}, true, nullptr));
   VSAResultCode code = 1;

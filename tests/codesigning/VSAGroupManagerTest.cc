@@ -179,14 +179,14 @@ TEST_F(Groups, AnOwnersGroupsAreListedUnderTheAllIdentifiersWriteLock) {
     });
   };
   // A reader of all identifiers (a look-up in progress) holds the listing back.
-  lock_all_identifiers_read();
+  context_->locks->lock_all_identifiers_read();
   auto waiting = list(true);
   EXPECT_EQ(waiting.wait_for(300ms), std::future_status::timeout);
   // Without locking the caller's own hold is enough.
   auto unlocked = list(false);
   ASSERT_EQ(unlocked.wait_for(10s), std::future_status::ready);
   EXPECT_EQ(unlocked.get()->size(), 1u);
-  unlock_all_identifiers();
+  context_->locks->unlock_all_identifiers();
   ASSERT_EQ(waiting.wait_for(10s), std::future_status::ready);
   auto ids = waiting.get();
   ASSERT_TRUE(ids);

@@ -10,6 +10,7 @@
 #include <thread>
 
 #include "VSAContainerTestRoot.h"
+#include "VSAFakeCodeSigning.h"
 #include "daemon/VSAClientConnection.h"
 #include "operations/VSACommandStageForDelete.h"
 #include "platform/VSAFaultInjectingFileSystem.h"
@@ -269,10 +270,16 @@ TEST_F(Lifecycle, DeletionStagesOnRequestCompletionAndDeathRowEmpties) {
 TEST_F(Lifecycle, ATransientBundleWithAPermanentTwinKeepsTheCodeSigningRecords) {
   auto c = installer();
   VSAResultCode code;
-  std::vector<std::string> forgotten;
-  context_->stageEnvironment->removeCodeSigning = [&](const std::string& id, VSACommandQueue&) {
-    forgotten.push_back(id);
-  };
+  // The context's stage-for-delete environment records instead of removing,
+  // for the stages below and the deletion request at the end.
+  VSARecordingCodeSigningChanges recorder;
+  struct Restore {
+    VSAStageForDeleteEnvironment& environment;
+    VSACodeSigningChanges* saved;
+    ~Restore() { environment.codeSigning = saved; }
+  } restore{*context_->stageEnvironment, context_->stageEnvironment->codeSigning};
+  context_->stageEnvironment->codeSigning = &recorder;
+  const std::vector<std::string>& forgotten = recorder.removed;
   auto permanent = create(*c, "com.example.twin", &code, false, 1);
   ASSERT_TRUE(permanent) << code;
   auto transient = create(*c, "com.example.twin", &code, true, 1);
@@ -375,10 +382,12 @@ TEST_F(Lifecycle, ACacheThatCannotDropAStagedContainerStopsTheCommandWith46) {
   // The class map goes away while the command runs (an identity
   // invalidation), and the class directory cannot be listed any more.
   auto environment = std::make_shared<VSAStageForDeleteEnvironment>(*context_->stageEnvironment);
-  environment->removeCodeSigning = [this](const std::string&, VSACommandQueue&) {
+  VSARecordingCodeSigningChanges recorder;
+  recorder.onRemove = [this](const std::string&, VSACommandQueue*) {
     context_->containerCache->invalidateUserIdentity(user_);
     faults_->failAll(Op::ReadDirectory, EIO);
   };
+  environment->codeSigning = &recorder;
   std::vector<VSAResultCode> reported;
   VSACommandQueue queue;
   queue.insertCommand(VSACommandStageForDelete::commandForStageForDeleteWithContainerIdentities(

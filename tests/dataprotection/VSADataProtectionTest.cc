@@ -4,6 +4,7 @@
 #include <filesystem>
 #include <future>
 
+#include "VSAFakeCodeSigning.h"
 #include "VSATestTempDir.h"
 #include "base/VSALocks.h"
 #include "base/VSAPlist.h"
@@ -32,22 +33,18 @@ class Protection : public ::testing::Test {
     personas_->personas = std::vector<VSAPersonaAttributes>{
         FakePersonaService::persona(Kind::Personal, 1000, "P", {})};
     identities_ = VSAUserIdentityCache::create({personas_, users, 501, 501, true, nullptr});
-    auto cache =
-        VSAContainerCache::create({identities_, config_, std::make_shared<VSASandboxService>(root),
-                                   std::make_shared<VSANotificationCenter>(root),
-                                   [](const std::string&) { return std::nullopt; },
-                                   [](const std::string&, VSAContainerClass) { return false; }});
+    auto cache = VSAContainerCache::create(
+        {identities_, config_, std::make_shared<VSASandboxService>(root),
+         std::make_shared<VSANotificationCenter>(root), testLocks_, &codeSigning_, &wellknown_});
     auto env = std::make_shared<VSADataProtectionEnvironment>();
     env->configuration = config_;
     env->userIdentityCache = identities_;
     env->containerCache = cache;
     env->transactions = transactions_;
     env->lockStateQueue = lockStateQueue_;
-    env->entitlementsForIdentifier = [this](const std::string& id) -> std::optional<VSAValue> {
-      auto it = entitlements_.find(id);
-      if (it == entitlements_.end()) return std::nullopt;
-      return it->second;
-    };
+    env->locks = locks_;
+    env->testLocks = testLocks_;
+    env->codeSigning = &codeSigning_;
     env_ = env;
     manager_ = std::make_unique<VSADataProtectionManager>(env_);
     user_ = identities_->userIdentityForPersonalPersona();
@@ -103,9 +100,13 @@ class Protection : public ::testing::Test {
   std::shared_ptr<VSATransactions> transactions_ = std::make_shared<VSATransactions>();
   VSAWorkQueue::Ref lockStateQueue_ = VSAWorkQueue::create("test.lockstate");
   VSAWorkQueue::Ref fileQueue_ = VSAWorkQueue::create("test.protection-files");
+  std::shared_ptr<VSALocks> locks_ = std::make_shared<VSALocks>();
+  std::shared_ptr<VSATestLocks> testLocks_ = std::make_shared<VSATestLocks>(locks_);
+  VSAFakeCodeSigningQueries codeSigning_;
+  std::map<std::string, VSAValue>& entitlements_ = codeSigning_.entitlements;
+  VSAFakeWellknownContainers wellknown_;
   std::shared_ptr<const VSADataProtectionEnvironment> env_;
   std::unique_ptr<VSADataProtectionManager> manager_;
-  std::map<std::string, VSAValue> entitlements_;
   VSAUserIdentityRef user_;
 };
 
@@ -412,7 +413,7 @@ TEST_F(Protection, TheClassIsRecordedOnTheMetadataAsItIsAtTheUnlock) {
       *m->containerIdentity(), 3, false, true, [&](VSAResultCode c) { done.set_value(c); });
   {
     // Meanwhile someone records another info value, the way metadata is written.
-    VSAIdentifierLockGuard guard(VSAValue(m->uuid().string()), true);
+    VSAIdentifierLockGuard guard(*locks_, VSAValue(m->uuid().string()), true);
     auto current = VSAMetadata::readAndValidateMetadataAtUrl(m->url(), user_, false, *config_,
                                                              *identities_, nullptr);
     ASSERT_TRUE(current);

@@ -8,6 +8,7 @@
 #include <fstream>
 #include <future>
 
+#include "VSAFakeCodeSigning.h"
 #include "VSATestTempDir.h"
 #include "base/VSAPlist.h"
 #include "model/FakePersonaService.h"
@@ -38,11 +39,10 @@ class Cache : public ::testing::Test {
     identities_ = VSAUserIdentityCache::create({personas_, users, 501, 501, true, nullptr});
     notifications_ = std::make_shared<VSANotificationCenter>(root);
     sandbox_ = std::make_shared<VSASandboxService>(root);
-    cache_ = VSAContainerCache::create({identities_, config_, sandbox_, notifications_,
-                                        [](const std::string&) { return std::nullopt; },
-                                        [](const std::string& id, VSAContainerClass c) {
-                                          return c == 12 && id == "com.wellknown";
-                                        }});
+    wellknown_.known = {{"com.wellknown", 12}};
+    cache_ = VSAContainerCache::create(
+        {identities_, config_, sandbox_, notifications_,
+         std::make_shared<VSATestLocks>(std::make_shared<VSALocks>()), &codeSigning_, &wellknown_});
     personal_ = identities_->userIdentityForPersonalPersona();
     enterprise_ = identities_->userIdentityForPersonaUniqueString(std::string("E"), 501, 501);
   }
@@ -72,6 +72,8 @@ class Cache : public ::testing::Test {
 
   VSATestTempDir temp_{"vessa-cache"};
   std::string root_;
+  VSAFakeCodeSigningQueries codeSigning_;
+  VSAFakeWellknownContainers wellknown_;
   std::shared_ptr<VSAGlobalConfiguration> config_;
   std::shared_ptr<FakePersonaService> personas_;
   std::shared_ptr<VSAUserIdentityCache> identities_;
@@ -97,8 +99,8 @@ TEST_F(Cache, BuildsFromDiskSkippingBadNamesAndWrongClasses) {
   // Well-known names count in Data/System only.
   onDisk(personal_, "com.wellknown", 12, "com.wellknown");
   EXPECT_EQ(cache_->allContainersForUserIdentity(personal_, 12, false, false, nullptr)->size(), 1u);
-  EXPECT_FALSE(VSAContainerCache::containerURLIsValidForContainerClass(
-      "/x/com.wellknown", 13, [](const std::string&, VSAContainerClass c) { return c == 12; }));
+  EXPECT_FALSE(
+      VSAContainerCache::containerURLIsValidForContainerClass("/x/com.wellknown", 13, wellknown_));
 }
 
 TEST_F(Cache, HostileMetadataFilesCostOnlyTheirOwnContainer) {

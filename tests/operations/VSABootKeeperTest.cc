@@ -38,7 +38,7 @@ class Boot : public VSAContainerTestRoot {
     std::promise<void> done;
     installer()->rebootKeeperCleanupWithCompletion([&] { done.set_value(); });
     done.get_future().wait();
-    VSADeathRow::_sharedBackgroundQueue()->sync([] {});
+    context_->backgroundQueue->sync([] {});
   }
   std::shared_ptr<VSAPerUserConfiguration> perUser() {
     return context_->globalConfiguration->getPerUserConfigurationForUserIdentity(
@@ -277,10 +277,11 @@ TEST_F(Boot, TheOrphanScanLeavesAloneAContainerThatAWipeIsReplacing) {
   auto live = create(*installer(), "com.example.app", &code);
   ASSERT_TRUE(live) << code;
   put(live->url() + "/Documents/old", "x");
-  auto& locks = VSATestLocks::shared();
+  auto& locks = *context_->testLocks;
   struct Off {
-    ~Off() { VSATestLocks::shared().setEnabled(false); }
-  } off;
+    VSATestLocks& locks;
+    ~Off() { locks.setEnabled(false); }
+  } off{locks};
   locks.setEnabled(true);
   locks.acquireLock(kVSATestLockReplace);
   std::promise<VSAResultCode> wiped;

@@ -138,7 +138,7 @@ TEST_F(ContainerContent, DeletingAnAssetMovesOnlyThatAssetToDeathRow) {
   EXPECT_EQ(deleteAsset(*c, "com.example.app", "album"), VSAResult::kSuccess);  // already gone
   EXPECT_TRUE(fs::exists(dir + "/note"));
   EXPECT_TRUE(fs::is_directory(dir));
-  VSADeathRow::_sharedBackgroundQueue()->sync([] {});
+  context_->backgroundQueue->sync([] {});
   EXPECT_EQ(emptyDeathRow(), VSAResult::kSuccess);
   EXPECT_EQ(entries(deathRow()), 0u);
 }
@@ -218,7 +218,7 @@ TEST_F(ContainerContent, ACrashWhileStagingLeavesTheOldOrTheNewContentNeverAMix)
     faults_->reset();
     faults_->crashAfter(n);
     stageFonts();
-    VSADeathRow::_sharedBackgroundQueue()->sync([] {});
+    context_->backgroundQueue->sync([] {});
     restart();
     std::string a = read(landed + "/a.ttf"), b = read(landed + "/b.ttf");
     if (!fs::exists(landed)) {

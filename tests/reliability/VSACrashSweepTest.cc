@@ -74,8 +74,8 @@ class CrashSweep : public VSAContainerTestRoot {
     if (m) known_[id] = {c, m->uuid()};
     return m;
   }
-  static void drainBackground() {
-    VSADeathRow::_sharedBackgroundQueue()->sync([] {});
+  void drainBackground() {
+    context_->backgroundQueue->sync([] {});
   }
 
   // The first start after a device boot, on a new context (unlocked).
