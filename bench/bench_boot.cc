@@ -48,9 +48,9 @@ std::vector<std::string> populate(const std::string& root, int containers, int o
   std::ofstream(root + "/etc/group") << "mobile:x:501:\n";
   // A device booting the build it last ran: a plain boot, not an upgrade.
   fs::create_directories(root + "/etc/vessad");
-  VSA_writeToURL(VSAValue::Dictionary{{"BuildVersion", VSAValue("BENCH1")},
-                                      {"ReleaseType", VSAValue("User")}},
-                 root + "/etc/vessad/system-version.plist", 0, nullptr);
+  VSA_writeToURL(
+      VSAValue::Dictionary{{"BuildVersion", VSAValue("BENCH1")}, {"ReleaseType", VSAValue("User")}},
+      root + "/etc/vessad/system-version.plist", 0, nullptr);
   VSADaemonContext context{VSASystemRoot(root)};
   VSAMigrationStatus::initForSystemMigration(*context.globalConfiguration,
                                              root + "/etc/vessad/system-version.plist")
@@ -64,8 +64,8 @@ std::vector<std::string> populate(const std::string& root, int containers, int o
     auto identity = VSAContainerIdentity::containerIdentityWithUserIdentity(
         user, "com.bench.app" + std::to_string(i), c, nullptr);
     VSAResultCode code = VSAResult::kSuccess;
-    if (!connection->createOrLookupContainerWithContainerIdentity(identity, true, false, true,
-                                                                  &code)) {
+    if (!connection->createOrLookupContainerWithContainerIdentity(
+            identity, {.createIfNecessary = true}, &code)) {
       std::fprintf(stderr, "creation failed: %llu\n", static_cast<unsigned long long>(code));
       std::exit(1);
     }

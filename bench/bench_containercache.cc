@@ -116,7 +116,7 @@ BENCHMARK(BM_RawMetadataReads)->Unit(benchmark::kMillisecond);
 void BM_BuildClassMap(benchmark::State& state) {
   for (auto _ : state) {
     auto cache = device().freshCache();
-    auto all = cache->allContainersForUserIdentity(device().user, 2, false, false, nullptr);
+    auto all = cache->allContainersForUserIdentity(device().user, 2, {}, nullptr);
     if (!all || all->size() != static_cast<size_t>(kContainers))
       state.SkipWithError("class map incomplete");
   }
@@ -130,7 +130,7 @@ int main(int argc, char** argv) {
   long before = maxRSSKiB();
   {
     auto cache = device().freshCache();
-    cache->allContainersForUserIdentity(device().user, 2, false, false, nullptr);
+    cache->allContainersForUserIdentity(device().user, 2, {}, nullptr);
     std::printf(
         "peak RSS after building one map of %d containers: %ld KiB (grew %ld KiB, %.0f "
         "bytes per container)\n\n",

@@ -72,8 +72,8 @@ class VSAContainerTestRoot : public ::testing::Test {
   VSAMetadataRef create(VSAClientConnection& c, const std::string& id, VSAResultCode* code,
                         bool transient = false, VSAContainerClass cls = 2) {
     *code = VSAResult::kSuccess;
-    return c.createOrLookupContainerWithContainerIdentity(identity(id, cls), true, transient, true,
-                                                          code);
+    return c.createOrLookupContainerWithContainerIdentity(
+        identity(id, cls), {.createIfNecessary = true, .transient = transient}, code);
   }
   static void put(const std::string& path, const std::string& text) { std::ofstream(path) << text; }
   static std::string read(const std::string& path) {
@@ -83,8 +83,7 @@ class VSAContainerTestRoot : public ::testing::Test {
   // The live container of `id`, never created.
   VSAMetadataRef lookup(const std::string& id, VSAContainerClass c = 2) {
     VSAResultCode code = VSAResult::kSuccess;
-    return installer()->createOrLookupContainerWithContainerIdentity(identity(id, c), false, false,
-                                                                     true, &code);
+    return installer()->createOrLookupContainerWithContainerIdentity(identity(id, c), {}, &code);
   }
   static size_t entries(const std::string& dir) {
     if (!std::filesystem::exists(dir)) return 0;

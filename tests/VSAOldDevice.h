@@ -24,8 +24,8 @@ struct VSAOldDevice {
   static void writeSystemVersion(const std::string& root, const std::string& build,
                                  const std::string& release = "User") {
     std::filesystem::create_directories(root + "/etc/vessad");
-    VSAValue version = VSAValue::Dictionary{{"BuildVersion", VSAValue(build)},
-                                            {"ReleaseType", VSAValue(release)}};
+    VSAValue version =
+        VSAValue::Dictionary{{"BuildVersion", VSAValue(build)}, {"ReleaseType", VSAValue(release)}};
     VSA_writeToURL(version, root + "/etc/vessad/system-version.plist", 0, nullptr);
   }
 
@@ -43,8 +43,8 @@ struct VSAOldDevice {
     auto make = [&](const char* id, VSAContainerClass c) {
       VSAResultCode code = VSAResult::kSuccess;
       auto identity = VSAContainerIdentity::containerIdentityWithUserIdentity(user, id, c, nullptr);
-      auto m = installer.createOrLookupContainerWithContainerIdentity(identity, true, false, true,
-                                                                      &code);
+      auto m = installer.createOrLookupContainerWithContainerIdentity(
+          identity, {.createIfNecessary = true}, &code);
       std::ofstream(m->url() + "/keep.txt") << id;  // content that must survive
       return identity;
     };

@@ -277,8 +277,7 @@ VSAResultCode VSACodeSigningMapping::invalidateCodeSigningInfoForAppsWithoutBund
       auto identity = VSAContainerIdentity::containerIdentityWithUserIdentity(owner, identifier,
                                                                               bundle, nullptr);
       if (identity && stageEnvironment_ &&
-          stageEnvironment_->cache->containerForContainerIdentity(*identity, false, false, false,
-                                                                  nullptr)) {
+          stageEnvironment_->cache->containerForContainerIdentity(*identity, {}, nullptr)) {
         found = true;
         break;
       }
@@ -314,7 +313,7 @@ void VSACodeSigningMapping::reconcileSystemContainersWithCommandQueue(
   if (!stageEnvironment_) return;
   VSAErrorRef listError;
   auto containers = stageEnvironment_->cache->allContainersForUserIdentity(
-      userIdentityCache_->defaultUserIdentity(), 12, false, false, &listError);
+      userIdentityCache_->defaultUserIdentity(), 12, {}, &listError);
   if (!containers) {
     logMapping(kVSALogError, "Failed to fetch system container list: %@", listError);
     return;

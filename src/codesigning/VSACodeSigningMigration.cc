@@ -62,7 +62,7 @@ bool VSACodeSigningMigration::performAllCodeSigningMigrationAndReconciliationWit
 
 std::optional<std::vector<VSAConstMetadataRef>> VSACodeSigningMigration::containers(
     const VSAUserIdentityRef& user, VSAContainerClass c, VSAErrorRef* error) {
-  return containerCache_->allContainersForUserIdentity(user, c, false, false, error);
+  return containerCache_->allContainersForUserIdentity(user, c, {}, error);
 }
 
 VSAResultCode VSACodeSigningMigration::clearInfoValue(const VSAMetadata& container,
@@ -79,7 +79,7 @@ VSAResultCode VSACodeSigningMigration::clearInfoValue(const VSAMetadata& contain
   fresh->setInfo(std::move(info));
   if (!fresh->writeMetadataToDiskWithError(*configuration_, &error))
     return error ? error->resultCode(VSAResult::kWriteFailed) : VSAResult::kWriteFailed;
-  if (!containerCache_->addContainerMetadata(*fresh, fresh->url(), false, true, &error))
+  if (!containerCache_->addContainerMetadata(*fresh, fresh->url(), {.updateSandbox = true}, &error))
     return VSAResult::kCacheAddFailed;
   return VSAResult::kSuccess;
 }

@@ -81,8 +81,7 @@ void VSAGroupManager::_cleanupUnreferencedGroupContainersForUserIdentity(
     const VSAUserIdentityRef& user, VSAContainerClass containerClass,
     const VSAReferenceCounts& referenceCounts, VSACommandQueue& commandQueue) {
   VSAErrorRef error;
-  auto all =
-      containerCache_->allContainersForUserIdentity(user, containerClass, false, false, &error);
+  auto all = containerCache_->allContainersForUserIdentity(user, containerClass, {}, &error);
   if (!all) {
     logGroups(kVSALogError, "Failed to fetch group container list for %@: %@", user, error);
     return;

@@ -45,11 +45,9 @@ bool VSAClientConnection::completeWithError(VSAResultCode* error) {
 }
 
 VSAMetadataRef VSAClientConnection::createOrLookupContainerWithContainerIdentity(
-    const VSAContainerIdentityRef& identity, bool createIfNecessary, bool transient,
-    bool useLocking, VSAResultCode* withError) {
+    const VSAContainerIdentityRef& identity, VSALookupOptions options, VSAResultCode* withError) {
   return VSAContainerLookup(services_, grants_)
-      .createOrLookupContainerWithContainerIdentity(identity, createIfNecessary, transient,
-                                                    useLocking, withError);
+      .createOrLookupContainerWithContainerIdentity(identity, options, withError);
 }
 
 std::optional<std::vector<VSAConstMetadataRef>> VSAClientConnection::containersWithClass(

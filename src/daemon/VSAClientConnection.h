@@ -24,6 +24,7 @@
 #include "model/VSAContainerIdentity.h"
 #include "model/VSAMetadata.h"
 #include "operations/VSACommandQueue.h"
+#include "operations/VSAContainerLookup.h"
 #include "operations/VSAOperationGrants.h"
 #include "platform/VSAIPCMessage.h"
 
@@ -61,8 +62,7 @@ class VSAClientConnection {
 
   // Create and look up (VSAContainerLookup).
   VSAMetadataRef createOrLookupContainerWithContainerIdentity(
-      const VSAContainerIdentityRef& identity, bool createIfNecessary, bool transient,
-      bool useLocking, VSAResultCode* withError);
+      const VSAContainerIdentityRef& identity, VSALookupOptions options, VSAResultCode* withError);
   bool isEntitledForLookupWithClass(VSAContainerClass containerClass,
                                     const std::string& identifier) const {
     return grants_.isEntitledForLookupWithClass(containerClass, identifier);
@@ -71,9 +71,8 @@ class VSAClientConnection {
       VSAContainerClass containerClass) const {
     return grants_.lookupForContainerClass(containerClass);
   }
-  std::optional<std::vector<VSAConstMetadataRef>> containersWithClass(VSAContainerClass containerClass,
-                                                                 bool transient,
-                                                                 VSAResultCode* withError);
+  std::optional<std::vector<VSAConstMetadataRef>> containersWithClass(
+      VSAContainerClass containerClass, bool transient, VSAResultCode* withError);
   VSAMetadataRef metadataWithContainerIdentity(const VSAContainerIdentityRef& identity,
                                                VSAResultCode* withError);
   std::optional<uint64_t> diskUsageWithContainerIdentity(const VSAContainerIdentityRef& identity,

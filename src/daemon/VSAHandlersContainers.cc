@@ -60,7 +60,10 @@ void VSAHandleCreateOrLookup(const VSAValue& request, VSAValue& reply,
   auto identity = args.containerIdentity();
   if (!identity) return;
   auto m = connection.createOrLookupContainerWithContainerIdentity(
-      identity, args.boolValue("CreateIfNecessary"), args.boolValue("Transient"), true, result);
+      identity,
+      {.createIfNecessary = args.boolValue("CreateIfNecessary"),
+       .transient = args.boolValue("Transient")},
+      result);
   if (!m) return;
   reply.set("ReplyPath", m->url());
   reply.set("ReplyUUID", m->uuid());
@@ -121,8 +124,7 @@ void VSAHandleStageForDelete(const VSAValue& request, VSAValue&, VSAClientConnec
     if (!identity) return;
     // The caller must be able to reach each container it names.
     VSAResultCode access = VSAResult::kSuccess;
-    if (!connection.createOrLookupContainerWithContainerIdentity(identity, false, false, true,
-                                                                 &access) &&
+    if (!connection.createOrLookupContainerWithContainerIdentity(identity, {}, &access) &&
         access == VSAResult::kNotEntitled) {
       VSASetCode(result, access);
       return;
@@ -186,8 +188,8 @@ void VSAHandleSystemContainerPath(const VSAValue& request, VSAValue& reply,
     VSASetCode(result, VSAResult::kNotEntitled);
     return;
   }
-  auto m =
-      connection.createOrLookupContainerWithContainerIdentity(identity, true, false, true, result);
+  auto m = connection.createOrLookupContainerWithContainerIdentity(
+      identity, {.createIfNecessary = true}, result);
   if (m) reply.set("ReplyPath", m->url());
 }
 
@@ -217,7 +219,7 @@ void VSAHandleSystemGroupContainerPath(const VSAValue& request, VSAValue& reply,
   if (!identity) return VSASetCode(result, code);
   // Entitlement to the group is the access grant here.
   connection.setAllowGroupIdLookup(true);
-  auto m =
-      connection.createOrLookupContainerWithContainerIdentity(identity, true, false, true, result);
+  auto m = connection.createOrLookupContainerWithContainerIdentity(
+      identity, {.createIfNecessary = true}, result);
   if (m) reply.set("ReplyPath", m->url());
 }

@@ -25,7 +25,7 @@ VSAUpcallEnvironment VSAKernelUpcall::environmentFor(VSADaemonContext& context) 
     VSAResultCode result = VSAResult::kSuccess;
     auto identity = VSAContainerIdentity::containerIdentityWithUserIdentity(user, id, c, &result);
     auto m = identity ? connection.createOrLookupContainerWithContainerIdentity(
-                            identity, true, false, true, &result)
+                            identity, {.createIfNecessary = true}, &result)
                       : nullptr;
     if (!m) {
       *code = result == VSAResult::kSuccess ? VSAResult::kInvalidArgument : result;

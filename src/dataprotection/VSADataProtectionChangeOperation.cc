@@ -266,7 +266,7 @@ VSADataProtectionChangeOperation::dataProtectionChangeOperationAtURL(
   }
   VSAErrorRef lookupError;
   VSAMetadataRef metadata = env->containerCache->containerForContainerIdentity(
-      *identity, false, true, false, &lookupError);
+      *identity, {.updateSandbox = true}, &lookupError);
   if (!metadata) {
     if (!lookupError)
       lookupError =

@@ -106,7 +106,7 @@ void VSADataProtectionManager::setDataProtectionOnDataContainerForContainerIdent
                                      "Can't act on an invalid object: identity: %@", identity)));
   VSAErrorRef lookupError;
   VSAMetadataRef metadata = env_->containerCache->containerForContainerIdentity(
-      identity, false, true, false, &lookupError);
+      identity, {.updateSandbox = true}, &lookupError);
   if (!metadata)
     return completion(fail(VSA_ERROR_UNDERLYING(VSAResult::kContainerNotFound, lookupError,
                                                 "No Container with identity: %@", identity)));
@@ -350,7 +350,7 @@ void VSADataProtectionManager::recordProtectionClass(const VSAMetadataRef& metad
   updated->setInfo(info);
   VSAErrorRef error;
   if (!updated->writeMetadataToDiskWithError(*env_->configuration, &error) ||
-      !env_->containerCache->addContainerMetadata(*updated, updated->url(), false, false, &error)) {
+      !env_->containerCache->addContainerMetadata(*updated, updated->url(), {}, &error)) {
     VSALog(kVSALogError, "_startDataProtectionChangeOperation",
            "Failed to set protection class info for %@ at %@ to %d : %llu", metadata->identifier(),
            metadata->url(), protectionClass,

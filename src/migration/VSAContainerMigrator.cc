@@ -178,7 +178,7 @@ bool VSAContainerMigrator::_performWhitelistMigrationWithError(VSAErrorRef* erro
   bool ok = true;
   for (VSAContainerClass c : {12, 13}) {
     auto dir = dependencies_.configuration->containerDirectoryURLForUserIdentity(user, c, false);
-    auto all = cache.allContainersForUserIdentity(user, c, false, false, error);
+    auto all = cache.allContainersForUserIdentity(user, c, {}, error);
     if (!dir || !all) {
       logMigrator(kVSALogError, origin,
                   "Failed to get list of system containers for migration: (error= %@ : %lld)",
@@ -212,7 +212,7 @@ bool VSAContainerMigrator::_performWhitelistMigrationWithError(VSAErrorRef* erro
       }
       VSAMetadata moved = *m;
       moved.setUrl(target);
-      if (!cache.addContainerMetadata(moved, target, false, true, &stepError)) {
+      if (!cache.addContainerMetadata(moved, target, {.updateSandbox = true}, &stepError)) {
         logMigrator(kVSALogError, origin,
                     "%s: Failed to update cache for whitelisted container %@: (error= %@: %lld)",
                     origin, m->identifier(), stepError, 0LL);
@@ -305,8 +305,7 @@ bool VSAContainerMigrator::subdirectoryMigration(const VSAUserIdentityRef& user,
   bool ok = true;
   for (VSAContainerClass c : {2, 4, 6, 7, 9, 10, 11}) {
     VSAErrorRef error;
-    auto all =
-        dependencies_.containerCache->allContainersForUserIdentity(user, c, false, false, &error);
+    auto all = dependencies_.containerCache->allContainersForUserIdentity(user, c, {}, &error);
     if (!all) {
       logMigrator(kVSALogError, origin,
                   "Failed to fetch list of containers for userIdentity: %@, class %ld : %@",
@@ -344,8 +343,7 @@ bool VSAContainerMigrator::dataProtectionMigration(const VSAUserIdentityRef& use
   bool ok = true;
   for (VSAContainerClass c : {2, 4, 6}) {
     VSAErrorRef error;
-    auto all =
-        dependencies_.containerCache->allContainersForUserIdentity(user, c, false, false, &error);
+    auto all = dependencies_.containerCache->allContainersForUserIdentity(user, c, {}, &error);
     if (!all) {
       logMigrator(kVSALogError, origin,
                   "Failed to fetch list of data containers for userIdentity: %@, class: %ld: %@",

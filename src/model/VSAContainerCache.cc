@@ -68,9 +68,10 @@ std::vector<VSAContainerCache::ClassMapSize> VSAContainerCache::classMapSizes() 
 }
 
 VSAContainerCache::ClassMap* VSAContainerCache::_lock_getCache(const VSAUserIdentityRef& user,
-                                                               VSAContainerClass c, bool transient,
-                                                               bool populateSandbox, bool build,
+                                                               VSAContainerClass c,
+                                                               VSACacheOptions options, bool build,
                                                                VSAErrorRef* error, bool* built) {
+  const bool transient = options.transient, populateSandbox = options.updateSandbox;
   std::string key = cacheKeyForUserIdentity(user, c);
   auto& maps = transient ? transient_ : live_;
   if (auto it = maps.find(key); it != maps.end()) return &it->second;
@@ -190,8 +191,8 @@ bool VSAContainerCache::checkFound(const VSAMetadata& m, const std::string& key,
 }
 
 VSAMetadataRef VSAContainerCache::containerForContainerIdentity(
-    const VSAContainerIdentity& identity, bool transient, bool updateSandbox,
-    bool allowKernelLookup, VSAErrorRef* error) {
+    const VSAContainerIdentity& identity, VSACacheOptions options, VSAErrorRef* error) {
+  const bool transient = options.transient, allowKernelLookup = options.allowKernelLookup;
   const auto& user = identity.userIdentity();
   VSAContainerClass c = identity.containerClass();
   std::string key = cacheKeyForUserIdentity(user, c);
@@ -200,13 +201,13 @@ VSAMetadataRef VSAContainerCache::containerForContainerIdentity(
   bool built = false;  // read from disk by this very call: no need to look again
   {
     std::lock_guard lock(cacheLock_);
-    ClassMap* map = _lock_getCache(user, c, transient, updateSandbox, false, nullptr);
+    ClassMap* map = _lock_getCache(user, c, options, false, nullptr);
     if (!map && allowKernelLookup && !transient) {
       found = fromSandbox = _lock_metadataFromSandbox(identity);
       built = found != nullptr;
     }
     if (!found) {
-      if (!map) map = _lock_getCache(user, c, transient, updateSandbox, true, nullptr, &built);
+      if (!map) map = _lock_getCache(user, c, options, true, nullptr, &built);
       if (!map) {
         VSASetError(error, rebuildError(user, c, transient));
         return nullptr;
@@ -232,8 +233,9 @@ VSAMetadataRef VSAContainerCache::containerForContainerIdentity(
 }
 
 std::optional<std::vector<VSAConstMetadataRef>> VSAContainerCache::allContainersForUserIdentity(
-    const VSAUserIdentityRef& user, VSAContainerClass c, bool transient, bool populateSandbox,
+    const VSAUserIdentityRef& user, VSAContainerClass c, VSACacheOptions options,
     VSAErrorRef* error) {
+  const bool transient = options.transient;
   if (!VSAContainerClassIsValid(c)) {
     VSASetError(error, cacheError(VSAResult::kInvalidArgument, "Invalid Content Class: %ld",
                                   static_cast<long>(c)));
@@ -244,7 +246,7 @@ std::optional<std::vector<VSAConstMetadataRef>> VSAContainerCache::allContainers
   bool built = false;  // every entry was read from disk by this very call
   {
     std::lock_guard lock(cacheLock_);
-    ClassMap* map = _lock_getCache(user, c, transient, populateSandbox, true, error, &built);
+    ClassMap* map = _lock_getCache(user, c, options, true, error, &built);
     if (!map) return std::nullopt;
     entries.reserve(map->size());
     for (const auto& [id, m] : *map) entries.push_back(m);
@@ -261,8 +263,8 @@ std::optional<std::vector<VSAConstMetadataRef>> VSAContainerCache::allContainers
 }
 
 bool VSAContainerCache::addContainerMetadata(const VSAMetadata& metadata, const std::string& url,
-                                             bool transient, bool updateSandbox,
-                                             VSAErrorRef* error) {
+                                             VSACacheOptions options, VSAErrorRef* error) {
+  const bool transient = options.transient, updateSandbox = options.updateSandbox;
   if (url.empty()) {
     VSASetError(error, cacheError(VSAResult::kInvalidArgument, "Invalid input: URL: %@", url));
     return false;
@@ -276,7 +278,7 @@ bool VSAContainerCache::addContainerMetadata(const VSAMetadata& metadata, const 
   }
   const auto& user = metadata.userIdentity();
   std::lock_guard lock(cacheLock_);
-  ClassMap* map = _lock_getCache(user, c, transient, false, true, nullptr);
+  ClassMap* map = _lock_getCache(user, c, {.transient = transient}, true, nullptr);
   if (!map) {
     VSASetError(error, rebuildError(user, c, transient));
     return false;
@@ -305,7 +307,7 @@ bool VSAContainerCache::removeContainerForUserIdentity(const VSAUserIdentityRef&
     return false;
   }
   std::lock_guard lock(cacheLock_);
-  ClassMap* map = _lock_getCache(user, c, transient, false, true, nullptr);
+  ClassMap* map = _lock_getCache(user, c, {.transient = transient}, true, nullptr);
   if (!map) {
     VSASetError(error, rebuildError(user, c, transient));
     return false;

@@ -32,6 +32,17 @@
 #include "platform/VSANotificationCenter.h"
 #include "platform/VSASandboxService.h"
 
+// How a cache call treats the containers it finds or adds. Call sites name
+// what they set ({.transient = true, .updateSandbox = true}); what is not
+// named is off.
+struct VSACacheOptions {
+  bool transient = false;      // the transient containers' maps, not the live ones
+  bool updateSandbox = false;  // keep the sandbox's container table in step
+  // Lookups only: a single container may come from the sandbox's table
+  // before its whole class map is built.
+  bool allowKernelLookup = false;
+};
+
 class VSAContainerCache : public VSAUserIdentityCacheObserver,
                           public std::enable_shared_from_this<VSAContainerCache> {
  public:
@@ -50,19 +61,18 @@ class VSAContainerCache : public VSAUserIdentityCacheObserver,
   // Makes the cache and registers it as an observer of the user identity cache.
   static std::shared_ptr<VSAContainerCache> create(Dependencies deps);
 
-  VSAMetadataRef containerForContainerIdentity(const VSAContainerIdentity& identity, bool transient,
-                                               bool updateSandbox, bool allowKernelLookup,
-                                               VSAErrorRef* error);
+  VSAMetadataRef containerForContainerIdentity(const VSAContainerIdentity& identity,
+                                               VSACacheOptions options, VSAErrorRef* error);
   VSAMetadataRef containerForContainerIdentity(const VSAContainerIdentity& identity) {
-    return containerForContainerIdentity(identity, false, false, false, nullptr);
+    return containerForContainerIdentity(identity, {}, nullptr);
   }
   // The entries are the maps' own (read-only, never changed once stored):
   // listing a class of 10,000 containers copies no metadata.
   std::optional<std::vector<VSAConstMetadataRef>> allContainersForUserIdentity(
-      const VSAUserIdentityRef& user, VSAContainerClass contentClass, bool transient,
-      bool populateSandboxCache, VSAErrorRef* error);
-  bool addContainerMetadata(const VSAMetadata& metadata, const std::string& url, bool transient,
-                            bool updateSandbox, VSAErrorRef* error);
+      const VSAUserIdentityRef& user, VSAContainerClass contentClass, VSACacheOptions options,
+      VSAErrorRef* error);
+  bool addContainerMetadata(const VSAMetadata& metadata, const std::string& url,
+                            VSACacheOptions options, VSAErrorRef* error);
   bool removeContainerForUserIdentity(const VSAUserIdentityRef& user,
                                       VSAContainerClass contentClass, const std::string& identifier,
                                       bool transient, VSAErrorRef* error);
@@ -99,8 +109,9 @@ class VSAContainerCache : public VSAUserIdentityCacheObserver,
   using ClassMap = std::unordered_map<std::string, VSAConstMetadataRef>;
   explicit VSAContainerCache(Dependencies deps) : deps_(std::move(deps)) {}
   // `built` (if given) is set when the map was read from disk by this call.
-  ClassMap* _lock_getCache(const VSAUserIdentityRef& user, VSAContainerClass c, bool transient,
-                           bool populateSandbox, bool build, VSAErrorRef* error,
+  // Without `build` only a map that exists is answered.
+  ClassMap* _lock_getCache(const VSAUserIdentityRef& user, VSAContainerClass c,
+                           VSACacheOptions options, bool build, VSAErrorRef* error,
                            bool* built = nullptr);
   VSAMetadataRef _lock_metadataFromSandbox(const VSAContainerIdentity& identity);
   // The on-disk checks done outside the lock; false (and the entry dropped) when stale.

@@ -33,7 +33,7 @@ void VSABootKeeper::_regenerateAllSystemContainerPaths(const VSAOperationGrants&
   for (VSAContainerClass c : {12, 13}) {
     VSAErrorRef error;
     auto all = services_.containerCache->allContainersForUserIdentity(grants.clientUserIdentity, c,
-                                                                      false, false, &error);
+                                                                      {}, &error);
     if (!all) {
       VSALogIn(VSALogCategory::Startup, kVSALogError, origin,
                "Failed to get list of system containers for migration: %@", error);
@@ -77,18 +77,18 @@ void VSABootKeeper::rebootKeeperCleanupWithCompletion(std::function<void()> comp
   // Transient containers do not survive a reboot.
   VSAErrorRef error;
   std::string transient = config.transientDirectory();
-  if (!deathRow._moveItemAtURLToDeathRow(transient, true, false, &error))
+  if (!deathRow._moveItemAtURLToDeathRow(transient, {}, &error))
     VSALogIn(VSALogCategory::Startup, kVSALogError, __func__,
              "Failed to delete shared transient URL %@ : %@", transient, error);
   if (auto legacy = config.legacyTransientBundleDirectory()) {
     VSALogIn(VSALogCategory::Startup, kVSALogNotice, __func__,
              "Sentencing legacy transient bundle directory [%@] to final deletion", *legacy);
-    if (!deathRow._moveItemAtURLToDeathRow(*legacy, true, false, &error))
+    if (!deathRow._moveItemAtURLToDeathRow(*legacy, {}, &error))
       VSALogIn(VSALogCategory::Startup, kVSALogError, __func__,
                "Failed to delete legacy shared transient bundle URL %@ : %@", *legacy, error);
   }
   std::string bundles = config.transientBundleDirectory();
-  if (!deathRow._moveItemAtURLToDeathRow(bundles, true, false, &error))
+  if (!deathRow._moveItemAtURLToDeathRow(bundles, {}, &error))
     VSALogIn(VSALogCategory::Startup, kVSALogError, __func__,
              "Failed to delete shared transient bundle URL %@ : %@", bundles, error);
   services_.userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
@@ -97,7 +97,7 @@ void VSABootKeeper::rebootKeeperCleanupWithCompletion(std::function<void()> comp
         if (!perUser || !perUser->existsUserBaseDirectory()) return;
         std::string userTransient = perUser->transientDirectory();
         VSAErrorRef userError;
-        if (!deathRow._moveItemAtURLToDeathRow(userTransient, true, false, &userError))
+        if (!deathRow._moveItemAtURLToDeathRow(userTransient, {}, &userError))
           VSALogIn(VSALogCategory::Startup, kVSALogError, "rebootKeeperCleanupWithCompletion",
                    "Failed to delete per-user transient URL %@ : %@", userTransient, userError);
       });
@@ -252,7 +252,7 @@ void VSABootKeeper::keeperCleanupWithCompletion(std::function<void()> completion
       [deathRow, staged = std::move(staged), token, completion = std::move(completion)] {
         for (const auto& item : staged) {
           VSAErrorRef error;
-          if (!deathRow->_moveItemAtURLToDeathRow(item, true, false, &error))
+          if (!deathRow->_moveItemAtURLToDeathRow(item, {}, &error))
             VSALog(kVSALogError, "keeperCleanupWithCompletion", "%@", error);
         }
         deathRow->deleteContainersOnDeathRowWithCompletion(

@@ -31,7 +31,7 @@ VSAMetadataRef VSACommandStageForDelete::find(const VSAContainerIdentity& identi
   auto& cache = *environment_->cache;
   // A plain identity names the live container of its identifier.
   if (!identity.isConcrete())
-    return cache.containerForContainerIdentity(identity, false, true, false, nullptr);
+    return cache.containerForContainerIdentity(identity, {.updateSandbox = true}, nullptr);
   // A concrete identity names one directory, which may be a transient
   // container (deleting one names it by its UUID); its permanent twin of the
   // same identifier, if any, must not be taken for it.
@@ -39,7 +39,7 @@ VSAMetadataRef VSACommandStageForDelete::find(const VSAContainerIdentity& identi
   VSAMetadataRef live = cache.containerForContainerIdentity(identity);
   if (live && live->uuid() == uuid) return live;
   VSAMetadataRef transient =
-      cache.containerForContainerIdentity(identity, true, false, false, nullptr);
+      cache.containerForContainerIdentity(identity, {.transient = true}, nullptr);
   if (transient && transient->uuid() == uuid) return transient;
   return live;
 }
@@ -56,8 +56,7 @@ bool VSACommandStageForDelete::hasPermanentTwin(const VSAMetadata& container) co
     return false;
   }
   VSAErrorRef error;
-  if (!environment_->cache->containerForContainerIdentity(*permanentIdentity, false, false, false,
-                                                          &error))
+  if (!environment_->cache->containerForContainerIdentity(*permanentIdentity, {}, &error))
     return false;
   VSALog(kVSALogNotice, "fromQueue",
          "Skipping removal of code sign mapping since container to be deleted [%@] is transient "

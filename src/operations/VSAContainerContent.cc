@@ -36,7 +36,7 @@ bool sameVersion(const struct stat& a, const struct stat& b) {
 VSAMetadataRef VSAContainerContent::find(const VSAContainerIdentityRef& identity,
                                          VSAResultCode* withError) {
   return VSAContainerLookup(services_, grants_)
-      .createOrLookupContainerWithContainerIdentity(identity, false, false, true, withError);
+      .createOrLookupContainerWithContainerIdentity(identity, {}, withError);
 }
 
 VSAMetadataRef VSAContainerContent::recheck(const VSAMetadata& found, VSAResultCode* withError) {
@@ -83,8 +83,8 @@ bool VSAContainerContent::recordAssetsDirectory(VSAMetadata& container, VSAResul
     VSASetCode(withError, codeOf(error, VSAResult::kWriteFailed));
     return false;
   }
-  if (!services_.containerCache->addContainerMetadata(*fresh, fresh->url(), fresh->transient(),
-                                                      true, &error))
+  if (!services_.containerCache->addContainerMetadata(
+          *fresh, fresh->url(), {.transient = fresh->transient(), .updateSandbox = true}, &error))
     return fail("recordAssetsDirectory", VSAResult::kCacheAddFailed, withError,
                 VSAFormat("Failed to add to cache: %@", *fresh));
   return true;
@@ -153,7 +153,7 @@ bool VSAContainerContent::deleteUserManagedAssetWithContainerIdentity(
                 VSAFormat("Asset %@ cannot be reached: %s", VSAClientStringForLog(relativePath),
                           std::strerror(rc)));
   VSAErrorRef error;
-  if (!services_.deathRow->_moveItemAtURLToDeathRow(*asset, S_ISDIR(st.st_mode), true, &error))
+  if (!services_.deathRow->_moveItemAtURLToDeathRow(*asset, {.startDeletionThread = true}, &error))
     return fail(origin, codeOf(error, VSAResult::kDeathRowMoveFailed), withError,
                 VSAFormat("Failed to move asset %@ to death row: %@", *asset, error));
   VSALog(kVSALogNotice, origin, "Deleted user-managed asset %@", *asset);
@@ -260,8 +260,7 @@ bool VSAContainerContent::copyIntoPlace(const VSAMetadata& data, const std::stri
     return discard(codeOf(error, VSAResult::kWriteFailed),
                    VSAFormat("Failed to exchange %@ and %@: %@", staging, destination, error));
   // The old content is in staging now: death row takes it, or the next cleanup does.
-  if (!services_.deathRow->_moveItemAtURLToDeathRow(staging, S_ISDIR(existing.st_mode), true,
-                                                    &error))
+  if (!services_.deathRow->_moveItemAtURLToDeathRow(staging, {.startDeletionThread = true}, &error))
     VSALog(kVSALogError, origin, "Failed to move replaced %@ to death row: %@", staging, error);
   return true;
 }

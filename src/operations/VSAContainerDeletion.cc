@@ -9,7 +9,7 @@ void VSAContainerDeletion::deleteContainerWithContainerIdentity(
   VSAResultCode code = VSAResult::kSuccess;
   VSAMetadataRef found =
       VSAContainerLookup(services_, grants_)
-          .createOrLookupContainerWithContainerIdentity(identity, false, transient, true, &code);
+          .createOrLookupContainerWithContainerIdentity(identity, {.transient = transient}, &code);
   if (!found) {
     VSALog(kVSALogError, __func__,
            "Failed to lookup existing container to delete-identity: %@, transient: %d",

@@ -122,7 +122,8 @@ struct CreateSteps {
   // is not there (its mkdir failed) is no failure.
   void discard(const std::string& directory, VSAErrorRef* error) {
     VSAErrorRef cleanup;
-    if (!services.deathRow->_moveItemAtURLToDeathRow(directory, true, true, &cleanup))
+    if (!services.deathRow->_moveItemAtURLToDeathRow(directory, {.startDeletionThread = true},
+                                                     &cleanup))
       *error = failure(VSAResult::kStagingRemovalFailed, *error,
                        VSAFormat("Failed to remove staging dir: %@", directory));
   }
@@ -160,8 +161,8 @@ struct CreateSteps {
     metadata->setUrl(live);
     metadata->setExisted(false);
     metadata->setTransient(transient);
-    if (!services.containerCache->addContainerMetadata(*metadata, live, transient, true,
-                                                       &underlying)) {
+    if (!services.containerCache->addContainerMetadata(
+            *metadata, live, {.transient = transient, .updateSandbox = true}, &underlying)) {
       *error = failure(VSAResult::kCacheAddFailed, underlying,
                        VSAFormat("Failed to add to cache : %@, url: %@, transient: %d", *metadata,
                                  live, transient));
@@ -176,8 +177,8 @@ struct CreateSteps {
 }  // namespace
 
 VSAMetadataRef VSAContainerLookup::createOrLookupContainerWithContainerIdentity(
-    const VSAContainerIdentityRef& identity, bool createIfNecessary, bool transient,
-    bool useLocking, VSAResultCode* withError) {
+    const VSAContainerIdentityRef& identity, VSALookupOptions options, VSAResultCode* withError) {
+  const bool createIfNecessary = options.createIfNecessary, transient = options.transient;
   // The identity's description is built only when the line is kept (every look-up passes here).
   if (VSALogger::enabled(kVSALogDebug))
     VSALog(kVSALogDebug, kOrigin,
@@ -193,12 +194,12 @@ VSAMetadataRef VSAContainerLookup::createOrLookupContainerWithContainerIdentity(
   CreateSteps steps{services_, grants_, *identity, transient};
   VSAErrorRef error = steps.checkAccess();
   VSAMetadataRef found;
-  GlobalLock lock(*services_.locks, useLocking);
+  GlobalLock lock(*services_.locks, options.useLocking);
   try {
     if (!error && !transient) {
       lock.acquire(false);
       found = services_.containerCache->containerForContainerIdentity(
-          *identity, false, true, !grants_.clientIsKernel, &error);
+          *identity, {.updateSandbox = true, .allowKernelLookup = !grants_.clientIsKernel}, &error);
       if (found) found->setExisted(true);
       if (isNotFound(error)) error = nullptr;
       lock.release();
@@ -210,15 +211,19 @@ VSAMetadataRef VSAContainerLookup::createOrLookupContainerWithContainerIdentity(
     if (!found && !error) {
       lock.acquire(true);
       found = services_.containerCache->containerForContainerIdentity(
-          *identity, transient, true, !grants_.clientIsKernel, &error);
+          *identity,
+          {.transient = transient,
+           .updateSandbox = true,
+           .allowKernelLookup = !grants_.clientIsKernel},
+          &error);
       if (isNotFound(error)) error = nullptr;
       if (found && !transient) {
         found->setExisted(true);
       } else if (!error) {
         // A transient container is always made fresh.
         VSAErrorRef moveError;
-        if (found &&
-            !services_.deathRow->_moveItemAtURLToDeathRow(found->url(), true, true, &moveError)) {
+        if (found && !services_.deathRow->_moveItemAtURLToDeathRow(
+                         found->url(), {.startDeletionThread = true}, &moveError)) {
           error = failure(VSAResult::kTransientRemovalFailed, moveError,
                           VSAFormat("Failed to remove transient container at %@", found->url()));
         } else {
@@ -248,8 +253,8 @@ std::optional<std::vector<VSAConstMetadataRef>> VSAContainerLookup::containersWi
   if (!user) user = services_.userIdentityCache->defaultUserIdentity();
   VSAAllIdentifiersLockGuard lock(*services_.locks, false);
   VSAErrorRef error;
-  auto all = services_.containerCache->allContainersForUserIdentity(user, containerClass, transient,
-                                                                    false, &error);
+  auto all = services_.containerCache->allContainersForUserIdentity(
+      user, containerClass, {.transient = transient}, &error);
   if (!all) {
     VSALog(kVSALogError, __func__, "Failed to list containers of class %llu: %@",
            static_cast<unsigned long long>(containerClass), error);
@@ -270,8 +275,7 @@ std::optional<std::vector<VSAConstMetadataRef>> VSAContainerLookup::containersWi
 
 VSAMetadataRef VSAContainerLookup::metadataWithContainerIdentity(
     const VSAContainerIdentityRef& identity, VSAResultCode* withError) {
-  VSAMetadataRef found =
-      createOrLookupContainerWithContainerIdentity(identity, false, false, true, withError);
+  VSAMetadataRef found = createOrLookupContainerWithContainerIdentity(identity, {}, withError);
   if (!found) return nullptr;
   // Re-read under the identifier lock so that a concurrent info change is seen whole.
   VSAIdentifierLockGuard lock(*services_.locks, VSAValue(found->uuid().string()), false);
@@ -293,7 +297,7 @@ VSAMetadataRef VSAContainerLookup::containerForIdentity(VSAContainerCache& cache
                             ? &static_cast<const VSAConcreteContainerIdentity&>(identity).uuid()
                             : nullptr;
   for (bool transient : {false, true}) {
-    auto m = cache.containerForContainerIdentity(identity, transient, false, false, nullptr);
+    auto m = cache.containerForContainerIdentity(identity, {.transient = transient}, nullptr);
     if (m && (!uuid || m->uuid() == *uuid)) {
       m->setTransient(transient);
       return m;
@@ -305,8 +309,7 @@ VSAMetadataRef VSAContainerLookup::containerForIdentity(VSAContainerCache& cache
 
 std::optional<uint64_t> VSAContainerLookup::diskUsageWithContainerIdentity(
     const VSAContainerIdentityRef& identity, VSAResultCode* withError) {
-  VSAMetadataRef found =
-      createOrLookupContainerWithContainerIdentity(identity, false, false, true, withError);
+  VSAMetadataRef found = createOrLookupContainerWithContainerIdentity(identity, {}, withError);
   if (!found) return std::nullopt;
   // The container keeps its place while it is measured.
   VSAIdentifierLockGuard lock(*services_.locks, VSAValue(found->uuid().string()), false);

@@ -15,6 +15,14 @@
 #include "operations/VSAOperationGrants.h"
 #include "operations/VSAOperationServices.h"
 
+// What a create-or-lookup call may do. Call sites name what they set
+// ({.createIfNecessary = true}); what is not named keeps its default.
+struct VSALookupOptions {
+  bool createIfNecessary = false;  // make the container when it does not exist
+  bool transient = false;          // a transient container (always made fresh)
+  bool useLocking = true;          // false: the caller holds the all-identifiers lock
+};
+
 class VSAContainerLookup {
  public:
   VSAContainerLookup(const VSAOperationServices& services, const VSAOperationGrants& grants)
@@ -24,13 +32,11 @@ class VSAContainerLookup {
   // `createIfNecessary`. A transient container is always made fresh. Takes
   // the all-identifiers lock unless `useLocking` is false.
   VSAMetadataRef createOrLookupContainerWithContainerIdentity(
-      const VSAContainerIdentityRef& identity, bool createIfNecessary, bool transient,
-      bool useLocking, VSAResultCode* withError);
+      const VSAContainerIdentityRef& identity, VSALookupOptions options, VSAResultCode* withError);
   // The client's containers of one class (its own user identity), filtered
   // to what its grants let it see.
-  std::optional<std::vector<VSAConstMetadataRef>> containersWithClass(VSAContainerClass containerClass,
-                                                                 bool transient,
-                                                                 VSAResultCode* withError);
+  std::optional<std::vector<VSAConstMetadataRef>> containersWithClass(
+      VSAContainerClass containerClass, bool transient, VSAResultCode* withError);
   // A live container's metadata, re-read under its identifier read lock.
   VSAMetadataRef metadataWithContainerIdentity(const VSAContainerIdentityRef& identity,
                                                VSAResultCode* withError);

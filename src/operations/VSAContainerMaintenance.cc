@@ -109,7 +109,8 @@ bool VSAContainerMaintenance::regenerateDirectoryUUIDWithContainerIdentity(
       return fail(origin, VSAResult::kMoveToNewUUIDFailed, withError,
                   VSAFormat("Failed to move dir: %@ to new UUID dir: %@", m->url(), moved));
     m->setUrl(moved);
-    if (!services_.containerCache->addContainerMetadata(*m, moved, m->transient(), true, &error))
+    if (!services_.containerCache->addContainerMetadata(
+            *m, moved, {.transient = m->transient(), .updateSandbox = true}, &error))
       return fail(origin, VSAResult::kCacheAddFailed, withError,
                   VSAFormat("Failed to add to cache: %@, url: %@, transient: %d", *m, moved,
                             m->transient()));
@@ -192,7 +193,8 @@ bool VSAContainerMaintenance::setInfoValue(const VSAValue* value, const VSAValue
                  error ? error->resultCode(VSAResult::kWriteFailed) : VSAResult::kWriteFailed);
       return false;
     }
-    if (!services_.containerCache->addContainerMetadata(*m, m->url(), m->transient(), true, &error))
+    if (!services_.containerCache->addContainerMetadata(
+            *m, m->url(), {.transient = m->transient(), .updateSandbox = true}, &error))
       return fail(origin, VSAResult::kCacheAddFailed, withError,
                   VSAFormat("Failed to add to cache: %@, url: %@, transient: %d", *m, m->url(),
                             m->transient()));

@@ -41,13 +41,12 @@ void VSAContentWipe::deleteDataContainerContentWithContainerIdentity(
   grants_.allowOtherIdLookup = true;
   VSAContainerLookup lookup(services_, grants_);
   VSAResultCode code = VSAResult::kSuccess;
-  auto existing =
-      lookup.createOrLookupContainerWithContainerIdentity(identity, false, false, true, &code);
+  auto existing = lookup.createOrLookupContainerWithContainerIdentity(identity, {}, &code);
   if (!existing)
     return refuse(code,
                   VSAFormat("Failed to lookup existing container to wipe-identifier: %@", id));
-  auto fresh =
-      lookup.createOrLookupContainerWithContainerIdentity(identity, true, true, true, &code);
+  auto fresh = lookup.createOrLookupContainerWithContainerIdentity(
+      identity, {.createIfNecessary = true, .transient = true}, &code);
   if (!fresh)
     return refuse(code,
                   VSAFormat("Failed to create transient container for wipe-identifier: %@", id));

@@ -26,13 +26,12 @@ VSADeathRow::VSADeathRow(std::shared_ptr<VSAGlobalConfiguration> configuration,
       transactions_(std::move(transactions)),
       backgroundQueue_(std::move(backgroundQueue)) {}
 
-bool VSADeathRow::_moveItemAtURLToDeathRow(const std::string& url, bool isDir,
-                                           bool startDeletionThread, VSAErrorRef* error,
-                                           bool durable) {
+bool VSADeathRow::_moveItemAtURLToDeathRow(const std::string& url, VSADeathRowMoveOptions options,
+                                           VSAErrorRef* error) {
+  const bool startDeletionThread = options.startDeletionThread, durable = options.durable;
   const char* fn = "_moveItemAtURLToDeathRow";
   VSAFileManager& fm = configuration_->fileManager();
   std::string deathrow = configuration_->deathrowDirectory();
-  (void)isDir;  // a directory and a file move alike here
   std::string destination;
   for (int attempt = 1;; ++attempt) {
     VSAErrorRef underlying;
@@ -89,7 +88,7 @@ bool VSADeathRow::_moveEntriesToDeathRowWithoutSync(const std::vector<std::strin
       // (and the ones after it) take fresh directories of their own.
       if (isMissing(moveError)) {
         VSAErrorRef single;
-        if (!_moveItemAtURLToDeathRow(url, true, false, &single, false)) all = false;
+        if (!_moveItemAtURLToDeathRow(url, {.durable = false}, &single)) all = false;
         continue;
       }
       VSALog(kVSALogError, fn, "Failed to move item at: %@ to: %@: %@", url, destination,

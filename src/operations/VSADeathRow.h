@@ -22,6 +22,15 @@
 #include "model/VSAGlobalConfiguration.h"
 #include "platform/VSATransactions.h"
 
+// How an item moves to death row ({.startDeletionThread = true}).
+struct VSADeathRowMoveOptions {
+  // Start emptying death row once the item is there.
+  bool startDeletionThread = false;
+  // false leaves the rename unsynced: for items whose move is redone if a
+  // crash undoes it (orphans found at boot).
+  bool durable = true;
+};
+
 class VSADeathRow : public std::enable_shared_from_this<VSADeathRow> {
  public:
   using Completion = std::function<void(VSAResultCode)>;
@@ -33,10 +42,8 @@ class VSADeathRow : public std::enable_shared_from_this<VSADeathRow> {
   const VSAWorkQueue::Ref& _sharedBackgroundQueue() const { return backgroundQueue_; }
 
   // A missing item is success and starts nothing; other failures are 41.
-  // `durable` false leaves the rename unsynced: for items whose move is
-  // redone if a crash undoes it (orphans found at boot).
-  bool _moveItemAtURLToDeathRow(const std::string& url, bool isDir, bool startDeletionThread,
-                                VSAErrorRef* error, bool durable = true);
+  bool _moveItemAtURLToDeathRow(const std::string& url, VSADeathRowMoveOptions options,
+                                VSAErrorRef* error);
   // Moves the entries of one directory (so their names differ) into one
   // fresh directory, without syncs: for orphans found at boot, whose moves
   // are redone if a crash undoes them. Each failure is logged and the others

@@ -54,7 +54,7 @@ VSAGroupContainerLookup::groupContainersForOwnerIdentifier(const std::string& ow
     auto identity = VSAContainerIdentity::containerIdentityWithUserIdentity(userIdentity, id,
                                                                             groupClass, &code);
     VSAMetadataRef m = identity ? lookup.createOrLookupContainerWithContainerIdentity(
-                                      identity, true, false, true, &code)
+                                      identity, {.createIfNecessary = true}, &code)
                                 : nullptr;
     if (!m) {
       VSALog(kVSALogError, kOrigin, "Failed to look up group container %@ of %@: %llu", id, owner,

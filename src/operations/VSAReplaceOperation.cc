@@ -81,8 +81,7 @@ struct ReplaceRun {
     if (resultTransient) return true;
     // The new container's own entry and the old one's are given up by the
     // exchange; any other holder of the identifier would be a twin.
-    auto holder = services.containerCache->containerForContainerIdentity(newIdentity, false, false,
-                                                                         false, nullptr);
+    auto holder = services.containerCache->containerForContainerIdentity(newIdentity, {}, nullptr);
     if (holder && holder->url() != newContainer->url() && holder->url() != oldContainer->url())
       return fail(VSAResult::kAlreadyExists,
                   VSAFormat("Container with identifier: %@, class: %ld, transient: %d already "
@@ -164,7 +163,8 @@ struct ReplaceRun {
     result.setUuid(preserveOldUUID ? oldContainer->uuid() : *uuidOf(newIdentity));
     result.setUrl(destURL);
     result.setTransient(resultTransient);
-    if (!cache.addContainerMetadata(result, destURL, resultTransient, true, nullptr))
+    if (!cache.addContainerMetadata(result, destURL,
+                                    {.transient = resultTransient, .updateSandbox = true}, nullptr))
       return fail(VSAResult::kCacheAddFailed,
                   VSAFormat("Failed to add to cache: %@, url: %@, transient: %d", result, destURL,
                             resultTransient));
@@ -182,8 +182,9 @@ struct ReplaceRun {
       return;
     }
     movedAside = false;
-    if (!services.containerCache->addContainerMetadata(*oldContainer, oldContainer->url(),
-                                                       oldContainer->transient(), true, &error))
+    if (!services.containerCache->addContainerMetadata(
+            *oldContainer, oldContainer->url(),
+            {.transient = oldContainer->transient(), .updateSandbox = true}, &error))
       VSALog(kVSALogError, kOrigin, "Failed to add to cache: %@, url: %@, transient: %d",
              *oldContainer, oldContainer->url(), oldContainer->transient());
   }
@@ -199,9 +200,10 @@ struct ReplaceRun {
     auto& deathRow = *services.deathRow;
     VSAErrorRef error;
     if (!stagingURL.empty() &&
-        !deathRow._moveItemAtURLToDeathRow(stagingURL, true, startDeletionThread, &error))
+        !deathRow._moveItemAtURLToDeathRow(stagingURL, {.startDeletionThread = startDeletionThread},
+                                           &error))
       fail(VSAResult::kRemoveFailed, VSAFormat("Failed to remove staging dir: %@", stagingURL));
-    if (!replaceURL.empty() && !deathRow._moveItemAtURLToDeathRow(replaceURL, false, false, &error))
+    if (!replaceURL.empty() && !deathRow._moveItemAtURLToDeathRow(replaceURL, {}, &error))
       fail(VSAResult::kRemoveFailed, VSAFormat("Failed to remove replace file: %@", replaceURL));
   }
 
@@ -317,7 +319,7 @@ bool VSAReplaceOperation::_recoverFromReplaceOperationsWithError(VSAErrorRef* er
       }
     }
     VSAErrorRef removeError;
-    if (!services_.deathRow->_moveItemAtURLToDeathRow(item.path, false, false, &removeError)) {
+    if (!services_.deathRow->_moveItemAtURLToDeathRow(item.path, {}, &removeError)) {
       auto e = VSA_ERROR_UNDERLYING(VSAResult::kRemoveFailed, removeError,
                                     "Failed to remove replace file at %@", item.path);
       VSALog(kVSALogError, fn, "%@", e->message());

@@ -168,7 +168,8 @@ void VSASystemContainerRestore::_moveSystemContainerIntoPlace(const std::string&
     return;
   }
   auto live = VSAContainerLookup(services_, grants_)
-                  .createOrLookupContainerWithContainerIdentity(identity, true, false, true, &code);
+                  .createOrLookupContainerWithContainerIdentity(identity,
+                                                                {.createIfNecessary = true}, &code);
   if (!live) {
     logRestore(kVSALogError, origin, "Failed to create system container %@: %llu", identifier,
                code);

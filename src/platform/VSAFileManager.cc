@@ -246,7 +246,7 @@ int VSAFileManager::makePath(const std::string& path, mode_t mode, bool* created
 
 bool VSAFileManager::moveItemAtURL(const std::string& from, const std::string& to, VSAErrorRef* e,
                                    bool durable) {
-  return moveItem(from, to, true, e, durable);
+  return moveItem(from, to, {.durable = durable}, e);
 }
 bool VSAFileManager::exchangeItemsAtURL(const std::string& a, const std::string& b,
                                         VSAErrorRef* error) {
@@ -278,7 +278,7 @@ void VSAFileManager::printDirectoryStructureAtURL(const std::string& path) {
 
 bool VSAFileManager::moveItemIfExistsAtURL(const std::string& from, const std::string& to,
                                            VSAErrorRef* e) {
-  return moveItem(from, to, false, e);
+  return moveItem(from, to, {.failIfSourceMissing = false}, e);
 }
 bool VSAFileManager::writeFileAtomicallyAtURL(const std::string& path,
                                               const std::vector<uint8_t>& bytes, mode_t mode,
@@ -326,13 +326,13 @@ bool VSAFileManager::checkSource(const std::string& from, const char* fn, bool* 
   return false;
 }
 
-bool VSAFileManager::moveItem(const std::string& from, const std::string& to, bool failIfSrcMissing,
-                              VSAErrorRef* error, bool durable) {
+bool VSAFileManager::moveItem(const std::string& from, const std::string& to, MoveOptions options,
+                              VSAErrorRef* error) {
   const char* fn = "moveItemAtURL";
   bool missing = false;
-  if (!failIfSrcMissing && !checkSource(from, fn, &missing, error)) return false;
+  if (!options.failIfSourceMissing && !checkSource(from, fn, &missing, error)) return false;
   if (missing) return true;
-  int rc = durable ? fs_->rename(from, to) : fs_->renameWithoutSync(from, to);
+  int rc = options.durable ? fs_->rename(from, to) : fs_->renameWithoutSync(from, to);
   if (rc == 0) return true;
   if (rc == EXDEV) {
     if (!copyItem(from, to, true, error)) return false;

@@ -151,8 +151,12 @@ class VSAFileManager {
 
  private:
   bool checkSource(const std::string& from, const char* fn, bool* missing, VSAErrorRef* error);
-  bool moveItem(const std::string& from, const std::string& to, bool failIfSrcMissing,
-                VSAErrorRef* error, bool durable = true);
+  struct MoveOptions {
+    bool failIfSourceMissing = true;  // false: a missing source is success
+    bool durable = true;              // false: the rename is not synced
+  };
+  bool moveItem(const std::string& from, const std::string& to, MoveOptions options,
+                VSAErrorRef* error);
   bool copyItem(const std::string& from, const std::string& to, bool failIfSrcMissing,
                 VSAErrorRef* error);
   int copyTree(int fromDir, const std::string& fromName, const std::string& fromPath, int toDir,

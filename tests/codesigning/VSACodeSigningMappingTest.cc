@@ -85,7 +85,7 @@ class Mapping : public ::testing::Test {
         VSAConcreteContainerIdentity::containerIdentityWithUUID(uuid, personal_, id, c, nullptr);
     VSAMetadata m(identity, std::nullopt, dir, std::nullopt);
     EXPECT_TRUE(m.writeMetadataToDiskWithError(*config_, nullptr));
-    EXPECT_TRUE(containers_->addContainerMetadata(m, dir, false, false, nullptr));
+    EXPECT_TRUE(containers_->addContainerMetadata(m, dir, {}, nullptr));
     return dir;
   }
 
@@ -174,7 +174,7 @@ TEST_F(Mapping, QueuedDeletionsStageTheContainersOnDeathRow) {
   VSAErrorRef error;
   auto gone = VSAContainerIdentity::containerIdentityWithUserIdentity(personal_, "group.shared", 7,
                                                                       nullptr);
-  EXPECT_FALSE(containers_->containerForContainerIdentity(*gone, false, false, false, &error));
+  EXPECT_FALSE(containers_->containerForContainerIdentity(*gone, {}, &error));
   EXPECT_EQ(error->resultCode(0), 21u);
 }
 

@@ -54,8 +54,8 @@ class Groups : public VSAContainerTestRoot {
                        VSAContainerClass c = 7) {
     VSAResultCode code = VSAResult::kSuccess;
     auto identity = VSAContainerIdentity::containerIdentityWithUserIdentity(user, id, c, &code);
-    return installer()->createOrLookupContainerWithContainerIdentity(identity, true, false, true,
-                                                                     &code);
+    return installer()->createOrLookupContainerWithContainerIdentity(
+        identity, {.createIfNecessary = true}, &code);
   }
   static VSAResultCode run(VSACommandQueue& q) {
     VSAResultCode code = VSAResult::kSuccess;

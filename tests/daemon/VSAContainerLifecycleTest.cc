@@ -47,10 +47,10 @@ TEST_F(Lifecycle, CreatesInPlaceWithMetadataAndSubdirectoriesThenFindsIt) {
   EXPECT_EQ(found->url(), created->url());
   EXPECT_EQ(found->uuid(), created->uuid());
   // Looking up without creation finds it too; a missing one is 21 and leaves nothing.
-  EXPECT_TRUE(c->createOrLookupContainerWithContainerIdentity(identity("com.example.app"), false,
-                                                              false, true, &code));
-  EXPECT_FALSE(c->createOrLookupContainerWithContainerIdentity(identity("com.example.none"), false,
-                                                               false, true, &code));
+  EXPECT_TRUE(
+      c->createOrLookupContainerWithContainerIdentity(identity("com.example.app"), {}, &code));
+  EXPECT_FALSE(
+      c->createOrLookupContainerWithContainerIdentity(identity("com.example.none"), {}, &code));
   EXPECT_EQ(code, VSAResult::kContainerNotFound);
   EXPECT_EQ(entries(classDirectory()), 1u);
 }
@@ -133,8 +133,8 @@ TEST_F(Lifecycle, AccessTestsComeBeforeAnyLookup) {
   EXPECT_EQ(code, VSAResult::kNotEntitled);
   auto existing = create(*installer(), "com.example.other", &code);
   ASSERT_TRUE(existing);
-  EXPECT_FALSE(self->createOrLookupContainerWithContainerIdentity(identity("com.example.other"),
-                                                                  false, false, true, &code));
+  EXPECT_FALSE(
+      self->createOrLookupContainerWithContainerIdentity(identity("com.example.other"), {}, &code));
   EXPECT_EQ(code, VSAResult::kNotEntitled);  // the same answer whether it exists or not
   // The lookup entitlement lists identifiers per class.
   VSAValue lookup = VSAValue::dictionary();
@@ -142,7 +142,7 @@ TEST_F(Lifecycle, AccessTestsComeBeforeAnyLookup) {
   lookup.set("plugin", VSAValue("not an array"));
   auto looker = connection("com.example.looker", false, false, lookup);
   EXPECT_TRUE(looker->createOrLookupContainerWithContainerIdentity(identity("com.example.other"),
-                                                                   false, false, true, &code));
+                                                                   {}, &code));
   EXPECT_TRUE(looker->isEntitledForLookupWithClass(2, "com.example.other"));
   EXPECT_FALSE(looker->isEntitledForLookupWithClass(3, "com.example.other"));
   EXPECT_EQ(looker->_lookupForContainerClass(3)->size(), 0u);
@@ -151,7 +151,7 @@ TEST_F(Lifecycle, AccessTestsComeBeforeAnyLookup) {
   auto whitelisted = connection("com.tamsk.mail.composer", false, false);
   ASSERT_TRUE(create(*installer(), "com.tamsk.mail", &code));
   EXPECT_TRUE(whitelisted->createOrLookupContainerWithContainerIdentity(identity("com.tamsk.mail"),
-                                                                        false, false, true, &code));
+                                                                        {}, &code));
   EXPECT_EQ(entries(classDirectory()), 3u);
 }
 
@@ -199,8 +199,7 @@ void Lifecycle::sweepCreation(VSAContainerClass cls) {
         ++survived;
         std::printf("  survived: %s\n", id.c_str());
         EXPECT_EQ(shapeOf(m->url()), shape);
-        auto found = c->createOrLookupContainerWithContainerIdentity(identity(id, cls), false,
-                                                                     false, true, &code);
+        auto found = c->createOrLookupContainerWithContainerIdentity(identity(id, cls), {}, &code);
         ASSERT_TRUE(found) << code;
         EXPECT_EQ(found->url(), m->url());
         EXPECT_EQ(found->uuid(), m->uuid());
@@ -251,8 +250,8 @@ TEST_F(Lifecycle, DeletionStagesOnRequestCompletionAndDeathRowEmpties) {
   EXPECT_FALSE(fs::exists(m->url()));
   std::string deathrow = context_->globalConfiguration->deathrowDirectory();
   EXPECT_EQ(entries(deathrow), 1u);
-  EXPECT_FALSE(c->createOrLookupContainerWithContainerIdentity(identity("com.example.doomed"),
-                                                               false, false, true, &code));
+  EXPECT_FALSE(
+      c->createOrLookupContainerWithContainerIdentity(identity("com.example.doomed"), {}, &code));
   EXPECT_EQ(code, VSAResult::kContainerNotFound);
   EXPECT_EQ(emptyDeathRow(), VSAResult::kSuccess);
   EXPECT_EQ(entries(deathrow), 0u);
@@ -291,7 +290,7 @@ TEST_F(Lifecycle, ATransientBundleWithAPermanentTwinKeepsTheCodeSigningRecords) 
   EXPECT_TRUE(forgotten.empty());
   VSAErrorRef error;
   EXPECT_FALSE(context_->containerCache->containerForContainerIdentity(
-      *identity("com.example.twin", 1), true, false, false, &error));
+      *identity("com.example.twin", 1), {.transient = true}, &error));
   ASSERT_TRUE(error);
   EXPECT_EQ(error->code(), VSAResult::kContainerNotFound);  // dropped, not found stale (44)
   auto still =
@@ -307,7 +306,7 @@ TEST_F(Lifecycle, ATransientBundleWithAPermanentTwinKeepsTheCodeSigningRecords) 
   EXPECT_EQ(forgotten, std::vector<std::string>{"com.example.lonely"});
   error = nullptr;
   EXPECT_FALSE(context_->containerCache->containerForContainerIdentity(
-      *identity("com.example.lonely", 1), true, false, false, &error));
+      *identity("com.example.lonely", 1), {.transient = true}, &error));
   ASSERT_TRUE(error);
   EXPECT_EQ(error->code(), VSAResult::kContainerNotFound);
 
@@ -334,8 +333,8 @@ TEST_F(Lifecycle, AContainerThatCannotBeMovedToDeathRowIsRemovedInPlace) {
   faults_->reset();
   EXPECT_FALSE(fs::exists(m->url()));
   EXPECT_EQ(entries(deathrow), staged);  // removed where it was
-  EXPECT_FALSE(c->createOrLookupContainerWithContainerIdentity(identity("com.example.stuck"), false,
-                                                               false, true, &code));
+  EXPECT_FALSE(
+      c->createOrLookupContainerWithContainerIdentity(identity("com.example.stuck"), {}, &code));
   EXPECT_EQ(code, VSAResult::kContainerNotFound);
 }
 
@@ -423,7 +422,8 @@ TEST_F(Lifecycle, DeathRowEntriesThatKeepResistingRemovalEndInTmp) {
   EXPECT_EQ(entries(root_ + "/tmp"), 1u);
   // Moving something that is not there succeeds and starts nothing.
   VSAErrorRef error;
-  EXPECT_TRUE(context_->deathRow->_moveItemAtURLToDeathRow(root_ + "/nothing", true, true, &error));
+  EXPECT_TRUE(context_->deathRow->_moveItemAtURLToDeathRow(root_ + "/nothing",
+                                                           {.startDeletionThread = true}, &error));
   EXPECT_EQ(entries(deathrow), 0u);
 }
 

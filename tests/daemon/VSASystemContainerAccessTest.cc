@@ -53,8 +53,8 @@ class SystemContainerAccess : public ::testing::Test {
     auto identity = VSAContainerIdentity::containerIdentityWithIdentifier(
         "com.example.service", 12, *context_->userIdentityCache, &code);
     ASSERT_TRUE(identity);
-    auto m =
-        installer.createOrLookupContainerWithContainerIdentity(identity, true, false, true, &code);
+    auto m = installer.createOrLookupContainerWithContainerIdentity(
+        identity, {.createIfNecessary = true}, &code);
     ASSERT_TRUE(m) << code;
     container_ = m->url();
     // Only the test's own temporary directory stands in the way of others.

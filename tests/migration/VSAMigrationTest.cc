@@ -141,8 +141,8 @@ class Migration : public VSAContainerTestRoot {
     for (auto [id, c] : std::vector<std::pair<const char*, VSAContainerClass>>{
              {VSAOldDevice::kCached, 1}, {VSAOldDevice::kGrouped, 2}, {VSAOldDevice::kGroup, 7}}) {
       VSAResultCode code = VSAResult::kSuccess;
-      auto m = installer()->createOrLookupContainerWithContainerIdentity(identity(id, c), false,
-                                                                         false, true, &code);
+      auto m =
+          installer()->createOrLookupContainerWithContainerIdentity(identity(id, c), {}, &code);
       ASSERT_TRUE(m) << id;
       EXPECT_TRUE(fs::exists(m->url() + "/keep.txt")) << id;
     }
@@ -351,7 +351,7 @@ TEST_F(Migration, TheBuildUpgradeMovesLogsBundlesAndWellKnownSystemContainers) {
   EXPECT_TRUE(fs::is_directory(wellKnown->url()));
   EXPECT_FALSE(fs::exists(uuidPath));
   auto found = installer()->createOrLookupContainerWithContainerIdentity(
-      identity("systemgroup.com.tamsk.launcher", 13), false, false, true, &code);
+      identity("systemgroup.com.tamsk.launcher", 13), {}, &code);
   ASSERT_TRUE(found);
   EXPECT_EQ(found->url(), wellKnown->url());
   EXPECT_EQ(found->uuid(), wellKnown->uuid());
@@ -481,7 +481,7 @@ TEST_F(Migration, AnInterruptedBuildUpgradeEndsLikeAnUninterruptedOneWhenRunAgai
         EXPECT_TRUE(fs::is_directory(wellKnown->url()));
         EXPECT_FALSE(fs::exists(uuidPath));
         auto found = installer()->createOrLookupContainerWithContainerIdentity(
-            identity("systemgroup.com.tamsk.launcher", 13), false, false, true, &code);
+            identity("systemgroup.com.tamsk.launcher", 13), {}, &code);
         ASSERT_TRUE(found);
         EXPECT_EQ(found->uuid(), wellKnown->uuid());
       });

@@ -92,13 +92,13 @@ TEST_F(Cache, BuildsFromDiskSkippingBadNamesAndWrongClasses) {
       *VSA_dictionaryWithContentsOfURL(misplaced->url() + "/" + kVSAMetadataFileName, 0, nullptr);
   v.set("VSAMetadataContentClass", VSAValue(1u));
   VSA_writeToURL(v, misplaced->url() + "/" + kVSAMetadataFileName, 0, nullptr);
-  auto all = cache_->allContainersForUserIdentity(personal_, 2, false, false, nullptr);
+  auto all = cache_->allContainersForUserIdentity(personal_, 2, {}, nullptr);
   ASSERT_TRUE(all);
   ASSERT_EQ(all->size(), 1u);
   EXPECT_EQ((*all)[0]->identifier(), "com.app");
   // Well-known names count in Data/System only.
   onDisk(personal_, "com.wellknown", 12, "com.wellknown");
-  EXPECT_EQ(cache_->allContainersForUserIdentity(personal_, 12, false, false, nullptr)->size(), 1u);
+  EXPECT_EQ(cache_->allContainersForUserIdentity(personal_, 12, {}, nullptr)->size(), 1u);
   EXPECT_FALSE(
       VSAContainerCache::containerURLIsValidForContainerClass("/x/com.wellknown", 13, wellknown_));
 }
@@ -129,7 +129,7 @@ TEST_F(Cache, HostileMetadataFilesCostOnlyTheirOwnContainer) {
   fs::create_directory(file(dir));
 
   auto listing = std::async(std::launch::async, [&] {
-    return cache_->allContainersForUserIdentity(personal_, 2, false, false, nullptr);
+    return cache_->allContainersForUserIdentity(personal_, 2, {}, nullptr);
   });
   if (listing.wait_for(std::chrono::seconds(20)) != std::future_status::ready) {
     ADD_FAILURE() << "listing the class blocked on a FIFO";
@@ -165,7 +165,7 @@ TEST_F(Cache, HugeSparseMetadataFileIsRefusedByItsSize) {
   std::string path = sparse->url() + "/" + kVSAMetadataFileName;
   // 64 GiB of holes: reading it whole would exhaust memory at every start.
   ASSERT_EQ(::truncate(path.c_str(), off_t{64} << 30), 0);
-  auto all = cache_->allContainersForUserIdentity(personal_, 2, false, false, nullptr);
+  auto all = cache_->allContainersForUserIdentity(personal_, 2, {}, nullptr);
   ASSERT_TRUE(all);
   ASSERT_EQ(all->size(), 1u);
   EXPECT_EQ((*all)[0]->identifier(), "com.good");
@@ -180,19 +180,19 @@ TEST_F(Cache, VanishedMetadataIsReportedOnceThenNotFound) {
   auto m = onDisk(personal_, "com.app", 2);
   auto id = identity(personal_, "com.app", 2);
   VSAErrorRef error;
-  ASSERT_TRUE(cache_->containerForContainerIdentity(*id, false, false, false, &error));
+  ASSERT_TRUE(cache_->containerForContainerIdentity(*id, {}, &error));
   fs::remove(m->url() + "/" + kVSAMetadataFileName);
-  EXPECT_FALSE(cache_->containerForContainerIdentity(*id, false, false, false, &error));
+  EXPECT_FALSE(cache_->containerForContainerIdentity(*id, {}, &error));
   EXPECT_EQ(error->resultCode(0), 44u);
-  EXPECT_FALSE(cache_->containerForContainerIdentity(*id, false, false, false, &error));
+  EXPECT_FALSE(cache_->containerForContainerIdentity(*id, {}, &error));
   EXPECT_EQ(error->resultCode(0), 21u);
 }
 
 TEST_F(Cache, KernelLookupAvoidsBuildingTheClassMap) {
   auto m = onDisk(personal_, "com.app", 2);
   ASSERT_TRUE(cache_->setSandboxContainerMappingForUserIdentity(personal_, "com.app", 2, m->url()));
-  auto found = cache_->containerForContainerIdentity(*identity(personal_, "com.app", 2), false,
-                                                     false, true, nullptr);
+  auto found = cache_->containerForContainerIdentity(*identity(personal_, "com.app", 2),
+                                                     {.allowKernelLookup = true}, nullptr);
   ASSERT_TRUE(found);
   EXPECT_EQ(found->url(), m->url());
   EXPECT_FALSE(cache_->hasClassMap(personal_, 2, false));
@@ -211,9 +211,9 @@ TEST_F(Cache, SandboxMappingRules) {
 
 TEST_F(Cache, AddRemoveAndInvalidateAnEnterpriseIdentity) {
   auto m = onDisk(enterprise_, "com.work", 2);
-  ASSERT_TRUE(cache_->addContainerMetadata(*m, m->url(), false, true, nullptr));
+  ASSERT_TRUE(cache_->addContainerMetadata(*m, m->url(), {.updateSandbox = true}, nullptr));
   EXPECT_EQ(sandboxItems(501), 1);
-  ASSERT_TRUE(cache_->allContainersForUserIdentity(enterprise_, 7, true, false, nullptr));
+  ASSERT_TRUE(cache_->allContainersForUserIdentity(enterprise_, 7, {.transient = true}, nullptr));
   EXPECT_TRUE(cache_->hasClassMap(enterprise_, 2, false));
   EXPECT_TRUE(cache_->hasClassMap(enterprise_, 7, true));
   // The enterprise persona goes away: its maps and mappings go, one notification.
@@ -229,8 +229,8 @@ TEST_F(Cache, AddRemoveAndInvalidateAnEnterpriseIdentity) {
   ASSERT_TRUE(cache_->containerForContainerIdentity(*identity(personal_, "com.app", 2)));
   ASSERT_TRUE(cache_->removeContainerForUserIdentity(personal_, 2, "com.app", false, nullptr));
   VSAErrorRef error;
-  EXPECT_FALSE(cache_->containerForContainerIdentity(*identity(personal_, "com.app", 2), false,
-                                                     false, false, &error));
+  EXPECT_FALSE(
+      cache_->containerForContainerIdentity(*identity(personal_, "com.app", 2), {}, &error));
   EXPECT_EQ(error->resultCode(0), 21u) << "the map is not rebuilt from disk once built";
 }
 

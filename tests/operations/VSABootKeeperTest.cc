@@ -80,7 +80,7 @@ TEST_F(Boot, BackedUpSystemContainersReplaceLiveItemsAndTheBackupGoes) {
   ASSERT_TRUE(metadata) << error;
   EXPECT_EQ(metadata->uuid(), live->uuid());
   auto fresh = installer()->createOrLookupContainerWithContainerIdentity(
-      identity("com.example.fresh", 12), false, false, true, &code);
+      identity("com.example.fresh", 12), {}, &code);
   ASSERT_TRUE(fresh);
   EXPECT_EQ(read(fresh->url() + "/Library/prefs"), "fresh");
   EXPECT_TRUE(logged("Installing system containers"));
@@ -322,8 +322,7 @@ TEST_F(Boot, AnUpgradeRenamesSystemContainersExceptWellKnownAndAnalytics) {
   installer()->rebootKeeperSetup();
   EXPECT_TRUE(logged("Rolling system container directory UUIDs on disk"));
   auto find = [&](const char* id, VSAContainerClass c) {
-    return installer()->createOrLookupContainerWithContainerIdentity(identity(id, c), false, false,
-                                                                     true, &code);
+    return installer()->createOrLookupContainerWithContainerIdentity(identity(id, c), {}, &code);
   };
   auto moved = find("com.example.sys", 12);
   ASSERT_TRUE(moved);

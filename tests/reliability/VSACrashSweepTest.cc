@@ -530,7 +530,7 @@ TEST_F(CrashSweep, AnItemStillReachesDeathRowWhenAnEmptyingTookItsDirectoryFirst
   faults_->reset();
   faults_->failNth(VSAFileSystem::Op::Rename, 1, ENOENT);  // the directory vanished
   VSAErrorRef error;
-  ASSERT_TRUE(context_->deathRow->_moveItemAtURLToDeathRow(m->url(), true, false, &error)) << error;
+  ASSERT_TRUE(context_->deathRow->_moveItemAtURLToDeathRow(m->url(), {}, &error)) << error;
   EXPECT_FALSE(fs::exists(m->url()));
   EXPECT_EQ(entries(context_->globalConfiguration->deathrowDirectory()), 1u);
   // The batch move of the boot's orphans does the same.

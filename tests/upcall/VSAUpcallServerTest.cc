@@ -123,7 +123,7 @@ TEST_F(Upcall, ClassesHomeAndTheContainerIdentifier) {
   p.containerID = "com.example.container";
   ASSERT_EQ(serve(p, &a), 0);
   auto named = installer()->createOrLookupContainerWithContainerIdentity(
-      identity("com.example.container"), false, false, true, nullptr);
+      identity("com.example.container"), {}, nullptr);
   ASSERT_TRUE(named);
   EXPECT_EQ(*a.dataContainer, named->url());
 }
