@@ -1,9 +1,10 @@
 // vessa-bench: a load generator for a running vessad.
 //
 // Every figure is printed beside a baseline measured in the same run:
-//  - the lookup mode first runs the same clients against an echo server built
-//    from the daemon's own listener, socket and framing, then against the
-//    daemon, and prints requests/s and p50/p99 latency as ratios;
+//  - the lookup mode runs the same clients against a floor, vessa-floor: a
+//    process of its own that sends every frame back as it came (the least
+//    work that could answer), then against the daemon, and prints
+//    requests/s and p50/p99 latency as ratios;
 //  - the create mode compares container creation through the daemon with a
 //    raw loop doing the same directory work (staging directory,
 //    sub-directories, metadata file with its fsync, rename) in the same root;
@@ -13,11 +14,14 @@
 //    and idle connections open, and before and after a soak of look-ups;
 //  - the upcall mode launches one app (data container and two group
 //    containers, made by the first launch) over the upcall's seqpacket
-//    socket, against an echo server on the daemon's own upcall transport
-//    that sends the same packet and a memfd of the same bytes back.
+//    socket, against vessa-floor sending the same packet and a memfd of
+//    the same bytes back.
 // The lookup, create and upcall modes run baseline and daemon in ten
 // alternating rounds and sum each side, so that both see the same drift in
-// the machine's latencies.
+// the machine's latencies. With --pin CPU the look-up and upcall modes run
+// with vessa-bench, the floor and every thread of the daemon on that one CPU
+// (the measure's name says "pinned"): the scheduler's cross-CPU wake-ups,
+// tens of microseconds on a VM, then no longer hide the work of a request.
 // The client must be registered in the root's client registry with the
 // "com.tamsk.private.Vessa.allowed" entitlement, and as the kernel bridge for
 // the upcall mode (scripts/vessa-bench.sh does both).
@@ -34,21 +38,19 @@
 #include <filesystem>
 #include <fstream>
 #include <functional>
+#include <optional>
 #include <string>
 #include <thread>
 #include <vector>
 
 #include "../bench/VSABenchTable.h"
+#include "VSABenchFloor.h"
+#include "VSABenchPin.h"
 #include "base/VSAPlist.h"
 #include "base/VSAUUID.h"
-#include "base/VSAWorkQueue.h"
-#include "platform/VSADescriptorPassing.h"
 #include "platform/VSAIPCClient.h"
-#include "platform/VSAIPCListener.h"
 #include "platform/VSALinuxFileSystem.h"
-#include "platform/VSATransactions.h"
 #include "platform/VSAUpcallClient.h"
-#include "platform/VSAUpcallListener.h"
 #include "upcall/VSAUpcallMessage.h"
 #include "upcall/VSAUpcallPayload.h"
 
@@ -62,6 +64,8 @@ struct Options {
   int requests = 10000;
   int containers = 10000;  // memory mode: containers made and cached
   int idle = 100;          // memory mode: connections left idle
+  int pin = -1;            // lookup and upcall: the CPU everything runs on (-1: none)
+  std::string floor;       // the vessa-floor program (default: beside vessa-bench)
 };
 
 struct Result {
@@ -168,27 +172,6 @@ Result runClients(const std::string& socket, const Options& o, const RequestMake
   });
 }
 
-// The daemon's listener, socket and framing, answering every request at once.
-Result runEcho(const Options& o, const RequestMaker& make) {
-  std::string dir = "/tmp/vessa-bench-echo-XXXXXX";
-  if (!mkdtemp(dir.data())) return {};
-  auto transactions = std::make_shared<VSATransactions>();
-  VSAIPCListener listener(dir + "/echo", VSAWorkQueue::create("vessa-bench.echo"), transactions);
-  VSAErrorRef error;
-  if (!listener.listen(&error)) return {};
-  listener.setHandler([](const VSAIPCMessageRef& m) {
-    auto reply = m->createReply();
-    if (!reply) return;
-    reply->set("ReplyError", VSAValue(1u));
-    m->sendReply(*reply);
-  });
-  listener.resume();
-  Result r = runClients(dir + "/echo", o, make, true);
-  listener.stop();
-  std::filesystem::remove_all(dir);
-  return r;
-}
-
 // Launches of one app over an upcall socket; `served` checks that every
 // reply is a served one with the success flag set.
 Result runUpcalls(const std::string& socket, const Options& o, bool served) {
@@ -230,25 +213,6 @@ Result runUpcalls(const std::string& socket, const Options& o, bool served) {
   });
 }
 
-// The daemon's upcall transport, sending every packet and its memory back.
-Result runUpcallEcho(const Options& o) {
-  std::string dir = "/tmp/vessa-bench-upcall-XXXXXX";
-  if (!mkdtemp(dir.data())) return {};
-  VSAUpcallListener echo(dir + "/echo", nullptr, 1u << 20);
-  VSAErrorRef error;
-  if (!echo.start(
-          [](VSAUpcallPacket packet, VSAUpcallListener::Reply reply) {
-            reply(packet.message,
-                  VSAUniqueFd(VSAMemfdWithBytes("vessa-bench-echo", packet.memory, true)));
-          },
-          &error))
-    return {};
-  Result r = runUpcalls(dir + "/echo", o, false);
-  echo.stop();
-  std::filesystem::remove_all(dir);
-  return r;
-}
-
 // Prints both runs and their ratios, and records the throughput ratio (and,
 // with several clients, the p99 latency ratio) for bench/run-all's table.
 void printPair(const char* what, const Result& base, const Result& daemon, const Options& o,
@@ -265,7 +229,7 @@ void printPair(const char* what, const Result& base, const Result& daemon, const
   std::printf("errors: %ld, lost replies: %ld (of %zu)\n", daemon.errors, daemon.lost,
               daemon.latenciesUs.size() + static_cast<size_t>(daemon.lost));
   std::string measure = std::string(what) + ", " + std::to_string(o.clients) +
-                        (o.clients == 1 ? " client" : " clients");
+                        (o.clients == 1 ? " client" : " clients") + (o.pin >= 0 ? ", pinned" : "");
   VSABenchRecord(measure.c_str(), baseline, daemon.perSecond() / base.perSecond(), target);
   if (o.clients > 1 && target > 0)  // p99 within 3x the baseline's
     VSABenchRecord((measure + ", p99").c_str(), baseline,
@@ -400,10 +364,15 @@ double rawMixedLoop(const std::string& root, const Options& o) {
 
 // The daemon's memory, in KiB: `field` of /proc/<pid>/status (VmRSS, VmHWM),
 // the pid taken from the root's pid file; -1 when either cannot be read.
-long daemonMemoryKiB(const std::string& root, const char* field = "VmRSS") {
+long daemonPid(const std::string& root) {
   std::ifstream pidFile(root + "/run/vessad/vessad.pid");
   long pid = 0;
-  if (!(pidFile >> pid) || pid <= 0) return -1;
+  return (pidFile >> pid) && pid > 0 ? pid : -1;
+}
+
+long daemonMemoryKiB(const std::string& root, const char* field = "VmRSS") {
+  long pid = daemonPid(root);
+  if (pid <= 0) return -1;
   std::ifstream status("/proc/" + std::to_string(pid) + "/status");
   std::string line, prefix = std::string(field) + ":";
   while (std::getline(status, line))
@@ -504,24 +473,45 @@ int runMemory(const std::string& socket, const Options& o) {
   return failed ? 1 : 0;
 }
 
+// With --pin: vessa-bench, the floor it starts next and the daemon on one
+// CPU for the scope of this object.
+class Pinning {
+ public:
+  explicit Pinning(const Options& o) {
+    if (o.pin < 0) return;
+    pin_.emplace(static_cast<pid_t>(daemonPid(o.root)), o.pin);
+    if (!pin_->pinned())
+      std::fprintf(stderr, "vessa-bench: cannot pin the daemon of %s to CPU %d\n", o.root.c_str(),
+                   o.pin);
+  }
+  bool ok() const { return !pin_ || pin_->pinned(); }
+
+ private:
+  std::optional<VSABenchPin> pin_;
+};
+
 int usage() {
   std::fprintf(
       stderr,
       "usage: vessa-bench --root DIR [--mode lookup|create|mixed|upcall|memory] [--clients N] "
       "[--requests N]\n"
-      "                   [--containers N] [--idle N]\n"
-      "  lookup: command 0 on one existing container (baseline: echo server)\n"
+      "                   [--containers N] [--idle N] [--pin CPU] [--floor PROGRAM]\n"
+      "  lookup: command 0 on one existing container (baseline: vessa-floor, an\n"
+      "          echo process sending every frame back)\n"
       "  create: command 0 creating a new container per request (baseline: raw\n"
       "          directory work in the same root)\n"
       "  mixed:  create, look up, read metadata, list, delete (baseline: the same\n"
       "          file work done by hand in one serial loop)\n"
       "  upcall: the kernel's upcall for an app with a data and two group\n"
-      "          containers (baseline: echo on the same seqpacket transport)\n"
+      "          containers (baseline: vessa-floor echoing packet and memfd)\n"
       "  memory: makes --containers containers (default 10000), leaves --idle\n"
       "          connections idle (default 100), prints the daemon's RSS, then\n"
       "          its RSS before and after a soak of look-ups (the daemon's user:\n"
       "          some idle connections come from uid 501)\n"
       "  --requests counts requests per client (default 10000)\n"
+      "  --pin CPU: lookup and upcall with vessa-bench, the floor and the daemon\n"
+      "          on that one CPU (the measure says \"pinned\")\n"
+      "  --floor: the vessa-floor program (default: beside vessa-bench)\n"
       "lookup, create and upcall alternate baseline and vessad in 10 rounds.\n");
   return 2;
 }
@@ -544,9 +534,15 @@ int main(int argc, char** argv) {
       o.containers = std::atoi(value().c_str());
     else if (a == "--idle")
       o.idle = std::atoi(value().c_str());
+    else if (a == "--pin")
+      o.pin = std::atoi(value().c_str());
+    else if (a == "--floor")
+      o.floor = value();
     else
       return usage();
   }
+  if (o.floor.empty())
+    o.floor = (std::filesystem::path(argv[0]).parent_path() / "vessa-floor").string();
   if (o.clients < 1 || o.requests < 1 || o.containers < 1 || o.idle < 0) return usage();
   std::string socket = o.root + "/run/vessad/com.tamsk.vessad";
   std::string pid = std::to_string(getpid());
@@ -559,10 +555,16 @@ int main(int argc, char** argv) {
     runClients(
         socket, one, [&](int, int) { return request(0, "com.bench.lookup", true); }, true);
     RequestMaker make = [](int, int) { return request(0, "com.bench.lookup"); };
+    Pinning pinning(o);
+    if (!pinning.ok()) return 1;
+    VSABenchFloor floor(o.floor, "stream");
+    if (!floor.running()) return 1;
     auto [base, daemon] = alternate(
-        o, [&](const Options& r, int) { return runEcho(r, make); },
+        o, [&](const Options& r, int) { return runClients(floor.socket(), r, make, false); },
         [&](const Options& r, int) { return runClients(socket, r, make, true); });
-    printPair("look-up", base, daemon, o, "socket echo, same framing", o.clients == 1 ? 0.8 : 0.5);
+    // One client, pinned: judged against the floor. The rest is reported.
+    printPair("look-up", base, daemon, o, "echo process, same frames",
+              o.clients == 1 && o.pin >= 0 ? 0.6 : 0);
     return 0;
   }
   if (o.mode == "create") {
@@ -612,10 +614,15 @@ int main(int argc, char** argv) {
       std::fprintf(stderr, "vessa-bench: the first upcall failed (is this a kernel bridge?)\n");
       return 1;
     }
+    Pinning pinning(o);
+    if (!pinning.ok()) return 1;
+    VSABenchFloor floor(o.floor, "seqpacket");
+    if (!floor.running()) return 1;
     auto [base, daemon] = alternate(
-        o, [&](const Options& r, int) { return runUpcallEcho(r); },
+        o, [&](const Options& r, int) { return runUpcalls(floor.socket(), r, false); },
         [&](const Options& r, int) { return runUpcalls(upcallSocket, r, true); });
-    printPair("upcall", base, daemon, o, "seqpacket+memfd echo", 0.7);
+    printPair("upcall", base, daemon, o, "seqpacket+memfd echo process",
+              o.clients == 1 && o.pin >= 0 ? 0.6 : 0);
     return 0;
   }
   if (o.mode == "mixed") {
