@@ -1,5 +1,6 @@
 #include "base/VSABinaryPlist.h"
 
+#include <algorithm>
 #include <bit>
 #include <cstring>
 #include <limits>
@@ -362,11 +363,16 @@ class Decoder {
         // Each byte becomes at least one UTF-8 byte: that much is charged
         // before the string is built, the rest once its length is known.
         if (!readCount(pos, low, count) || !fits(pos, count, 1) || !charge(count)) return false;
-        // One-byte strings are ASCII; stray high bytes are taken as Latin-1 so
-        // that every decoded string is valid UTF-8.
+        // One-byte strings are ASCII (copied as they are); stray high bytes
+        // are taken as Latin-1 so that every decoded string is valid UTF-8.
+        const uint8_t* bytes = d_ + pos;
+        if (std::all_of(bytes, bytes + count, [](uint8_t b) { return b < 0x80; })) {
+          out = VSAValue(std::string(reinterpret_cast<const char*>(bytes), count));
+          return true;
+        }
         std::string s;
         s.reserve(count);
-        for (uint64_t i = 0; i < count; ++i) VSAAppendUTF8(s, d_[pos + i]);
+        for (uint64_t i = 0; i < count; ++i) VSAAppendUTF8(s, bytes[i]);
         if (!charge(s.size() - count)) return false;
         out = VSAValue(std::move(s));
         return true;

@@ -40,9 +40,13 @@ std::shared_ptr<VSAContainerCache> VSAContainerCache::create(Dependencies deps) 
 
 std::string VSAContainerCache::cacheKeyForUserIdentity(const VSAUserIdentityRef& user,
                                                        VSAContainerClass c) {
-  if (VSAUserIdentity::isUserIdentityRequiredForContainerClass(c))
-    return VSAFormat("[%@]-%@", user ? user->identifier() : std::string("(null)"), shortName(c));
-  return shortName(c);
+  if (!VSAUserIdentity::isUserIdentityRequiredForContainerClass(c)) return shortName(c);
+  // "[user]-class", built by hand: every look-up makes one.
+  std::string key = "[";
+  key += user ? user->identifier() : std::string("(null)");
+  key += "]-";
+  key += shortName(c);
+  return key;
 }
 
 bool VSAContainerCache::containerURLIsValidForContainerClass(

@@ -142,6 +142,21 @@ std::vector<uint8_t> handMade(const std::vector<std::vector<uint8_t>>& objects, 
   return out;
 }
 
+// One-byte strings: ASCII comes through as it is; a stray high byte is
+// Latin-1 and becomes its two-byte UTF-8 form, so no decoded string is
+// invalid UTF-8.
+TEST(VSABinaryPlist, OneByteStringsDecodeAsASCIIOrLatin1) {
+  std::string why;
+  auto ascii = handMade({{0x53, 'a', '/', 'Z'}});
+  auto a = VSABinaryPlist::decode(ascii.data(), ascii.size(), &why);
+  ASSERT_TRUE(a) << why;
+  EXPECT_EQ(*a->stringValue(), "a/Z");
+  auto latin = handMade({{0x53, 'c', 0xE9, 'x'}});
+  auto l = VSABinaryPlist::decode(latin.data(), latin.size(), &why);
+  ASSERT_TRUE(l) << why;
+  EXPECT_EQ(*l->stringValue(), "c\xC3\xA9x");
+}
+
 TEST(VSABinaryPlist, HostileStructuresAreRefused) {
   std::string why;
   // An array that contains itself.
