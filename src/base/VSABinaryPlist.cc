@@ -67,9 +67,13 @@ class Encoder {
   Encoder(VSABinaryPlist::UUIDForm form) : form_(form) {}
 
   std::optional<std::vector<uint8_t>> run(const VSAValue& root, std::string* error) {
+    nodes_.reserve(64);  // a request or reply: a few dozen objects
     flatten(root);
     size_t count = nodes_.size();
     refSize_ = count <= 0xFF ? 1 : count <= 0xFFFF ? 2 : 4;
+    // Grown once: markers, counts, references and offsets take at most this
+    // much beside the payload (a UTF-16 string at most twice its bytes).
+    out_.reserve(8 + 2 * payloadBytes_ + count * (18 + 2 * refSize_) + 32);
     out_ = {'b', 'p', 'l', 'i', 's', 't', '0', '0'};
     std::vector<uint64_t> offsets;
     offsets.reserve(count);
@@ -100,6 +104,8 @@ class Encoder {
   uint64_t flatten(const VSAValue& v) {
     uint64_t index = nodes_.size();
     nodes_.push_back(Node{&v, nullptr, {}});
+    if (auto s = v.stringValue()) payloadBytes_ += s->size();
+    if (auto d = v.dataValue()) payloadBytes_ += d->size();
     if (auto a = v.arrayValue()) {
       std::vector<uint64_t> kids;
       kids.reserve(a->size());
@@ -107,9 +113,12 @@ class Encoder {
       nodes_[index].children = std::move(kids);
     } else if (auto d = v.dictionaryValue()) {
       std::vector<uint64_t> keys, values;
+      keys.reserve(2 * d->size());
+      values.reserve(d->size());
       for (const auto& [k, _] : *d) {
         keys.push_back(nodes_.size());
         nodes_.push_back(Node{nullptr, &k, {}});
+        payloadBytes_ += k.size();
       }
       for (const auto& [_, child] : *d) values.push_back(flatten(child));
       keys.insert(keys.end(), values.begin(), values.end());
@@ -129,9 +138,9 @@ class Encoder {
     }
   }
   void writeBE(uint64_t v, int size) {
-    uint8_t buf[8];
-    putBE(buf, v, size);
-    out_.insert(out_.end(), buf, buf + size);
+    size_t at = out_.size();
+    out_.resize(at + static_cast<size_t>(size));
+    putBE(out_.data() + at, v, size);
   }
   void writeMarkerWithCount(uint8_t high, uint64_t count) {
     if (count < 15) {
@@ -232,6 +241,7 @@ class Encoder {
   std::vector<Node> nodes_;
   std::vector<uint8_t> out_;
   int refSize_ = 1;
+  size_t payloadBytes_ = 0;  // strings, keys and data
 };
 
 // ---- Decoder --------------------------------------------------------------
