@@ -33,6 +33,9 @@ echo
 echo "== Look-ups of an existing container, 16 clients"
 "$bench" --root "$root" --mode lookup --clients 16 --requests "$(( ${LOOKUPS:-20000} / 16 ))"
 echo
+echo "== Look-ups of an existing container, 16 clients, all on CPU 0"
+"$bench" --root "$root" --mode lookup --clients 16 --requests "$(( ${LOOKUPS:-20000} / 16 ))" --pin 0
+echo
 echo "== Creation, one client"
 "$bench" --root "$root" --mode create --clients 1 --requests "${CREATES:-2000}"
 echo
