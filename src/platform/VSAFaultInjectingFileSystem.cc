@@ -228,7 +228,6 @@ int VSAFaultInjectingFileSystem::writeFile(const std::string& path,
   // The data is synced; a file the call makes is a new entry of its directory.
   bool existed = unsynced_.tracking() && inner_->exists(path) == 0;
   int rc = inner_->writeFile(path, bytes, mode);
-  if (rc == 0 && existed) unsynced_.dataSynced(path);
   if (rc == 0 && !existed) unsynced_.created(path);
   return rc;
 }
@@ -364,7 +363,7 @@ int VSAFaultInjectingFileSystem::copyDataAt(int fromDir, const std::string& from
                                             const std::string& toName, mode_t mode) {
   if (int e = injected(Op::CopyData)) return e;
   int rc = inner_->copyDataAt(fromDir, fromName, toDir, toName, mode);
-  if (rc == 0) unsynced_.createdWithUnsyncedData(toDir, toName);
+  if (rc == 0) unsynced_.created(toDir, toName);  // its data is synced
   return rc;
 }
 

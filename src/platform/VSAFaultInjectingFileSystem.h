@@ -20,12 +20,11 @@
 //     the n-th, or crashNow()) everything the calls since crashAfter() left
 //     without making durable is undone on the real disk underneath, newest
 //     first: renames not synced are renamed back, entries made in a
-//     directory not synced since are removed with everything below them,
-//     and data that copyDataAt wrote is dropped (writeFile syncs its data,
-//     so only its entry can be lost). What existed before crashAfter() counts
-//     as durable. VSAUnsyncedChanges holds the rules: which call makes what
-//     durable, as VSAFileSystem promises; what is not modelled (removals
-//     stay removed; attribute changes stay).
+//     directory not synced since are removed with everything below them
+//     (writeFile and copyDataAt sync a file's data, so only its entry can be
+//     lost). What existed before crashAfter() counts as durable. VSAUnsyncedChanges holds the
+//     rules: which call makes what durable, as VSAFileSystem promises; what is not modelled
+//     (removals stay removed; attribute changes stay).
 // Only what goes through this interface is seen: the code-signing database
 // (SQLite syncs its own files) and run-time state under the run directory
 // (written directly, and gone at a reboot anyway) are outside the model.

@@ -1,8 +1,6 @@
 #include "platform/VSAUnsyncedChanges.h"
 
-#include <fcntl.h>
 #include <sys/stat.h>
-#include <unistd.h>
 
 #include <cstdio>
 #include <set>
@@ -95,34 +93,11 @@ void VSAUnsyncedChanges::created(const std::string& path) {
 void VSAUnsyncedChanges::created(int dir, const std::string& name) {
   std::lock_guard lock(mutex_);
   if (!tracking_) return;
-  Change change{Change::Kind::Create, {}, name, 0, {}, {}, 0, nullptr};
+  Change change{Change::Kind::Create, {}, name, 0, {}, {}, 0};
   struct stat st;
   if (!holdLocked(dir, &change.dir) || disk_->statAt(dir, name, &st) != 0) return;
   change.item = st.st_ino;
   addLocked(std::move(change));
-}
-
-void VSAUnsyncedChanges::createdWithUnsyncedData(int dir, const std::string& name) {
-  created(dir, name);
-  std::lock_guard lock(mutex_);
-  if (!tracking_) return;
-  // Held open so that the data can be dropped wherever the file has gone.
-  auto file = std::make_shared<VSAUniqueFd>(
-      ::openat(dir, name.c_str(), O_WRONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
-  struct stat st;
-  if (!*file || ::fstat(file->get(), &st) != 0 || !S_ISREG(st.st_mode)) return;
-  Change change{Change::Kind::Data, {st.st_dev, 0}, name, st.st_ino, {}, {}, 0, file};
-  addLocked(std::move(change));
-}
-
-void VSAUnsyncedChanges::dataSynced(const std::string& path) {
-  if (!tracking()) return;
-  struct stat st;
-  if (disk_->lstat(path, &st) != 0) return;
-  std::lock_guard lock(mutex_);
-  std::erase_if(changes_, [&](const Change& c) {
-    return c.kind == Change::Kind::Data && c.dir.dev == st.st_dev && c.item == st.st_ino;
-  });
 }
 
 void VSAUnsyncedChanges::renamed(const std::string& from, const std::string& to) {
@@ -137,7 +112,7 @@ void VSAUnsyncedChanges::renamed(int fromDir, const std::string& fromName, int t
                                  const std::string& toName) {
   std::lock_guard lock(mutex_);
   if (!tracking_) return;
-  Change change{Change::Kind::Rename, {}, fromName, 0, {}, toName, 0, nullptr};
+  Change change{Change::Kind::Rename, {}, fromName, 0, {}, toName, 0};
   struct stat st;
   if (!holdLocked(fromDir, &change.dir) || !holdLocked(toDir, &change.otherDir) ||
       disk_->statAt(toDir, toName, &st) != 0)
@@ -151,7 +126,7 @@ void VSAUnsyncedChanges::exchanged(const std::string& a, const std::string& b) {
     atParent(b, [&](int bDir, const std::string& bName) {
       std::lock_guard lock(mutex_);
       if (!tracking_) return;
-      Change change{Change::Kind::Exchange, {}, aName, 0, {}, bName, 0, nullptr};
+      Change change{Change::Kind::Exchange, {}, aName, 0, {}, bName, 0};
       struct stat atA, atB;
       if (!holdLocked(aDir, &change.dir) || !holdLocked(bDir, &change.otherDir) ||
           disk_->statAt(aDir, aName, &atA) != 0 || disk_->statAt(bDir, bName, &atB) != 0)
@@ -174,16 +149,7 @@ void VSAUnsyncedChanges::synced(int dir) {
   std::lock_guard lock(mutex_);
   if (powerLost_) return;  // a sync under way when the power failed did not finish
   std::erase_if(changes_, [&](const Change& c) {
-    switch (c.kind) {
-      case Change::Kind::Create:
-        return c.dir == key;
-      case Change::Kind::Rename:
-      case Change::Kind::Exchange:
-        return c.dir == key || c.otherDir == key;
-      case Change::Kind::Data:
-        return false;
-    }
-    return false;
+    return c.dir == key || (c.kind != Change::Kind::Create && c.otherDir == key);
   });
   dropUnreferencedLocked();
 }
@@ -222,12 +188,6 @@ void VSAUnsyncedChanges::undoLocked(const Change& change) {
         ::renameat2(dir, change.name.c_str(), other, change.otherName.c_str(), RENAME_EXCHANGE);
       return;
     }
-    case Change::Kind::Data:
-      // Data never synced: after the power loss the file is there but empty.
-      if (::ftruncate(change.file->get(), 0) != 0) {
-        // A file made immutable since keeps its data.
-      }
-      return;
   }
 }
 
@@ -255,7 +215,6 @@ void VSAUnsyncedChanges::removeTreeLocked(int dir, const std::string& name, int 
 void VSAUnsyncedChanges::dropUnreferencedLocked() {
   std::set<DirectoryKey> used;
   for (const auto& c : changes_) {
-    if (c.kind == Change::Kind::Data) continue;
     used.insert(c.dir);
     if (c.kind != Change::Kind::Create) used.insert(c.otherDir);
   }

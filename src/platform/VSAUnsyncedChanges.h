@@ -1,6 +1,6 @@
-// What a power loss takes back: the changes made to directories, and the
-// file data written, that were not yet made durable, kept in the order they
-// were made so that they can be undone on the real disk, newest first.
+// What a power loss takes back: the changes made to directories that were
+// not yet made durable, kept in the order they were made so that they can be
+// undone on the real disk, newest first.
 //
 // The durability rules are those VSAFileSystem promises:
 //   - a new entry (a directory, file or link made in directory D) is durable
@@ -12,9 +12,8 @@
 //     it (rename and renameAt sync the destination at once, so they are
 //     durable when they return; renameWithoutSync waits for a later sync);
 //   - an exchange syncs both directories and is durable when it returns;
-//   - writeFile syncs the file's data (only its entry is a change here);
-//     copyDataAt does not: a copied file's data is lost, the file left empty,
-//     unless writeFile later replaces its whole content.
+//   - writeFile and copyDataAt sync the file's data: only the entry of a
+//     file they make is a change here, never its content.
 // A removal is not undone: what was removed is not kept, so an unsynced
 // removal stays removed. A removal that comes back after a power loss loses
 // nothing; it can only bring back what the daemon took away, and what the
@@ -72,10 +71,6 @@ class VSAUnsyncedChanges {
   // path; descriptor forms by its directory (any descriptor of it) and name.
   void created(const std::string& path);
   void created(int dir, const std::string& name);
-  // A new file whose data was not synced.
-  void createdWithUnsyncedData(int dir, const std::string& name);
-  // The whole content of an existing file was written and synced.
-  void dataSynced(const std::string& path);
   void renamed(const std::string& from, const std::string& to);
   void renamed(int fromDir, const std::string& fromName, int toDir, const std::string& toName);
   void exchanged(const std::string& a, const std::string& b);
@@ -93,7 +88,7 @@ class VSAUnsyncedChanges {
     auto operator<=>(const DirectoryKey&) const = default;
   };
   struct Change {
-    enum class Kind { Create, Rename, Exchange, Data } kind;
+    enum class Kind { Create, Rename, Exchange } kind;
     // Create: the new entry. Rename: the source. Exchange: one side.
     DirectoryKey dir;
     std::string name;
@@ -102,7 +97,6 @@ class VSAUnsyncedChanges {
     DirectoryKey otherDir;
     std::string otherName;
     ino_t otherItem = 0;
-    std::shared_ptr<VSAUniqueFd> file;  // Data: the file, open for writing
   };
 
   // The key of `dir`, opening a descriptor of it to hold when it is new.
