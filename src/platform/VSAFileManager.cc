@@ -290,37 +290,6 @@ bool VSAFileManager::exchangeItemsAtURL(const std::string& a, const std::string&
   return false;
 }
 
-bool VSAFileManager::syncDirectoriesAtURL(const std::string& path, VSAErrorRef* error) {
-  // An empty directory has no entry to make durable: only the directories
-  // something was met in are synced. One flag per directory being walked.
-  std::vector<bool> holding;
-  int failed = 0;
-  std::string failedPath;
-  bool walked = traverseDirectory(path, error, [&](const VSAWalkItem& item, WalkPhase phase) {
-    if (phase != WalkPhase::DirectoryEnd) {
-      if (!holding.empty()) holding.back() = true;
-      if (phase == WalkPhase::Directory) holding.push_back(false);
-      return true;
-    }
-    bool held = holding.back();
-    holding.pop_back();
-    if (!held) return true;
-    int raw = -1;
-    int rc = fs_->openDirectoryAt(item.directory, item.name, &raw);
-    VSAUniqueFd directory(raw);
-    if (rc == 0) rc = fs_->syncDirectory(directory.get());
-    if (rc == 0) return true;
-    failed = rc;
-    failedPath = item.path;
-    return false;
-  });
-  if (!walked) return false;
-  if (failed == 0) return true;
-  VSASetError(error, VSAFileManagerFail(failed, "syncDirectoriesAtURL", "sync of %@ failed: %s",
-                                        failedPath, std::strerror(failed)));
-  return false;
-}
-
 void VSAFileManager::printDirectoryStructureAtURL(const std::string& path) {
   VSAErrorRef error;
   bool walked = traverseDirectory(path, &error, [](const VSAWalkItem& item, WalkPhase phase) {
