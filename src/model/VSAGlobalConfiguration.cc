@@ -38,8 +38,12 @@ std::string VSAGlobalConfiguration::ensureDirectory(const std::string& path, uid
   }
   if (known && fileManager_->directoryExistsAtURL(path)) return path;
   VSAErrorRef error;
-  if (!fileManager_->createDirectoryAtURL(path, true, 0755, owner, protectionClass, &error,
-                                          group)) {
+  // Durable once made: containers, pending updates and journals are committed
+  // into these directories by renames that sync the directory itself, not
+  // the entries that name it and its parents; a class directory lost in a
+  // power loss would take every container committed into it.
+  if (!fileManager_->createDurableDirectoryAtURL(path, 0755, owner, protectionClass, &error,
+                                                 group)) {
     VSALog(kVSALogError, "VSAGlobalConfiguration", failureFormat, path, error);
     std::lock_guard lock(ensuredMutex_);
     ensured_.erase(path);

@@ -244,6 +244,11 @@ bool VSAContainerContent::copyIntoPlace(const VSAMetadata& data, const std::stri
   if (!fm.standardizeOwnershipAtURL(staging, uid, gid, &error))
     return discard(codeOf(error, VSAResult::kWriteFailed),
                    VSAFormat("Failed to give %@ to %u: %@", staging, uid, error));
+  // The commit below (a rename or an exchange) makes the staged item's own
+  // entry durable, not the entries copied below it.
+  if (!fm.syncDirectoriesAtURL(staging, &error))
+    return discard(codeOf(error, VSAResult::kWriteFailed),
+                   VSAFormat("Failed to sync %@: %@", staging, error));
   std::string parent = VSADirectoryName(destination.substr(prefix.size()));
   if (!parent.empty() && !fm.createDirectoriesAt(container.get(), parent, 0755, uid, gid, &error))
     return discard(codeOf(error, VSAResult::kWriteFailed),

@@ -29,8 +29,8 @@ bool VSAContainerDirectories::_createTopLevelContainerDirectory(const std::strin
 }
 
 bool VSAContainerDirectories::_createSubDirectories(const std::string& url,
-                                                    const VSAMetadata& metadata,
-                                                    VSAErrorRef* error) {
+                                                    const VSAMetadata& metadata, VSAErrorRef* error,
+                                                    bool durable) {
   VSAContainerClass c = metadata.containerClass();
   bool system = VSAContainerClassIsSystem(c);
   mode_t mode = system ? 0 : 0755;
@@ -61,9 +61,12 @@ bool VSAContainerDirectories::_createSubDirectories(const std::string& url,
     VSAErrorRef underlying;
     // A system sub-directory made with mode 0 inherits the ACL under a mask
     // of none; setting its ACL again makes the "systemusers" entry count.
-    if (!fm.createDirectoryAtURL(path, true, mode, owner, static_cast<uint32_t>(itemClass),
-                                 &underlying, group) ||
-        (system && !fm.setSystemContainerDirectoryACLAtURL(path, &underlying))) {
+    bool made = durable
+                    ? fm.createDurableDirectoryAtURL(
+                          path, mode, owner, static_cast<uint32_t>(itemClass), &underlying, group)
+                    : fm.createDirectoryAtURL(path, true, mode, owner,
+                                              static_cast<uint32_t>(itemClass), &underlying, group);
+    if (!made || (system && !fm.setSystemContainerDirectoryACLAtURL(path, &underlying))) {
       auto e = VSA_ERROR_UNDERLYING(
           underlying->resultCode(VSAResult::kStagingCreateFailed), underlying,
           "Failed to create sub-dir for %@ at %@ (protClass: %d)", name, url, itemClass);

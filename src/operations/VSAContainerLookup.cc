@@ -149,6 +149,13 @@ struct CreateSteps {
     auto base = config.containerDirectoryURLForUserIdentity(identity.userIdentity(), c, transient);
     std::string live = VSAPathJoin(base.value_or(""), liveName(name));
     VSAErrorRef underlying;
+    // The rename below commits the container's own entry; the directories
+    // made inside it are durable only once the staged tree has been synced.
+    if (!services.fileManager->syncDirectoriesAtURL(staging, &underlying)) {
+      *error = failure(VSAResult::kStagingMoveFailed, underlying,
+                       VSAFormat("Failed to sync staging dir: %@", staging));
+      return nullptr;
+    }
     services.testLocks->waitOnLock(kVSATestLockCreate);
     if (!base || !services.fileManager->moveItemAtURL(staging, live, &underlying)) {
       *error = failure(VSAResult::kStagingMoveFailed, underlying,

@@ -128,7 +128,9 @@ bool VSAContainerMaintenance::recreateDefaultStructureWithContainerIdentity(
     auto m = findLocked(identity, key, origin, withError);
     if (!m) return false;
     VSAErrorRef error;
-    if (!VSAContainerDirectories(services_)._createSubDirectories(m->url(), *m, &error) ||
+    // A live container: what is made is synced as it is made, or a power
+    // loss takes back the structure the reply reported recreated.
+    if (!VSAContainerDirectories(services_)._createSubDirectories(m->url(), *m, &error, true) ||
         (VSAContainerClassIsSystem(m->containerClass()) &&
          !services_.fileManager->standardizeACLsForSystemContainerAtURL(m->url(), &error))) {
       VSASetCode(withError,

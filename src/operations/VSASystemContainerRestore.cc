@@ -56,7 +56,10 @@ std::optional<std::string> VSASystemContainerRestore::holdingDirectory() {
   std::string holding =
       VSAPathJoin(services_.configuration->libraryDirectory(), kVSASystemContainerRestoreDirName);
   VSAErrorRef error;
-  if (fm.createDirectoryAtURL(holding, true, 0700, 0, kVSANoProtectionClass, &error) &&
+  // Durable before the backup is moved in: that rename syncs the holding
+  // directory, not the entry naming it, and a holding directory lost in a
+  // power loss would take the backup, gone from the user's home, with it.
+  if (fm.createDurableDirectoryAtURL(holding, 0700, 0, kVSANoProtectionClass, &error) &&
       fm.restrictItemToRootAtURL(holding, &error))
     return holding;
   logRestore(kVSALogError, kOrigin, "Cannot restore system containers without %@: %@", holding,

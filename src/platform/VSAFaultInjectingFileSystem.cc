@@ -1,7 +1,7 @@
 #include "platform/VSAFaultInjectingFileSystem.h"
 
 VSAFaultInjectingFileSystem::VSAFaultInjectingFileSystem(std::shared_ptr<VSAFileSystem> inner)
-    : inner_(std::move(inner)) {}
+    : inner_(std::move(inner)), unsynced_(inner_) {}
 
 std::shared_ptr<VSAFaultInjectingFileSystem> VSAFaultInjectingFileSystem::readOnly(
     std::shared_ptr<VSAFileSystem> inner) {
@@ -23,9 +23,28 @@ void VSAFaultInjectingFileSystem::failAll(Op op, int error) {
   rules_.push_back({op, -1, error});
 }
 
-void VSAFaultInjectingFileSystem::crashAfter(int calls) {
+void VSAFaultInjectingFileSystem::crashAfter(int calls, CrashModel model) {
   std::lock_guard lock(mutex_);
   crashRemaining_ = calls;
+  crashModel_ = model;
+  powerLost_ = false;
+  // From here on every change is durable only once synced.
+  if (model == CrashModel::PowerLoss)
+    unsynced_.start();
+  else
+    unsynced_.clear();
+}
+
+void VSAFaultInjectingFileSystem::crashNow() {
+  bool losePower = false;
+  {
+    std::lock_guard lock(mutex_);
+    if (crashRemaining_ < 0) return;
+    crashRemaining_ = 0;
+    losePower = crashModel_ == CrashModel::PowerLoss && !powerLost_;
+    powerLost_ = true;
+  }
+  if (losePower) unsynced_.losePower();
 }
 
 void VSAFaultInjectingFileSystem::failCall(int n, int error) {
@@ -49,6 +68,9 @@ void VSAFaultInjectingFileSystem::reset() {
   std::lock_guard lock(mutex_);
   rules_.clear();
   crashRemaining_ = -1;
+  crashModel_ = CrashModel::ProcessDeath;
+  powerLost_ = false;
+  unsynced_.clear();
   failCallRemaining_ = -1;
   counts_.fill(0);
   lstatHooks_.clear();
@@ -67,9 +89,21 @@ int VSAFaultInjectingFileSystem::totalCalls() const {
 }
 
 int VSAFaultInjectingFileSystem::injected(Op op) {
-  std::lock_guard lock(mutex_);
-  ++counts_[static_cast<size_t>(op)];
-  if (crashRemaining_ == 0) return EIO;
+  {
+    std::lock_guard lock(mutex_);
+    ++counts_[static_cast<size_t>(op)];
+    if (crashRemaining_ != 0) return injectedLocked(op);
+    if (crashModel_ != CrashModel::PowerLoss || powerLost_) return EIO;
+    powerLost_ = true;
+  }
+  // The first call after the crash point: the power fails now. Undone
+  // outside the lock: calls under way on other threads report their
+  // changes meanwhile, and those are undone as they arrive.
+  unsynced_.losePower();
+  return EIO;
+}
+
+int VSAFaultInjectingFileSystem::injectedLocked(Op op) {
   if (crashRemaining_ > 0) --crashRemaining_;
   if (failCallRemaining_ >= 0 && failCallRemaining_-- == 0) return failCallError_;
   for (auto it = rules_.begin(); it != rules_.end(); ++it) {
@@ -103,7 +137,9 @@ int VSAFaultInjectingFileSystem::lstat(const std::string& path, struct stat* st)
 
 int VSAFaultInjectingFileSystem::mkdir(const std::string& path, mode_t mode) {
   if (int e = injected(Op::Mkdir)) return e;
-  return inner_->mkdir(path, mode);
+  int rc = inner_->mkdir(path, mode);
+  if (rc == 0) unsynced_.created(path);
+  return rc;
 }
 
 int VSAFaultInjectingFileSystem::lchown(const std::string& path, uid_t uid, gid_t gid) {
@@ -118,17 +154,30 @@ int VSAFaultInjectingFileSystem::chmod(const std::string& path, mode_t mode) {
 
 int VSAFaultInjectingFileSystem::rename(const std::string& from, const std::string& to) {
   if (int e = injected(Op::Rename)) return e;
-  return inner_->rename(from, to);
+  int rc = inner_->rename(from, to);
+  if (rc == 0) {
+    unsynced_.renamed(from, to);
+    unsynced_.syncedParentOf(to);
+  }
+  return rc;
 }
 
 int VSAFaultInjectingFileSystem::renameWithoutSync(const std::string& from, const std::string& to) {
   if (int e = injected(Op::Rename)) return e;
-  return inner_->renameWithoutSync(from, to);
+  int rc = inner_->renameWithoutSync(from, to);
+  if (rc == 0) unsynced_.renamed(from, to);
+  return rc;
 }
 
 int VSAFaultInjectingFileSystem::exchange(const std::string& a, const std::string& b) {
   if (int e = injected(Op::Rename)) return e;
-  return inner_->exchange(a, b);
+  int rc = inner_->exchange(a, b);
+  if (rc == 0) {
+    unsynced_.exchanged(a, b);
+    unsynced_.syncedParentOf(a);
+    unsynced_.syncedParentOf(b);
+  }
+  return rc;
 }
 
 int VSAFaultInjectingFileSystem::readlink(const std::string& path, std::string* target) {
@@ -176,7 +225,11 @@ int VSAFaultInjectingFileSystem::setFlags(const std::string& path, int flags) {
 int VSAFaultInjectingFileSystem::writeFile(const std::string& path,
                                            const std::vector<uint8_t>& bytes, mode_t mode) {
   if (int e = injected(Op::WriteFile)) return e;
-  return inner_->writeFile(path, bytes, mode);
+  // The data is synced; a file the call makes is a new entry of its directory.
+  bool existed = unsynced_.tracking() && inner_->exists(path) == 0;
+  int rc = inner_->writeFile(path, bytes, mode);
+  if (rc == 0 && !existed) unsynced_.created(path);
+  return rc;
 }
 
 int VSAFaultInjectingFileSystem::readFile(const std::string& path, std::vector<uint8_t>* bytes,
@@ -187,7 +240,9 @@ int VSAFaultInjectingFileSystem::readFile(const std::string& path, std::vector<u
 
 int VSAFaultInjectingFileSystem::mkdtemp(const std::string& templ, std::string* path) {
   if (int e = injected(Op::Mkdtemp)) return e;
-  return inner_->mkdtemp(templ, path);
+  int rc = inner_->mkdtemp(templ, path);
+  if (rc == 0) unsynced_.created(*path);
+  return rc;
 }
 
 int VSAFaultInjectingFileSystem::setSystemContainerACL(const std::string& path,
@@ -238,7 +293,9 @@ int VSAFaultInjectingFileSystem::readDirectoryAt(int dir, std::vector<VSADirecto
 
 int VSAFaultInjectingFileSystem::mkdirAt(int dir, const std::string& name, mode_t mode) {
   if (int e = injected(Op::Mkdir)) return e;
-  return inner_->mkdirAt(dir, name, mode);
+  int rc = inner_->mkdirAt(dir, name, mode);
+  if (rc == 0) unsynced_.created(dir, name);
+  return rc;
 }
 
 int VSAFaultInjectingFileSystem::unlinkAt(int dir, const std::string& name, bool directory) {
@@ -249,7 +306,12 @@ int VSAFaultInjectingFileSystem::unlinkAt(int dir, const std::string& name, bool
 int VSAFaultInjectingFileSystem::renameAt(int fromDir, const std::string& fromName, int toDir,
                                           const std::string& toName) {
   if (int e = injected(Op::Rename)) return e;
-  return inner_->renameAt(fromDir, fromName, toDir, toName);
+  int rc = inner_->renameAt(fromDir, fromName, toDir, toName);
+  if (rc == 0) {
+    unsynced_.renamed(fromDir, fromName, toDir, toName);
+    unsynced_.synced(toDir);
+  }
+  return rc;
 }
 
 int VSAFaultInjectingFileSystem::chownAt(int dir, const std::string& name, uid_t uid, gid_t gid) {
@@ -292,13 +354,17 @@ int VSAFaultInjectingFileSystem::setProtectionClassAt(int dir, const std::string
 
 int VSAFaultInjectingFileSystem::syncDirectory(int dir) {
   if (int e = injected(Op::SyncDirectory)) return e;
-  return inner_->syncDirectory(dir);
+  int rc = inner_->syncDirectory(dir);
+  if (rc == 0) unsynced_.synced(dir);
+  return rc;
 }
 
 int VSAFaultInjectingFileSystem::copyDataAt(int fromDir, const std::string& fromName, int toDir,
                                             const std::string& toName, mode_t mode) {
   if (int e = injected(Op::CopyData)) return e;
-  return inner_->copyDataAt(fromDir, fromName, toDir, toName, mode);
+  int rc = inner_->copyDataAt(fromDir, fromName, toDir, toName, mode);
+  if (rc == 0) unsynced_.created(toDir, toName);  // its data is synced
+  return rc;
 }
 
 int VSAFaultInjectingFileSystem::readlinkAt(int dir, const std::string& name, std::string* target) {
@@ -309,7 +375,9 @@ int VSAFaultInjectingFileSystem::readlinkAt(int dir, const std::string& name, st
 int VSAFaultInjectingFileSystem::symlinkAt(const std::string& target, int dir,
                                            const std::string& name) {
   if (int e = injected(Op::Symlink)) return e;
-  return inner_->symlinkAt(target, dir, name);
+  int rc = inner_->symlinkAt(target, dir, name);
+  if (rc == 0) unsynced_.created(dir, name);
+  return rc;
 }
 
 int VSAFaultInjectingFileSystem::listxattrAt(int dir, const std::string& name,

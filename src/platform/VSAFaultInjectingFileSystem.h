@@ -5,12 +5,32 @@
 // fails every call of `op`. Call counts per operation let a test enumerate
 // the steps of an operation and fail each in turn. A descriptor-relative call
 // counts as the operation of its path form (statAt as Lstat, unlinkAt as
-// Unlink or Rmdir, renameAt as Rename, ...). crashAfter(n) stops every call
-// after the n-th, for crash-point sweeps. readOnly() makes a layer that
+// Unlink or Rmdir, renameAt as Rename, ...). readOnly() makes a layer that
 // refuses every call that would change the disk (EROFS), for code that must
 // only look, such as the root checker. afterNextLstatOf() runs a test's code
 // at one exact point of an operation, to make a race with another thread
-// happen every time. Thread-safe.
+// happen every time.
+//
+// crashAfter(n, model) stops every call after the n-th, for crash-point
+// sweeps, in one of two ways:
+//   - ProcessDeath: every later call fails with EIO and changes nothing, as
+//     if the process had died after its n-th call; what reached the disk
+//     stays, synced or not.
+//   - PowerLoss: the same, and at the moment of the crash (the call after
+//     the n-th, or crashNow()) everything the calls since crashAfter() left
+//     without making durable is undone on the real disk underneath, newest
+//     first: renames not synced are renamed back, entries made in a
+//     directory not synced since are removed with everything below them
+//     (writeFile and copyDataAt sync a file's data, so only its entry can be
+//     lost). What existed before crashAfter() counts as durable. VSAUnsyncedChanges holds the
+//     rules: which call makes what durable, as VSAFileSystem promises; what is not modelled
+//     (removals stay removed; attribute changes stay).
+// Only what goes through this interface is seen: the code-signing database
+// (SQLite syncs its own files) and run-time state under the run directory
+// (written directly, and gone at a reboot anyway) are outside the model.
+//
+// Thread-safe. A call that is under way when the power fails is undone
+// when it returns.
 #pragma once
 
 #include <array>
@@ -20,9 +40,12 @@
 #include <vector>
 
 #include "platform/VSAFileSystem.h"
+#include "platform/VSAUnsyncedChanges.h"
 
 class VSAFaultInjectingFileSystem : public VSAFileSystem {
  public:
+  enum class CrashModel { ProcessDeath, PowerLoss };
+
   explicit VSAFaultInjectingFileSystem(std::shared_ptr<VSAFileSystem> inner);
   static std::shared_ptr<VSAFaultInjectingFileSystem> readOnly(
       std::shared_ptr<VSAFileSystem> inner);
@@ -31,8 +54,13 @@ class VSAFaultInjectingFileSystem : public VSAFileSystem {
   void failAll(Op op, int error);
   // A simulated crash: the next `calls` calls of any kind go through, every
   // later one fails with EIO and changes nothing, as if the process had died
-  // after its `calls`-th file-system call. reset() ends it.
-  void crashAfter(int calls);
+  // after its `calls`-th file-system call, or (PowerLoss) the device had
+  // lost power then. reset() ends it.
+  void crashAfter(int calls, CrashModel model = CrashModel::ProcessDeath);
+  // The planned crash happens now, if it has not yet: for a power loss,
+  // what the calls so far left unsynced is lost at once (an operation that
+  // returned before its crash point, and the power failed after it).
+  void crashNow();
   // The n-th call from now, whatever its kind, fails with `error` (ENOSPC,
   // EIO, ...) and changes nothing; the calls after it go through.
   void failCall(int n, int error);
@@ -99,6 +127,7 @@ class VSAFaultInjectingFileSystem : public VSAFileSystem {
  private:
   // Counts the call; answers the errno to fail it with, or 0 to forward it.
   int injected(Op op);
+  int injectedLocked(Op op);  // the failures planned besides the crash
 
   struct Rule {
     Op op;
@@ -106,11 +135,14 @@ class VSAFaultInjectingFileSystem : public VSAFileSystem {
     int error;
   };
   std::shared_ptr<VSAFileSystem> inner_;
+  VSAUnsyncedChanges unsynced_;  // tracking only while a power loss is planned
   mutable std::mutex mutex_;
   std::array<int, static_cast<size_t>(Op::Count)> counts_{};
   std::vector<Rule> rules_;
   std::vector<std::pair<std::string, std::function<void()>>> lstatHooks_;
-  int crashRemaining_ = -1;     // -1: no crash planned
+  int crashRemaining_ = -1;  // -1: no crash planned
+  CrashModel crashModel_ = CrashModel::ProcessDeath;
+  bool powerLost_ = false;
   int failCallRemaining_ = -1;  // -1: no single failure planned
   int failCallError_ = 0;
 };

@@ -147,10 +147,25 @@ std::optional<std::string> VSAFileManager::realPathForURL(const std::string& pat
 bool VSAFileManager::createDirectoryAtURL(const std::string& path, bool intermediates, mode_t mode,
                                           uid_t owner, uint32_t protectionClass, VSAErrorRef* error,
                                           std::optional<gid_t> group) {
+  return createDirectory(path, intermediates, false, mode, owner, protectionClass, error, group);
+}
+
+bool VSAFileManager::createDurableDirectoryAtURL(const std::string& path, mode_t mode, uid_t owner,
+                                                 uint32_t protectionClass, VSAErrorRef* error,
+                                                 std::optional<gid_t> group) {
+  return createDirectory(path, true, true, mode, owner, protectionClass, error, group);
+}
+
+bool VSAFileManager::createDirectory(const std::string& path, bool intermediates, bool durable,
+                                     mode_t mode, uid_t owner, uint32_t protectionClass,
+                                     VSAErrorRef* error, std::optional<gid_t> group) {
   const char* fn = "createDirectoryAtURL";
   bool created = false;
+  int made = 0;  // directories made, `path` the deepest
   if (intermediates) {
-    if (int rc = makePath(path, mode, &created)) {
+    int rc = makePath(path, mode, &made);
+    created = made > 0;
+    if (rc) {
       VSASetError(
           error, VSAFileManagerFail(rc, fn, "mkpath_np of %s failed: %s", path, std::strerror(rc)));
       return false;
@@ -161,6 +176,7 @@ bool VSAFileManager::createDirectoryAtURL(const std::string& path, bool intermed
     return false;
   } else {
     created = rc == 0;
+    made = created ? 1 : 0;
   }
   if (protectionClass != kVSANoProtectionClass) {
     if (int rc = fs_->setProtectionClass(path, static_cast<int>(protectionClass))) {
@@ -182,6 +198,22 @@ bool VSAFileManager::createDirectoryAtURL(const std::string& path, bool intermed
                                             path, std::strerror(rc)));
       return false;
     }
+  }
+  // Each directory made is named by an entry of its parent: synced, that
+  // entry survives a power loss, and with it what is later committed below.
+  std::string child = path;
+  for (int i = 0; durable && i < made; ++i) {
+    std::string parent = VSADirectoryName(child);
+    int raw = -1;
+    int rc = fs_->openDirectory(parent.empty() ? "." : parent, &raw);
+    VSAUniqueFd directory(raw);
+    if (rc == 0) rc = fs_->syncDirectory(directory.get());
+    if (rc != 0) {
+      VSASetError(error,
+                  VSAFileManagerFail(rc, fn, "Failed to sync %s: %s", parent, std::strerror(rc)));
+      return false;
+    }
+    child = parent;
   }
   return true;
 }
@@ -224,18 +256,18 @@ bool VSAFileManager::createDirectoriesAt(int base, const std::string& relativePa
 // missing: a directory whose parent exists (the usual case) costs one mkdir,
 // an existing one a mkdir and an lstat, however deep the path. A non-directory
 // (a symbolic link included) in the way is ENOTDIR.
-int VSAFileManager::makePath(const std::string& path, mode_t mode, bool* created, int depth) {
-  *created = false;
+int VSAFileManager::makePath(const std::string& path, mode_t mode, int* made, int depth) {
+  *made = 0;
   if (path.empty() || path == "/" || depth > 256) return path.empty() ? ENOENT : 0;
   int rc = fs_->mkdir(path, mode);
+  int parentsMade = 0;
   if (rc == ENOENT) {
     std::string parent = VSADirectoryName(path);
     if (parent == path) return rc;
-    bool parentCreated = false;
-    if (int prc = makePath(parent, mode, &parentCreated, depth + 1)) return prc;
+    if (int prc = makePath(parent, mode, &parentsMade, depth + 1)) return prc;
     rc = fs_->mkdir(path, mode);
   }
-  if (rc == 0) *created = true;
+  if (rc == 0) *made = parentsMade + 1;
   if (rc == EEXIST) {
     struct stat st;
     if (int src = fs_->lstat(path, &st)) return src;

@@ -62,6 +62,13 @@ class VSAFileManager {
   bool createDirectoryAtURL(const std::string& path, bool withIntermediateDirectories, mode_t mode,
                             uid_t owner, uint32_t protectionClass, VSAErrorRef* error,
                             std::optional<gid_t> group = std::nullopt);
+  // The same with intermediate directories, made durable: the directory
+  // holding each directory the call made is synced before it returns. For a
+  // directory that things are then committed into by rename (such a commit
+  // syncs the directory, not the entry that names it).
+  bool createDurableDirectoryAtURL(const std::string& path, mode_t mode, uid_t owner,
+                                   uint32_t protectionClass, VSAErrorRef* error,
+                                   std::optional<gid_t> group = std::nullopt);
   // Makes the missing directories of `relativePath` (plain names joined by
   // "/") below directory `base`, by descriptor and on `base`'s device: each
   // one made gets `mode` and is given to `owner`:`group`; one already there
@@ -74,6 +81,11 @@ class VSAFileManager {
                      bool durable = true);
   // Swaps two existing items atomically (each takes the other's place).
   bool exchangeItemsAtURL(const std::string& a, const std::string& b, VSAErrorRef* error);
+  // Syncs every directory of the tree at `path`, deepest first, so that the
+  // entries made in it survive a power loss: what is built in staging is
+  // synced before the rename that commits it, which makes only the tree's
+  // own entry durable.
+  bool syncDirectoriesAtURL(const std::string& path, VSAErrorRef* error);
   bool moveItemIfExistsAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
   bool copyItemAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
   // Writes a whole file atomically and durably: a temporary file beside it
@@ -181,9 +193,12 @@ class VSAFileManager {
   std::optional<gid_t> systemUsersGroup(VSAErrorRef* error);
   bool setSystemContainerACLAtURL(const std::string& path, VSASystemContainerACL kind,
                                   VSAErrorRef* error);
-  // mkdir -p from the bottom up: 0 or an errno.
-  // `created` tells whether `path` itself was made by this call.
-  int makePath(const std::string& path, mode_t mode, bool* created, int depth = 0);
+  bool createDirectory(const std::string& path, bool intermediates, bool durable, mode_t mode,
+                       uid_t owner, uint32_t protectionClass, VSAErrorRef* error,
+                       std::optional<gid_t> group);
+  // mkdir -p from the bottom up: 0 or an errno. `made` tells how many
+  // directories this call made: `path` itself and the parents above it.
+  int makePath(const std::string& path, mode_t mode, int* made, int depth = 0);
 
   std::shared_ptr<VSAFileSystem> fs_;
   std::shared_ptr<const VSAUserDatabase> userDatabase_;

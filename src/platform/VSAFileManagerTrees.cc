@@ -1,4 +1,4 @@
-// Whole-tree operations of VSAFileManager: walking, removal, copying,
+// Whole-tree operations of VSAFileManager: walking, syncing, removal, copying,
 // ownership and ACL normalisation, disk usage.
 #include <cstring>
 
@@ -109,6 +109,37 @@ bool VSAFileManager::traverseDirectory(const std::string& path, VSAErrorRef* err
     return false;
   }
   return true;
+}
+
+bool VSAFileManager::syncDirectoriesAtURL(const std::string& path, VSAErrorRef* error) {
+  // An empty directory has no entry to make durable: only the directories
+  // something was met in are synced. One flag per directory being walked.
+  std::vector<bool> holding;
+  int failed = 0;
+  std::string failedPath;
+  bool walked = traverseDirectory(path, error, [&](const VSAWalkItem& item, WalkPhase phase) {
+    if (phase != WalkPhase::DirectoryEnd) {
+      if (!holding.empty()) holding.back() = true;
+      if (phase == WalkPhase::Directory) holding.push_back(false);
+      return true;
+    }
+    bool held = holding.back();
+    holding.pop_back();
+    if (!held) return true;
+    int raw = -1;
+    int rc = fs_->openDirectoryAt(item.directory, item.name, &raw);
+    VSAUniqueFd directory(raw);
+    if (rc == 0) rc = fs_->syncDirectory(directory.get());
+    if (rc == 0) return true;
+    failed = rc;
+    failedPath = item.path;
+    return false;
+  });
+  if (!walked) return false;
+  if (failed == 0) return true;
+  VSASetError(error, VSAFileManagerFail(failed, "syncDirectoriesAtURL", "sync of %@ failed: %s",
+                                        failedPath, std::strerror(failed)));
+  return false;
 }
 
 struct VSAFileManager::Removal {

@@ -164,7 +164,8 @@ class VSAFileSystem {
   // Flushes a directory's entries to disk (the second half of a commit).
   virtual int syncDirectory(int dir) = 0;
   // Creates `toName` in `toDir` (it must not exist) with the data of regular
-  // file `fromName` of `fromDir`, cloning extents where the file system can.
+  // file `fromName` of `fromDir`, cloning extents where the file system can,
+  // and syncs it (as writeFile: the data, not the directory entry).
   virtual int copyDataAt(int fromDir, const std::string& fromName, int toDir,
                          const std::string& toName, mode_t mode) = 0;
   virtual int readlinkAt(int dir, const std::string& name, std::string* target) = 0;

@@ -307,6 +307,9 @@ int VSALinuxFileSystem::copyDataAt(int fromDir, const std::string& fromName, int
       ::openat(toDir, toName.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, mode);
   if (out < 0) return errno;
   int rc = copyBytes(in.get(), out);
+  // Copies land in staging and are committed by a rename: data not yet on
+  // disk would come back empty after a power loss, under the committed name.
+  if (rc == 0 && ::fsync(out) != 0) rc = errno;
   if (::close(out) != 0 && rc == 0) rc = errno;
   if (rc != 0) ::unlinkat(toDir, toName.c_str(), 0);
   return rc;

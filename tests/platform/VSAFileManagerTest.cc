@@ -328,4 +328,37 @@ TEST_F(FileManager, FastSizingFallsBackToTheFullWalk) {
   EXPECT_GT(fm_->fastDiskUsageForURL(base_), 0u);
 }
 
+// Under the fault-injecting layer's power-loss model: what a durable
+// creation makes, and a staged tree synced before its commit, survive the
+// power failing right after; the plain forms do not.
+TEST_F(FileManager, DurableDirectoriesAndSyncedTreesOutliveAPowerLoss) {
+  using CrashModel = VSAFaultInjectingFileSystem::CrashModel;
+  VSAErrorRef error;
+  faults_->crashAfter(1 << 20, CrashModel::PowerLoss);
+  ASSERT_TRUE(
+      fm_->createDirectoryAtURL(root_ + "/plain/a/b", true, 0755, 0, kVSANoProtectionClass, &error))
+      << error;
+  ASSERT_TRUE(fm_->createDurableDirectoryAtURL(root_ + "/durable/a/b", 0755, 0,
+                                               kVSANoProtectionClass, &error))
+      << error;
+  for (const char* name : {"synced", "unsynced"}) {
+    std::string staged = root_ + "/staging-" + name;
+    ASSERT_TRUE(fm_->createDirectoryAtURL(staged + "/Library/Caches", true, 0755, 0,
+                                          kVSANoProtectionClass, &error))
+        << error;
+    if (std::string(name) == "synced") {
+      ASSERT_TRUE(fm_->syncDirectoriesAtURL(staged, &error)) << error;
+    }
+    ASSERT_TRUE(fm_->moveItemAtURL(staged, base_ + "/" + name, &error)) << error;
+  }
+  faults_->crashNow();
+  faults_->reset();
+  EXPECT_FALSE(fs::exists(base_ + "/Documents/plain"));
+  EXPECT_TRUE(fs::is_directory(root_ + "/durable/a/b"));
+  EXPECT_TRUE(fs::is_directory(base_ + "/synced/Library/Caches"));
+  // The commit's rename made the staged directory's own entry durable only.
+  EXPECT_TRUE(fs::is_directory(base_ + "/unsynced"));
+  EXPECT_FALSE(fs::exists(base_ + "/unsynced/Library"));
+}
+
 }  // namespace

@@ -1,16 +1,19 @@
 // Crash sweeps of every operation that changes the disk, judged by the root
 // checker. For each crash point n the operation runs with the file system
-// stopped after its n-th call (every later call fails and changes nothing,
-// as if the device had lost power), then a new daemon context starts on the
-// same root as the first start after a boot (boot setup, replace recovery,
-// pending protection changes, both cleanups), and then:
+// stopped after its n-th call, twice: once as if the process had died there
+// (every later call fails and changes nothing; what reached the disk stays),
+// and once as if the device had lost power there (the same, and what the
+// operation had not yet made durable is undone: unsynced renames go back,
+// entries made in directories not synced since vanish). Then a new daemon
+// context starts on the same root as the first start after a boot (boot
+// setup, replace recovery, pending protection changes, both cleanups), and:
 //   - the root checker finds nothing,
 //   - every container that existed before and that the operation does not
 //     remove is still found, with the same UUID,
 //   - the operation's own promise holds (below, per operation).
 // CI runs a sample of the crash points of each operation; VESSA_SWEEP=full
 // runs every one. The table of operations, crash points and clean restarts
-// is printed at the end:
+// (a row per crash model) is printed at the end:
 //   VESSA_SWEEP=full build/tests/test_reliability --gtest_filter='CrashSweep.*'
 #include <gtest/gtest.h>
 
@@ -46,9 +49,9 @@ class SweepTablePrinter : public ::testing::Environment {
  public:
   void TearDown() override {
     if (sweepTable().empty()) return;
-    std::printf("\n%-46s %12s %8s %8s  %s\n", "operation", "crash points", "run", "clean", "codes");
+    std::printf("\n%-56s %12s %8s %8s  %s\n", "operation", "crash points", "run", "clean", "codes");
     for (const auto& r : sweepTable())
-      std::printf("%-46s %12d %8d %8d  %s\n", r.operation.c_str(), r.points, r.run, r.clean,
+      std::printf("%-56s %12d %8d %8d  %s\n", r.operation.c_str(), r.points, r.run, r.clean,
                   r.codes.c_str());
   }
 };
@@ -130,43 +133,57 @@ class CrashSweep : public VSAContainerTestRoot {
     }
   }
 
-  // Sweeps `operation` over its crash points. `prepare(n)` makes what the
-  // operation works on (fresh names per point); `operation(n)` answers its
-  // result code (it must succeed when nothing stops it); `after(n)` checks
-  // the operation's own promise once the root has been brought into order.
+  // Sweeps `operation` over its crash points, under each crash model.
+  // `prepare(k)` makes what the operation works on (fresh names for each run
+  // k: 0 uninterrupted, then one number per crash point and model);
+  // `operation(k)` answers its result code (it must succeed when nothing
+  // stops it); `after(k)` checks the operation's own promise once the root
+  // has been brought into order; it finds the code the run answered in
+  // `answered_`: a result the operation reported done must outlive the crash.
   void sweep(const std::string& name, const std::function<void(int)>& prepare,
              const std::function<VSAResultCode(int)>& operation,
              const std::function<void(int)>& after) {
     prepare(0);
     faults_->reset();
-    ASSERT_EQ(operation(0), VSAResult::kSuccess) << name << " does not succeed uninterrupted";
+    answered_ = operation(0);
+    ASSERT_EQ(answered_, VSAResult::kSuccess) << name << " does not succeed uninterrupted";
     int total = faults_->totalCalls();
     restartAfterBoot();
     after(0);
     ASSERT_GT(total, 0);
-    SweepRow row{name, total, 0, 0, ""};
-    for (int n : crashPoints(total)) {
-      SCOPED_TRACE(name + ": crash after call " + std::to_string(n) + " of " +
-                   std::to_string(total));
-      prepare(n);
-      faults_->reset();
-      faults_->crashAfter(n);
-      operation(n);
-      // Background work the operation started (emptying death row) dies
-      // with the process too: it must not run on once the file system
-      // works again, moving half-removed trees aside as no crash would.
-      drainBackground();
-      faults_->reset();
-      restartAfterBoot();
-      ++row.run;
-      expectCheckerClean();
-      expectNothingLost();
-      after(n);
-      if (HasFailure()) break;
-      ++row.clean;
+    using CrashModel = VSAFaultInjectingFileSystem::CrashModel;
+    for (CrashModel model : {CrashModel::ProcessDeath, CrashModel::PowerLoss}) {
+      bool powerLoss = model == CrashModel::PowerLoss;
+      SweepRow row{name + (powerLoss ? " (power loss)" : ""), total, 0, 0, ""};
+      for (int n : crashPoints(total)) {
+        SCOPED_TRACE(row.operation + ": crash after call " + std::to_string(n) + " of " +
+                     std::to_string(total));
+        int k = powerLoss ? total + n : n;
+        prepare(k);
+        faults_->reset();
+        faults_->crashAfter(n, model);
+        answered_ = operation(k);
+        // Background work the operation started (emptying death row) dies
+        // with the process too: it must not run on once the file system
+        // works again, moving half-removed trees aside as no crash would.
+        drainBackground();
+        // An operation that made fewer calls than the crash point (the last
+        // point: all of them) returned first; the power fails after it.
+        faults_->crashNow();
+        faults_->reset();
+        restartAfterBoot();
+        ++row.run;
+        expectCheckerClean();
+        expectNothingLost();
+        after(k);
+        if (HasFailure()) break;
+        ++row.clean;
+      }
+      sweepTable().push_back(row);
+      std::printf("%s: %d crash points, %d run, %d clean\n", row.operation.c_str(), total, row.run,
+                  row.clean);
+      if (HasFailure()) return;
     }
-    sweepTable().push_back(row);
-    std::printf("%s: %d crash points, %d run, %d clean\n", name.c_str(), total, row.run, row.clean);
   }
 
   // Every call of the run, or a dozen spread over it (always the last).
@@ -231,11 +248,13 @@ class CrashSweep : public VSAContainerTestRoot {
 
   static std::string at(const char* prefix, int n) { return prefix + std::to_string(n); }
   std::map<std::string, Known> known_;
+  VSAResultCode answered_ = VSAResult::kSuccess;  // by the sweep's last run of the operation
 };
 
 TEST_F(CrashSweep, CreationOfDataAndSystemContainers) {
   for (VSAContainerClass c : {2u, 12u}) {
     std::string prefix = c == 2 ? "com.example.new." : "com.example.system.";
+    std::map<std::string, std::string> whole;  // what the uninterrupted creation made
     sweep(
         c == 2 ? "create data container" : "create system container", [](int) {},
         [&](int n) {
@@ -244,9 +263,16 @@ TEST_F(CrashSweep, CreationOfDataAndSystemContainers) {
           return code;
         },
         [&](int n) {
-          // Made whole or not at all; if made, it must stay.
-          if (auto m = lookup(prefix + std::to_string(n), c))
-            known_[prefix + std::to_string(n)] = {c, m->uuid()};
+          // Made whole or not at all; if made, it must stay. One reported
+          // made must have been made.
+          auto m = lookup(prefix + std::to_string(n), c);
+          if (answered_ == VSAResult::kSuccess) {
+            EXPECT_TRUE(m) << "a container reported created was lost";
+          }
+          if (!m) return;
+          known_[prefix + std::to_string(n)] = {c, m->uuid()};
+          if (n == 0) whole = shapeOf(m->url());
+          EXPECT_EQ(shapeOf(m->url()), whole);
         });
   }
 }
@@ -261,13 +287,18 @@ TEST_F(CrashSweep, DeletionThroughDeathRow) {
         return code;
       },
       [&](int n) {
-        // Either still whole (the rename did not happen) or gone for good.
+        // Either still whole (the rename did not happen) or gone for good;
+        // gone if the deletion was reported done.
         EXPECT_EQ(entries(context_->globalConfiguration->deathrowDirectory()), 0u) << n;
+        if (answered_ == VSAResult::kSuccess) {
+          EXPECT_FALSE(lookup(at("com.example.doomed.", n))) << "a deleted container came back";
+        }
       });
 }
 
 TEST_F(CrashSweep, WipeKeepsPathAndUUID) {
   std::string file;
+  std::map<std::string, std::string> fresh;  // what the uninterrupted wipe left
   sweep(
       "wipe data container",
       [&](int n) {
@@ -284,9 +315,14 @@ TEST_F(CrashSweep, WipeKeepsPathAndUUID) {
       [&](int n) {
         auto m = lookup(at("com.example.wiped.", n));
         ASSERT_TRUE(m);
-        // Old content whole, or a fresh structure.
+        // Old content whole, or a fresh structure; fresh if the wipe was
+        // reported done.
+        if (n == 0) fresh = shapeOf(m->url());
+        if (answered_ == VSAResult::kSuccess) {
+          EXPECT_NE(read(file), "precious") << "a wiped container's content came back";
+        }
         if (read(file) != "precious") {
-          EXPECT_TRUE(fs::is_directory(m->url() + "/Documents"));
+          EXPECT_EQ(shapeOf(m->url()), fresh);
         }
       });
 }
@@ -307,12 +343,18 @@ TEST_F(CrashSweep, ReplaceLosesNeitherContainer) {
                                               false, false, &code);
         return code;
       },
-      [](int) {});
+      [&](int n) {
+        if (answered_ == VSAResult::kSuccess) {
+          EXPECT_FALSE(lookup(at("com.example.old.", n))) << "a replaced container came back";
+        }
+      });
 }
 
 TEST_F(CrashSweep, MaintenanceOperations) {
+  std::string before;
   sweep(
-      "regenerate directory UUID", [&](int n) { made(at("com.example.renamed.", n)); },
+      "regenerate directory UUID",
+      [&](int n) { before = made(at("com.example.renamed.", n))->url(); },
       [&](int n) {
         // The directory's name changes; the container's UUID does not.
         VSAResultCode code = VSAResult::kSuccess;
@@ -320,11 +362,19 @@ TEST_F(CrashSweep, MaintenanceOperations) {
             identity(at("com.example.renamed.", n)), &code);
         return code;
       },
-      [](int) {});
+      [&](int n) {
+        auto m = lookup(at("com.example.renamed.", n));
+        ASSERT_TRUE(m);
+        if (answered_ == VSAResult::kSuccess) {
+          EXPECT_NE(m->url(), before) << "the directory's new name was lost";
+        }
+      });
+  std::map<std::string, std::string> whole;  // a container with its default structure
   sweep(
       "recreate default structure",
       [&](int n) {
         auto m = made(at("com.example.restructured.", n));
+        if (n == 0) whole = shapeOf(m->url());
         fs::remove_all(m->url() + "/Library");
       },
       [&](int n) {
@@ -333,7 +383,13 @@ TEST_F(CrashSweep, MaintenanceOperations) {
             identity(at("com.example.restructured.", n)), &code);
         return code;
       },
-      [](int) {});
+      [&](int n) {
+        auto m = lookup(at("com.example.restructured.", n));
+        ASSERT_TRUE(m);
+        if (answered_ == VSAResult::kSuccess) {
+          EXPECT_EQ(shapeOf(m->url()), whole) << "the recreated structure was lost";
+        }
+      });
   sweep(
       "set info value", [&](int n) { made(at("com.example.info.", n)); },
       [&](int n) {
@@ -347,6 +403,9 @@ TEST_F(CrashSweep, MaintenanceOperations) {
         VSAValue key("Flavour");
         auto v =
             installer()->infoValueForKey(&key, identity(at("com.example.info.", n)), true, &code);
+        if (answered_ == VSAResult::kSuccess) {
+          EXPECT_TRUE(v) << "a value reported set was lost";
+        }
         if (v) {
           ASSERT_TRUE(v->stringValue());
           EXPECT_EQ(*v->stringValue(), "mint");
@@ -519,6 +578,45 @@ TEST_F(CrashSweep, FullDiskAndIOErrorsAtEachStepLeaveTheRootInOrder) {
 }  // namespace
 
 namespace {
+
+// The sweeps start from a root whose directories exist and count as durable.
+// On a fresh root the first start makes them (class directories, staging,
+// the library directory), and a container committed into a class directory
+// lives only as long as that directory's own entry: the power fails right
+// after the first creation was reported, and the container must be found.
+TEST_F(CrashSweep, AContainerMadeOnAFreshRootOutlivesAPowerLoss) {
+  VSATestTempDir fresh{"vessa-fresh"};
+  context_.reset();
+  root_ = fresh.path();
+  VSAWriteMobileUser(root_);
+  std::ofstream(root_ + "/etc/group") << "mobile:x:501:\nsystemusers:x:600:\n";
+  using CrashModel = VSAFaultInjectingFileSystem::CrashModel;
+  // Tracked from the context's first call: nothing the daemon made is durable
+  // until it syncs it.
+  context_ = std::make_unique<VSADaemonContext>(
+      VSASystemRoot(root_), [this](std::shared_ptr<VSAFileSystem> real) {
+        faults_ = std::make_shared<VSAFaultInjectingFileSystem>(std::move(real));
+        faults_->crashAfter(1 << 30, CrashModel::PowerLoss);
+        return faults_;
+      });
+  user_ = context_->userIdentityCache->userIdentityForPersonalPersona();
+  auto c = installer();
+  c->rebootKeeperSetup();
+  c->keeperSetup();
+  for (VSAContainerClass cls : {2u, 12u}) {
+    VSAResultCode code;
+    std::string id = cls == 2 ? "com.example.first" : "com.example.first.system";
+    auto m = create(*installer(), id, &code, false, cls);
+    ASSERT_TRUE(m) << code;
+    known_[id] = {cls, m->uuid()};
+  }
+  faults_->crashNow();
+  faults_->reset();
+  restartAfterBoot();
+  expectCheckerClean();
+  expectNothingLost();
+  context_.reset();  // before `fresh` goes
+}
 
 // Death row is emptied while other work moves items onto it: an emptying
 // can remove the fresh directory an item is about to be moved into. The item
