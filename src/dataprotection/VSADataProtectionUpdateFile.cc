@@ -122,8 +122,9 @@ bool VSAWriteDataProtectionUpdate(const VSADataProtectionUpdate& update, const s
                                   VSAFileManager& fm, int protectionClass, mode_t mode,
                                   VSAErrorRef* error) {
   std::string directory = VSADirectoryName(url);
+  // Made durably: the update file committed into it must survive a power loss.
   if (!fm.itemExistsAtURL(directory) &&
-      !fm.createDirectoryAtURL(directory, true, 0755, 0, kVSANoProtectionClass, error))
+      !fm.createDurableDirectoryAtURL(directory, 0755, 0, kVSANoProtectionClass, error))
     return false;
   auto bytes = VSAPlist::serialize(update.plist(), VSAPlist::Format::Binary, error);
   if (!bytes) return false;

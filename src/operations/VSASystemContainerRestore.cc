@@ -215,7 +215,8 @@ void VSASystemContainerRestore::_moveFailedPathAside(const std::string& item,
   const char* origin = "_moveFailedPathAside";
   auto& fm = *services_.fileManager;
   VSAErrorRef error;
-  if (!fm.createDirectoryAtURL(failureDirectory, true, 0700, 0, kVSANoProtectionClass, &error)) {
+  // Made durably: what is moved into it was a backup and must not vanish with it.
+  if (!fm.createDurableDirectoryAtURL(failureDirectory, 0700, 0, kVSANoProtectionClass, &error)) {
     logRestore(kVSALogError, origin, "Failed to create %@: %@", failureDirectory, error);
     return;
   }
