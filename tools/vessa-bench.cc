@@ -265,7 +265,8 @@ class RawContainers {
 
   // A new container as creation makes it: staging directory, metadata file
   // (written, fsynced, renamed), sub-directories with owner, mode and class,
-  // and the rename into place.
+  // the staged directories that hold entries synced (so that the tree
+  // survives a power loss once committed), and the rename into place.
   void create(const std::string& name) {
     std::string dir = staging_ + "/" + name;
     fs_.mkdir(dir, 0755);
@@ -282,6 +283,13 @@ class RawContainers {
       fs_.lchown(sub, 501, 501);
       fs_.chmod(sub, 0755);
       fs_.setProtectionClass(sub, 0);
+    }
+    for (const std::string& holder : {dir + "/Library", dir}) {
+      int fd = -1;
+      if (fs_.openDirectory(holder, &fd) == 0) {
+        fs_.syncDirectory(fd);
+        close(fd);
+      }
     }
     fs_.rename(dir, live_ + "/" + name);
   }
