@@ -23,6 +23,7 @@
 #include <vector>
 
 #include "VSABenchTable.h"
+#include "base/VSACommands.h"
 #include "base/VSALog.h"
 #include "base/VSAPlist.h"
 #include "base/VSAUUID.h"
@@ -57,7 +58,11 @@ std::vector<std::string> populate(const std::string& root, int containers, int o
       ->writeCurrentBuildInfoToDisk();
   auto connection = VSAClientConnection::sharedClientConnection(context);
   auto user = context.userIdentityCache->defaultUserIdentity();
-  const VSAContainerClass classes[] = {2, 2, 2, 4, 4, 7, 1, 1, 6, 10};
+  using namespace VSAClass;
+  const VSAContainerClass classes[] = {kDataApplication,   kDataApplication,   kDataApplication,
+                                       kDataPlugin,        kDataPlugin,        kAppGroup,
+                                       kBundleApplication, kBundleApplication, kDataVPNPlugin,
+                                       kDataInternalDaemon};
   std::vector<std::string> classDirectories;
   for (int i = 0; i < containers; ++i) {
     VSAContainerClass c = classes[i % 10];
@@ -70,7 +75,8 @@ std::vector<std::string> populate(const std::string& root, int containers, int o
       std::exit(1);
     }
   }
-  for (VSAContainerClass c : {1, 2, 4, 6, 7, 10})
+  for (VSAContainerClass c : {kBundleApplication, kDataApplication, kDataPlugin, kDataVPNPlugin,
+                              kAppGroup, kDataInternalDaemon})
     classDirectories.push_back(
         *context.globalConfiguration->containerDirectoryURLForUserIdentity(user, c, false));
   for (int i = 0; i < orphans; ++i) {
@@ -130,8 +136,9 @@ DaemonBoot daemonBoot(const std::string& vessad, const std::string& root) {
     if (boot.firstReply == 0) {
       VSAIPCClient client;
       if (client.connect(socket, nullptr) &&
-          client.sendRequest(VSAValue::Dictionary{{"Command", VSAValue(uint64_t{32})}},
-                             std::chrono::seconds(60), nullptr))
+          client.sendRequest(
+              VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kPersonaUniqueStrings)}},
+              std::chrono::seconds(60), nullptr))
         boot.firstReply = seconds(start);
     }
     for (const auto& name : notifications.postedNames())

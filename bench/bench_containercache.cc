@@ -41,13 +41,15 @@ struct Device {
     identities = VSAUserIdentityCache::create(
         {std::make_shared<VSALinuxPersonaService>(r), users, 501, 501, true, nullptr});
     user = identities->userIdentityForPersonalPersona();
-    std::string base = *config->containerDirectoryURLForUserIdentity(user, 2, false);
+    std::string base =
+        *config->containerDirectoryURLForUserIdentity(user, VSAClass::kDataApplication, false);
     for (int i = 0; i < kContainers; ++i) {
       VSAUUID uuid = VSAUUID::random();
       std::string dir = base + "/" + uuid.string();
       fs::create_directory(dir);
       auto identity = VSAConcreteContainerIdentity::containerIdentityWithUUID(
-          VSAUUID::random(), user, "com.bench.app" + std::to_string(i), 2, nullptr);
+          VSAUUID::random(), user, "com.bench.app" + std::to_string(i), VSAClass::kDataApplication,
+          nullptr);
       VSAMetadata m(identity, std::nullopt, dir, std::nullopt);
       auto bytes = VSAPlist::serialize(m.plist(), VSAPlist::Format::Binary, nullptr);
       files.push_back(dir + "/" + kVSAMetadataFileName);
@@ -116,7 +118,8 @@ BENCHMARK(BM_RawMetadataReads)->Unit(benchmark::kMillisecond);
 void BM_BuildClassMap(benchmark::State& state) {
   for (auto _ : state) {
     auto cache = device().freshCache();
-    auto all = cache->allContainersForUserIdentity(device().user, 2, {}, nullptr);
+    auto all =
+        cache->allContainersForUserIdentity(device().user, VSAClass::kDataApplication, {}, nullptr);
     if (!all || all->size() != static_cast<size_t>(kContainers))
       state.SkipWithError("class map incomplete");
   }
@@ -130,7 +133,7 @@ int main(int argc, char** argv) {
   long before = maxRSSKiB();
   {
     auto cache = device().freshCache();
-    cache->allContainersForUserIdentity(device().user, 2, {}, nullptr);
+    cache->allContainersForUserIdentity(device().user, VSAClass::kDataApplication, {}, nullptr);
     std::printf(
         "peak RSS after building one map of %d containers: %ld KiB (grew %ld KiB, %.0f "
         "bytes per container)\n\n",

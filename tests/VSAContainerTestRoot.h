@@ -66,11 +66,13 @@ class VSAContainerTestRoot : public ::testing::Test {
   std::unique_ptr<VSAClientConnection> installer() {
     return connection("com.example.installer", true, true);
   }
-  VSAContainerIdentityRef identity(const std::string& id, VSAContainerClass c = 2) {
+  VSAContainerIdentityRef identity(const std::string& id,
+                                   VSAContainerClass c = VSAClass::kDataApplication) {
     return VSAContainerIdentity::containerIdentityWithUserIdentity(user_, id, c, nullptr);
   }
   VSAMetadataRef create(VSAClientConnection& c, const std::string& id, VSAResultCode* code,
-                        bool transient = false, VSAContainerClass cls = 2) {
+                        bool transient = false,
+                        VSAContainerClass cls = VSAClass::kDataApplication) {
     *code = VSAResult::kSuccess;
     return c.createOrLookupContainerWithContainerIdentity(
         identity(id, cls), {.createIfNecessary = true, .transient = transient}, code);
@@ -81,7 +83,7 @@ class VSAContainerTestRoot : public ::testing::Test {
     return std::string(std::istreambuf_iterator<char>(in), {});
   }
   // The live container of `id`, never created.
-  VSAMetadataRef lookup(const std::string& id, VSAContainerClass c = 2) {
+  VSAMetadataRef lookup(const std::string& id, VSAContainerClass c = VSAClass::kDataApplication) {
     VSAResultCode code = VSAResult::kSuccess;
     return installer()->createOrLookupContainerWithContainerIdentity(identity(id, c), {}, &code);
   }
@@ -89,11 +91,12 @@ class VSAContainerTestRoot : public ::testing::Test {
     if (!std::filesystem::exists(dir)) return 0;
     return static_cast<size_t>(std::distance(std::filesystem::directory_iterator(dir), {}));
   }
-  std::string classDirectory(VSAContainerClass c = 2, bool transient = false) {
+  std::string classDirectory(VSAContainerClass c = VSAClass::kDataApplication,
+                             bool transient = false) {
     return *context_->globalConfiguration->containerDirectoryURLForUserIdentity(user_, c,
                                                                                 transient);
   }
-  std::string staging(VSAContainerClass c = 2) {
+  std::string staging(VSAContainerClass c = VSAClass::kDataApplication) {
     return context_->globalConfiguration->stagingDirectoryURLForUserIdentity(user_, c);
   }
   // Runs one stage-for-delete command of the context's environment; its code.

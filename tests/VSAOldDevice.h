@@ -53,14 +53,15 @@ struct VSAOldDevice {
       VSAValue k(key);
       installer.setInfoValue(&value, &k, identity, true, &code);
     };
-    setInfo(make(kCached, 1), "com.tamsk.Ferrox.CachedCodeSigningInfo",
+    setInfo(make(kCached, VSAClass::kBundleApplication), "com.tamsk.Ferrox.CachedCodeSigningInfo",
             VSAValue::Dictionary{
                 {"Entitlements", VSAValue::Dictionary{{"com.tamsk.security.application-groups",
                                                        strings({kGroup})}}},
                 {"SignerType", VSAValue("developer")}});
-    make(kCached, 2);
-    setInfo(make(kGrouped, 2), "com.tamsk.Ferrox.GroupContainerIDs", strings({kGroup}));
-    make(kGroup, 7);
+    make(kCached, VSAClass::kDataApplication);
+    setInfo(make(kGrouped, VSAClass::kDataApplication), "com.tamsk.Ferrox.GroupContainerIDs",
+            strings({kGroup}));
+    make(kGroup, VSAClass::kAppGroup);
     VSAValue legacy = VSAValue::Dictionary{
         {kLegacy,
          VSAValue::Dictionary{{"com.tamsk.security.application-groups", strings({kGroup})}}},

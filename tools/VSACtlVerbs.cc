@@ -3,6 +3,8 @@
 #include <cstdlib>
 #include <map>
 
+#include "base/VSACommands.h"
+#include "base/VSAContainerClasses.h"
 #include "base/VSAError.h"
 #include "base/VSAJSON.h"
 #include "base/VSAUUID.h"
@@ -64,8 +66,8 @@ std::optional<Parsed> parse(const std::vector<std::string>& args, std::string* e
 }
 
 // Identifier, class (data by default), persona and UUID of a container.
-VSAValue container(uint64_t command, const Parsed& p, const std::string& id,
-                   uint64_t defaultClass = 2) {
+VSAValue container(VSACommandNumber command, const Parsed& p, const std::string& id,
+                   VSAContainerClass defaultClass = VSAClass::kDataApplication) {
   VSAValue r =
       VSAValue::Dictionary{{"Command", VSAValue(command)},
                            {"Identifier", VSAValue(id)},
@@ -121,13 +123,15 @@ const VSACtlVerb* VSACtlVerbs::find(const std::string& name) {
 }
 
 std::optional<uint64_t> VSACtlVerbs::classNamed(const std::string& text) {
-  for (uint64_t c = 1; c <= 13; ++c)
+  for (VSAContainerClass c = kVSAContainerClassMin; c <= kVSAContainerClassMax; ++c)
     if (text == kClassNames[c] || text == std::to_string(c)) return c;
   return std::nullopt;
 }
 
 const char* VSACtlVerbs::className(uint64_t containerClass) {
-  return containerClass >= 1 && containerClass <= 13 ? kClassNames[containerClass] : "unknown";
+  return containerClass >= kVSAContainerClassMin && containerClass <= kVSAContainerClassMax
+             ? kClassNames[containerClass]
+             : "unknown";
 }
 
 const char* VSACtlVerbs::meaningOfCode(uint64_t code) {
@@ -157,37 +161,44 @@ std::optional<VSAValue> VSACtlVerbs::request(const std::string& verb,
   };
   if (verb == "create" || verb == "lookup") {
     if (!need(1)) return std::nullopt;
-    VSAValue r = container(0, p, pos[0]);
+    VSAValue r = container(VSACommands::kCreateOrLookup, p, pos[0]);
     r.set("CreateIfNecessary", verb == "create");
     return r;
   }
   if (verb == "ls") {
     if (!need(0)) return std::nullopt;
-    VSAValue r = VSAValue::Dictionary{{"Command", VSAValue(1u)},
-                                      {"ContainerClass", VSAValue(p.containerClass.value_or(2))}};
+    VSAValue r = VSAValue::Dictionary{
+        {"Command", VSAValue(VSACommands::kListContainers)},
+        {"ContainerClass", VSAValue(p.containerClass.value_or(VSAClass::kDataApplication))}};
     if (p.transient) r.set("Transient", true);
     return r;
   }
-  static const std::map<std::string, uint64_t> single = {
-      {"rm", 10}, {"regen-uuid", 9}, {"restructure", 8}, {"usage", 23}};
+  static const std::map<std::string, VSACommandNumber> single = {
+      {"rm", VSACommands::kDeleteContainer},
+      {"regen-uuid", VSACommands::kRegenerateDirectoryUUID},
+      {"restructure", VSACommands::kRecreateDefaultStructure},
+      {"usage", VSACommands::kDiskUsage}};
   if (auto it = single.find(verb); it != single.end()) {
     if (!need(1)) return std::nullopt;
     return container(it->second, p, pos[0]);
   }
   if (verb == "show") {
     if (!need(1)) return std::nullopt;
-    VSAValue r = container(7, p, pos[0]);
+    VSAValue r = container(VSACommands::kContainerMetadata, p, pos[0]);
     r.set("InfoDictRequested", true);
     return r;
   }
   if (verb == "wipe") {
     if (!need(1)) return std::nullopt;
-    return container(p.containerClass == 4u ? 11 : 12, p, pos[0]);
+    return container(p.containerClass == VSAClass::kDataPlugin
+                         ? VSACommands::kWipePluginData
+                         : VSACommands::kDeleteContainerContent,
+                     p, pos[0]);
   }
   if (verb == "replace") {
     if (!need(2)) return std::nullopt;
-    uint64_t c = p.containerClass.value_or(2);
-    VSAValue r = VSAValue::Dictionary{{"Command", VSAValue(2u)},
+    VSAContainerClass c = p.containerClass.value_or(VSAClass::kDataApplication);
+    VSAValue r = VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kReplaceContainer)},
                                       {"OldIdentifier", VSAValue(pos[0])},
                                       {"OldContainerClass", VSAValue(c)},
                                       {"NewIdentifier", VSAValue(pos[1])},
@@ -204,18 +215,20 @@ std::optional<VSAValue> VSACtlVerbs::request(const std::string& verb,
       return std::nullopt;
     }
     if (!need(pos[0] == "set" ? 4 : 3)) return std::nullopt;
-    VSAValue r = container(pos[0] == "get" ? 6 : 5, p, pos[1]);
+    VSAValue r = container(pos[0] == "get" ? VSACommands::kInfoValue : VSACommands::kSetInfoValue,
+                           p, pos[1]);
     r.set("Key", pos[2]);
     if (pos[0] == "set") r.set("Value", typed(pos[3]));
     return r;
   }
   if (verb == "groups") {
     if (!need(1)) return std::nullopt;
-    return container(14, p, pos[0], 7);
+    return container(VSACommands::kGroupContainerIdentifiers, p, pos[0], VSAClass::kAppGroup);
   }
   if (verb == "cs") {
     if (!pos.empty() && pos[0] == "get" && need(2))
-      return VSAValue::Dictionary{{"Command", VSAValue(19u)}, {"Identifier", VSAValue(pos[1])}};
+      return VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kReadCodeSigningInfo)},
+                                  {"Identifier", VSAValue(pos[1])}};
     if (!pos.empty() && pos[0] == "set" && (pos.size() == 4 || need(3))) {
       std::string why;
       auto info = VSAJSON::parse(pos[2], &why);
@@ -228,7 +241,7 @@ std::optional<VSAValue> VSACtlVerbs::request(const std::string& verb,
         *error = "registration options must be a JSON object" + (why.empty() ? "" : ": " + why);
         return std::nullopt;
       }
-      return VSAValue::Dictionary{{"Command", VSAValue(18u)},
+      return VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kRecordCodeSigningInfo)},
                                   {"Identifier", VSAValue(pos[1])},
                                   {"CodeSigningInfo", *info},
                                   {"OptionsDictionary", *options}};
@@ -242,14 +255,14 @@ std::optional<VSAValue> VSACtlVerbs::request(const std::string& verb,
       *error = "protect takes a protection class 1-4";
       return std::nullopt;
     }
-    VSAValue r = container(21, p, pos[0]);
+    VSAValue r = container(VSACommands::kSetDataProtection, p, pos[0]);
     r.set("DataProtectionClass", static_cast<uint64_t>(pos[1][0] - '0'));
     r.set("RetryIfLocked", p.retry);
     return r;
   }
   if (verb == "assets") {
     if (!need(1)) return std::nullopt;
-    VSAValue r = container(28, p, pos[0]);
+    VSAValue r = container(VSACommands::kUserManagedAssetsPath, p, pos[0]);
     r.set("CreateIfNecessary", p.create);
     return r;
   }
@@ -258,18 +271,18 @@ std::optional<VSAValue> VSACtlVerbs::request(const std::string& verb,
       *error = "deathrow takes empty";
       return std::nullopt;
     }
-    return VSAValue::Dictionary{{"Command", VSAValue(4u)}};
+    return VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kDeleteDeathRow)}};
   }
   if (verb == "personas") {
     if (!need(0)) return std::nullopt;
-    return VSAValue::Dictionary{{"Command", VSAValue(32u)}};
+    return VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kPersonaUniqueStrings)}};
   }
   if (verb == "test-lock") {
     if (!need(2) || (pos[1] != "on" && pos[1] != "off")) {
       if (error->empty()) *error = "test-lock takes N and on or off";
       return std::nullopt;
     }
-    return VSAValue::Dictionary{{"Command", VSAValue(31u)},
+    return VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kTestLock)},
                                 {"TestLock", typed(pos[0])},
                                 {"Enable", VSAValue(pos[1] == "on")}};
   }

@@ -14,6 +14,8 @@
 #include <cstdio>
 #include <cstring>
 
+#include "base/VSACommands.h"
+#include "base/VSAContainerClasses.h"
 #include "base/VSAJSON.h"
 #include "platform/VSAAuditToken.h"
 #include "platform/VSAIPCClient.h"
@@ -32,8 +34,6 @@ volatile sig_atomic_t gChild = 0;
 void passOn(int signal) {
   if (gChild > 0) ::kill(static_cast<pid_t>(gChild), signal);
 }
-
-constexpr uint64_t kBundleClass = 1;
 }  // namespace
 
 VSALauncher::VSALauncher(VSALaunchOptions options, VSALandlock& landlock)
@@ -114,9 +114,10 @@ bool VSALauncher::askForContainers(VSAUpcallClient& client, std::string* step, s
 
 std::optional<uint64_t> VSALauncher::askForBundle(VSAIPCClient& client) const {
   VSAErrorRef error;
-  VSAValue request(VSAValue::Dictionary{{"Command", VSAValue(uint64_t{0})},
-                                        {"Identifier", VSAValue(options_.signingIdentifier)},
-                                        {"ContainerClass", VSAValue(kBundleClass)}});
+  VSAValue request(
+      VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kCreateOrLookup)},
+                           {"Identifier", VSAValue(options_.signingIdentifier)},
+                           {"ContainerClass", VSAValue(VSAClass::kBundleApplication)}});
   if (!client.connect(root_.socketPath(), &error)) return std::nullopt;
   return client.send(std::move(request), &error);
 }

@@ -46,6 +46,8 @@
 #include "../bench/VSABenchTable.h"
 #include "VSABenchFloor.h"
 #include "VSABenchPin.h"
+#include "base/VSACommands.h"
+#include "base/VSAContainerClasses.h"
 #include "base/VSAPlist.h"
 #include "base/VSAUUID.h"
 #include "platform/VSAIPCClient.h"
@@ -238,10 +240,10 @@ void printPair(const char* what, const Result& base, const Result& daemon, const
     VSABenchRecord((measure + ": errors or lost replies").c_str(), "none", 0, 1);
 }
 
-VSAValue request(uint64_t command, const std::string& id, bool create = false) {
+VSAValue request(VSACommandNumber command, const std::string& id, bool create = false) {
   return VSAValue::Dictionary{{"Command", VSAValue(command)},
                               {"Identifier", VSAValue(id)},
-                              {"ContainerClass", VSAValue(2u)},
+                              {"ContainerClass", VSAValue(VSAClass::kDataApplication)},
                               {"CreateIfNecessary", VSAValue(create)}};
 }
 
@@ -432,7 +434,10 @@ int runMemory(const std::string& socket, const Options& o) {
   make.requests = (o.containers + 15) / 16;
   auto id = [](int n) { return "com.bench.memory." + std::to_string(n); };
   Result made = runClients(
-      socket, make, [&](int c, int i) { return request(0, id(c * make.requests + i), true); },
+      socket, make,
+      [&](int c, int i) {
+        return request(VSACommands::kCreateOrLookup, id(c * make.requests + i), true);
+      },
       true);
   // One process may hold only so many connections: the rest come from another one.
   const int own = std::min(o.idle, 48);
@@ -442,7 +447,8 @@ int runMemory(const std::string& socket, const Options& o) {
     VSAErrorRef error;
     // One request each, as a client that looked something up and then went quiet.
     if (client->connect(socket, &error) &&
-        client->sendRequest(request(0, id(i)), std::chrono::seconds(60), &error))
+        client->sendRequest(request(VSACommands::kCreateOrLookup, id(i)), std::chrono::seconds(60),
+                            &error))
       idle.push_back(client);
   }
   int held = o.idle > own ? holdConnectionsAs(501, socket, o.idle - own) : -1;
@@ -451,7 +457,9 @@ int runMemory(const std::string& socket, const Options& o) {
                  o.idle - own, socket.c_str());
   std::this_thread::sleep_for(std::chrono::milliseconds(500));  // let the daemon accept them
   long cached = daemonMemoryKiB(o.root);
-  RequestMaker lookup = [&](int c, int i) { return request(0, id((c * 7919 + i) % o.containers)); };
+  RequestMaker lookup = [&](int c, int i) {
+    return request(VSACommands::kCreateOrLookup, id((c * 7919 + i) % o.containers));
+  };
   Options warm = o;
   warm.requests = std::max(1, o.requests / 10);
   runClients(socket, warm, lookup, true);
@@ -563,9 +571,13 @@ int main(int argc, char** argv) {
     // The first request of a run: on a daemon that has not listed the class
     // yet it builds the class's map (every container's metadata read).
     Result first = runClients(
-        socket, one, [&](int, int) { return request(0, "com.bench.lookup", true); }, true);
+        socket, one,
+        [&](int, int) { return request(VSACommands::kCreateOrLookup, "com.bench.lookup", true); },
+        true);
     std::printf("first request: %.1f us\n", first.percentile(0.5));
-    RequestMaker make = [](int, int) { return request(0, "com.bench.lookup"); };
+    RequestMaker make = [](int, int) {
+      return request(VSACommands::kCreateOrLookup, "com.bench.lookup");
+    };
     Pinning pinning(o);
     if (!pinning.ok()) return 1;
     VSABenchFloor floor(o.floor, "stream");
@@ -586,7 +598,7 @@ int main(int argc, char** argv) {
           return runClients(
               socket, r,
               [&, k](int c, int i) {
-                return request(0,
+                return request(VSACommands::kCreateOrLookup,
                                "com.bench.create." + pid + "." + std::to_string(c) + "." +
                                    std::to_string(k * r.requests + i),
                                true);
@@ -612,12 +624,12 @@ int main(int argc, char** argv) {
         socket, one,
         [](int, int) {
           return VSAValue(VSAValue::Dictionary{
-              {"Command", VSAValue(18u)},
+              {"Command", VSAValue(VSACommands::kRecordCodeSigningInfo)},
               {"Identifier", VSAValue("com.bench.upcall")},
               {"CodeSigningInfo",
                VSAValue::Dictionary{{"com.tamsk.Vessa.Entitlements", VSAValue::dictionary()}}},
-              {"OptionsDictionary",
-               VSAValue::Dictionary{{"com.tamsk.Vessa.DataContainerClass", VSAValue(2u)}}}});
+              {"OptionsDictionary", VSAValue::Dictionary{{"com.tamsk.Vessa.DataContainerClass",
+                                                          VSAValue(VSAClass::kDataApplication)}}}});
         },
         true);
     Result warm = runUpcalls(upcallSocket, one, true);  // makes the containers
@@ -643,16 +655,17 @@ int main(int argc, char** argv) {
           "com.bench.mixed." + pid + "." + std::to_string(c) + "." + std::to_string(i / 5);
       switch (i % 5) {
         case 0:
-          return request(0, id, true);
+          return request(VSACommands::kCreateOrLookup, id, true);
         case 1:
-          return request(0, id);
+          return request(VSACommands::kCreateOrLookup, id);
         case 2:
-          return request(7, id);
+          return request(VSACommands::kContainerMetadata, id);
         case 3:
           return VSAValue(
-              VSAValue::Dictionary{{"Command", VSAValue(1u)}, {"ContainerClass", VSAValue(2u)}});
+              VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kListContainers)},
+                                   {"ContainerClass", VSAValue(VSAClass::kDataApplication)}});
         default:
-          return request(10, id);
+          return request(VSACommands::kDeleteContainer, id);
       }
     };
     double raw = rawMixedLoop(o.root, o);

@@ -19,6 +19,7 @@
 #include "VSACtlStatus.h"
 #include "VSACtlVerbs.h"
 #include "VSACtlWaitIndicator.h"
+#include "base/VSACommands.h"
 #include "base/VSAJSON.h"
 #include "base/VSAPlist.h"
 #include "daemon/VSACommandTable.h"
@@ -314,10 +315,11 @@ int main(int argc, char** argv) {
   {
     // Emptying death row and changing a protection class answer when done.
     const VSAValue* command = request.get("Command");
-    uint64_t number = command ? command->uint64Value().value_or(0) : 0;
+    VSACommandNumber number = command ? command->uint64Value().value_or(0) : 0;
     std::optional<VSACtlWaitIndicator> waiting;
-    if (number == 4 || number == 21)
-      waiting.emplace(number == 4 ? "emptying death row" : "changing the protection class");
+    if (number == VSACommands::kDeleteDeathRow || number == VSACommands::kSetDataProtection)
+      waiting.emplace(number == VSACommands::kDeleteDeathRow ? "emptying death row"
+                                                             : "changing the protection class");
     reply = client.sendRequest(request, std::chrono::seconds(timeout), &error);
   }
   if (!reply) {

@@ -13,7 +13,9 @@ VSACodeSigningEntry VSACodeSigningEntry::initWithSerializedDictionary(const VSAV
   const VSAValue* info = d.get("CodeSigningInfo");
   VSACodeSigningEntry e(
       info ? *info : VSAValue(),
-      d.get("DataContainerClass") ? d.get("DataContainerClass")->uint64Value().value_or(0) : 0);
+      d.get("DataContainerClass")
+          ? d.get("DataContainerClass")->uint64Value().value_or(VSAClass::kUndefined)
+          : VSAClass::kUndefined);
   if (const VSAValue* children = d.get("ChildBundleIds"); children && children->isArray()) {
     std::vector<std::string> ids;
     for (const VSAValue& v : *children->arrayValue())
@@ -66,7 +68,7 @@ size_t VSACodeSigningEntry::hash() const {
   h += invalid_ ? 2 : 0;
   h += placeholder_ ? 4 : 0;
   h += registeredByCaller_ ? 8 : 0;
-  h += dataContainerClass_ != 0 ? 16 : 0;
+  h += dataContainerClass_ != VSAClass::kUndefined ? 16 : 0;
   h += advanceCopy_ ? 32 : 0;
   return h;
 }

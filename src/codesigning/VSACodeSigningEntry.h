@@ -14,7 +14,8 @@
 class VSACodeSigningEntry {
  public:
   // initWithCodeSigningInfo:andDataContainerClass:
-  explicit VSACodeSigningEntry(VSAValue codeSigningInfo, VSAContainerClass dataContainerClass = 0);
+  explicit VSACodeSigningEntry(VSAValue codeSigningInfo,
+                               VSAContainerClass dataContainerClass = VSAClass::kUndefined);
   // initWithSerializedDictionary: (values are not type-checked; missing flags are false)
   static VSACodeSigningEntry initWithSerializedDictionary(const VSAValue& serialized);
 
@@ -49,5 +50,5 @@ class VSACodeSigningEntry {
   bool placeholder_ = false;
   bool advanceCopy_ = false;
   bool registeredByCaller_ = false;
-  VSAContainerClass dataContainerClass_ = 0;
+  VSAContainerClass dataContainerClass_ = VSAClass::kUndefined;
 };

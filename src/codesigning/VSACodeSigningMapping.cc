@@ -108,8 +108,8 @@ VSAResultCode VSACodeSigningMapping::processCodeSigningInfo(const std::optional<
 void VSACodeSigningMapping::_onQueue_queueSystemContainerDeletion(const std::string& identifier,
                                                                   VSACommandQueue* commandQueue) {
   VSAResultCode code = VSAResult::kSuccess;
-  auto identity = VSAContainerIdentity::containerIdentityWithIdentifier(identifier, 12,
-                                                                        *userIdentityCache_, &code);
+  auto identity = VSAContainerIdentity::containerIdentityWithIdentifier(
+      identifier, VSAClass::kSystemData, *userIdentityCache_, &code);
   if (!identity) {
     logMapping(kVSALogError, "Failed to create system container identity for %@: %@", identifier,
                code);
@@ -139,7 +139,8 @@ VSAResultCode VSACodeSigningMapping::_onQueue_processCodeSigningInfo(
     auto current = _onQueue_entry(identifier, &error);
     if (error) return error->resultCode(VSAResult::kDatabaseFailed);
     const VSAValue* cls = options.get(kVSAOptionDataContainerClass);
-    VSACodeSigningEntry entry(VSAValue(), cls ? cls->uint64Value().value_or(0) : 0);
+    VSACodeSigningEntry entry(
+        VSAValue(), cls ? cls->uint64Value().value_or(VSAClass::kUndefined) : VSAClass::kUndefined);
     if (const VSAValue* parent = options.get(kVSAOptionParentBundleID);
         parent && parent->isString()) {
       const std::string& parentID = *parent->stringValue();
@@ -312,7 +313,7 @@ VSAContainerClass VSACodeSigningMapping::dataContainerTypeForIdentifier(
     if (!c && e && !VSASQLiteDB::isNotFound(e))
       logMapping(kVSALogError, "Error retrieving entry from DB with identifier %@ : %@", identifier,
                  e);
-    return c.value_or(0);
+    return c.value_or(VSAClass::kUndefined);
   });
 }
 

@@ -152,8 +152,8 @@ void VSACodeSigningMapping::_onQueue_removeReferenceForGroupIdentifiers(
       [&](const VSAUserIdentityRef& user) {
         auto perUser = configuration_->getPerUserConfigurationForUserIdentity(user);
         if (perUser && perUser->existsUserBaseDirectory())
-          _onQueue_removeGroupContainersIfNeededforUserIdentity(user, 7, ids, *counts,
-                                                                commandQueue);
+          _onQueue_removeGroupContainersIfNeededforUserIdentity(user, VSAClass::kAppGroup, ids,
+                                                                *counts, commandQueue);
       });
 }
 
@@ -264,7 +264,8 @@ VSAResultCode VSACodeSigningMapping::invalidateCodeSigningInfoForAppsWithoutBund
       continue;
     }
     VSAContainerClass c = entry->dataContainerClass();
-    bool plugIn = c >= 3 && c <= 6;
+    bool plugIn = c == VSAClass::kBundlePlugin || c == VSAClass::kDataPlugin ||
+                  c == VSAClass::kBundleVPNPlugin || c == VSAClass::kDataVPNPlugin;
     bool hasParent = plugIn && parentIdentifierForChildIdentifier(identifier).has_value();
     logMapping(kVSALogInfo,
                "Checking for invalidation: identifier = %@, codeSigningEntry = <%p>, "
@@ -273,7 +274,8 @@ VSAResultCode VSACodeSigningMapping::invalidateCodeSigningInfoForAppsWithoutBund
                hasParent);
     if (entry->isRegisteredByCaller() || hasParent) continue;
     bool found = false;
-    for (VSAContainerClass bundle : {1ull, 3ull, 5ull}) {
+    for (VSAContainerClass bundle :
+         {VSAClass::kBundleApplication, VSAClass::kBundlePlugin, VSAClass::kBundleVPNPlugin}) {
       auto identity = VSAContainerIdentity::containerIdentityWithUserIdentity(owner, identifier,
                                                                               bundle, nullptr);
       if (identity && stageEnvironment_ &&
@@ -313,7 +315,7 @@ void VSACodeSigningMapping::reconcileSystemContainersWithCommandQueue(
   if (!stageEnvironment_) return;
   VSAErrorRef listError;
   auto containers = stageEnvironment_->cache->allContainersForUserIdentity(
-      userIdentityCache_->defaultUserIdentity(), 12, {}, &listError);
+      userIdentityCache_->defaultUserIdentity(), VSAClass::kSystemData, {}, &listError);
   if (!containers) {
     logMapping(kVSALogError, "Failed to fetch system container list: %@", listError);
     return;

@@ -82,7 +82,8 @@ bool VSACodeSigningMapping::_onQueue_migrateDataFromLegacyEntitlementsFileToCode
   for (const auto& [identifier, entitlements] : *file->dictionaryValue()) {
     if (identifier == kChildren || identifier == kRegisteredByCaller || identifier == kPlaceholders)
       continue;
-    VSACodeSigningEntry entry(VSAValue::Dictionary{{kVSAEntitlementsKey, entitlements}}, 0);
+    VSACodeSigningEntry entry(VSAValue::Dictionary{{kVSAEntitlementsKey, entitlements}},
+                              VSAClass::kUndefined);
     entry.setChildBundleIdentifiers(childrenFor(&children, identifier));
     entry.setPlaceholder(flagFor(&placeholders, identifier));
     entry.setRegisteredByCaller(flagFor(&byCaller, identifier));

@@ -15,14 +15,14 @@ void logMigration(int level, const char* origin, const char* format, const A&...
 // The data container class an app's entry records for its bundle class.
 VSAContainerClass dataClassForBundleClass(VSAContainerClass bundleClass) {
   switch (bundleClass) {
-    case 1:
-      return 2;
-    case 3:
-      return 4;
-    case 5:
-      return 6;
+    case VSAClass::kBundleApplication:
+      return VSAClass::kDataApplication;
+    case VSAClass::kBundlePlugin:
+      return VSAClass::kDataPlugin;
+    case VSAClass::kBundleVPNPlugin:
+      return VSAClass::kDataVPNPlugin;
     default:
-      return 0;
+      return VSAClass::kUndefined;
   }
 }
 }  // namespace
@@ -90,7 +90,8 @@ bool VSACodeSigningMigration::migrateAppGroupIdsFromDataContainersToFile() {
   logMigration(kVSALogNotice, origin, "Performing group ID migration");
   auto user = userIdentityCache_->userIdentityForLegacyMobileUser();
   bool ok = true;
-  for (VSAContainerClass c : {2, 4, 6}) {
+  for (VSAContainerClass c :
+       {VSAClass::kDataApplication, VSAClass::kDataPlugin, VSAClass::kDataVPNPlugin}) {
     VSAErrorRef error;
     auto list = containers(user, c, &error);
     if (!list) {
@@ -146,7 +147,8 @@ bool VSACodeSigningMigration::migrateCachedCodeSigningInfoFromBundleContainersTo
   logMigration(kVSALogNotice, origin, "Performing code signing migration");
   auto user = userIdentityCache_->defaultUserIdentity();
   bool ok = true;
-  for (VSAContainerClass c : {1, 3, 5, 8}) {
+  for (VSAContainerClass c : {VSAClass::kBundleApplication, VSAClass::kBundlePlugin,
+                              VSAClass::kBundleVPNPlugin, VSAClass::kBundleFramework}) {
     VSAErrorRef error;
     auto list = containers(user, c, &error);
     if (!list) {

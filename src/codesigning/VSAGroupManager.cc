@@ -46,8 +46,9 @@ VSAGroupManager::groupContainerIdentifiersForOwnerIdentifier(const VSAValue* own
   VSAAllIdentifiersLockGuard lock(*stageEnvironment_->locks, true, useLocking);
   try {
     const std::string& id = *owner->stringValue();
-    auto ids = groupContainerClass == 13 ? mapping_->systemGroupIdentifiersForIdentifier(id)
-                                         : mapping_->appGroupIdentifiersForIdentifier(id);
+    auto ids = groupContainerClass == VSAClass::kSystemGroup
+                   ? mapping_->systemGroupIdentifiersForIdentifier(id)
+                   : mapping_->appGroupIdentifiersForIdentifier(id);
     return ids.value_or(std::vector<std::string>{});
   } catch (const std::exception& e) {
     VSALogIn(VSALogCategory::CodeSignMapping, kVSALogError, fn, "Got exception: %@ : %@",
@@ -65,15 +66,16 @@ void VSAGroupManager::reconcileGroupContainersOfType(int groupType, VSACommandQu
     return;
   }
   if (groupType == kVSAGroupTypeSystem) {
-    _cleanupUnreferencedGroupContainersForUserIdentity(userIdentityCache_->defaultUserIdentity(),
-                                                       13, *counts, commandQueue);
+    _cleanupUnreferencedGroupContainersForUserIdentity(
+        userIdentityCache_->defaultUserIdentity(), VSAClass::kSystemGroup, *counts, commandQueue);
     return;
   }
   userIdentityCache_->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
       [&](const VSAUserIdentityRef& user) {
         auto perUser = configuration_->getPerUserConfigurationForUserIdentity(user);
         if (perUser && perUser->existsUserBaseDirectory())
-          _cleanupUnreferencedGroupContainersForUserIdentity(user, 7, *counts, commandQueue);
+          _cleanupUnreferencedGroupContainersForUserIdentity(user, VSAClass::kAppGroup, *counts,
+                                                             commandQueue);
       });
 }
 

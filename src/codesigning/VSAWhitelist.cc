@@ -30,7 +30,8 @@ VSAWhitelist::VSAWhitelist(const VSAValue& systemContainers, const VSAValue& sys
     : system_(stringSet(&systemContainers)), systemGroups_(stringSet(&systemGroupContainers)) {
   if (const auto* d = whitelistedContainers.dictionaryValue()) {
     for (const auto& [key, list] : *d)
-      if (auto c = classKey(key); c && *c < 14) perClass_[*c] = stringSet(&list);
+      if (auto c = classKey(key); c && *c <= kVSAContainerClassMax)
+        perClass_[*c] = stringSet(&list);
   }
   // Arrays become sets, through the nested dictionaries.
   if (const auto* d = clients.dictionaryValue()) {
@@ -66,7 +67,8 @@ VSAValue VSAWhitelist::builtInTables() {
              "systemgroup.com.tamsk.nfcd", "systemgroup.com.tamsk.installd",
              "systemgroup.com.tamsk.security", "systemgroup.com.tamsk.personaservice"})},
       {"InternalSystemGroupContainers", list({"systemgroup.com.tamsk.internal.tools"})},
-      {"ClassLookup", VSAValue::Dictionary{{"10", list({"com.tamsk.diagnosticd"})}}},
+      {"ClassLookup", VSAValue::Dictionary{{std::to_string(VSAClass::kDataInternalDaemon),
+                                            list({"com.tamsk.diagnosticd"})}}},
       {"Clients",
        VSAValue::Dictionary{
            {"com.tamsk.backupd", VSAValue(kAnyMarker)},
@@ -110,7 +112,7 @@ std::shared_ptr<VSAWhitelist> VSAWhitelist::load(const std::string& configPath,
 bool VSAWhitelist::isLookupWhitelistedFromCodeSignIdentifier(const std::string& client,
                                                              VSAContainerClass c,
                                                              const std::string& id) const {
-  if (c >= 14) return false;
+  if (c > kVSAContainerClassMax) return false;
   if (auto it = perClass_.find(c); it != perClass_.end() && it->second.count(id)) return true;
   auto entry = clients_.find(client);
   if (entry == clients_.end()) return false;
@@ -122,7 +124,7 @@ bool VSAWhitelist::isLookupWhitelistedFromCodeSignIdentifier(const std::string& 
 
 std::optional<std::string> VSAWhitelist::wellknownContainerForId(const std::string& id,
                                                                  VSAContainerClass c) const {
-  if (c == 12 && systemContainerIdIsWellknown(id)) return id;
-  if (c == 13 && systemGroupContainerIdIsWellknown(id)) return id;
+  if (c == VSAClass::kSystemData && systemContainerIdIsWellknown(id)) return id;
+  if (c == VSAClass::kSystemGroup && systemGroupContainerIdIsWellknown(id)) return id;
   return std::nullopt;
 }

@@ -4,6 +4,7 @@
 // reply keys of its own.
 #pragma once
 
+#include "base/VSACommands.h"
 #include "base/VSAError.h"
 #include "base/VSAValue.h"
 #include "model/VSAMetadata.h"
@@ -15,7 +16,8 @@ class VSAClientConnection;
 // reply with "ReplyError" set to `code`, exactly once; failures are logged.
 // Such handlers keep the request's reply context, not its message, so the
 // request dictionary is freed as soon as it has been dispatched.
-void VSASendLateReply(const VSAIPCReplyContextRef& context, VSAResultCode code, uint64_t command);
+void VSASendLateReply(const VSAIPCReplyContextRef& context, VSAResultCode code,
+                      VSACommandNumber command);
 
 using VSACommandHandler = void (*)(const VSAValue& request, VSAValue& reply,
                                    VSAClientConnection& connection, VSAResultCode* result);

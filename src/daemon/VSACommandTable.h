@@ -1,11 +1,11 @@
 // The command table: the single place that binds command numbers to
 // handlers and to the entitlement each command requires.
 //
-// Exactly 33 entries, indexed by command number. Flags: replyAfterHandler
-// (the dispatcher replies when the handler returns; when clear the handler
-// replies itself on success), openToUnentitled (a client without the
-// entitlement still reaches the handler, with `entitled` false) and
-// honoursLookupEntitlement (a client without "allowed" hands its lookup
+// One entry per command of VSACommands, at the index of its number. Flags:
+// replyAfterHandler (the dispatcher replies when the handler returns; when
+// clear the handler replies itself on success), openToUnentitled (a client
+// without the entitlement still reaches the handler, with `entitled` false)
+// and honoursLookupEntitlement (a client without "allowed" hands its lookup
 // dictionary to the connection). An entry whose handler is null is answered
 // with 49 by the dispatcher. Constant; thread-safe.
 #pragma once
@@ -13,10 +13,11 @@
 #include <array>
 #include <cstdint>
 
+#include "base/VSACommands.h"
 #include "daemon/VSACommandHandlers.h"
 
 struct VSACommandTableEntry {
-  uint64_t command;
+  VSACommandNumber command;
   VSACommandHandler handler;
   const char* entitlement;
   bool replyAfterHandler;
@@ -24,9 +25,6 @@ struct VSACommandTableEntry {
   bool honoursLookupEntitlement;
 };
 
-inline constexpr size_t kVSACommandCount = 33;
-// Test locks: served on their own queue, so that a request frozen at a test
-// lock on the listener queue cannot keep the command that releases it waiting.
-inline constexpr uint64_t kVSATestLockCommand = 31;
+inline constexpr size_t kVSACommandCount = VSACommands::kCount;
 
 const std::array<VSACommandTableEntry, kVSACommandCount>& VSACommandTable();

@@ -5,6 +5,7 @@
 
 #include <cstring>
 
+#include "base/VSACommands.h"
 #include "base/VSACrash.h"
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
@@ -103,7 +104,7 @@ int VSADaemon::run() {
 // disk, so the I/O thread is back within the request's own time.
 VSAIPCListener::Route VSADaemon::routeRequest(const VSAValue& body) {
   const VSAValue* command = body.get(kVSARequestCommandKey);
-  if (command && command->uint64Value() == kVSATestLockCommand) {
+  if (command && command->uint64Value() == VSACommands::kTestLock) {
     testLocksInUse_ = true;
     return {testLockQueue_, false};
   }

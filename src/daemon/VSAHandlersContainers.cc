@@ -13,8 +13,10 @@
 
 namespace {
 const char* extensionClassFor(VSAContainerClass c) {
-  if (c == 2 || c == 4 || c == 6 || c == 10) return "com.tamsk.sandbox.container";
-  if (c == 7) return "com.tamsk.sandbox.application-group";
+  using namespace VSAClass;
+  if (c == kDataApplication || c == kDataPlugin || c == kDataVPNPlugin || c == kDataInternalDaemon)
+    return "com.tamsk.sandbox.container";
+  if (c == kAppGroup) return "com.tamsk.sandbox.application-group";
   return nullptr;
 }
 
@@ -141,7 +143,9 @@ void VSAHandleDeleteDeathRow(const VSAValue&, VSAValue&, VSAClientConnection& co
   VSAIPCReplyContextRef context =
       connection.relayMessage() ? connection.relayMessage()->replyContext() : nullptr;
   connection.context().deathRow->deleteContainersOnDeathRowWithCompletion(
-      [context](VSAResultCode code) { VSASendLateReply(context, code, 4); });
+      [context](VSAResultCode code) {
+        VSASendLateReply(context, code, VSACommands::kDeleteDeathRow);
+      });
 }
 
 void VSAHandleContainerMetadata(const VSAValue& request, VSAValue& reply,
@@ -179,10 +183,10 @@ void VSAHandleDeleteContainer(const VSAValue& request, VSAValue&, VSAClientConne
 void VSAHandleSystemContainerPath(const VSAValue& request, VSAValue& reply,
                                   VSAClientConnection& connection, VSAResultCode* result) {
   VSARequestArguments args(request, connection, result);
-  auto identity = args.containerIdentity({}, 12);
+  auto identity = args.containerIdentity({}, VSAClass::kSystemData);
   if (!identity) return;
-  if (!connection.allowOtherIdLookup() &&
-      !connection.context().whitelist->containerIdIsWellknown(identity->identifier(), 12)) {
+  if (!connection.allowOtherIdLookup() && !connection.context().whitelist->containerIdIsWellknown(
+                                              identity->identifier(), VSAClass::kSystemData)) {
     VSALogIn(VSALogCategory::Relay, kVSALogError, "VSAHandleSystemContainerPath",
              "%@ is not a well-known system container", identity->identifier());
     VSASetCode(result, VSAResult::kNotEntitled);
@@ -215,7 +219,7 @@ void VSAHandleSystemGroupContainerPath(const VSAValue& request, VSAValue& reply,
   }
   VSAResultCode code = VSAResult::kSuccess;
   auto identity = VSAContainerIdentity::containerIdentityWithIdentifier(
-      *group, 13, *connection.context().userIdentityCache, &code);
+      *group, VSAClass::kSystemGroup, *connection.context().userIdentityCache, &code);
   if (!identity) return VSASetCode(result, code);
   // Entitlement to the group is the access grant here.
   connection.setAllowGroupIdLookup(true);

@@ -49,7 +49,7 @@ void VSAHandleStageSharedContent(const VSAValue& request, VSAValue& reply,
   VSARequestArguments args(request, connection, result);
   const std::string* identifier = args.identifier();
   if (!identifier) return;
-  auto user = args.userIdentity(2);
+  auto user = args.userIdentity(VSAClass::kDataApplication);
   if (!user) return;
   const std::string* source = pathArgument(args, "SourcePath", result);
   const std::string* destination = source ? pathArgument(args, "DestPath", result) : nullptr;

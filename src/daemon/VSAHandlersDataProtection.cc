@@ -24,11 +24,13 @@ void VSAHandleSetDataProtection(const VSAValue& request, VSAValue&, VSAClientCon
       connection.relayMessage() ? connection.relayMessage()->replyContext() : nullptr;
   connection.context().dataProtectionManager->setDataProtectionOnDataContainerForContainerIdentity(
       *identity, static_cast<int32_t>(*protectionClass), args.boolValue("IsThirdParty"),
-      args.boolValue("RetryIfLocked"),
-      [context](VSAResultCode code) { VSASendLateReply(context, code, 21); });
+      args.boolValue("RetryIfLocked"), [context](VSAResultCode code) {
+        VSASendLateReply(context, code, VSACommands::kSetDataProtection);
+      });
 }
 
-void VSASendLateReply(const VSAIPCReplyContextRef& context, VSAResultCode code, uint64_t command) {
+void VSASendLateReply(const VSAIPCReplyContextRef& context, VSAResultCode code,
+                      VSACommandNumber command) {
   if (!context) return;
   VSAValue reply = context->createReply();
   reply.set("ReplyError", VSAValue(code));

@@ -10,7 +10,7 @@
 namespace {
 struct GroupRequest {
   std::string owner;
-  VSAContainerClass groupClass = 0;
+  VSAContainerClass groupClass = VSAClass::kUndefined;
   VSAUserIdentityRef user;
 };
 
@@ -20,12 +20,13 @@ std::optional<GroupRequest> readGroupRequest(VSARequestArguments& args,
   if (!c) return std::nullopt;
   const std::string* owner = args.identifier();
   if (!owner) return std::nullopt;
-  if (*c != 7 && *c != 13) {
+  if (*c != VSAClass::kAppGroup && *c != VSAClass::kSystemGroup) {
     args.fail(VSAResult::kInvalidArgument);
     return std::nullopt;
   }
-  VSAUserIdentityRef user = *c == 13 ? connection.context().userIdentityCache->defaultUserIdentity()
-                                     : args.userIdentity(*c);
+  VSAUserIdentityRef user = *c == VSAClass::kSystemGroup
+                                ? connection.context().userIdentityCache->defaultUserIdentity()
+                                : args.userIdentity(*c);
   if (!user) return std::nullopt;
   return GroupRequest{*owner, *c, user};
 }

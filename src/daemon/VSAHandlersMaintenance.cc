@@ -58,7 +58,7 @@ void VSAHandleReplaceContainer(const VSAValue& request, VSAValue&, VSAClientConn
 void VSAHandleWipePluginData(const VSAValue& request, VSAValue&, VSAClientConnection& connection,
                              VSAResultCode* result) {
   VSARequestArguments args(request, connection, result);
-  auto identity = args.containerIdentity({}, 4);
+  auto identity = args.containerIdentity({}, VSAClass::kDataPlugin);
   if (!identity) return;
   connection.deleteDataContainerContentWithContainerIdentity(identity, result);
 }

@@ -1,5 +1,6 @@
 #include "daemon/VSARelayDispatcher.h"
 
+#include "base/VSACommands.h"
 #include "base/VSALog.h"
 #include "daemon/VSAClientConnection.h"
 #include "daemon/VSAGrants.h"
@@ -94,7 +95,7 @@ void VSARelayDispatcher::processRelayEvent(const VSAIPCMessageRef& message) {
     // Command 31 may arrive while a frozen request holds what recording
     // entitlements waits for (the mapping's queue, the identifier locks).
     // A launched app's entitlements are read from the mapping, not presented.
-    if (identity && grants.admitted && command != kVSATestLockCommand &&
+    if (identity && grants.admitted && command != VSACommands::kTestLock &&
         !identity->isLaunchedApp()) {
       VSAResultCode registered = context_.codeSigningMapping->processCallerRegisteredEntitlements(
           identity->entitlements(), identity->bundleIdentifier(), commandQueue.get());
@@ -126,7 +127,9 @@ void VSARelayDispatcher::processRelayEvent(const VSAIPCMessageRef& message) {
                              command, client));
   VSALogIn(VSALogCategory::Relay, kVSALogNotice, kOrigin, "command=%llu, client=%@, error=%llu",
            command, client, result);
-  if (result == VSAResult::kSuccess && (command == 4 || command == 21)) return;
+  if (result == VSAResult::kSuccess &&
+      (command == VSACommands::kDeleteDeathRow || command == VSACommands::kSetDataProtection))
+    return;
   reply->set(kVSAReplyErrorKey, VSAValue(result));
   VSAErrorRef error;
   if (!message->sendReply(*reply, &error)) {

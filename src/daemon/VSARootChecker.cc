@@ -24,9 +24,6 @@ constexpr const char* kNextBoot = "removed by the next boot's cleanup";
 constexpr const char* kNextStart = "finished or undone by the next start";
 constexpr const char* kAttention = "nothing repairs this: needs attention";
 
-constexpr VSAContainerClass kPerUserClasses[] = {2, 4, 6, 7, 9, 10, 11};
-constexpr VSAContainerClass kGlobalClasses[] = {1, 3, 5, 8, 12, 13};
-
 std::string errnoText(int rc) { return std::strerror(rc); }
 }  // namespace
 
@@ -79,13 +76,13 @@ VSARootChecker::Status VSARootChecker::check() {
     auto perUser = config.getPerUserConfigurationForUserIdentity(u);
     if (!perUser->existsUserBaseDirectory()) return;
     ++counts_["users"];
-    for (VSAContainerClass c : kPerUserClasses) {
+    for (VSAContainerClass c : kVSAPerUserContainerClasses) {
       checkClassDirectory(u, c, false);
       checkClassDirectory(u, c, true);
       stagingDirectories.insert(config.stagingDirectoryURLForUserIdentity(u, c));
     }
   });
-  for (VSAContainerClass c : kGlobalClasses) {
+  for (VSAContainerClass c : kVSAGlobalContainerClasses) {
     checkClassDirectory(users.defaultUserIdentity(), c, false);
     checkClassDirectory(users.defaultUserIdentity(), c, true);
   }
@@ -155,7 +152,7 @@ void VSARootChecker::checkEntry(const VSAUserIdentityRef& user, VSAContainerClas
   auto [uat, uinserted] = uuids_.emplace((transient ? "transient|" : "live|") + uuid, path);
   if (!uinserted)
     add("duplicate-uuid", path, "UUID " + uuid + " also at " + uat->second, kAttention);
-  if (c == 7 && !transient) appGroups_[metadata->identifier()].push_back(path);
+  if (c == VSAClass::kAppGroup && !transient) appGroups_[metadata->identifier()].push_back(path);
   checkOwnership(path, st, user, c);
 }
 

@@ -33,7 +33,7 @@ inline constexpr size_t kVSADataProtectionUpdateFileMaxSize = 16u << 10;
 
 struct VSADataProtectionUpdate {
   std::string identifier;
-  VSAContainerClass containerClass = 0;
+  VSAContainerClass containerClass = VSAClass::kUndefined;
   int32_t protectionClass = 0;
   uint32_t changeType = 0;
   bool retryIfLocked = false;

@@ -41,7 +41,11 @@ std::optional<std::string> migratedLogName(const std::string& name) {
 }
 
 VSAContainerClass bundleClassForDataClass(VSAContainerClass c) {
-  return c == 2 ? 1 : c == 4 ? 3 : c == 6 ? 5 : 0;
+  using namespace VSAClass;
+  return c == kDataApplication ? kBundleApplication
+         : c == kDataPlugin    ? kBundlePlugin
+         : c == kDataVPNPlugin ? kBundleVPNPlugin
+                               : kUndefined;
 }
 
 template <typename Body>
@@ -128,7 +132,7 @@ void VSAContainerMigrator::_checkIfDeviceMayNeedSystemContainerACLMigration(
   if (status.hasMigrationOccurredForType(kACLMigration)) return;
   auto& config = *dependencies_.configuration;
   auto& fm = config.fileManager();
-  for (VSAContainerClass c : {12, 13})
+  for (VSAContainerClass c : {VSAClass::kSystemData, VSAClass::kSystemGroup})
     if (fm.itemExistsAtURL(config.globalContainerBaseURLWithContentClass(c, false).value_or("")))
       return;
   logMigrator(kVSALogNotice, "_checkIfDeviceMayNeedSystemContainerACLMigration",
@@ -142,13 +146,13 @@ bool VSAContainerMigrator::_performInternalACLMigrationWithError(VSAMigrationSta
   auto& config = *dependencies_.configuration;
   auto& fm = config.fileManager();
   bool ok = true;
-  for (VSAContainerClass c : {12, 13}) {
+  for (VSAContainerClass c : {VSAClass::kSystemData, VSAClass::kSystemGroup}) {
     std::string dir = config.globalContainerBaseURLWithContentClass(c, false).value_or("");
     if (!fm.itemExistsAtURL(dir)) continue;
     if (fm.standardizeAllSystemContainerACLsAtURL(dir, error)) continue;
     logMigrator(kVSALogError, "_performInternalACLMigrationWithError",
-                c == 12 ? "Failed to set ACLs on system containers : %@"
-                        : "Failed to set ACLs on system group containers : %@",
+                c == VSAClass::kSystemData ? "Failed to set ACLs on system containers : %@"
+                                           : "Failed to set ACLs on system group containers : %@",
                 error ? *error : nullptr);
     ok = false;
   }
@@ -176,7 +180,7 @@ bool VSAContainerMigrator::_performWhitelistMigrationWithError(VSAErrorRef* erro
   auto& cache = *dependencies_.containerCache;
   auto& fm = dependencies_.configuration->fileManager();
   bool ok = true;
-  for (VSAContainerClass c : {12, 13}) {
+  for (VSAContainerClass c : {VSAClass::kSystemData, VSAClass::kSystemGroup}) {
     auto dir = dependencies_.configuration->containerDirectoryURLForUserIdentity(user, c, false);
     auto all = cache.allContainersForUserIdentity(user, c, {}, error);
     if (!dir || !all) {
@@ -303,7 +307,7 @@ bool VSAContainerMigrator::subdirectoryMigration(const VSAUserIdentityRef& user,
   logMigrator(kVSALogNotice, origin, "Performing Per User Subdirectory Migration for %@ on %@",
               user->shortDescription(), build);
   bool ok = true;
-  for (VSAContainerClass c : {2, 4, 6, 7, 9, 10, 11}) {
+  for (VSAContainerClass c : kVSAPerUserContainerClasses) {
     VSAErrorRef error;
     auto all = dependencies_.containerCache->allContainersForUserIdentity(user, c, {}, &error);
     if (!all) {
@@ -341,7 +345,8 @@ bool VSAContainerMigrator::dataProtectionMigration(const VSAUserIdentityRef& use
   logMigrator(kVSALogNotice, origin, "Performing User Data Protection Migration for %@ on %@",
               user->shortDescription(), build);
   bool ok = true;
-  for (VSAContainerClass c : {2, 4, 6}) {
+  for (VSAContainerClass c :
+       {VSAClass::kDataApplication, VSAClass::kDataPlugin, VSAClass::kDataVPNPlugin}) {
     VSAErrorRef error;
     auto all = dependencies_.containerCache->allContainersForUserIdentity(user, c, {}, &error);
     if (!all) {
@@ -376,10 +381,10 @@ VSAMetadataRef VSAContainerMigrator::_bundleContainerForDataContainer(const VSAM
     return nullptr;
   }
   std::string app = data.identifier();
-  if (data.containerClass() == 4)
+  if (data.containerClass() == VSAClass::kDataPlugin)
     if (auto parent = dependencies_.codeSigning.parentIdentifierForChildIdentifier(app)) {
       app = *parent;
-      bundleClass = 1;
+      bundleClass = VSAClass::kBundleApplication;
     }
   VSAResultCode code = VSAResult::kSuccess;
   auto identity = VSAContainerIdentity::containerIdentityWithUserIdentity(data.userIdentity(), app,
@@ -424,7 +429,7 @@ void VSAContainerMigrator::removeDeprecatedContainers(const VSAMigrationClient& 
   for (const VSAValue& entry : *entries) {
     const VSAValue* id = entry.get("Identifier");
     const VSAValue* cls = entry.get("ContainerClass");
-    uint64_t c = cls && cls->uint64Value() ? *cls->uint64Value() : 0;
+    VSAContainerClass c = cls && cls->uint64Value() ? *cls->uint64Value() : VSAClass::kUndefined;
     std::string name = id && id->isString() ? *id->stringValue() : std::string("(null)");
     VSAResultCode code = VSAResult::kSuccess;
     auto identity = id && id->isString() && VSAContainerClassIsValid(c)

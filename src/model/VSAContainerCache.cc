@@ -1,5 +1,7 @@
 #include "model/VSAContainerCache.h"
 
+#include <iterator>
+
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
 #include "base/VSATestLocks.h"
@@ -12,7 +14,7 @@ const char* shortName(VSAContainerClass c) {
   static const char* names[] = {"undefined", "app",     "appData",    "plugin",     "pluginData",
                                 "vpn",       "vpnData", "appGroup",   "framework",  "relayService",
                                 "daemon",    "tempDir", "systemData", "systemGroup"};
-  return c < 14 ? names[c] : "invalid";
+  return c < std::size(names) ? names[c] : "invalid";
 }
 
 const char* transientTag(bool transient) { return transient ? "(transient)" : ""; }
@@ -53,7 +55,7 @@ bool VSAContainerCache::containerURLIsValidForContainerClass(
     const std::string& url, VSAContainerClass c, const VSAWellknownContainers& wellknown) {
   std::string_view name = VSALastPathComponentView(url);
   if (VSAUUID::parse(name)) return true;
-  return (c == 12 || c == 13) && wellknown.containerIdIsWellknown(std::string(name), c);
+  return VSAContainerClassIsSystem(c) && wellknown.containerIdIsWellknown(std::string(name), c);
 }
 
 bool VSAContainerCache::hasClassMap(const VSAUserIdentityRef& user, VSAContainerClass c,
@@ -329,7 +331,7 @@ bool VSAContainerCache::removeContainerForUserIdentity(const VSAUserIdentityRef&
 void VSAContainerCache::invalidateUserIdentity(const VSAUserIdentityRef& user) {
   {
     std::lock_guard lock(cacheLock_);
-    for (VSAContainerClass c = 1; c <= 13; ++c) {
+    for (VSAContainerClass c = kVSAContainerClassMin; c <= kVSAContainerClassMax; ++c) {
       std::string key = cacheKeyForUserIdentity(user, c);
       if (auto it = live_.find(key); it != live_.end()) {
         for (const auto& [id, m] : it->second)
@@ -357,15 +359,17 @@ bool VSAContainerCache::shouldRegisterSandboxMappingWithUserIdentity(const VSAUs
                                                                      VSAContainerClass c) {
   bool decision, multi = false;
   std::string app = identifier;
-  if (c == 2 || c == 4 || c == 6 || c == 9 || c == 10 || c == 11) {
-    if (c == 4 || c == 6)
+  using namespace VSAClass;
+  if (c == kDataApplication || c == kDataPlugin || c == kDataVPNPlugin || c == kDataRelayService ||
+      c == kDataInternalDaemon || c == kDataTempDir) {
+    if (c == kDataPlugin || c == kDataVPNPlugin)
       if (auto parent = deps_.codeSigning->parentIdentifierForChildIdentifier(identifier))
         app = *parent;
     auto set = deps_.userIdentityCache->userIdentitiesForBundleIdentifier(app);
     auto personal = deps_.userIdentityCache->userIdentityForPersonalPersona();
     multi = set.size() >= 2 && set.count(personal) > 0;
     decision = multi ? !(user && user->isEnterprise()) : set.count(user) > 0;
-  } else if (c == 7) {
+  } else if (c == kAppGroup) {
     decision = true;
   } else {
     decision = !(user && user->isEnterprise());

@@ -1,25 +1,35 @@
 #include "model/VSAContainerClass.h"
 
+#include <iterator>
+
 namespace {
-const char* const kPathComponents[] = {
-    "Undefined",          "Bundle/Application",  "Data/Application",
-    "Bundle/PlexaPlugin", "Data/PlexaPlugin",    "Bundle/VPNPlugin",
-    "Data/VPNPlugin",     "Shared/AppGroup",     "Bundle/Framework",
-    "Data/RelayService",  "Data/InternalDaemon", "Data/TempDir",
-    "Data/System",        "Shared/SystemGroup",  "MAX"};
-}
+// Indexed by class: "Undefined", every class in order, then "MAX".
+#define VSA_CONTAINER_CLASS_PATH(name, value, pathComponent) pathComponent,
+const char* const kPathComponents[] = {"Undefined",
+                                       VSA_CONTAINER_CLASSES(VSA_CONTAINER_CLASS_PATH) "MAX"};
+#undef VSA_CONTAINER_CLASS_PATH
+static_assert(std::size(kPathComponents) == kVSAContainerClassMax + 2);
+}  // namespace
 
 const char* VSAContainerClassPathComponent(VSAContainerClass c) {
-  return c <= 14 ? kPathComponents[c] : "MAX";
+  return c < std::size(kPathComponents) ? kPathComponents[c] : "MAX";
 }
 
 bool VSAContainerClassIsValid(VSAContainerClass c) {
   return c >= kVSAContainerClassMin && c <= kVSAContainerClassMax;
 }
 
-bool VSAContainerClassIsBundle(VSAContainerClass c) { return c == 1 || c == 3 || c == 5 || c == 8; }
-bool VSAContainerClassIsSystem(VSAContainerClass c) { return c == 12 || c == 13; }
-bool VSAContainerClassIsGroup(VSAContainerClass c) { return c == 7 || c == 13; }
+bool VSAContainerClassIsBundle(VSAContainerClass c) {
+  using namespace VSAClass;
+  return c == kBundleApplication || c == kBundlePlugin || c == kBundleVPNPlugin ||
+         c == kBundleFramework;
+}
+bool VSAContainerClassIsSystem(VSAContainerClass c) {
+  return c == VSAClass::kSystemData || c == VSAClass::kSystemGroup;
+}
+bool VSAContainerClassIsGroup(VSAContainerClass c) {
+  return c == VSAClass::kAppGroup || c == VSAClass::kSystemGroup;
+}
 
 bool VSAContainerClassIsPerUser(VSAContainerClass c) {
   return VSAContainerClassIsValid(c) && !VSAContainerClassIsBundle(c) &&

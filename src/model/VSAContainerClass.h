@@ -1,11 +1,6 @@
 // Container classes: what kind of container, and so where it lives on disk
-// and who owns it.
-//
-//   1 Bundle/Application   2 Data/Application    3 Bundle/PlexaPlugin
-//   4 Data/PlexaPlugin     5 Bundle/VPNPlugin    6 Data/VPNPlugin
-//   7 Shared/AppGroup      8 Bundle/Framework    9 Data/RelayService
-//  10 Data/InternalDaemon 11 Data/TempDir       12 Data/System
-//  13 Shared/SystemGroup   (0 "Undefined" and 14 "MAX" are markers)
+// and who owns it. base/VSAContainerClasses.h names them (0 "Undefined" and 14
+// "MAX" are markers, no classes).
 //
 // Bundle classes {1,3,5,8} and system classes {12,13} are global; the
 // per-user classes {2,4,6,7,9,10,11} live below a user's home. Pure
@@ -16,16 +11,23 @@
 
 #include <cstdint>
 
-using VSAContainerClass = uint64_t;
+#include "base/VSAContainerClasses.h"
 
 // Owner of bundle containers (uid and gid) and of system containers.
 inline constexpr uid_t CONTAINER_INSTALLATION_UID = 33;
 inline constexpr uid_t CONTAINER_SYSTEM_UID = 0;
 
-inline constexpr VSAContainerClass kVSAContainerClassMin = 1;
-inline constexpr VSAContainerClass kVSAContainerClassMax = 13;
+// The per-user classes and the global ones (bundle and system), in
+// increasing order.
+inline constexpr VSAContainerClass kVSAPerUserContainerClasses[] = {
+    VSAClass::kDataApplication, VSAClass::kDataPlugin,       VSAClass::kDataVPNPlugin,
+    VSAClass::kAppGroup,        VSAClass::kDataRelayService, VSAClass::kDataInternalDaemon,
+    VSAClass::kDataTempDir};
+inline constexpr VSAContainerClass kVSAGlobalContainerClasses[] = {
+    VSAClass::kBundleApplication, VSAClass::kBundlePlugin, VSAClass::kBundleVPNPlugin,
+    VSAClass::kBundleFramework,   VSAClass::kSystemData,   VSAClass::kSystemGroup};
 
-// "Bundle/Application" ...; only for 0..14.
+// "Bundle/Application" ...; "Undefined" for 0, "MAX" from 14 on.
 const char* VSAContainerClassPathComponent(VSAContainerClass containerClass);
 bool VSAContainerClassIsValid(VSAContainerClass c);    // 1..13
 bool VSAContainerClassIsBundle(VSAContainerClass c);   // 1, 3, 5, 8

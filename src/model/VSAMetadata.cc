@@ -169,9 +169,10 @@ VSAMetadataRef VSAMetadata::readAndValidateMetadataAtFileUrl(
   if (!cls || !cls->isNumber())
     return invalid(error, bad, "Invalid metadata Class: %@ at %@", shown(cls), file);
   int64_t classValue = cls->int64Value().value_or(-1);
-  if (classValue < 1 || classValue > 13)
-    return invalid(error, bad, "Invalid metadata Content Class: %ld at %@", classValue, file);
+  // A negative number becomes a huge one, out of range as well.
   VSAContainerClass c = static_cast<VSAContainerClass>(classValue);
+  if (!VSAContainerClassIsValid(c))
+    return invalid(error, bad, "Invalid metadata Content Class: %ld at %@", classValue, file);
 
   VSAUserIdentityRef owner;
   if (!VSAUserIdentity::isUserIdentityRequiredForContainerClass(c)) {

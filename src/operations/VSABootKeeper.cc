@@ -30,7 +30,7 @@ void VSABootKeeper::_regenerateAllSystemContainerPaths(const VSAOperationGrants&
   VSALogIn(VSALogCategory::Startup, kVSALogNotice, origin,
            "Rolling system container directory UUIDs on disk");
   VSAContainerMaintenance maintenance(services_);
-  for (VSAContainerClass c : {12, 13}) {
+  for (VSAContainerClass c : {VSAClass::kSystemData, VSAClass::kSystemGroup}) {
     VSAErrorRef error;
     auto all = services_.containerCache->allContainersForUserIdentity(grants.clientUserIdentity, c,
                                                                       {}, &error);
@@ -133,10 +133,10 @@ void VSABootKeeper::rebootKeeperCleanupWithCompletion(std::function<void()> comp
       [&](const VSAUserIdentityRef& user) {
         auto perUser = config.getPerUserConfigurationForUserIdentity(user);
         if (!perUser || !perUser->existsUserBaseDirectory()) return;
-        for (VSAContainerClass c : {2, 4, 6, 7, 9, 10, 11}) scan(user, c);
+        for (VSAContainerClass c : kVSAPerUserContainerClasses) scan(user, c);
       });
   auto defaultUser = services_.userIdentityCache->defaultUserIdentity();
-  for (VSAContainerClass c : {1, 3, 5, 8, 12, 13}) scan(defaultUser, c);
+  for (VSAContainerClass c : kVSAGlobalContainerClasses) scan(defaultUser, c);
   queue->async([services = &services_, keep = queue] {
     VSABootKeeper(*services)._cleanupOprhanedCodeSigningMappingData();
   });
@@ -229,7 +229,7 @@ void VSABootKeeper::keeperCleanupWithCompletion(std::function<void()> completion
   collect(config.stagingDirectory(), "Failed to get items at global staging URL: %@ : %@");
   services_.userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
       [&](const VSAUserIdentityRef& user) {
-        for (VSAContainerClass c : {2, 4, 6, 7, 9, 10, 11})
+        for (VSAContainerClass c : kVSAPerUserContainerClasses)
           collect(config.stagingDirectoryURLForUserIdentity(user, c),
                   "Failed to get items at per-user staging URL: %@ : %@");
       });

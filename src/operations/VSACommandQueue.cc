@@ -7,7 +7,7 @@ VSACommandQueue::VSACommandQueue()
 
 void VSACommandQueue::insertCommand(std::shared_ptr<VSACommand> command) {
   const void* p = command.get();
-  uint64_t type = command->command();
+  VSACommandNumber type = command->command();
   {
     std::lock_guard lock(commandsMutex_);
     commands_.push_back(std::move(command));

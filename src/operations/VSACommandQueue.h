@@ -15,6 +15,7 @@
 #include <mutex>
 #include <vector>
 
+#include "base/VSACommands.h"
 #include "base/VSAError.h"
 #include "base/VSAWorkQueue.h"
 
@@ -23,8 +24,8 @@ class VSACommandQueue;
 class VSACommand {
  public:
   virtual ~VSACommand() = default;
-  // The command's type number, used in logs.
-  virtual uint64_t command() const = 0;
+  // The number of the request command whose work this is, used in logs.
+  virtual VSACommandNumber command() const = 0;
   // Runs the command; on failure stores a code in `error` and returns false.
   virtual bool fromQueue(VSACommandQueue& queue, VSAResultCode* executeWithError) = 0;
 };

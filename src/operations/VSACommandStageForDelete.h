@@ -12,6 +12,7 @@
 #include <memory>
 #include <vector>
 
+#include "base/VSACommands.h"
 #include "model/VSAContainerIdentity.h"
 #include "operations/VSACommandQueue.h"
 #include "operations/VSAStageForDeleteEnvironment.h"
@@ -30,7 +31,7 @@ class VSACommandStageForDelete : public VSACommand {
                            std::vector<VSAContainerIdentityRef> containerIdentities,
                            bool useLocking, ErrorHandler onError);
 
-  uint64_t command() const override { return 3; }
+  VSACommandNumber command() const override { return VSACommands::kStageForDelete; }
   bool fromQueue(VSACommandQueue& queue, VSAResultCode* executeWithError) override;
 
   const std::vector<VSAContainerIdentityRef>& containerIdentities() const { return identities_; }

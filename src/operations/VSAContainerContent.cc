@@ -172,10 +172,10 @@ std::optional<std::string> VSAContainerContent::stageSharedContentForIdentifier(
       return std::nullopt;
     }
   VSAResultCode code = VSAResult::kSuccess;
-  auto bundleIdentity =
-      VSAContainerIdentity::containerIdentityWithUserIdentity(userIdentity, identifier, 1, &code);
-  auto dataIdentity =
-      VSAContainerIdentity::containerIdentityWithUserIdentity(userIdentity, identifier, 2, &code);
+  auto bundleIdentity = VSAContainerIdentity::containerIdentityWithUserIdentity(
+      userIdentity, identifier, VSAClass::kBundleApplication, &code);
+  auto dataIdentity = VSAContainerIdentity::containerIdentityWithUserIdentity(
+      userIdentity, identifier, VSAClass::kDataApplication, &code);
   if (!bundleIdentity || !dataIdentity) {
     VSASetCode(withError, code);
     return std::nullopt;

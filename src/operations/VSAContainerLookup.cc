@@ -66,14 +66,15 @@ struct CreateSteps {
     const std::string& id = identity.identifier();
     bool entitledLookup = grants.isEntitledForLookupWithClass(c, id);
     bool allowed = id == bundle || grants.allowOtherIdLookup ||
-                   ((c == 13 || c == 7) && grants.allowGroupIdLookup) || grants.unrestricted ||
-                   entitledLookup || whitelisted(bundle, c, id);
+                   (VSAContainerClassIsGroup(c) && grants.allowGroupIdLookup) ||
+                   grants.unrestricted || entitledLookup || whitelisted(bundle, c, id);
     if (!allowed)
       return failure(VSAResult::kNotEntitled, nullptr,
                      VSAFormat("%@ not entitled to retrieve container class %ld with identifier %@",
                                bundle, static_cast<long>(c), id));
-    if (c == 12 && !grants.allowOtherIdLookup && !grants.unrestricted && !entitledLookup) {
-      bool passes = whitelisted(bundle, 12, id) ||
+    if (c == VSAClass::kSystemData && !grants.allowOtherIdLookup && !grants.unrestricted &&
+        !entitledLookup) {
+      bool passes = whitelisted(bundle, VSAClass::kSystemData, id) ||
                     (id == bundle && services.codeSigning.identifierHasSystemContainer(id));
       if (!passes)
         return failure(
@@ -85,7 +86,7 @@ struct CreateSteps {
 
   std::string liveName(const std::string& uuidName) {
     VSAContainerClass c = identity.containerClass();
-    if (c == 12 || c == 13)
+    if (VSAContainerClassIsSystem(c))
       if (auto name = services.wellknown.wellknownContainerForId(identity.identifier(), c))
         return *name;
     return uuidName;

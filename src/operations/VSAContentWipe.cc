@@ -8,9 +8,8 @@
 namespace {
 const char* const kOrigin = "deleteDataContainerContentWithContainerIdentity";
 
-bool isDataClass(VSAContainerClass c) {
-  return c == 2 || c == 4 || c == 6 || c == 7 || c == 9 || c == 10 || c == 11;
-}
+// The data classes and the app group: every per-user class.
+bool isDataClass(VSAContainerClass c) { return VSAContainerClassIsPerUser(c); }
 }  // namespace
 
 void VSAContentWipe::deleteDataContainerContentWithContainerIdentity(
@@ -30,7 +29,7 @@ void VSAContentWipe::deleteDataContainerContentWithContainerIdentity(
                   VSAFormat("Can't wipe container non-data container of type: %llu, identifier: %@",
                             static_cast<unsigned long long>(c), id));
   if (!grants_.unrestricted) {
-    if (c != 4)
+    if (c != VSAClass::kDataPlugin)
       return refuse(VSAResult::kNotEntitled,
                     VSAFormat("Can't wipe container with of type: %llu, identifier: %@",
                               static_cast<unsigned long long>(c), id));

@@ -13,7 +13,7 @@ std::optional<std::vector<std::string>>
 VSAGroupContainerLookup::groupContainerIdentifiersForOwnerIdentifier(const std::string& owner,
                                                                      VSAContainerClass groupClass,
                                                                      VSAResultCode* withError) {
-  if (groupClass != 7 && groupClass != 13) {
+  if (!VSAContainerClassIsGroup(groupClass)) {
     VSALog(kVSALogError, kOrigin, "Not a group container class: %llu",
            static_cast<unsigned long long>(groupClass));
     VSASetCode(withError, VSAResult::kInvalidArgument);

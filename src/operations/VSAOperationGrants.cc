@@ -9,7 +9,7 @@ const char* const kLookupKeys[] = {nullptr,  "app",     "appData",    "plugin", 
 
 std::optional<std::set<std::string>> VSAOperationGrants::lookupForContainerClass(
     VSAContainerClass c) const {
-  if (c == 0 || c > 13) return std::nullopt;
+  if (!VSAContainerClassIsValid(c)) return std::nullopt;
   std::lock_guard lock(lookupCacheMutex_);
   if (!lookup) return std::nullopt;
   if (!lookupCache_) lookupCache_.emplace();

@@ -34,12 +34,13 @@ void VSASystemContainerRestore::moveSystemContainersIntoPlace() {
                                      "Failed to move shared system containers to inprogress: %@");
   if (systemMoved) {
     logRestore(kVSALogNotice, kOrigin, "Installing system containers");
-    installAll(system, 12, "Couldn't find any system containers at %@: %@");
+    installAll(system, VSAClass::kSystemData, "Couldn't find any system containers at %@: %@");
     markRestored(system);
   }
   if (groupMoved) {
     logRestore(kVSALogNotice, kOrigin, "Installing system group containers");
-    installAll(group, 13, "Couldn't find any system shared containers at %@: %@");
+    installAll(group, VSAClass::kSystemGroup,
+               "Couldn't find any system shared containers at %@: %@");
     markRestored(group);
   }
   if (services_.configuration->isInternalImage()) return;  // kept for inspection

@@ -20,21 +20,24 @@ std::optional<std::vector<std::string>> namesFrom(const VSAValue& value) {
 }
 }  // namespace
 
-const std::map<uint64_t, std::vector<std::string>>& VSAContainerSubdirectories::builtIn() {
-  static const std::map<uint64_t, std::vector<std::string>> table = {
-      {1, {}},
-      {2, {"Documents", "Library", "Library/Caches", "Library/Preferences", "SystemData", "tmp"}},
-      {3, {}},
-      {4, {"Documents", "Library", "Library/Caches", "Library/Preferences", "SystemData", "tmp"}},
-      {5, {}},
-      {6, {"Library", "Library/Caches", "tmp"}},
-      {7, {"Library", "Library/Caches", "Library/Preferences"}},
-      {8, {}},
-      {9, {"Library", "Library/Caches", "tmp"}},
-      {10, {"Library", "Library/Caches", "Library/Preferences", "tmp"}},
-      {11, {"tmp"}},
-      {12, {"Library", "Library/Caches", "tmp"}},
-      {13, {"Library", "Library/Caches"}},
+const std::map<VSAContainerClass, std::vector<std::string>>& VSAContainerSubdirectories::builtIn() {
+  using namespace VSAClass;
+  static const std::map<VSAContainerClass, std::vector<std::string>> table = {
+      {kBundleApplication, {}},
+      {kDataApplication,
+       {"Documents", "Library", "Library/Caches", "Library/Preferences", "SystemData", "tmp"}},
+      {kBundlePlugin, {}},
+      {kDataPlugin,
+       {"Documents", "Library", "Library/Caches", "Library/Preferences", "SystemData", "tmp"}},
+      {kBundleVPNPlugin, {}},
+      {kDataVPNPlugin, {"Library", "Library/Caches", "tmp"}},
+      {kAppGroup, {"Library", "Library/Caches", "Library/Preferences"}},
+      {kBundleFramework, {}},
+      {kDataRelayService, {"Library", "Library/Caches", "tmp"}},
+      {kDataInternalDaemon, {"Library", "Library/Caches", "Library/Preferences", "tmp"}},
+      {kDataTempDir, {"tmp"}},
+      {kSystemData, {"Library", "Library/Caches", "tmp"}},
+      {kSystemGroup, {"Library", "Library/Caches"}},
   };
   return table;
 }
@@ -49,7 +52,8 @@ VSAContainerSubdirectories::VSAContainerSubdirectories(const VSASystemRoot& root
     char* end = nullptr;
     unsigned long long c = std::strtoull(key.c_str(), &end, 10);
     auto names = namesFrom(value);
-    if (key.empty() || *end != '\0' || c < 1 || c > 13 || !names) {
+    if (key.empty() || *end != '\0' || c < kVSAContainerClassMin || c > kVSAContainerClassMax ||
+        !names) {
       VSALog(kVSALogError, "VSAContainerSubdirectories",
              "Ignoring invalid sub-directory entry %@ in %@", key, path);
       continue;
@@ -59,7 +63,7 @@ VSAContainerSubdirectories::VSAContainerSubdirectories(const VSASystemRoot& root
 }
 
 std::optional<std::vector<std::string>> VSAContainerSubdirectories::subdirectoriesForClass(
-    uint64_t containerClass, VSAResultCode* error) const {
+    VSAContainerClass containerClass, VSAResultCode* error) const {
   auto it = table_.find(containerClass);
   if (it == table_.end()) {
     VSASetCode(error, VSAResult::kInvalidClass);

@@ -13,6 +13,7 @@
 #include <string>
 #include <vector>
 
+#include "base/VSAContainerClasses.h"
 #include "base/VSAError.h"
 #include "platform/VSASystemRoot.h"
 
@@ -23,10 +24,10 @@ class VSAContainerSubdirectories {
 
   // container_subdirectories_for_class: the names, or nothing (with a code)
   // for a class the table does not know.
-  std::optional<std::vector<std::string>> subdirectoriesForClass(uint64_t containerClass,
+  std::optional<std::vector<std::string>> subdirectoriesForClass(VSAContainerClass containerClass,
                                                                  VSAResultCode* error) const;
-  static const std::map<uint64_t, std::vector<std::string>>& builtIn();
+  static const std::map<VSAContainerClass, std::vector<std::string>>& builtIn();
 
  private:
-  std::map<uint64_t, std::vector<std::string>> table_;
+  std::map<VSAContainerClass, std::vector<std::string>> table_;
 };

@@ -29,25 +29,25 @@ std::string hex(const std::string& s) {
 }
 }  // namespace
 
-std::optional<uint64_t> VSASandboxItemTypeForClass(uint64_t c) {
+std::optional<uint64_t> VSASandboxItemTypeForClass(VSAContainerClass c) {
   switch (c) {
-    case 2:
+    case VSAClass::kDataApplication:
       return 1;  // app data
-    case 4:
+    case VSAClass::kDataPlugin:
       return 2;  // plug-in data
-    case 6:
+    case VSAClass::kDataVPNPlugin:
       return 3;  // VPN plug-in data
-    case 7:
+    case VSAClass::kAppGroup:
       return 4;  // app group
-    case 9:
+    case VSAClass::kDataRelayService:
       return 5;  // relay service data
-    case 10:
+    case VSAClass::kDataInternalDaemon:
       return 6;  // internal daemon data
-    case 11:
+    case VSAClass::kDataTempDir:
       return 7;  // temporary directory
-    case 12:
+    case VSAClass::kSystemData:
       return 8;  // system data
-    case 13:
+    case VSAClass::kSystemGroup:
       return 9;  // system group
     default:
       return std::nullopt;
@@ -83,7 +83,7 @@ const VSASandboxService::Table& VSASandboxService::load(uid_t uid) {
                      *persona = v.get("PersonaID"), *path = v.get("Path");
       if (!type || !id || !id->isString() || !cls || !path || !path->isString()) continue;
       VSASandboxItem item{type->uint64Value().value_or(0), *id->stringValue(),
-                          cls->uint64Value().value_or(0),
+                          cls->uint64Value().value_or(VSAClass::kUndefined),
                           static_cast<int32_t>(persona ? persona->int64Value().value_or(0) : 0),
                           *path->stringValue()};
       items[{item.identifier, item.containerClass, item.personaID}] = std::move(item);
@@ -146,7 +146,7 @@ std::chrono::steady_clock::duration VSASandboxService::writePending() {
 void VSASandboxService::flush() { writePending(); }
 
 int VSASandboxService::setUserStateItem(uid_t uid, uint64_t itemType, const std::string& identifier,
-                                        uint64_t containerClass, int32_t personaID,
+                                        VSAContainerClass containerClass, int32_t personaID,
                                         const std::optional<std::string>& path) {
   if (identifier.empty()) return EINVAL;
   bool wake = false;
@@ -154,7 +154,7 @@ int VSASandboxService::setUserStateItem(uid_t uid, uint64_t itemType, const std:
     std::lock_guard lock(mutex_);
     load(uid);
     auto& items = tables_[uid];
-    std::tuple<std::string, uint64_t, int32_t> key{identifier, containerClass, personaID};
+    std::tuple<std::string, VSAContainerClass, int32_t> key{identifier, containerClass, personaID};
     auto it = items.find(key);
     // Launches and look-ups push the same mapping again and again: only a
     // change makes the table worth rewriting.
@@ -189,7 +189,7 @@ int VSASandboxService::iterateUserStateItems(
 
 std::optional<VSASandboxItem> VSASandboxService::userStateItem(uid_t uid,
                                                                const std::string& identifier,
-                                                               uint64_t containerClass,
+                                                               VSAContainerClass containerClass,
                                                                int32_t personaID) {
   std::lock_guard lock(mutex_);
   const Table& items = load(uid);

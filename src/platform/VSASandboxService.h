@@ -33,20 +33,21 @@
 #include <utility>
 #include <vector>
 
+#include "base/VSAContainerClasses.h"
 #include "platform/VSAAuditToken.h"
 #include "platform/VSASystemRoot.h"
 
 struct VSASandboxItem {
   uint64_t itemType = 0;
   std::string identifier;
-  uint64_t containerClass = 0;
+  VSAContainerClass containerClass = VSAClass::kUndefined;
   int32_t personaID = 0;
   std::string path;
 };
 
 // The sandbox's item type for a container class; nothing for classes the
 // sandbox does not track (the bundle classes).
-std::optional<uint64_t> VSASandboxItemTypeForClass(uint64_t containerClass);
+std::optional<uint64_t> VSASandboxItemTypeForClass(VSAContainerClass containerClass);
 
 class VSASandboxService {
  public:
@@ -59,13 +60,13 @@ class VSASandboxService {
   // and persona (personas may share a uid); an absent path removes it.
   // Returns 0 or an errno.
   int setUserStateItem(uid_t uid, uint64_t itemType, const std::string& identifier,
-                       uint64_t containerClass, int32_t personaID,
+                       VSAContainerClass containerClass, int32_t personaID,
                        const std::optional<std::string>& path);
   // Calls `block` for each item of `uid` until it answers false; 0 or an errno.
   int iterateUserStateItems(uid_t uid, const std::function<bool(const VSASandboxItem&)>& block);
   // The item of `uid` for `identifier`, `containerClass` and `personaID`.
   std::optional<VSASandboxItem> userStateItem(uid_t uid, const std::string& identifier,
-                                              uint64_t containerClass, int32_t personaID);
+                                              VSAContainerClass containerClass, int32_t personaID);
 
   // Issues a token granting `auditToken`'s process access to `path`.
   std::optional<std::string> issueFileExtension(const std::string& extensionClass,
@@ -75,7 +76,7 @@ class VSASandboxService {
                            const std::string& path, const VSAAuditToken& auditToken);
 
  private:
-  using Table = std::map<std::tuple<std::string, uint64_t, int32_t>, VSASandboxItem>;
+  using Table = std::map<std::tuple<std::string, VSAContainerClass, int32_t>, VSASandboxItem>;
 
   std::string tablePath(uid_t uid) const;
   const Table& load(uid_t uid);  // caller holds mutex_

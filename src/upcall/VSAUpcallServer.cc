@@ -106,9 +106,8 @@ VSAValue pathsByIdentifier(const std::vector<std::pair<std::string, std::string>
   return VSAValue(std::move(d));
 }
 
-bool isDataClass(VSAContainerClass c) {
-  return c == 2 || c == 4 || c == 6 || c == 7 || c == 9 || c == 10 || c == 11;
-}
+// The data classes and the app group: every per-user class.
+bool isDataClass(VSAContainerClass c) { return VSAContainerClassIsPerUser(c); }
 
 // One upcall's containers, made and packed.
 struct ContainerRun {
@@ -139,19 +138,20 @@ struct ContainerRun {
   VSAContainerClass dataClass(const std::string& id) {
     VSAContainerClass c = env.dataContainerTypeForIdentifier(id);
     if (isDataClass(c)) {
-      if (request.sandboxType == 1 && c != 4) {
+      if (request.sandboxType == 1 && c != VSAClass::kDataPlugin) {
         logUpcall(kVSALogNotice, "SB Type: %u, FX Type: %llu.  Declaring this a plugin",
                   request.sandboxType, static_cast<unsigned long long>(c));
-        return 4;
+        return VSAClass::kDataPlugin;
       }
-      if (request.sandboxType == 0 && c != 2)
+      if (request.sandboxType == 0 && c != VSAClass::kDataApplication)
         logUpcall(kVSALogNotice, "SB type is app, but FX type is %llu",
                   static_cast<unsigned long long>(c));
       return c;
     }
     logUpcall(kVSALogError, "Invalid data container class for %@: %llu", id,
               static_cast<unsigned long long>(c));
-    VSAContainerClass fallback = request.sandboxType == 1 ? 4 : 2;
+    VSAContainerClass fallback =
+        request.sandboxType == 1 ? VSAClass::kDataPlugin : VSAClass::kDataApplication;
     logUpcall(kVSALogNotice, "SB Type: %u, falling back to class: %llu", request.sandboxType,
               static_cast<unsigned long long>(fallback));
     return fallback;
@@ -166,15 +166,16 @@ struct ContainerRun {
     }
     if (request.systemContainerID)
       systemContainer =
-          make(*request.systemContainerID, 12,
+          make(*request.systemContainerID, VSAClass::kSystemData,
                "createOrLookupContainerForUser:(system container) Failed with error: %llu");
-    if (!request.groups.empty()) checkUID(7);
+    if (!request.groups.empty()) checkUID(VSAClass::kAppGroup);
     for (const auto& g : request.groups)
-      if (auto path = make(g, 7, "createOrLookupGroupContainersForUser: Failed with error: %llu"))
+      if (auto path = make(g, VSAClass::kAppGroup,
+                           "createOrLookupGroupContainersForUser: Failed with error: %llu"))
         groupPaths.emplace_back(g, *path);
     for (const auto& g : request.systemGroups)
       if (auto path = make(
-              g, 13,
+              g, VSAClass::kSystemGroup,
               "createOrLookupContainerForUser:(system group container) Failed with error: %llu"))
         systemGroupPaths.emplace_back(g, *path);
   }

@@ -7,6 +7,7 @@
 #include <limits>
 
 #include "base/VSABinaryPlist.h"
+#include "base/VSACommands.h"
 #include "base/VSAPlist.h"
 
 namespace {
@@ -98,7 +99,7 @@ TEST(VSABinaryPlist, InvalidUTF8IsRefusedByTheEncoder) {
 
 TEST(VSABinaryPlist, EveryTruncationIsRejectedWithoutCrashing) {
   auto bytes =
-      encode(VSAValue::Dictionary{{"Command", VSAValue(3u)},
+      encode(VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kStageForDelete)},
                                   {"Identifier", VSAValue("com.a")},
                                   {"List", VSAValue(VSAValue::Array{VSAValue(1), VSAValue(2)})}});
   for (size_t n = 0; n < bytes.size(); ++n) {

@@ -109,8 +109,9 @@ TEST_F(Mapping, RoundTripAndExternalReads) {
   EXPECT_EQ(*back->get("CDHash")->stringValue(), "abc");
   // A placeholder is not shown to clients but is there for the daemon.
   ASSERT_EQ(reg("com.placeholder", info(VSAValue::dictionary()), q,
-                VSAValue::Dictionary{{kVSAOptionPlaceholder, VSAValue(true)},
-                                     {kVSAOptionDataContainerClass, VSAValue(2u)}}),
+                VSAValue::Dictionary{
+                    {kVSAOptionPlaceholder, VSAValue(true)},
+                    {kVSAOptionDataContainerClass, VSAValue(VSAClass::kDataApplication)}}),
             1u);
   EXPECT_FALSE(mapping_->getCodeSigningInfoForIdentifier("com.placeholder"));
   EXPECT_TRUE(mapping_->entitlementsForIdentifier("com.placeholder"));
@@ -161,7 +162,7 @@ TEST_F(Mapping, SharedGroupIsQueuedForDeletionOnlyAtTheLastReference) {
 }
 
 TEST_F(Mapping, QueuedDeletionsStageTheContainersOnDeathRow) {
-  std::string shared = container("group.shared", 7);
+  std::string shared = container("group.shared", VSAClass::kAppGroup);
   VSACommandQueue q;
   ASSERT_EQ(reg("com.a", info(groups({"group.shared"})), q), 1u);
   ASSERT_EQ(reg("com.a", info(VSAValue::dictionary()), q), 1u);
@@ -172,18 +173,18 @@ TEST_F(Mapping, QueuedDeletionsStageTheContainersOnDeathRow) {
   EXPECT_TRUE(
       fs::exists(config_->deathrowDirectory() + "/" + fs::path(shared).filename().string()));
   VSAErrorRef error;
-  auto gone = VSAContainerIdentity::containerIdentityWithUserIdentity(personal_, "group.shared", 7,
-                                                                      nullptr);
+  auto gone = VSAContainerIdentity::containerIdentityWithUserIdentity(personal_, "group.shared",
+                                                                      VSAClass::kAppGroup, nullptr);
   EXPECT_FALSE(containers_->containerForContainerIdentity(*gone, {}, &error));
   EXPECT_EQ(error->resultCode(0), 21u);
 }
 
 TEST_F(Mapping, AStagedBundleTakesItsCodeSigningRecordsAlong) {
-  std::string bundle = container("com.bundled", 1);
+  std::string bundle = container("com.bundled", VSAClass::kBundleApplication);
   VSACommandQueue q;
   ASSERT_EQ(reg("com.bundled", info(VSAValue::dictionary()), q), 1u);
-  auto identity =
-      VSAContainerIdentity::containerIdentityWithUserIdentity(personal_, "com.bundled", 1, nullptr);
+  auto identity = VSAContainerIdentity::containerIdentityWithUserIdentity(
+      personal_, "com.bundled", VSAClass::kBundleApplication, nullptr);
   auto environment = std::make_shared<VSAStageForDeleteEnvironment>(
       VSAStageForDeleteEnvironment{containers_, config_, locks_, testLocks_, mapping_.get()});
   q.insertCommand(VSACommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
@@ -239,7 +240,7 @@ TEST_F(Mapping, CallerRegisteredEntitlementsNeverOverwriteASignature) {
 }
 
 TEST_F(Mapping, LegacyMappingFileMovesIntoTheDatabaseOnce) {
-  VSACodeSigningEntry old(info(groups({"group.legacy"})), 2);
+  VSACodeSigningEntry old(info(groups({"group.legacy"})), VSAClass::kDataApplication);
   VSAValue file = VSAValue::Dictionary{{"com.legacy.app", old.serialize()}};
   build(&file);
   VSAErrorRef error;
@@ -254,16 +255,18 @@ TEST_F(Mapping, LegacyMappingFileMovesIntoTheDatabaseOnce) {
 }
 
 TEST_F(Mapping, AppsWithoutABundleContainerAreInvalidated) {
-  container("com.installed", 1);
+  container("com.installed", VSAClass::kBundleApplication);
   VSACommandQueue q;
   ASSERT_EQ(reg("com.installed", info(VSAValue::dictionary()), q), 1u);
   ASSERT_EQ(reg("com.gone", info(VSAValue::dictionary()), q,
-                VSAValue::Dictionary{{kVSAOptionDataContainerClass, VSAValue(2u)}}),
+                VSAValue::Dictionary{
+                    {kVSAOptionDataContainerClass, VSAValue(VSAClass::kDataApplication)}}),
             1u);
-  ASSERT_EQ(reg("com.gone.plugin", info(VSAValue::dictionary()), q,
-                VSAValue::Dictionary{{kVSAOptionParentBundleID, VSAValue("com.gone")},
-                                     {kVSAOptionDataContainerClass, VSAValue(4u)}}),
-            1u);
+  ASSERT_EQ(
+      reg("com.gone.plugin", info(VSAValue::dictionary()), q,
+          VSAValue::Dictionary{{kVSAOptionParentBundleID, VSAValue("com.gone")},
+                               {kVSAOptionDataContainerClass, VSAValue(VSAClass::kDataPlugin)}}),
+      1u);
   ASSERT_EQ(mapping_->processCallerRegisteredEntitlements(VSAValue::dictionary(), "com.caller", &q),
             1u);
   EXPECT_EQ(mapping_->invalidateCodeSigningInfoForAppsWithoutBundleContainer(), 1u);
@@ -276,8 +279,8 @@ TEST_F(Mapping, AppsWithoutABundleContainerAreInvalidated) {
 }
 
 TEST_F(Mapping, UnclaimedSystemContainersAreReconciledAway) {
-  container("com.claimed", 12);
-  std::string orphan = container("com.orphan", 12);
+  container("com.claimed", VSAClass::kSystemData);
+  std::string orphan = container("com.orphan", VSAClass::kSystemData);
   VSACommandQueue q;
   ASSERT_EQ(reg("com.claimed",
                 info(VSAValue::Dictionary{{kVSAEntitlementSystemContainer, VSAValue(true)}}), q),

@@ -51,7 +51,7 @@ class Groups : public VSAContainerTestRoot {
   }
   // A group container of `user` made through the normal creation path.
   VSAMetadataRef group(const std::string& id, const VSAUserIdentityRef& user,
-                       VSAContainerClass c = 7) {
+                       VSAContainerClass c = VSAClass::kAppGroup) {
     VSAResultCode code = VSAResult::kSuccess;
     auto identity = VSAContainerIdentity::containerIdentityWithUserIdentity(user, id, c, &code);
     return installer()->createOrLookupContainerWithContainerIdentity(
@@ -77,7 +77,8 @@ TEST_F(Groups, ASharedGroupGoesWithItsLastReferenceForEveryUser) {
   ASSERT_EQ(
       reg("com.example.c", appGroups(strings({"group.example.shared", "group.example.shared"})), q),
       1u);
-  EXPECT_EQ((*context_->codeSigningMapping->copyReferenceCountSetOfType(0))["group.example.shared"],
+  EXPECT_EQ((*context_->codeSigningMapping->copyReferenceCountSetOfType(
+                kVSAGroupTypeApplication))["group.example.shared"],
             3);
   ASSERT_EQ(reg("com.example.a", VSAValue::dictionary(), q), 1u);
   ASSERT_EQ(reg("com.example.c", VSAValue::dictionary(), q), 1u);
@@ -106,21 +107,22 @@ TEST_F(Groups, ReconciliationRemovesOnlyUnreferencedGroupsAndAloneRemovesSystemG
     made[std::string("work:") + id] = group(id, work_);
   }
   for (const char* id : {"systemgroup.com.example.sys", "systemgroup.com.example.orphan"})
-    made[id] = group(id, context_->userIdentityCache->defaultUserIdentity(), 13);
+    made[id] =
+        group(id, context_->userIdentityCache->defaultUserIdentity(), VSAClass::kSystemGroup);
   for (const auto& [id, m] : made) ASSERT_TRUE(m) << id;
 
   // A registration that drops a system group leaves its container alone.
   ASSERT_EQ(reg("com.example.sys", VSAValue::dictionary(), q), 1u);
   EXPECT_EQ(q.count(), 0u);
 
-  context_->groupManager->reconcileGroupContainersOfType(0, q);
+  context_->groupManager->reconcileGroupContainersOfType(kVSAGroupTypeApplication, q);
   EXPECT_EQ(q.count(), 2u);  // group.example.orphan, for each user
   run(q);
   for (const auto& [id, m] : made) {
     bool orphanApp = id.find("group.example.orphan") != std::string::npos;
     EXPECT_EQ(fs::exists(m->url()), !orphanApp) << id;
   }
-  context_->groupManager->reconcileGroupContainersOfType(1, q);
+  context_->groupManager->reconcileGroupContainersOfType(kVSAGroupTypeSystem, q);
   run(q);
   EXPECT_FALSE(fs::exists(made["systemgroup.com.example.sys"]->url()));
   EXPECT_FALSE(fs::exists(made["systemgroup.com.example.orphan"]->url()));
@@ -134,10 +136,11 @@ TEST_F(Groups, AClientGetsAnOwnersGroupsOnlyWithAGrant) {
             1u);
   ASSERT_EQ(reg("com.example.b", appGroups(strings({"group.example.b1", "group.example.b2"})), q),
             1u);
-  auto appGroupsDir = classDirectory(7);
+  auto appGroupsDir = classDirectory(VSAClass::kAppGroup);
   VSAResultCode code = VSAResult::kSuccess;
   auto self = connection("com.example.a", false, false);
-  auto own = self->groupContainersForOwnerIdentifier("com.example.a", user_, 7, &code);
+  auto own =
+      self->groupContainersForOwnerIdentifier("com.example.a", user_, VSAClass::kAppGroup, &code);
   ASSERT_TRUE(own) << code;
   ASSERT_EQ(own->size(), 2u);
   EXPECT_EQ((*own)[0].first, "group.example.a1");
@@ -145,23 +148,27 @@ TEST_F(Groups, AClientGetsAnOwnersGroupsOnlyWithAGrant) {
   EXPECT_EQ(entries(appGroupsDir), 2u);
   // Another owner's groups: refused, and nothing is made or revealed.
   code = VSAResult::kSuccess;
-  EXPECT_FALSE(self->groupContainersForOwnerIdentifier("com.example.b", user_, 7, &code));
+  EXPECT_FALSE(
+      self->groupContainersForOwnerIdentifier("com.example.b", user_, VSAClass::kAppGroup, &code));
   EXPECT_EQ(code, VSAResult::kNotEntitled);
-  EXPECT_FALSE(self->groupContainerIdentifiersForOwnerIdentifier("com.example.b", 7, &code));
+  EXPECT_FALSE(self->groupContainerIdentifiersForOwnerIdentifier("com.example.b",
+                                                                 VSAClass::kAppGroup, &code));
   EXPECT_EQ(entries(appGroupsDir), 2u);
   // A lookup entitlement listing one of them gives that one only.
   VSAValue lookup = VSAValue::Dictionary{{"appGroup", strings({"group.example.b2"})}};
   auto looker = connection("com.example.a", false, false, lookup);
   code = VSAResult::kSuccess;
-  auto listed = looker->groupContainersForOwnerIdentifier("com.example.b", user_, 7, &code);
+  auto listed =
+      looker->groupContainersForOwnerIdentifier("com.example.b", user_, VSAClass::kAppGroup, &code);
   ASSERT_TRUE(listed) << code;
   ASSERT_EQ(listed->size(), 1u);
   EXPECT_EQ((*listed)[0].first, "group.example.b2");
   // Only the group classes; an owner without entitlements has no groups.
-  EXPECT_FALSE(installer()->groupContainerIdentifiersForOwnerIdentifier("com.example.a", 2, &code));
+  EXPECT_FALSE(installer()->groupContainerIdentifiersForOwnerIdentifier(
+      "com.example.a", VSAClass::kDataApplication, &code));
   EXPECT_EQ(code, VSAResult::kInvalidArgument);
-  auto none =
-      installer()->groupContainerIdentifiersForOwnerIdentifier("com.example.none", 7, &code);
+  auto none = installer()->groupContainerIdentifiersForOwnerIdentifier("com.example.none",
+                                                                       VSAClass::kAppGroup, &code);
   ASSERT_TRUE(none);
   EXPECT_TRUE(none->empty());
 }
@@ -174,8 +181,8 @@ TEST_F(Groups, AnOwnersGroupsAreListedUnderTheAllIdentifiersWriteLock) {
   auto list = [&](bool useLocking) {
     return std::async(std::launch::async, [&, useLocking] {
       VSAResultCode code = VSAResult::kSuccess;
-      return context_->groupManager->groupContainerIdentifiersForOwnerIdentifier(&owner, 7,
-                                                                                 useLocking, &code);
+      return context_->groupManager->groupContainerIdentifiersForOwnerIdentifier(
+          &owner, VSAClass::kAppGroup, useLocking, &code);
     });
   };
   // A reader of all identifiers (a look-up in progress) holds the listing back.

@@ -19,7 +19,8 @@ class CodeSigningDB : public ::testing::Test {
     std::filesystem::remove_all(dir_);
   }
   static VSACodeSigningEntry entry(const char* team, std::vector<std::string> children = {}) {
-    VSACodeSigningEntry e(VSAValue::Dictionary{{"TeamIdentifier", VSAValue(team)}}, 2);
+    VSACodeSigningEntry e(VSAValue::Dictionary{{"TeamIdentifier", VSAValue(team)}},
+                          VSAClass::kDataApplication);
     if (!children.empty()) e.setChildBundleIdentifiers(children);
     return e;
   }
@@ -35,7 +36,7 @@ class CodeSigningDB : public ::testing::Test {
 };
 
 TEST(VSACodeSigningEntry, SerialisationEqualityAndHash) {
-  VSACodeSigningEntry a(VSAValue::Dictionary{{"k", VSAValue(1)}}, 0);
+  VSACodeSigningEntry a(VSAValue::Dictionary{{"k", VSAValue(1)}}, VSAClass::kUndefined);
   a.setChildBundleIdentifiers(std::vector<std::string>{"x", "y"});
   a.setAdvanceCopy(true);
   VSACodeSigningEntry back = VSACodeSigningEntry::initWithSerializedDictionary(a.serialize());
@@ -44,9 +45,9 @@ TEST(VSACodeSigningEntry, SerialisationEqualityAndHash) {
   reordered.setChildBundleIdentifiers(std::vector<std::string>{"y", "x"});
   EXPECT_FALSE(reordered.isEqual(a)) << "child order matters";
   VSACodeSigningEntry classed = a;
-  classed.setDataContainerClass(7);
+  classed.setDataContainerClass(VSAClass::kAppGroup);
   EXPECT_EQ(classed.hash(), a.hash() + 16);
-  classed.setDataContainerClass(2);
+  classed.setDataContainerClass(VSAClass::kDataApplication);
   EXPECT_EQ(classed.hash(), a.hash() + 16) << "whatever the class's value";
   EXPECT_NE(a.description().find("advanceCopy: Y"), std::string::npos);
   VSACodeSigningEntry empty =
@@ -60,7 +61,7 @@ TEST_F(CodeSigningDB, UpdateThenInsertAndReplace) {
   auto got = db_->codeSigningEntryWithIdentifier("com.p", &error);
   ASSERT_TRUE(got);
   EXPECT_EQ(*got->codeSigningInfo().get("TeamIdentifier")->stringValue(), "A");
-  EXPECT_EQ(got->dataContainerClass(), 2u);
+  EXPECT_EQ(got->dataContainerClass(), VSAClass::kDataApplication);
   EXPECT_EQ(got->childBundleIdentifiers()->size(), 2u);
   // Re-adding replaces blob and flags but keeps child links it no longer lists.
   auto second = entry("B", {"com.p.child1"});
@@ -95,12 +96,13 @@ TEST_F(CodeSigningDB, ClassAloneAgreesWithTheEntry) {
   EXPECT_EQ(error->code(), 67);
   EXPECT_TRUE(VSASQLiteDB::isNotFound(error));
   ASSERT_TRUE(add(entry("A", {"com.p.child"}), "com.p"));
-  EXPECT_EQ(db_->dataContainerClassWithIdentifier("com.p", &error), 2u);
+  EXPECT_EQ(db_->dataContainerClassWithIdentifier("com.p", &error), VSAClass::kDataApplication);
   auto plugin = entry("A");
-  plugin.setDataContainerClass(4);
+  plugin.setDataContainerClass(VSAClass::kDataPlugin);
   ASSERT_TRUE(add(plugin, "com.p"));
-  EXPECT_EQ(db_->dataContainerClassWithIdentifier("com.p", &error), 4u);
-  EXPECT_EQ(db_->codeSigningEntryWithIdentifier("com.p", &error)->dataContainerClass(), 4u);
+  EXPECT_EQ(db_->dataContainerClassWithIdentifier("com.p", &error), VSAClass::kDataPlugin);
+  EXPECT_EQ(db_->codeSigningEntryWithIdentifier("com.p", &error)->dataContainerClass(),
+            VSAClass::kDataPlugin);
   EXPECT_FALSE(db_->dataContainerClassWithIdentifier("com.p.child", &error))
       << "a child link is not an entry of its own";
   std::string id = "com.p";

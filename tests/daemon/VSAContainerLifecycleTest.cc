@@ -86,13 +86,14 @@ TEST_F(Lifecycle, TransientContainersAreAlwaysMadeFresh) {
   auto first = create(*c, "com.example.temp", &code, true);
   ASSERT_TRUE(first) << code;
   EXPECT_TRUE(first->transient());
-  EXPECT_EQ(fs::path(first->url()).parent_path(), fs::path(classDirectory(2, true)));
+  EXPECT_EQ(fs::path(first->url()).parent_path(),
+            fs::path(classDirectory(VSAClass::kDataApplication, true)));
   auto second = create(*c, "com.example.temp", &code, true);
   ASSERT_TRUE(second) << code;
   EXPECT_FALSE(second->existed());
   EXPECT_NE(second->url(), first->url());
   EXPECT_FALSE(fs::exists(first->url()));
-  EXPECT_EQ(entries(classDirectory(2, true)), 1u);
+  EXPECT_EQ(entries(classDirectory(VSAClass::kDataApplication, true)), 1u);
 }
 
 TEST_F(Lifecycle, TransientContainersOfEveryUserGoAtTheFirstStartAfterABoot) {
@@ -112,13 +113,13 @@ TEST_F(Lifecycle, TransientContainersOfEveryUserGoAtTheFirstStartAfterABoot) {
 TEST_F(Lifecycle, WellKnownSystemGroupsLiveUnderTheirNameWithSystemOwners) {
   auto c = installer();
   VSAResultCode code;
-  auto m = create(*c, "systemgroup.com.tamsk.launcher", &code, false, 13);
+  auto m = create(*c, "systemgroup.com.tamsk.launcher", &code, false, VSAClass::kSystemGroup);
   ASSERT_TRUE(m) << code;
   EXPECT_EQ(fs::path(m->url()).filename(), "systemgroup.com.tamsk.launcher");
   struct stat st;
   ASSERT_EQ(::stat((m->url() + "/Library").c_str(), &st), 0);
   EXPECT_EQ(st.st_uid, kVSANobodyID);
-  auto other = create(*c, "systemgroup.com.example.unknown", &code, false, 13);
+  auto other = create(*c, "systemgroup.com.example.unknown", &code, false, VSAClass::kSystemGroup);
   ASSERT_TRUE(other) << code;
   EXPECT_EQ(fs::path(other->url()).filename().string().size(), 36u);
 }
@@ -143,9 +144,10 @@ TEST_F(Lifecycle, AccessTestsComeBeforeAnyLookup) {
   auto looker = connection("com.example.looker", false, false, lookup);
   EXPECT_TRUE(looker->createOrLookupContainerWithContainerIdentity(identity("com.example.other"),
                                                                    {}, &code));
-  EXPECT_TRUE(looker->isEntitledForLookupWithClass(2, "com.example.other"));
-  EXPECT_FALSE(looker->isEntitledForLookupWithClass(3, "com.example.other"));
-  EXPECT_EQ(looker->_lookupForContainerClass(3)->size(), 0u);
+  EXPECT_TRUE(
+      looker->isEntitledForLookupWithClass(VSAClass::kDataApplication, "com.example.other"));
+  EXPECT_FALSE(looker->isEntitledForLookupWithClass(VSAClass::kBundlePlugin, "com.example.other"));
+  EXPECT_EQ(looker->_lookupForContainerClass(VSAClass::kBundlePlugin)->size(), 0u);
   EXPECT_FALSE(looker->_lookupForContainerClass(14));
   // The built-in whitelist lets this client see one app's data.
   auto whitelisted = connection("com.tamsk.mail.composer", false, false);
@@ -230,9 +232,9 @@ void Lifecycle::sweepCreation(VSAContainerClass cls) {
 }
 
 TEST_F(Lifecycle, AFailureOfAnyCallOfCreationLeavesNothingBehind) {
-  sweepCreation(2);
+  sweepCreation(VSAClass::kDataApplication);
   if (HasFatalFailure()) return;
-  sweepCreation(13);  // a system class: an ACL and system owners
+  sweepCreation(VSAClass::kSystemGroup);  // a system class: an ACL and system owners
   std::printf("creation sweeps: %d injected faults\n", injectedFaults_);
   RecordProperty("injected_faults", injectedFaults_);
 }
@@ -279,9 +281,9 @@ TEST_F(Lifecycle, ATransientBundleWithAPermanentTwinKeepsTheCodeSigningRecords) 
   } restore{*context_->stageEnvironment, context_->stageEnvironment->codeSigning};
   context_->stageEnvironment->codeSigning = &recorder;
   const std::vector<std::string>& forgotten = recorder.removed;
-  auto permanent = create(*c, "com.example.twin", &code, false, 1);
+  auto permanent = create(*c, "com.example.twin", &code, false, VSAClass::kBundleApplication);
   ASSERT_TRUE(permanent) << code;
-  auto transient = create(*c, "com.example.twin", &code, true, 1);
+  auto transient = create(*c, "com.example.twin", &code, true, VSAClass::kBundleApplication);
   ASSERT_TRUE(transient) << code;
   // A transient container is named by its concrete identity (its UUID).
   ASSERT_EQ(stage({transient->containerIdentity()}), VSAResult::kSuccess);
@@ -290,28 +292,29 @@ TEST_F(Lifecycle, ATransientBundleWithAPermanentTwinKeepsTheCodeSigningRecords) 
   EXPECT_TRUE(forgotten.empty());
   VSAErrorRef error;
   EXPECT_FALSE(context_->containerCache->containerForContainerIdentity(
-      *identity("com.example.twin", 1), {.transient = true}, &error));
+      *identity("com.example.twin", VSAClass::kBundleApplication), {.transient = true}, &error));
   ASSERT_TRUE(error);
   EXPECT_EQ(error->code(), VSAResult::kContainerNotFound);  // dropped, not found stale (44)
-  auto still =
-      context_->containerCache->containerForContainerIdentity(*identity("com.example.twin", 1));
+  auto still = context_->containerCache->containerForContainerIdentity(
+      *identity("com.example.twin", VSAClass::kBundleApplication));
   ASSERT_TRUE(still);
   EXPECT_EQ(still->uuid(), permanent->uuid());
 
   // A transient bundle container without a permanent twin takes the records along.
-  auto lonely = create(*c, "com.example.lonely", &code, true, 1);
+  auto lonely = create(*c, "com.example.lonely", &code, true, VSAClass::kBundleApplication);
   ASSERT_TRUE(lonely) << code;
   ASSERT_EQ(stage({lonely->containerIdentity()}), VSAResult::kSuccess);
   EXPECT_FALSE(fs::exists(lonely->url()));
   EXPECT_EQ(forgotten, std::vector<std::string>{"com.example.lonely"});
   error = nullptr;
   EXPECT_FALSE(context_->containerCache->containerForContainerIdentity(
-      *identity("com.example.lonely", 1), {.transient = true}, &error));
+      *identity("com.example.lonely", VSAClass::kBundleApplication), {.transient = true}, &error));
   ASSERT_TRUE(error);
   EXPECT_EQ(error->code(), VSAResult::kContainerNotFound);
 
   // Deleting the permanent container forgets the records too.
-  c->deleteContainerWithContainerIdentity(identity("com.example.twin", 1), false, &code);
+  c->deleteContainerWithContainerIdentity(
+      identity("com.example.twin", VSAClass::kBundleApplication), false, &code);
   ASSERT_TRUE(c->completeWithError(&code)) << code;
   EXPECT_FALSE(fs::exists(permanent->url()));
   EXPECT_EQ(forgotten, (std::vector<std::string>{"com.example.lonely", "com.example.twin"}));
@@ -375,8 +378,8 @@ TEST_F(Lifecycle, AContainerThatCannotBeRemovedKeepsItsEntryAndFailsWith28) {
 TEST_F(Lifecycle, ACacheThatCannotDropAStagedContainerStopsTheCommandWith46) {
   auto c = installer();
   VSAResultCode code;
-  auto first = create(*c, "com.example.first", &code, false, 1);
-  auto second = create(*c, "com.example.second", &code, false, 1);
+  auto first = create(*c, "com.example.first", &code, false, VSAClass::kBundleApplication);
+  auto second = create(*c, "com.example.second", &code, false, VSAClass::kBundleApplication);
   ASSERT_TRUE(first && second);
   // The class map goes away while the command runs (an identity
   // invalidation), and the class directory cannot be listed any more.
@@ -390,8 +393,10 @@ TEST_F(Lifecycle, ACacheThatCannotDropAStagedContainerStopsTheCommandWith46) {
   std::vector<VSAResultCode> reported;
   VSACommandQueue queue;
   queue.insertCommand(VSACommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
-      environment, {identity("com.example.first", 1), identity("com.example.second", 1)}, true,
-      [&](VSAResultCode failure) { reported.push_back(failure); }));
+      environment,
+      {identity("com.example.first", VSAClass::kBundleApplication),
+       identity("com.example.second", VSAClass::kBundleApplication)},
+      true, [&](VSAResultCode failure) { reported.push_back(failure); }));
   code = VSAResult::kSuccess;
   EXPECT_FALSE(queue.executeAllUntilExhaustedOrError(&code));
   faults_->reset();

@@ -7,6 +7,7 @@
 #include <fstream>
 
 #include "VSATestReplies.h"
+#include "base/VSACommands.h"
 #include "base/VSAPlist.h"
 #include "daemon/VSAClientConnection.h"
 #include "daemon/VSAEntitlements.h"
@@ -19,7 +20,7 @@ using namespace std::chrono_literals;
 
 class FailingCommand : public VSACommand {
  public:
-  uint64_t command() const override { return 3; }
+  VSACommandNumber command() const override { return VSACommands::kStageForDelete; }
   bool fromQueue(VSACommandQueue&, VSAResultCode* error) override {
     *error = 41;
     return false;
@@ -33,7 +34,7 @@ void fail(const VSAValue&, VSAValue&, VSAClientConnection&, VSAResultCode* resul
 void queueFailure(const VSAValue&, VSAValue&, VSAClientConnection& c, VSAResultCode*) {
   c.commandQueue()->insertCommand(std::make_shared<FailingCommand>());
 }
-// Replies itself, as commands 4 and 21 do on success.
+// Replies itself, as emptying death row and changing data protection do on success.
 void replyLater(const VSAValue&, VSAValue&, VSAClientConnection& c, VSAResultCode*) {
   VSAValue reply = *c.relayMessage()->createReply();
   reply.set("ReplyError", VSAValue(1u));
@@ -43,16 +44,21 @@ void replyLater(const VSAValue&, VSAValue&, VSAClientConnection& c, VSAResultCod
 
 const char* kAllowed = kVSAEntitlementAllowed;
 
-// A table with a misnumbered entry at index 2 and self-replying entries 4 and 21.
-std::array<VSACommandTableEntry, 33> testTable() {
-  std::array<VSACommandTableEntry, 33> t{};
-  for (uint64_t i = 0; i < 33; ++i) t[i] = {i, succeed, kAllowed, true, false, false};
+// A table whose entries all succeed, but for a few arbitrary slots (1 fails,
+// 2 is misnumbered, 3 queues a failing command, 5 has no handler) and the two
+// commands the dispatcher leaves to their handlers to answer.
+std::array<VSACommandTableEntry, kVSACommandCount> testTable() {
+  std::array<VSACommandTableEntry, kVSACommandCount> t{};
+  for (VSACommandNumber i = 0; i < kVSACommandCount; ++i)
+    t[i] = {i, succeed, kAllowed, true, false, false};
   t[1].handler = fail;
   t[2].command = 7;
   t[3].handler = queueFailure;
-  t[4] = {4, replyLater, kAllowed, false, false, false};
   t[5].handler = nullptr;
-  t[21] = {21, fail, kAllowed, false, false, false};
+  t[VSACommands::kDeleteDeathRow] = {
+      VSACommands::kDeleteDeathRow, replyLater, kAllowed, false, false, false};
+  t[VSACommands::kSetDataProtection] = {
+      VSACommands::kSetDataProtection, fail, kAllowed, false, false, false};
   return t;
 }
 
@@ -99,10 +105,10 @@ class VSARelayDispatcherTest : public ::testing::Test {
   std::unique_ptr<VSARelayDispatcher> dispatcher_;
   VSAIPCConnectionRef connection_;
   int peer_ = -1;
-  std::array<VSACommandTableEntry, 33> table_ = testTable();
+  std::array<VSACommandTableEntry, kVSACommandCount> table_ = testTable();
 };
 
-VSAValue request(uint64_t command) {
+VSAValue request(VSACommandNumber command) {
   return VSAValue::Dictionary{{"Command", VSAValue(command)}, {"MessageID", VSAValue(77u)}};
 }
 
@@ -139,10 +145,10 @@ TEST_F(VSARelayDispatcherTest, AFailingQueuedCommandBecomesTheResult) {
 
 TEST_F(VSARelayDispatcherTest, SelfReplyingCommandsReplyExactlyOnce) {
   dispatcher_ = std::make_unique<VSARelayDispatcher>(*context_, table_.data(), table_.size());
-  auto late = dispatch(request(4));
+  auto late = dispatch(request(VSACommands::kDeleteDeathRow));
   ASSERT_EQ(late.size(), 1u);
   EXPECT_TRUE(late[0].get("Late"));
-  auto failed = dispatch(request(21));
+  auto failed = dispatch(request(VSACommands::kSetDataProtection));
   ASSERT_EQ(failed.size(), 1u);
   EXPECT_EQ(failed[0].get("ReplyError")->uint64Value(), 21u);
   EXPECT_TRUE(context_->transactions->waitUntilIdle(1s));
@@ -150,10 +156,10 @@ TEST_F(VSARelayDispatcherTest, SelfReplyingCommandsReplyExactlyOnce) {
 
 TEST_F(VSARelayDispatcherTest, RealTableRetiredCommandAndMissingHandlers) {
   dispatcher_ = std::make_unique<VSARelayDispatcher>(*context_);
-  auto retired = dispatch(request(27));
+  auto retired = dispatch(request(VSACommands::kRetired));
   ASSERT_EQ(retired.size(), 1u);
   EXPECT_EQ(retired[0].get("ReplyError")->uint64Value(), 49u);
-  auto high = dispatch(request(33));
+  auto high = dispatch(request(33));  // past the last command
   ASSERT_EQ(high.size(), 1u);
   EXPECT_EQ(high[0].get("ReplyError")->uint64Value(), 49u);
 }

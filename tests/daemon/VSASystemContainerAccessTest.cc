@@ -51,7 +51,7 @@ class SystemContainerAccess : public ::testing::Test {
                                   std::make_shared<VSACommandQueue>());
     VSAResultCode code = VSAResult::kSuccess;
     auto identity = VSAContainerIdentity::containerIdentityWithIdentifier(
-        "com.example.service", 12, *context_->userIdentityCache, &code);
+        "com.example.service", VSAClass::kSystemData, *context_->userIdentityCache, &code);
     ASSERT_TRUE(identity);
     auto m = installer.createOrLookupContainerWithContainerIdentity(
         identity, {.createIfNecessary = true}, &code);

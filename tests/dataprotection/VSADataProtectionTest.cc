@@ -51,7 +51,7 @@ class Protection : public ::testing::Test {
   }
 
   // A data container on disk with a small tree; returns its metadata.
-  VSAMetadataRef container(const char* id, VSAContainerClass c = 2) {
+  VSAMetadataRef container(const char* id, VSAContainerClass c = VSAClass::kDataApplication) {
     VSAUUID uuid = VSAUUID::random();
     std::string dir =
         *config_->containerDirectoryURLForUserIdentity(user_, c, false) + "/" + uuid.string();
@@ -223,7 +223,7 @@ TEST_F(Protection, UpdateFilesAreValidatedWhenRead) {
   EXPECT_FALSE(bad->writeToDiskWithError(&error));
   EXPECT_EQ(error->resultCode(0), VSAResult::kOutOfRange);
   // Classes without a user identity store none.
-  auto system = container("com.system", 12);
+  auto system = container("com.system", VSAClass::kSystemData);
   ASSERT_TRUE(operation(system, 4, false)->writeToDiskWithError(nullptr));
   auto systemDict = *VSA_dictionaryWithContentsOfURL(updateFile(system), 0, nullptr);
   EXPECT_FALSE(systemDict.get(kVSADataOperationUserIdentityKey));
@@ -249,10 +249,10 @@ TEST_F(Protection, ManagerRulesForRequestedClasses) {
   EXPECT_EQ(VSADataProtectionManager::currentProtectionClassOfMetadata(*reread), 3);
   EXPECT_EQ(setClass(m, 3), VSAResult::kSuccess);
   // Not a data class, or no such container.
-  auto bundle = container("com.bundle", 1);
+  auto bundle = container("com.bundle", VSAClass::kBundleApplication);
   EXPECT_EQ(setClass(bundle, 3), VSAResult::kInvalidArgument);
-  auto missing =
-      VSAContainerIdentity::containerIdentityWithUserIdentity(user_, "com.none", 2, nullptr);
+  auto missing = VSAContainerIdentity::containerIdentityWithUserIdentity(
+      user_, "com.none", VSAClass::kDataApplication, nullptr);
   std::promise<VSAResultCode> done;
   manager_->setDataProtectionOnDataContainerForContainerIdentity(
       *missing, 3, false, false, [&](VSAResultCode c) { done.set_value(c); });

@@ -17,6 +17,7 @@
 #include <filesystem>
 #include <thread>
 
+#include "base/VSACommands.h"
 #include "base/VSAPlist.h"
 #include "e2e/VSATestDaemon.h"
 #include "platform/VSAFrameCodec.h"
@@ -119,7 +120,9 @@ TEST(ClientIdentity, ExecingARegisteredExecutableAfterConnectingGainsNothing) {
 
   // Command 19 without an identifier: an entitled client is told 18, anyone else 55.
   auto request = *VSAFrameCodec::encode(
-      VSAValue::Dictionary{{"Command", VSAValue(19u)}, {"MessageID", VSAValue(1u)}}, &error);
+      VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kReadCodeSigningInfo)},
+                           {"MessageID", VSAValue(1u)}},
+      &error);
   std::string socketPath = d.socketPath();
   sockaddr_un addr{};
   addr.sun_family = AF_UNIX;
@@ -165,7 +168,9 @@ TEST(ClientIdentity, ExecingARegisteredExecutableAfterConnectingGainsNothing) {
   // check above would have seen the entitlement. (Shown with this test
   // process registered under the same entitlements.)
   d.registerSelf("com.example.self", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
-  EXPECT_EQ(VSAReplyError(d.request(VSAValue::Dictionary{{"Command", VSAValue(19u)}})), 18u);
+  EXPECT_EQ(VSAReplyError(d.request(
+                VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kReadCodeSigningInfo)}})),
+            18u);
   EXPECT_EQ(d.stop(), 0);
 }
 
@@ -206,11 +211,14 @@ TEST_P(ExecBeforeAccept, AMobileProcessNeverBecomesAClientRegisteredForRoot) {
   }
   std::atomic<bool> busy{!beforeTheDaemonRuns};
   std::thread load([&] {
-    while (busy) d.request(VSAValue::Dictionary{{"Command", VSAValue(19u)}}, 2s);
+    while (busy)
+      d.request(VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kReadCodeSigningInfo)}}, 2s);
   });
 
   auto request = *VSAFrameCodec::encode(
-      VSAValue::Dictionary{{"Command", VSAValue(19u)}, {"MessageID", VSAValue(1u)}}, &error);
+      VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kReadCodeSigningInfo)},
+                           {"MessageID", VSAValue(1u)}},
+      &error);
   int report[2];
   ASSERT_EQ(pipe(report), 0);
   pid_t connector = fork();

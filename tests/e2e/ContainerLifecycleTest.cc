@@ -9,6 +9,8 @@
 #include <future>
 #include <thread>
 
+#include "base/VSACommands.h"
+#include "base/VSAContainerClasses.h"
 #include "base/VSAJSON.h"
 #include "base/VSAPlist.h"
 #include "base/VSAUUID.h"
@@ -25,8 +27,9 @@ namespace {
 
 const char* kAllowed = "com.tamsk.private.Vessa.allowed";
 
-VSAValue createRequest(const char* id, bool create = true, uint64_t containerClass = 2) {
-  return VSAValue::Dictionary{{"Command", VSAValue(0u)},
+VSAValue createRequest(const char* id, bool create = true,
+                       VSAContainerClass containerClass = VSAClass::kDataApplication) {
+  return VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kCreateOrLookup)},
                               {"Identifier", VSAValue(id)},
                               {"ContainerClass", VSAValue(containerClass)},
                               {"CreateIfNecessary", VSAValue(create)}};
@@ -56,9 +59,9 @@ TEST(DaemonContainers, CreateLookUpDeleteAndEmptyDeathRow) {
   EXPECT_TRUE(*found->get("ReplyExisted")->boolValue());
   EXPECT_EQ(VSAReplyString(found, "ReplyPath"), path);
   // Metadata with and without the info dictionary.
-  VSAValue meta = VSAValue::Dictionary{{"Command", VSAValue(7u)},
+  VSAValue meta = VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kContainerMetadata)},
                                        {"Identifier", VSAValue("com.example.app")},
-                                       {"ContainerClass", VSAValue(2u)}};
+                                       {"ContainerClass", VSAValue(VSAClass::kDataApplication)}};
   auto plain = d.request(meta);
   EXPECT_EQ(VSAReplyString(plain, "ReplyPath"), path);
   EXPECT_FALSE(plain->get("ReplyInfoDictionary"));
@@ -66,25 +69,29 @@ TEST(DaemonContainers, CreateLookUpDeleteAndEmptyDeathRow) {
   EXPECT_TRUE(d.request(meta)->get("ReplyInfoDictionary"));
   // Listing shows it.
   auto list =
-      d.request(VSAValue::Dictionary{{"Command", VSAValue(1u)}, {"ContainerClass", VSAValue(2u)}});
+      d.request(VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kListContainers)},
+                                     {"ContainerClass", VSAValue(VSAClass::kDataApplication)}});
   ASSERT_EQ(VSAReplyError(list), 1u);
   EXPECT_EQ(list->get("ReplyIdsArray")->arrayValue()->size(), 1u);
-  // Argument errors.
+  // Argument errors: class 14 is past the last class.
   EXPECT_EQ(VSAReplyError(d.request(createRequest("com.example.app", false, 14))), 20u);
   EXPECT_EQ(VSAReplyError(d.request(
-                VSAValue::Dictionary{{"Command", VSAValue(0u)}, {"ContainerClass", VSAValue(2u)}})),
+                VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kCreateOrLookup)},
+                                     {"ContainerClass", VSAValue(VSAClass::kDataApplication)}})),
             18u);
   VSAValue badPersona = createRequest("com.example.app", false);
   badPersona.set("PersonaUniqueString", VSAValue("NO-SUCH-PERSONA"));
   EXPECT_EQ(VSAReplyError(d.request(badPersona)), 76u);
   // Delete, then empty death row (command 4 replies from its completion).
-  VSAValue del = VSAValue::Dictionary{{"Command", VSAValue(10u)},
+  VSAValue del = VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kDeleteContainer)},
                                       {"Identifier", VSAValue("com.example.app")},
-                                      {"ContainerClass", VSAValue(2u)}};
+                                      {"ContainerClass", VSAValue(VSAClass::kDataApplication)}};
   EXPECT_EQ(VSAReplyError(d.request(del)), 1u);
   EXPECT_FALSE(fs::exists(path));
   EXPECT_EQ(VSAReplyError(d.request(del)), 21u);
-  EXPECT_EQ(VSAReplyError(d.request(VSAValue::Dictionary{{"Command", VSAValue(4u)}})), 1u);
+  EXPECT_EQ(VSAReplyError(d.request(
+                VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kDeleteDeathRow)}})),
+            1u);
   EXPECT_TRUE(fs::is_empty(d.path("/private/var/root/Library/Caches/com.tamsk.vessad/Dead")) ||
               !fs::exists(d.path("/private/var/root/Library/Caches/com.tamsk.vessad/Dead")));
   EXPECT_EQ(d.stop(), 0);
@@ -137,7 +144,7 @@ TEST(DaemonContainers, SandboxTokensOnlyForEnterpriseContainers) {
   EXPECT_NE(VSAReplyString(enterprise, "ReplyPath"), VSAReplyString(personal, "ReplyPath"));
   EXPECT_FALSE(VSAReplyString(enterprise, "ReplySandboxToken").empty());
   // Class 1 (a bundle) gets no token even there.
-  auto bundle = d.request(createRequest("com.example.work", true, 1));
+  auto bundle = d.request(createRequest("com.example.work", true, VSAClass::kBundleApplication));
   ASSERT_EQ(VSAReplyError(bundle), 1u);
   EXPECT_FALSE(bundle->get("ReplySandboxToken"));
   fs::remove(d.path("/run/vessad/process-personas/" + std::to_string(getpid())));
@@ -153,17 +160,18 @@ TEST(DaemonContainers, GroupContainersOfAnOwnerCarryTokensOnlyInEnterprisePerson
                                        VSAValue(VSAValue::Array{VSAValue("group.example.work")})}},
                  true);
   ASSERT_TRUE(d.start());
-  VSAValue groups = VSAValue::Dictionary{{"Command", VSAValue(13u)},
+  VSAValue groups = VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kGroupContainers)},
                                          {"Identifier", VSAValue("com.example.work")},
-                                         {"ContainerClass", VSAValue(7u)}};
+                                         {"ContainerClass", VSAValue(VSAClass::kAppGroup)}};
   auto dict = [](const std::optional<VSAValue>& reply, const char* key, const char* id) {
     const VSAValue* d = reply ? reply->get(key) : nullptr;
     const VSAValue* v = d ? d->get(id) : nullptr;
     return v && v->isString() ? *v->stringValue() : std::string();
   };
-  auto ids = d.request(VSAValue::Dictionary{{"Command", VSAValue(14u)},
-                                            {"Identifier", VSAValue("com.example.work")},
-                                            {"ContainerClass", VSAValue(7u)}});
+  auto ids =
+      d.request(VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kGroupContainerIdentifiers)},
+                                     {"Identifier", VSAValue("com.example.work")},
+                                     {"ContainerClass", VSAValue(VSAClass::kAppGroup)}});
   ASSERT_EQ(VSAReplyError(ids), 1u);
   ASSERT_EQ(ids->get("ReplyGroupIdentifiersArray")->arrayValue()->size(), 1u);
   auto personal = d.request(groups);
@@ -179,7 +187,7 @@ TEST(DaemonContainers, GroupContainersOfAnOwnerCarryTokensOnlyInEnterprisePerson
   EXPECT_FALSE(dict(work, "ReplySandboxTokenDict", "group.example.work").empty());
   EXPECT_EQ(dict(work, "ReplyPersonaUniqueStringDict", "group.example.work"), "WORK-1001");
   VSAValue paths = groups;
-  paths.set("Command", VSAValue(16u));
+  paths.set("Command", VSAValue(VSACommands::kGroupContainerPaths));
   auto pathsOnly = d.request(paths);
   ASSERT_EQ(VSAReplyError(pathsOnly), 1u);
   EXPECT_EQ(dict(pathsOnly, "ReplyGroupContainerDict", "group.example.work"),
@@ -197,9 +205,9 @@ TEST(DaemonContainers, ProtectionChangeWaitsForTheUnlock) {
   ASSERT_EQ(VSAReplyError(created), 1u);
   std::string path = VSAReplyString(created, "ReplyPath");
   std::ofstream(path + "/Library/notes") << "secret";
-  VSAValue protect = VSAValue::Dictionary{{"Command", VSAValue(21u)},
+  VSAValue protect = VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kSetDataProtection)},
                                           {"Identifier", VSAValue("com.example.app")},
-                                          {"ContainerClass", VSAValue(2u)},
+                                          {"ContainerClass", VSAValue(VSAClass::kDataApplication)},
                                           {"DataProtectionClass", VSAValue(3)},
                                           {"RetryIfLocked", VSAValue(true)}};
   ASSERT_EQ(VSAReplyError(d.request(protect)), 1u);
@@ -249,11 +257,13 @@ TEST(DaemonContainers, AnAppsDeepTreeGoesWholeWithItsContainer) {
   }
   ASSERT_TRUE(dir);
   std::ofstream(path + "/Documents/nested/nested/diary") << "private";
-  VSAValue del = VSAValue::Dictionary{{"Command", VSAValue(10u)},
+  VSAValue del = VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kDeleteContainer)},
                                       {"Identifier", VSAValue("com.example.app")},
-                                      {"ContainerClass", VSAValue(2u)}};
+                                      {"ContainerClass", VSAValue(VSAClass::kDataApplication)}};
   ASSERT_EQ(VSAReplyError(d.request(del)), 1u);
-  EXPECT_EQ(VSAReplyError(d.request(VSAValue::Dictionary{{"Command", VSAValue(4u)}})), 1u);
+  EXPECT_EQ(VSAReplyError(d.request(
+                VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kDeleteDeathRow)}})),
+            1u);
   std::string dead = d.path("/private/var/root/Library/Caches/com.tamsk.vessad/Dead");
   EXPECT_TRUE(!fs::exists(dead) || fs::is_empty(dead));
   EXPECT_TRUE(!fs::exists(d.path("/tmp")) || fs::is_empty(d.path("/tmp")))

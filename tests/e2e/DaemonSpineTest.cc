@@ -13,6 +13,8 @@
 #include <fstream>
 #include <thread>
 
+#include "base/VSACommands.h"
+#include "base/VSAContainerClasses.h"
 #include "base/VSAJSON.h"
 #include "base/VSAPlist.h"
 #include "e2e/VSATestDaemon.h"
@@ -28,7 +30,7 @@ using namespace std::chrono_literals;
 
 const char* kAllowed = "com.tamsk.private.Vessa.allowed";
 
-VSAValue command(uint64_t n) { return VSAValue::Dictionary{{"Command", VSAValue(n)}}; }
+VSAValue command(VSACommandNumber n) { return VSAValue::Dictionary{{"Command", VSAValue(n)}}; }
 
 // Starts `d` (with this process registered as a full client) and sends
 // command 27 on `client`; the caller holds initialisation beforehand.
@@ -36,14 +38,16 @@ std::optional<uint64_t> sendWhileInitialisationIsHeld(VSATestDaemon& d, VSAIPCCl
   d.registerSelf("com.example.full", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
   VSAErrorRef error;
   if (!d.start() || !client.connect(d.socketPath(), &error)) return std::nullopt;
-  return client.send(command(27), &error);
+  return client.send(command(VSACommands::kRetired), &error);
 }
 
 TEST(DaemonSpine, InvalidCommandsGetOnlyReplyError49) {
   VSATestDaemon d;
   d.registerSelf("com.example.full", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
   ASSERT_TRUE(d.start());
-  for (uint64_t n : {33ull, 34ull, 1000ull, 27ull}) {
+  // Numbers past the last command, and the retired one.
+  const VSACommandNumber invalid[] = {33, 34, 1000, VSACommands::kRetired};
+  for (VSACommandNumber n : invalid) {
     auto reply = d.request(command(n));
     ASSERT_TRUE(reply) << n;
     EXPECT_EQ(VSAReplyError(reply), 49u) << n;
@@ -245,13 +249,13 @@ TEST(DaemonSpine, GarbageFramesLeaveTheDaemonServingOthers) {
   ASSERT_TRUE(oversized.sendRaw(huge, sizeof huge, &error));
   auto arr = *VSAFrameCodec::encode(VSAValue(VSAValue::Array{VSAValue(1)}), &error);
   ASSERT_TRUE(array.sendRaw(arr.data(), arr.size(), &error));
-  auto frame = *VSAFrameCodec::encode(command(27), &error);
+  auto frame = *VSAFrameCodec::encode(command(VSACommands::kRetired), &error);
   ASSERT_TRUE(truncated.sendRaw(frame.data(), frame.size() - 3, &error));
   truncated.close();
   EXPECT_TRUE(garbage.waitForClose(5s));
   EXPECT_TRUE(oversized.waitForClose(5s));
   EXPECT_TRUE(array.waitForClose(5s));
-  EXPECT_EQ(VSAReplyError(good.sendRequest(command(27), 5s, &error)), 49u);
+  EXPECT_EQ(VSAReplyError(good.sendRequest(command(VSACommands::kRetired), 5s, &error)), 49u);
   std::string out = d.daemonOutput();
   EXPECT_NE(out.find("Dictionary does not have reply context"), std::string::npos);
   EXPECT_NE(out.find("exceeds the limit"), std::string::npos);
@@ -364,14 +368,16 @@ TEST(DaemonCodeSigning, RecordThenReadThroughTheRealDaemon) {
        VSAValue::Dictionary{{"com.tamsk.security.application-groups", VSAValue("group.demo")}}},
       {"TeamIdentifier", VSAValue("TEAM")}};
   auto record = [&](const char* id, VSAValue options) {
-    return d.request(VSAValue::Dictionary{{"Command", VSAValue(18u)},
-                                          {"Identifier", VSAValue(id)},
-                                          {"CodeSigningInfo", info},
-                                          {"OptionsDictionary", options}});
+    return d.request(
+        VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kRecordCodeSigningInfo)},
+                             {"Identifier", VSAValue(id)},
+                             {"CodeSigningInfo", info},
+                             {"OptionsDictionary", options}});
   };
   EXPECT_EQ(VSAReplyError(record("com.example.app", VSAValue::dictionary())), 1u);
-  auto read = d.request(VSAValue::Dictionary{{"Command", VSAValue(19u)},
-                                             {"Identifier", VSAValue("com.example.app")}});
+  auto read =
+      d.request(VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kReadCodeSigningInfo)},
+                                     {"Identifier", VSAValue("com.example.app")}});
   ASSERT_TRUE(read && read->get("ReplyInfoDictionary"));
   EXPECT_EQ(*read->get("ReplyInfoDictionary"), info);
   // A placeholder is recorded but not shown to clients.
@@ -379,11 +385,14 @@ TEST(DaemonCodeSigning, RecordThenReadThroughTheRealDaemon) {
                 "com.example.placeholder",
                 VSAValue::Dictionary{{"com.tamsk.Vessa.PlaceholderEntitlements", VSAValue(true)}})),
             1u);
-  auto hidden = d.request(VSAValue::Dictionary{
-      {"Command", VSAValue(19u)}, {"Identifier", VSAValue("com.example.placeholder")}});
+  auto hidden =
+      d.request(VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kReadCodeSigningInfo)},
+                                     {"Identifier", VSAValue("com.example.placeholder")}});
   EXPECT_EQ(VSAReplyError(hidden), 1u);
   EXPECT_FALSE(hidden->get("ReplyInfoDictionary"));
-  EXPECT_EQ(VSAReplyError(d.request(VSAValue::Dictionary{{"Command", VSAValue(19u)}})), 18u);
+  EXPECT_EQ(VSAReplyError(d.request(
+                VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kReadCodeSigningInfo)}})),
+            18u);
   EXPECT_TRUE(
       std::filesystem::exists(d.path("/private/var/root/Library/Vessa/containers.sqlite3")));
   EXPECT_EQ(d.stop(), 0);
@@ -397,16 +406,16 @@ TEST(DaemonCodeSigning, AGroupStaysWhileTheRegistrationThatDropsItIsNotWritten) 
   d.registerSelf("com.example.installer", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
   auto record = [&](VSAValue entitlements) {
     return VSAReplyError(d.request(VSAValue::Dictionary{
-        {"Command", VSAValue(18u)},
+        {"Command", VSAValue(VSACommands::kRecordCodeSigningInfo)},
         {"Identifier", VSAValue("com.example.app")},
         {"CodeSigningInfo",
          VSAValue::Dictionary{{"com.tamsk.Vessa.Entitlements", std::move(entitlements)}}}}));
   };
   auto group = [&] {
     return VSAReplyString(
-        d.request(VSAValue::Dictionary{{"Command", VSAValue(0u)},
+        d.request(VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kCreateOrLookup)},
                                        {"Identifier", VSAValue("group.example.only")},
-                                       {"ContainerClass", VSAValue(7u)},
+                                       {"ContainerClass", VSAValue(VSAClass::kAppGroup)},
                                        {"CreateIfNecessary", VSAValue(true)}}),
         "ReplyPath");
   };
@@ -443,7 +452,8 @@ TEST(DaemonCodeSigning, ASecondDaemonOnTheSameRootStopsAtStartUp) {
   int status = 0;
   waitpid(pid, &status, 0);
   EXPECT_TRUE(WIFSIGNALED(status) || (WIFEXITED(status) && WEXITSTATUS(status) != 0));
-  EXPECT_EQ(VSAReplyError(first.request(command(27))), 55u) << "the first daemon still serves";
+  EXPECT_EQ(VSAReplyError(first.request(command(VSACommands::kRetired))), 55u)
+      << "the first daemon still serves";
   EXPECT_EQ(first.stop(), 0);
 }
 

@@ -16,6 +16,8 @@
 #include <future>
 #include <thread>
 
+#include "base/VSACommands.h"
+#include "base/VSAContainerClasses.h"
 #include "base/VSAJSON.h"
 #include "base/VSAPlist.h"
 #include "base/VSAUUID.h"
@@ -27,7 +29,8 @@ namespace {
 
 const char* kAllowed = "com.tamsk.private.Vessa.allowed";
 
-VSAValue request(uint64_t command, const std::string& id, uint64_t containerClass = 2) {
+VSAValue request(VSACommandNumber command, const std::string& id,
+                 VSAContainerClass containerClass = VSAClass::kDataApplication) {
   return VSAValue::Dictionary{{"Command", VSAValue(command)},
                               {"Identifier", VSAValue(id)},
                               {"ContainerClass", VSAValue(containerClass)},
@@ -55,21 +58,22 @@ TEST(HostileRequests, NamesThatCouldLeaveTheirDirectoryAreRefusedWithEleven) {
                                             "/abs", nul, std::string(256, 'a')};
   for (const auto& id : hostile) {
     SCOPED_TRACE(id.size() > 40 ? "long identifier" : id);
-    EXPECT_EQ(VSAReplyError(d.request(request(0, id))), 11u);
-    EXPECT_EQ(VSAReplyError(d.request(request(10, id))), 11u);
-    VSAValue protect = request(21, id);
+    EXPECT_EQ(VSAReplyError(d.request(request(VSACommands::kCreateOrLookup, id))), 11u);
+    EXPECT_EQ(VSAReplyError(d.request(request(VSACommands::kDeleteContainer, id))), 11u);
+    VSAValue protect = request(VSACommands::kSetDataProtection, id);
     protect.set("DataProtectionClass", VSAValue(int64_t{3}));
     EXPECT_EQ(VSAReplyError(d.request(protect)), 11u);
-    EXPECT_EQ(VSAReplyError(d.request(request(19, id))), 11u);
-    VSAValue record = request(18, id);
+    EXPECT_EQ(VSAReplyError(d.request(request(VSACommands::kReadCodeSigningInfo, id))), 11u);
+    VSAValue record = request(VSACommands::kRecordCodeSigningInfo, id);
     record.set("CodeSigningInfo", VSAValue::dictionary());
     EXPECT_EQ(VSAReplyError(d.request(record)), 11u);
   }
-  VSAValue persona = request(0, "com.example.app");
+  VSAValue persona = request(VSACommands::kCreateOrLookup, "com.example.app");
   persona.set("PersonaUniqueString", VSAValue("../../x"));
   EXPECT_EQ(VSAReplyError(d.request(persona)), 11u);
   // The longest name allowed still works.
-  EXPECT_EQ(VSAReplyError(d.request(request(0, std::string(255, 'b')))), 1u);
+  EXPECT_EQ(VSAReplyError(d.request(request(VSACommands::kCreateOrLookup, std::string(255, 'b')))),
+            1u);
   EXPECT_TRUE(fs::exists(d.path("/private/var/victim/file")));
   // Nothing was made for any refused request (only the allowed one's container).
   std::set<std::string> made;
@@ -86,7 +90,8 @@ TEST(HostileRequests, AUsersDirectorySwappedForALinkLeadsNowhere) {
   VSATestDaemon d;
   d.registerSelf("com.example.installer", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
   ASSERT_TRUE(d.start());
-  ASSERT_EQ(VSAReplyError(d.request(request(0, "com.example.first"))), 1u);
+  ASSERT_EQ(VSAReplyError(d.request(request(VSACommands::kCreateOrLookup, "com.example.first"))),
+            1u);
   // The user owns Containers/: it replaces Data with a link to a root-owned
   // place and waits for the next creation.
   std::string data = d.path("/private/var/mobile/Containers/Data");
@@ -95,7 +100,7 @@ TEST(HostileRequests, AUsersDirectorySwappedForALinkLeadsNowhere) {
   fs::create_directories(target + "/Application");
   fs::rename(data, data + ".real");
   fs::create_directory_symlink(target, data);
-  auto reply = d.request(request(0, "com.example.second"));
+  auto reply = d.request(request(VSACommands::kCreateOrLookup, "com.example.second"));
   EXPECT_NE(VSAReplyError(reply), 1u);
   EXPECT_TRUE(fs::is_empty(target + "/Application")) << "a container was assembled outside";
   struct stat st;
@@ -109,7 +114,8 @@ TEST(HostileRequests, AUsersDirectorySwappedForALinkLeadsNowhere) {
   fs::rename(data + ".real", data);
   if (fs::exists(staging)) fs::rename(staging, staging + ".real");
   fs::create_directory_symlink(target, staging);
-  EXPECT_NE(VSAReplyError(d.request(request(0, "com.example.third"))), 1u);
+  EXPECT_NE(VSAReplyError(d.request(request(VSACommands::kCreateOrLookup, "com.example.third"))),
+            1u);
   EXPECT_TRUE(fs::is_empty(target + "/Application"));
   EXPECT_EQ(std::distance(fs::directory_iterator(target), {}), 1) << "nothing but what was there";
   EXPECT_EQ(d.stop(), 0);
@@ -130,8 +136,8 @@ TEST(HostileRequests, AnAppsMetadataFileSpeaksForNoOtherContainer) {
       d.path("/etc/vessad/clients.d/app.plist"), 0, nullptr));
   fs::permissions(d.root(), fs::perms(0755));  // the app reaches its client and the socket
   ASSERT_TRUE(d.start());
-  VSAValue system =
-      VSAValue::Dictionary{{"Command", VSAValue(15u)}, {"Identifier", VSAValue("com.example.sys")}};
+  VSAValue system = VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kSystemContainerPath)},
+                                         {"Identifier", VSAValue("com.example.sys")}};
   auto real = d.request(system);
   ASSERT_EQ(VSAReplyError(real), 1u);
   std::string systemPath = VSAReplyString(real, "ReplyPath");
@@ -159,7 +165,7 @@ TEST(HostileRequests, AnAppsMetadataFileSpeaksForNoOtherContainer) {
   auto forged = VSAPlist::serialize(
       VSAValue::Dictionary{{"VSAMetadataIdentifier", VSAValue("com.example.sys")},
                            {"VSAMetadataUUID", VSAValue(VSAUUID::random().string())},
-                           {"VSAMetadataContentClass", VSAValue(uint64_t{12})},
+                           {"VSAMetadataContentClass", VSAValue(VSAClass::kSystemData)},
                            {"VSAMetadataVersion", VSAValue("2")}},
       VSAPlist::Format::Binary, nullptr);
   ASSERT_TRUE(forged);
@@ -182,9 +188,10 @@ TEST(HostileRequests, AnAppsMetadataFileSpeaksForNoOtherContainer) {
   auto again = d.request(system);
   ASSERT_EQ(VSAReplyError(again), 1u);
   EXPECT_EQ(VSAReplyString(again, "ReplyPath"), systemPath);
-  auto looked = d.request(VSAValue::Dictionary{{"Command", VSAValue(0u)},
-                                               {"Identifier", VSAValue("com.example.sys")},
-                                               {"ContainerClass", VSAValue(12u)}});
+  auto looked =
+      d.request(VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kCreateOrLookup)},
+                                     {"Identifier", VSAValue("com.example.sys")},
+                                     {"ContainerClass", VSAValue(VSAClass::kSystemData)}});
   ASSERT_EQ(VSAReplyError(looked), 1u);
   EXPECT_EQ(VSAReplyString(looked, "ReplyPath"), systemPath);
   EXPECT_EQ(d.stop(), 0);
@@ -251,8 +258,9 @@ TEST(HostileRequests, ASystemContainerBackupIsRestoredOnlyAsRootLeftIt) {
   ASSERT_TRUE(d.start(true, {"--after-boot"}));
   swapper.wait();
 
-  auto reply = d.request(VSAValue::Dictionary{{"Command", VSAValue(15u)},
-                                              {"Identifier", VSAValue("com.example.sys")}});
+  auto reply =
+      d.request(VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kSystemContainerPath)},
+                                     {"Identifier", VSAValue("com.example.sys")}});
   ASSERT_EQ(VSAReplyError(reply), 1u);
   std::string live = VSAReplyString(reply, "ReplyPath");
   EXPECT_TRUE(fs::exists(live + "/genuine.txt"));
@@ -266,7 +274,7 @@ TEST(HostileRequests, TheCodeSigningDatabaseIsReadableByRootAlone) {
   VSATestDaemon d;
   d.registerSelf("com.example.installer", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
   ASSERT_TRUE(d.start());
-  VSAValue record = request(18, "com.example.app");
+  VSAValue record = request(VSACommands::kRecordCodeSigningInfo, "com.example.app");
   record.set("CodeSigningInfo", VSAValue::dictionary());
   ASSERT_EQ(VSAReplyError(d.request(record)), 1u);
   std::string dir = d.path("/private/var/root/Library/Vessa");

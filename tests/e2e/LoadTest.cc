@@ -22,6 +22,8 @@
 #include <sstream>
 #include <thread>
 
+#include "base/VSACommands.h"
+#include "base/VSAContainerClasses.h"
 #include "base/VSAJSON.h"
 #include "e2e/VSATestDaemon.h"
 
@@ -45,10 +47,10 @@ constexpr int kKills = 50;
 #endif
 constexpr int kIdsPerClient = 6;
 
-VSAValue request(uint64_t command, const std::string& id) {
+VSAValue request(VSACommandNumber command, const std::string& id) {
   return VSAValue::Dictionary{{"Command", VSAValue(command)},
                               {"Identifier", VSAValue(id)},
-                              {"ContainerClass", VSAValue(2u)}};
+                              {"ContainerClass", VSAValue(VSAClass::kDataApplication)}};
 }
 
 // What clients were told: identifier -> UUID of its container. A request
@@ -87,31 +89,31 @@ void client(VSATestDaemon& d, int index, std::atomic<bool>& stop, Promises& prom
     switch (random() % 8) {
       case 0:
       case 1:
-        body = request(0, id);
+        body = request(VSACommands::kCreateOrLookup, id);
         body.set("CreateIfNecessary", VSAValue(true));
         break;
       case 2:
-        body = request(12, id);  // wipe
+        body = request(VSACommands::kDeleteContainerContent, id);  // wipe
         break;
       case 3:
-        body = request(5, id);  // info value
+        body = request(VSACommands::kSetInfoValue, id);
         body.set("Key", VSAValue("Flavour"));
         body.set("Value", VSAValue("mint"));
         break;
       case 4:
-        body = request(9, id);  // new directory UUID name
+        body = request(VSACommands::kRegenerateDirectoryUUID, id);
         break;
       case 5:
-        body = request(21, id);  // protection class
+        body = request(VSACommands::kSetDataProtection, id);
         body.set("DataProtectionClass", VSAValue(3u));
         break;
       case 6:
         if (which < kIdsPerClient / 2) continue;
         promises.forget(id);
-        body = request(10, id);  // delete
+        body = request(VSACommands::kDeleteContainer, id);
         break;
       default:
-        body = request(0, id);
+        body = request(VSACommands::kCreateOrLookup, id);
         break;
     }
     auto reply = d.request(body, 2s);
@@ -119,7 +121,7 @@ void client(VSATestDaemon& d, int index, std::atomic<bool>& stop, Promises& prom
     ++*answered;
     const VSAValue* uuid = reply->get("ReplyUUID");
     if (VSAReplyError(reply) == 1 && uuid && uuid->uuidValue() &&
-        body.get("Command")->uint64Value() == 0u)
+        body.get("Command")->uint64Value() == VSACommands::kCreateOrLookup)
       promises.made(id, *uuid->uuidValue());
   }
 }
@@ -176,7 +178,7 @@ TEST(DaemonCrash, KilledAtRandomUnderSixteenClientsLosesNothing) {
     // Restarted, its start finished, then stopped: the root is in order.
     ASSERT_TRUE(startAndSettle(d));
     for (const auto& [id, uuid] : promises.all()) {
-      auto reply = d.request(request(0, id));
+      auto reply = d.request(request(VSACommands::kCreateOrLookup, id));
       ASSERT_EQ(VSAReplyError(reply), 1u) << id << " was lost";
       ASSERT_EQ(*reply->get("ReplyUUID")->uuidValue(), uuid) << id;
     }
@@ -208,17 +210,18 @@ void soakClient(VSATestDaemon& d, int index, int requests, std::atomic<int>& los
     VSAValue body;
     switch (random() % 6) {
       case 0:
-        body = request(0, id);
+        body = request(VSACommands::kCreateOrLookup, id);
         body.set("CreateIfNecessary", VSAValue(true));
         break;
       case 1:
-        body = request(12, id);  // wipe: a replace by a fresh transient container
+        // A wipe: a replace by a fresh transient container.
+        body = request(VSACommands::kDeleteContainerContent, id);
         break;
       case 2: {
         // A registration that moves the identifier between two groups.
         std::string group = "group.example.soak." + std::to_string(random() % 2);
         body = VSAValue::Dictionary{
-            {"Command", VSAValue(18u)},
+            {"Command", VSAValue(VSACommands::kRecordCodeSigningInfo)},
             {"Identifier", VSAValue(id)},
             {"CodeSigningInfo",
              VSAValue::Dictionary{{"com.tamsk.Vessa.Entitlements",
@@ -228,16 +231,16 @@ void soakClient(VSATestDaemon& d, int index, int requests, std::atomic<int>& los
         break;
       }
       case 3:
-        body = request(21, id);
+        body = request(VSACommands::kSetDataProtection, id);
         body.set("DataProtectionClass", VSAValue(static_cast<uint64_t>(1 + random() % 4)));
         body.set("RetryIfLocked", VSAValue(random() % 2 == 0));
         break;
       case 4:
-        body = request(13, id);  // the owner's groups
-        body.set("ContainerClass", VSAValue(7u));
+        body = request(VSACommands::kGroupContainers, id);  // the owner's groups
+        body.set("ContainerClass", VSAValue(VSAClass::kAppGroup));
         break;
       default:
-        body = request(9, id);
+        body = request(VSACommands::kRegenerateDirectoryUUID, id);
         break;
     }
     auto reply = d.request(body, 60s);

@@ -8,6 +8,8 @@
 #include <random>
 #include <thread>
 
+#include "base/VSACommands.h"
+#include "base/VSAContainerClasses.h"
 #include "e2e/VSATestDaemon.h"
 
 namespace fs = std::filesystem;
@@ -17,7 +19,8 @@ namespace {
 
 const char* kAllowed = "com.tamsk.private.Vessa.allowed";
 
-VSAValue request(uint64_t command, const char* id, uint64_t containerClass = 2) {
+VSAValue request(VSACommandNumber command, const char* id,
+                 VSAContainerClass containerClass = VSAClass::kDataApplication) {
   return VSAValue::Dictionary{{"Command", VSAValue(command)},
                               {"Identifier", VSAValue(id)},
                               {"ContainerClass", VSAValue(containerClass)}};
@@ -34,8 +37,9 @@ struct Container {
 };
 
 std::optional<Container> lookup(VSATestDaemon& d, const char* id, bool create = false,
-                                uint64_t containerClass = 2) {
-  auto reply = d.request(with(request(0, id, containerClass), "CreateIfNecessary", create));
+                                VSAContainerClass containerClass = VSAClass::kDataApplication) {
+  auto reply = d.request(
+      with(request(VSACommands::kCreateOrLookup, id, containerClass), "CreateIfNecessary", create));
   if (VSAReplyError(reply) != 1) return std::nullopt;
   return Container{VSAReplyString(reply, "ReplyPath"), *reply->get("ReplyUUID")->uuidValue()};
 }
@@ -59,46 +63,56 @@ TEST(DaemonMaintenance, InfoValuesStructureUUIDReplaceAndWipeThroughTheSocket) {
 
   // Info values: set, read, unset key, bad key, removal.
   EXPECT_EQ(
-      VSAReplyError(d.request(with(with(request(5, "com.example.app"), "Key", VSAValue("color")),
-                                   "Value", VSAValue("blue")))),
+      VSAReplyError(d.request(with(
+          with(request(VSACommands::kSetInfoValue, "com.example.app"), "Key", VSAValue("color")),
+          "Value", VSAValue("blue")))),
       1u);
-  auto value = d.request(with(request(6, "com.example.app"), "Key", VSAValue("color")));
+  auto value = d.request(
+      with(request(VSACommands::kInfoValue, "com.example.app"), "Key", VSAValue("color")));
   EXPECT_EQ(VSAReplyString(value, "ReplyInfoValue"), "blue");
-  EXPECT_EQ(VSAReplyError(d.request(with(request(6, "com.example.app"), "Key", VSAValue("size")))),
+  EXPECT_EQ(VSAReplyError(d.request(with(request(VSACommands::kInfoValue, "com.example.app"), "Key",
+                                         VSAValue("size")))),
             24u);
-  EXPECT_EQ(
-      VSAReplyError(d.request(with(request(6, "com.example.app"), "Key", VSAValue(int64_t{3})))),
-      38u);
-  EXPECT_EQ(VSAReplyError(d.request(with(request(5, "com.example.app"), "Key", VSAValue("color")))),
+  EXPECT_EQ(VSAReplyError(d.request(with(request(VSACommands::kInfoValue, "com.example.app"), "Key",
+                                         VSAValue(int64_t{3})))),
+            38u);
+  EXPECT_EQ(VSAReplyError(d.request(with(request(VSACommands::kSetInfoValue, "com.example.app"),
+                                         "Key", VSAValue("color")))),
             1u);
-  EXPECT_EQ(VSAReplyError(d.request(with(request(6, "com.example.app"), "Key", VSAValue("color")))),
+  EXPECT_EQ(VSAReplyError(d.request(with(request(VSACommands::kInfoValue, "com.example.app"), "Key",
+                                         VSAValue("color")))),
             24u);
 
-  // 8 and 22 make missing default sub-directories again.
-  for (uint64_t command : {8u, 22u}) {
+  // Both commands make missing default sub-directories again.
+  for (VSACommandNumber command :
+       {VSACommands::kRecreateDefaultStructure, VSACommands::kRestoreDefaultStructure}) {
     fs::remove_all(app->path + "/Library/Caches");
     EXPECT_EQ(VSAReplyError(d.request(request(command, "com.example.app"))), 1u) << command;
     EXPECT_TRUE(fs::is_directory(app->path + "/Library/Caches")) << command;
   }
 
-  // 23: the bytes it takes.
+  // Disk usage: the bytes it takes.
   std::ofstream(app->path + "/Documents/blob") << std::string(50000, 'x');
-  auto usage = d.request(request(23, "com.example.app"));
+  auto usage = d.request(request(VSACommands::kDiskUsage, "com.example.app"));
   ASSERT_EQ(VSAReplyError(usage), 1u);
   EXPECT_GE(usage->get("ReplyDiskUsage")->uint64Value().value_or(0), 50000u);
   fs::remove(app->path + "/Documents/blob");
 
-  // 9: a new directory name, the same identity.
-  EXPECT_EQ(VSAReplyError(d.request(request(9, "com.example.app"))), 1u);
+  // A new directory name, the same identity.
+  EXPECT_EQ(
+      VSAReplyError(d.request(request(VSACommands::kRegenerateDirectoryUUID, "com.example.app"))),
+      1u);
   auto renamed = lookup(d, "com.example.app");
   ASSERT_TRUE(renamed);
   EXPECT_NE(renamed->path, app->path);
   EXPECT_EQ(renamed->uuid, app->uuid);
   EXPECT_FALSE(fs::exists(app->path));
 
-  // 12: the content goes, path and UUID stay.
+  // Deleting the content: the content goes, path and UUID stay.
   std::ofstream(renamed->path + "/Documents/diary") << "secret";
-  EXPECT_EQ(VSAReplyError(d.request(request(12, "com.example.app"))), 1u);
+  EXPECT_EQ(
+      VSAReplyError(d.request(request(VSACommands::kDeleteContainerContent, "com.example.app"))),
+      1u);
   auto wiped = lookup(d, "com.example.app");
   ASSERT_TRUE(wiped);
   EXPECT_EQ(wiped->path, renamed->path);
@@ -106,26 +120,27 @@ TEST(DaemonMaintenance, InfoValuesStructureUUIDReplaceAndWipeThroughTheSocket) {
   EXPECT_FALSE(fs::exists(renamed->path + "/Documents/diary"));
   EXPECT_TRUE(fs::is_directory(renamed->path + "/Documents"));
 
-  // 11: plug-in data, class fixed to 4.
-  auto plugin = lookup(d, "com.example.plugin", true, 4);
+  // Wiping plug-in data: the class is fixed to plug-in data.
+  auto plugin = lookup(d, "com.example.plugin", true, VSAClass::kDataPlugin);
   ASSERT_TRUE(plugin);
   std::ofstream(plugin->path + "/Documents/cache") << "x";
-  VSAValue wipePlugin = VSAValue::Dictionary{{"Command", VSAValue(11u)},
+  VSAValue wipePlugin = VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kWipePluginData)},
                                              {"Identifier", VSAValue("com.example.plugin")}};
   EXPECT_EQ(VSAReplyError(d.request(wipePlugin)), 1u);
   EXPECT_FALSE(fs::exists(plugin->path + "/Documents/cache"));
 
-  // 2: b takes a's place under its own UUID; a is gone.
+  // Replace: b takes a's place under its own UUID; a is gone.
   auto a = lookup(d, "com.example.a", true);
   auto b = lookup(d, "com.example.b", true);
   ASSERT_TRUE(a && b);
-  VSAValue replace = VSAValue::Dictionary{{"Command", VSAValue(2u)},
-                                          {"OldIdentifier", VSAValue("com.example.a")},
-                                          {"OldContainerClass", VSAValue(2u)},
-                                          {"OldContainerUUID", VSAValue(a->uuid)},
-                                          {"NewIdentifier", VSAValue("com.example.b")},
-                                          {"NewContainerClass", VSAValue(2u)},
-                                          {"NewContainerUUID", VSAValue(b->uuid)}};
+  VSAValue replace =
+      VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kReplaceContainer)},
+                           {"OldIdentifier", VSAValue("com.example.a")},
+                           {"OldContainerClass", VSAValue(VSAClass::kDataApplication)},
+                           {"OldContainerUUID", VSAValue(a->uuid)},
+                           {"NewIdentifier", VSAValue("com.example.b")},
+                           {"NewContainerClass", VSAValue(VSAClass::kDataApplication)},
+                           {"NewContainerUUID", VSAValue(b->uuid)}};
   EXPECT_EQ(VSAReplyError(d.request(replace)), 1u);
   EXPECT_FALSE(lookup(d, "com.example.a"));
   auto moved = lookup(d, "com.example.b");
@@ -154,7 +169,9 @@ TEST(DaemonCrash, KilledInsideAWipeRestartsWithTheContainerWhole) {
   while (killsInsideAReplace == 0 && kills < 60) {
     std::atomic<bool> stop{false};
     std::thread wiper([&] {
-      while (!stop && VSAReplyError(d.request(request(12, "com.example.app"), 2s)) == 1) {
+      while (!stop &&
+             VSAReplyError(d.request(
+                 request(VSACommands::kDeleteContainerContent, "com.example.app"), 2s)) == 1) {
       }
     });
     std::this_thread::sleep_for(std::chrono::milliseconds(5 + random() % 60));

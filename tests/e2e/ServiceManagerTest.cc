@@ -20,6 +20,8 @@
 #include <thread>
 #include <vector>
 
+#include "base/VSACommands.h"
+#include "base/VSAContainerClasses.h"
 #include "e2e/VSATestDaemon.h"
 #include "platform/VSAIPCClient.h"
 #include "platform/VSAUpcallClient.h"
@@ -112,10 +114,11 @@ TEST(DaemonServiceManager, ASocketTheManagerHoldsIsTakenOver) {
   auto state = d.vessactl("", {"status", "--json"});
   EXPECT_EQ(state.status, 0) << state.output;
   EXPECT_NE(state.output.find("\"generation\": 1"), std::string::npos) << state.output;
-  auto reply = d.request(VSAValue::Dictionary{{"Command", VSAValue(0u)},
-                                              {"Identifier", VSAValue("com.example.app")},
-                                              {"ContainerClass", VSAValue(2u)},
-                                              {"CreateIfNecessary", VSAValue(true)}});
+  auto reply =
+      d.request(VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kCreateOrLookup)},
+                                     {"Identifier", VSAValue("com.example.app")},
+                                     {"ContainerClass", VSAValue(VSAClass::kDataApplication)},
+                                     {"CreateIfNecessary", VSAValue(true)}});
   EXPECT_EQ(VSAReplyError(reply), 1u);
   d.registerVessactl("installer", "com.example.installer",
                      VSAValue::Dictionary{{"com.tamsk.private.Vessa.allowed", VSAValue(true)}});
@@ -203,7 +206,9 @@ TEST(DaemonServiceManager, BothSocketsTheManagerHoldsAreTakenOver) {
   ASSERT_EQ(::stat(d.upcallSocketPath().c_str(), &st), 0);
   EXPECT_EQ(st.st_mode & 0777, 0600u);
   // The request socket was taken over too (the bridge holds no entitlement).
-  EXPECT_EQ(VSAReplyError(d.request(VSAValue::Dictionary{{"Command", VSAValue(19u)}})), 55u);
+  EXPECT_EQ(VSAReplyError(d.request(
+                VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kReadCodeSigningInfo)}})),
+            55u);
   EXPECT_EQ(d.stop(), 0);
   EXPECT_TRUE(std::filesystem::exists(d.upcallSocketPath())) << "the manager's file stays";
   ::close(requests);
@@ -226,9 +231,9 @@ TEST(DaemonServiceManager, AnIdleDaemonLeavesAndTheNextStartAnswersWhatWaited) {
   const std::vector<std::string> idle = {"--idle-exit", "1"};
   ASSERT_TRUE(d.start(true, idle));
   auto lookup = [](bool create) {
-    return VSAValue::Dictionary{{"Command", VSAValue(0u)},
+    return VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kCreateOrLookup)},
                                 {"Identifier", VSAValue("com.example.kept")},
-                                {"ContainerClass", VSAValue(2u)},
+                                {"ContainerClass", VSAValue(VSAClass::kDataApplication)},
                                 {"CreateIfNecessary", VSAValue(create)}};
   };
   auto made = d.request(lookup(true));

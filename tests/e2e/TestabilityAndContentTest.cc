@@ -11,6 +11,8 @@
 #include <fstream>
 #include <future>
 
+#include "base/VSACommands.h"
+#include "base/VSAContainerClasses.h"
 #include "base/VSAUUID.h"
 #include "e2e/VSATestDaemon.h"
 
@@ -22,7 +24,8 @@ namespace {
 const char* kAllowed = "com.tamsk.private.Vessa.allowed";
 const char* kTestability = "com.tamsk.private.Vessa.testability";
 
-VSAValue request(uint64_t command, const char* id, uint64_t containerClass = 2) {
+VSAValue request(VSACommandNumber command, const char* id,
+                 VSAContainerClass containerClass = VSAClass::kDataApplication) {
   return VSAValue::Dictionary{{"Command", VSAValue(command)},
                               {"Identifier", VSAValue(id)},
                               {"ContainerClass", VSAValue(containerClass)}};
@@ -32,12 +35,13 @@ VSAValue with(VSAValue body, const char* key, VSAValue value) {
   return body;
 }
 VSAValue testLock(uint64_t lock, bool enable) {
-  return VSAValue::Dictionary{{"Command", VSAValue(uint64_t{31})},
+  return VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kTestLock)},
                               {"TestLock", VSAValue(lock)},
                               {"Enable", VSAValue(enable)}};
 }
-VSAValue create(const char* id, uint64_t containerClass = 2) {
-  return with(request(0, id, containerClass), "CreateIfNecessary", VSAValue(true));
+VSAValue create(const char* id, VSAContainerClass containerClass = VSAClass::kDataApplication) {
+  return with(request(VSACommands::kCreateOrLookup, id, containerClass), "CreateIfNecessary",
+              VSAValue(true));
 }
 void markInternal(VSATestDaemon& d) {
   std::ofstream(d.path("/etc/vessad/device.plist"))
@@ -85,7 +89,8 @@ TEST_F(Testability, AFrozenDaemonStillTakesTheCommandThatReleasesIt) {
   ASSERT_EQ(VSAReplyError(d.request(testLock(0, true))), 1u);  // held once
   auto blocked = later(create("com.example.app"));
   EXPECT_EQ(blocked.wait_for(500ms), std::future_status::timeout);
-  auto queued = later(request(23, "com.example.app"));  // behind it on the listener queue
+  // Behind it on the listener queue.
+  auto queued = later(request(VSACommands::kDiskUsage, "com.example.app"));
   EXPECT_EQ(queued.wait_for(200ms), std::future_status::timeout);
   // One release suffices; the frozen creation then finishes, and the
   // request after it sees the container.
@@ -95,7 +100,7 @@ TEST_F(Testability, AFrozenDaemonStillTakesTheCommandThatReleasesIt) {
 
   // Lock 6 stops a cache rebuild: a class not yet cached (plug-in data).
   ASSERT_EQ(VSAReplyError(d.request(testLock(6, true))), 1u);
-  auto rebuild = later(create("com.example.plugin", 4));
+  auto rebuild = later(create("com.example.plugin", VSAClass::kDataPlugin));
   EXPECT_EQ(rebuild.wait_for(500ms), std::future_status::timeout);
   ASSERT_EQ(VSAReplyError(d.request(testLock(7, false))), 1u);  // everything off
   EXPECT_EQ(VSAReplyError(rebuild.get()), 1u);
@@ -115,7 +120,7 @@ TEST_F(Testability, TakingLockZeroBehindAFrozenWipeNeverHoldsUpReleasesOrAStop) 
   auto freezeWipe = [&] {
     size_t seen = occurrences(d.daemonOutput(), "Waiting on lock: 3");
     EXPECT_EQ(VSAReplyError(d.request(testLock(3, true))), 1u);
-    auto wipe = later(request(12, "com.example.app"));
+    auto wipe = later(request(VSACommands::kDeleteContainerContent, "com.example.app"));
     EXPECT_TRUE(
         eventually([&] { return occurrences(d.daemonOutput(), "Waiting on lock: 3") > seen; }));
     return wipe;
@@ -147,7 +152,8 @@ TEST_F(Testability, KilledWhileFrozenInsideACreationTheDaemonRestartsWithoutHalf
   d.crash();
   EXPECT_EQ(VSAReplyError(frozen.get()), 0u);  // no reply ever came
   ASSERT_TRUE(d.start());
-  EXPECT_EQ(VSAReplyError(d.request(request(0, "com.example.frozen"))), 21u);
+  EXPECT_EQ(VSAReplyError(d.request(request(VSACommands::kCreateOrLookup, "com.example.frozen"))),
+            21u);
   EXPECT_TRUE(eventually([&] { return entries(staging()) == 0; }));
   // The test locks did not survive the crash: creation runs straight through.
   EXPECT_EQ(VSAReplyError(d.request(create("com.example.frozen"))), 1u);
@@ -156,7 +162,7 @@ TEST_F(Testability, KilledWhileFrozenInsideACreationTheDaemonRestartsWithoutHalf
 
 TEST_F(Testability, TheRetryTestCrashesTheDaemonAsOftenAsAskedThenFinishes) {
   auto retry = [&](uint64_t n) {
-    return d.request(VSAValue::Dictionary{{"Command", VSAValue(uint64_t{25})},
+    return d.request(VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kRetryTest)},
                                           {"NumRetryCrashes", VSAValue(n)}});
   };
   EXPECT_EQ(VSAReplyError(retry(11)), 38u);
@@ -188,13 +194,14 @@ TEST(DaemonContent, AssetsAndSharedContentThroughTheSocket) {
   VSATestDaemon d;
   d.registerSelf("com.example.installer", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
   ASSERT_TRUE(d.start());
-  ASSERT_EQ(VSAReplyError(d.request(create("com.example.app", 1))), 1u);
+  ASSERT_EQ(VSAReplyError(d.request(create("com.example.app", VSAClass::kBundleApplication))), 1u);
   auto data = d.request(create("com.example.app"));
   ASSERT_EQ(VSAReplyError(data), 1u);
   std::string dataPath = VSAReplyString(data, "ReplyPath");
 
   auto assets = [&](bool relative, bool createIt) {
-    return d.request(with(with(request(28, "com.example.app"), "IsRelative", VSAValue(relative)),
+    return d.request(with(with(request(VSACommands::kUserManagedAssetsPath, "com.example.app"),
+                               "IsRelative", VSAValue(relative)),
                           "CreateIfNecessary", VSAValue(createIt)));
   };
   auto first = assets(false, true);
@@ -206,18 +213,21 @@ TEST(DaemonContent, AssetsAndSharedContentThroughTheSocket) {
   EXPECT_TRUE(*second->get("ReplyExisted")->boolValue());
   std::ofstream(dataPath + "/UserManagedAssets/song") << "la";
   auto remove = [&](VSAValue path) {
-    return VSAReplyError(d.request(with(request(29, "com.example.app"), "SourcePath", path)));
+    return VSAReplyError(d.request(with(
+        request(VSACommands::kDeleteUserManagedAsset, "com.example.app"), "SourcePath", path)));
   };
   EXPECT_EQ(remove(VSAValue("../Documents")), 11u);
   EXPECT_EQ(remove(VSAValue(uint64_t{3})), 11u);
   EXPECT_EQ(remove(VSAValue("song")), 1u);
   EXPECT_FALSE(fs::exists(dataPath + "/UserManagedAssets/song"));
 
-  auto bundle = d.request(request(0, "com.example.app", 1));
+  auto bundle = d.request(
+      request(VSACommands::kCreateOrLookup, "com.example.app", VSAClass::kBundleApplication));
   std::string bundlePath = VSAReplyString(bundle, "ReplyPath");
   std::ofstream(bundlePath + "/shared.db") << "rows";
   auto stage = [&](const char* src, const char* dst) {
-    VSAValue body = with(with(request(26, "com.example.app"), "SourcePath", VSAValue(src)),
+    VSAValue body = with(with(request(VSACommands::kStageSharedContent, "com.example.app"),
+                              "SourcePath", VSAValue(src)),
                          "DestPath", VSAValue(dst));
     return d.request(body);
   };
@@ -237,7 +247,7 @@ TEST(DaemonContent, SharedContentMakesTheMissingDirectoriesTheContainerOwners) {
   VSATestDaemon d;
   d.registerSelf("com.example.installer", VSAValue::Dictionary{{kAllowed, VSAValue(true)}});
   ASSERT_TRUE(d.start());
-  auto bundle = d.request(create("com.example.app", 1));
+  auto bundle = d.request(create("com.example.app", VSAClass::kBundleApplication));
   auto data = d.request(create("com.example.app"));
   ASSERT_EQ(VSAReplyError(data), 1u);
   std::string bundlePath = VSAReplyString(bundle, "ReplyPath");
@@ -249,7 +259,8 @@ TEST(DaemonContent, SharedContentMakesTheMissingDirectoriesTheContainerOwners) {
   ASSERT_EQ(owner(dataPath), 501u);
   fs::create_directories(bundlePath + "/Shared/fonts");
   std::ofstream(bundlePath + "/Shared/fonts/serif") << "glyphs";
-  VSAValue body = with(with(request(26, "com.example.app"), "SourcePath", VSAValue("Shared")),
+  VSAValue body = with(with(request(VSACommands::kStageSharedContent, "com.example.app"),
+                            "SourcePath", VSAValue("Shared")),
                        "DestPath", VSAValue("Documents/a/b/c/Shared"));
   auto staged = d.request(body);
   ASSERT_EQ(VSAReplyError(staged), 1u);

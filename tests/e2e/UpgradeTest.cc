@@ -11,6 +11,8 @@
 #include <filesystem>
 #include <fstream>
 
+#include "base/VSACommands.h"
+#include "base/VSAContainerClasses.h"
 #include "base/VSAPlist.h"
 #include "base/VSAUUID.h"
 #include "e2e/VSATestDaemon.h"
@@ -20,9 +22,11 @@ namespace fs = std::filesystem;
 
 namespace {
 
-VSAValue body(uint64_t command) { return VSAValue::Dictionary{{"Command", VSAValue(command)}}; }
+VSAValue body(VSACommandNumber command) {
+  return VSAValue::Dictionary{{"Command", VSAValue(command)}};
+}
 
-VSAValue withContainer(uint64_t command, const char* id, uint64_t containerClass) {
+VSAValue withContainer(VSACommandNumber command, const char* id, VSAContainerClass containerClass) {
   VSAValue v = body(command);
   v.set("Identifier", VSAValue(id));
   v.set("ContainerClass", VSAValue(containerClass));
@@ -50,7 +54,8 @@ TEST(DaemonUpgrade, OnlyANewBuildVersionIsAnUpgrade) {
                  VSAValue::Dictionary{{"com.tamsk.private.Vessa.allowed", VSAValue(true)}});
   writeVersion(d, "1A100");
   ASSERT_TRUE(d.start());
-  VSAValue create = withContainer(0, "com.example.systemservice", 12);
+  VSAValue create = withContainer(VSACommands::kCreateOrLookup, "com.example.systemservice",
+                                  VSAClass::kSystemData);
   create.set("CreateIfNecessary", VSAValue(true));
   auto made = d.request(create);
   ASSERT_EQ(VSAReplyError(made), 1u);
@@ -59,7 +64,9 @@ TEST(DaemonUpgrade, OnlyANewBuildVersionIsAnUpgrade) {
     writeVersion(d, build, release);
     EXPECT_TRUE(d.start(true, {"--after-boot"}));
     std::string path =
-        VSAReplyString(d.request(withContainer(0, "com.example.systemservice", 12)), "ReplyPath");
+        VSAReplyString(d.request(withContainer(VSACommands::kCreateOrLookup,
+                                               "com.example.systemservice", VSAClass::kSystemData)),
+                       "ReplyPath");
     EXPECT_EQ(d.stop(), 0);
     return path;
   };
@@ -83,10 +90,12 @@ TEST(DaemonUpgrade, AnOldDeviceIsUpgradedAtBootAndByTheMigrationCommands) {
   writeVersion(d, "OLD1");
   ASSERT_TRUE(d.start());
   // The old release kept code-signing info in the bundle's metadata.
-  VSAValue create = withContainer(0, "com.example.old", 1);
+  VSAValue create =
+      withContainer(VSACommands::kCreateOrLookup, "com.example.old", VSAClass::kBundleApplication);
   create.set("CreateIfNecessary", VSAValue(true));
   ASSERT_EQ(VSAReplyError(d.request(create)), 1u);
-  VSAValue setInfo = withContainer(5, "com.example.old", 1);
+  VSAValue setInfo =
+      withContainer(VSACommands::kSetInfoValue, "com.example.old", VSAClass::kBundleApplication);
   setInfo.set("Key", VSAValue("com.tamsk.Ferrox.CachedCodeSigningInfo"));
   setInfo.set("Value", VSAValue(VSAValue::Dictionary{
                            {"Entitlements", VSAValue::Dictionary{{"old", VSAValue(true)}}}}));
@@ -104,21 +113,21 @@ TEST(DaemonUpgrade, AnOldDeviceIsUpgradedAtBootAndByTheMigrationCommands) {
   EXPECT_NE(d.daemonOutput().find("Detected upgrade from OLD1 (User) to NEW2 (User)"),
             std::string::npos);
   EXPECT_TRUE(fs::exists(d.path("/private/var/root/Library/Logs/Vessa/vessad.0")));
-  EXPECT_EQ(VSAReplyError(d.request(body(24))), 1u);
+  EXPECT_EQ(VSAReplyError(d.request(body(VSACommands::kDataMigration))), 1u);
   EXPECT_FALSE(fs::exists(library + "/vsa_entitlements.plist"));
-  VSAValue read = body(19);
+  VSAValue read = body(VSACommands::kReadCodeSigningInfo);
   read.set("Identifier", VSAValue("com.example.old"));
   auto info = d.request(read);
   ASSERT_EQ(VSAReplyError(info), 1u);
   ASSERT_TRUE(info->get("ReplyInfoDictionary"));
   EXPECT_TRUE(info->get("ReplyInfoDictionary")->get("com.tamsk.Vessa.Entitlements"));
-  EXPECT_EQ(VSAReplyError(d.request(body(30))), 1u);
+  EXPECT_EQ(VSAReplyError(d.request(body(VSACommands::kPerUserDataMigration))), 1u);
   EXPECT_EQ(d.stop(), 0);
 
   // Same build at the next boot: no upgrade, and 24 finds every type recorded.
   ASSERT_TRUE(d.start(true, {"--after-boot"}));
   EXPECT_EQ(count(d.daemonOutput(), "skipping upgrade"), 1u);
-  EXPECT_EQ(VSAReplyError(d.request(body(24))), 1u);
+  EXPECT_EQ(VSAReplyError(d.request(body(VSACommands::kDataMigration))), 1u);
   EXPECT_EQ(count(d.daemonOutput(), "Performing code signing migration"), 1u);
   EXPECT_EQ(d.stop(), 0);
 }
@@ -141,7 +150,7 @@ TEST(DaemonUpgrade, ABundleTheUserPlantedInTheOldLocationIsLeftThere) {
   auto forged = VSAPlist::serialize(
       VSAValue::Dictionary{{"VSAMetadataIdentifier", VSAValue("com.example.victim")},
                            {"VSAMetadataUUID", VSAValue(VSAUUID::random().string())},
-                           {"VSAMetadataContentClass", VSAValue(uint64_t{1})},
+                           {"VSAMetadataContentClass", VSAValue(VSAClass::kBundleApplication)},
                            {"VSAMetadataVersion", VSAValue("2")}},
       VSAPlist::Format::Binary, nullptr);
   ASSERT_TRUE(forged);
@@ -160,7 +169,8 @@ TEST(DaemonUpgrade, ABundleTheUserPlantedInTheOldLocationIsLeftThere) {
   writeVersion(d, "NEW2");
   ASSERT_TRUE(d.start(true, {"--after-boot"}));
   EXPECT_NE(d.daemonOutput().find("Detected upgrade from OLD1"), std::string::npos);
-  auto victim = d.request(withContainer(0, "com.example.victim", 1));
+  auto victim = d.request(withContainer(VSACommands::kCreateOrLookup, "com.example.victim",
+                                        VSAClass::kBundleApplication));
   EXPECT_EQ(VSAReplyError(victim), 21u) << VSAReplyString(victim, "ReplyPath");
   EXPECT_FALSE(fs::exists(d.path("/private/var/containers/Bundle/Application/" + uuid)));
   EXPECT_TRUE(fs::exists(metadata));
@@ -179,15 +189,18 @@ TEST(DaemonUpgrade, APassThatKeepsASourceForItsRetryRemovesNoGroupThatSourceName
                                       {"com.tamsk.private.Vessa.dataMigration", VSAValue(true)}});
   writeVersion(d, "OLD1");
   ASSERT_TRUE(d.start());
-  for (auto [id, containerClass] :
-       {std::pair<const char*, uint64_t>{"com.example.grouped", 2}, {"group.example.legacy", 7}}) {
-    VSAValue create = withContainer(0, id, containerClass);
+  for (auto [id, containerClass] : {std::pair<const char*, VSAContainerClass>{
+                                        "com.example.grouped", VSAClass::kDataApplication},
+                                    {"group.example.legacy", VSAClass::kAppGroup}}) {
+    VSAValue create = withContainer(VSACommands::kCreateOrLookup, id, containerClass);
     create.set("CreateIfNecessary", VSAValue(true));
     ASSERT_EQ(VSAReplyError(d.request(create)), 1u) << id;
   }
-  VSAValue lookup = withContainer(0, "group.example.legacy", 7);
+  VSAValue lookup =
+      withContainer(VSACommands::kCreateOrLookup, "group.example.legacy", VSAClass::kAppGroup);
   std::string group = VSAReplyString(d.request(lookup), "ReplyPath");
-  VSAValue setInfo = withContainer(5, "com.example.grouped", 2);
+  VSAValue setInfo =
+      withContainer(VSACommands::kSetInfoValue, "com.example.grouped", VSAClass::kDataApplication);
   setInfo.set("Key", VSAValue("com.tamsk.Ferrox.GroupContainerIDs"));
   setInfo.set("Value", VSAValue(VSAValue::Array{VSAValue("group.example.legacy")}));
   ASSERT_EQ(VSAReplyError(d.request(setInfo)), 1u);
@@ -196,14 +209,14 @@ TEST(DaemonUpgrade, APassThatKeepsASourceForItsRetryRemovesNoGroupThatSourceName
   ASSERT_EQ(VSARefuseEntryWrites(d, "com.example.grouped", true), "");
   writeVersion(d, "NEW2");
   ASSERT_TRUE(d.start(true, {"--after-boot"}));
-  EXPECT_NE(VSAReplyError(d.request(body(24))), 1u);
+  EXPECT_NE(VSAReplyError(d.request(body(VSACommands::kDataMigration))), 1u);
   EXPECT_TRUE(fs::exists(group + "/.com.tamsk.vessa_keeper.metadata.plist"));
   EXPECT_NE(d.daemonOutput().find("Not reconciling application groups"), std::string::npos);
   EXPECT_EQ(d.stop(), 0);
 
   ASSERT_EQ(VSARefuseEntryWrites(d, "com.example.grouped", false), "");
   ASSERT_TRUE(d.start());
-  EXPECT_EQ(VSAReplyError(d.request(body(24))), 1u);
+  EXPECT_EQ(VSAReplyError(d.request(body(VSACommands::kDataMigration))), 1u);
   EXPECT_TRUE(fs::exists(group + "/.com.tamsk.vessa_keeper.metadata.plist"));
   EXPECT_EQ(VSAReplyString(d.request(lookup), "ReplyPath"), group);
   EXPECT_EQ(d.stop(), 0);

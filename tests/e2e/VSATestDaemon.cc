@@ -14,6 +14,7 @@
 #include <stdexcept>
 #include <thread>
 
+#include "base/VSACommands.h"
 #include "base/VSAPlist.h"
 #include "platform/VSAIPCClient.h"
 #include "platform/VSANamedSemaphore.h"
@@ -150,7 +151,8 @@ bool VSATestDaemon::start(bool waitForSocket, std::vector<std::string> extraArgs
       // (the retired command 27, which changes nothing). A start held on
       // purpose is given up on after ten seconds.
       VSAErrorRef error;
-      probe.sendRequest(VSAValue::Dictionary{{"Command", VSAValue(uint64_t{27})}}, 10s, &error);
+      probe.sendRequest(VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kRetired)}}, 10s,
+                        &error);
       return true;
     }
     std::this_thread::sleep_for(10ms);

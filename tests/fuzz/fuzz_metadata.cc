@@ -12,8 +12,9 @@ namespace {
 struct Device : VSAFuzzDevice {
   std::string container, file;
   Device() : VSAFuzzDevice("metadata") {
-    container = *config->containerDirectoryURLForUserIdentity(personal, 2, false) +
-                "/0A1B2C3D-0000-4000-8000-00000000F00D";
+    container =
+        *config->containerDirectoryURLForUserIdentity(personal, VSAClass::kDataApplication, false) +
+        "/0A1B2C3D-0000-4000-8000-00000000F00D";
     std::filesystem::create_directories(container);
     file = container + "/" + kVSAMetadataFileName;
   }
@@ -39,7 +40,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   // Accepted: only a binary list within the size limit can have been.
   if (size > kVSAMetadataFileMaxSize || !VSABinaryPlist::isBinaryPlist(data, size))
     __builtin_trap();
-  if (m->containerClass() < 1 || m->containerClass() > 13 || m->url() != device.container)
+  if (!VSAContainerClassIsValid(m->containerClass()) || m->url() != device.container)
     __builtin_trap();
   // Written back and read again, it names the same container.
   if (!m->writeMetadataToDiskWithError(*device.config, &error)) __builtin_trap();

@@ -101,7 +101,8 @@ class Migration : public VSAContainerTestRoot {
   // UUID name: the container and the name it has now.
   std::pair<VSAMetadataRef, std::string> hideWellKnownUnderUUID() {
     VSAResultCode code;
-    auto wellKnown = create(*installer(), "systemgroup.com.tamsk.launcher", &code, false, 13);
+    auto wellKnown = create(*installer(), "systemgroup.com.tamsk.launcher", &code, false,
+                            VSAClass::kSystemGroup);
     if (!wellKnown) return {nullptr, ""};
     std::string uuidPath = fs::path(wellKnown->url()).parent_path() / VSAUUID::random().string();
     fs::rename(wellKnown->url(), uuidPath);
@@ -113,7 +114,7 @@ class Migration : public VSAContainerTestRoot {
     auto cached = entry(VSAOldDevice::kCached);
     ASSERT_TRUE(cached);
     EXPECT_FALSE(cached->isInvalid());
-    EXPECT_EQ(cached->dataContainerClass(), 2u);
+    EXPECT_EQ(cached->dataContainerClass(), VSAClass::kDataApplication);
     EXPECT_TRUE(cached->codeSigningInfo().get(kVSAEntitlementsKey));
     EXPECT_FALSE(cached->codeSigningInfo().get("Entitlements"));
     auto grouped = entry(VSAOldDevice::kGrouped);
@@ -129,8 +130,10 @@ class Migration : public VSAContainerTestRoot {
     auto kept = entry(VSAOldDevice::kKept);
     ASSERT_TRUE(kept);
     EXPECT_TRUE(kept->codeSigningInfo().get(kVSAEntitlementsKey)->get("current"));
-    EXPECT_FALSE(info(VSAOldDevice::kCached, 1, kVSACachedCodeSigningInfoKey));
-    EXPECT_FALSE(info(VSAOldDevice::kGrouped, 2, kVSAGroupContainerIDsKey));
+    EXPECT_FALSE(
+        info(VSAOldDevice::kCached, VSAClass::kBundleApplication, kVSACachedCodeSigningInfoKey));
+    EXPECT_FALSE(
+        info(VSAOldDevice::kGrouped, VSAClass::kDataApplication, kVSAGroupContainerIDsKey));
     EXPECT_FALSE(fs::exists(library() + "/vsa_entitlements.plist"));
     auto s = status();
     ASSERT_TRUE(s);
@@ -139,7 +142,9 @@ class Migration : public VSAContainerTestRoot {
       EXPECT_TRUE(s->hasMigrationOccurredForType(type)) << type;
     // Every container keeps its files; the group stays referenced.
     for (auto [id, c] : std::vector<std::pair<const char*, VSAContainerClass>>{
-             {VSAOldDevice::kCached, 1}, {VSAOldDevice::kGrouped, 2}, {VSAOldDevice::kGroup, 7}}) {
+             {VSAOldDevice::kCached, VSAClass::kBundleApplication},
+             {VSAOldDevice::kGrouped, VSAClass::kDataApplication},
+             {VSAOldDevice::kGroup, VSAClass::kAppGroup}}) {
       VSAResultCode code = VSAResult::kSuccess;
       auto m =
           installer()->createOrLookupContainerWithContainerIdentity(identity(id, c), {}, &code);
@@ -235,30 +240,32 @@ TEST_F(Migration, EachMigratedIdentifierIsAnnouncedBeforeItsDatabaseWrite) {
   // Nothing was lost: every source stays for the next pass.
   EXPECT_FALSE(entry(VSAOldDevice::kLegacy));
   EXPECT_TRUE(fs::exists(library() + "/vsa_entitlements.plist"));
-  EXPECT_TRUE(info(VSAOldDevice::kCached, 1, kVSACachedCodeSigningInfoKey));
-  EXPECT_TRUE(info(VSAOldDevice::kGrouped, 2, kVSAGroupContainerIDsKey));
+  EXPECT_TRUE(
+      info(VSAOldDevice::kCached, VSAClass::kBundleApplication, kVSACachedCodeSigningInfoKey));
+  EXPECT_TRUE(info(VSAOldDevice::kGrouped, VSAClass::kDataApplication, kVSAGroupContainerIDsKey));
 }
 
 TEST_F(Migration, ClearingFailuresCarryTheirOwnResultCodeAndOddCachedValuesAreCleared) {
   VSAOldDevice::build(*context_, *installer(), user_);
   VSAResultCode code = VSAResult::kSuccess;
-  auto odd = create(*installer(), "com.example.odd", &code, false, 1);
+  auto odd = create(*installer(), "com.example.odd", &code, false, VSAClass::kBundleApplication);
   ASSERT_TRUE(odd) << code;
   VSAValue notADictionary("not a dictionary");
   VSAValue key(kVSACachedCodeSigningInfoKey);
-  ASSERT_TRUE(
-      installer()->setInfoValue(&notADictionary, &key, identity("com.example.odd", 1), true, &code))
+  ASSERT_TRUE(installer()->setInfoValue(&notADictionary, &key,
+                                        identity("com.example.odd", VSAClass::kBundleApplication),
+                                        true, &code))
       << code;
   // Two containers whose metadata file goes bad behind the cache's back.
-  auto cached = lookup(VSAOldDevice::kCached, 1);
-  auto grouped = lookup(VSAOldDevice::kGrouped, 2);
+  auto cached = lookup(VSAOldDevice::kCached, VSAClass::kBundleApplication);
+  auto grouped = lookup(VSAOldDevice::kGrouped, VSAClass::kDataApplication);
   ASSERT_TRUE(cached && grouped);
   for (const auto& m : {cached, grouped})
     put(m->url() + "/" + kVSAMetadataFileName, "not a property list");
   code = VSAResult::kSuccess;
   VSAValue anyKey("any");
-  EXPECT_FALSE(
-      installer()->infoValueForKey(&anyKey, identity(VSAOldDevice::kCached, 1), true, &code));
+  EXPECT_FALSE(installer()->infoValueForKey(
+      &anyKey, identity(VSAOldDevice::kCached, VSAClass::kBundleApplication), true, &code));
   VSAResultCode unreadable = code;  // what reading that metadata answers
   ASSERT_NE(unreadable, VSAResult::kSuccess);
   ASSERT_NE(unreadable, VSAResult::kWriteFailed);
@@ -272,12 +279,12 @@ TEST_F(Migration, ClearingFailuresCarryTheirOwnResultCodeAndOddCachedValuesAreCl
                            cached->containerIdentity()->description() + " : " + u));
   // The value that was no dictionary left no entry and is gone.
   EXPECT_FALSE(entry("com.example.odd"));
-  EXPECT_FALSE(info("com.example.odd", 1, kVSACachedCodeSigningInfoKey));
+  EXPECT_FALSE(info("com.example.odd", VSAClass::kBundleApplication, kVSACachedCodeSigningInfoKey));
 }
 
 TEST_F(Migration, TheDataMigrationAnswersTheCodeOfTheStepThatFailed) {
   VSAResultCode code = VSAResult::kSuccess;
-  ASSERT_TRUE(create(*installer(), "com.example.sys", &code, false, 12)) << code;
+  ASSERT_TRUE(create(*installer(), "com.example.sys", &code, false, VSAClass::kSystemData)) << code;
   // Without the "systemusers" group no system container ACL can be made;
   // the bundle ownership step after it still succeeds.
   std::ofstream(root_ + "/etc/group") << "mobile:x:501:\n";
@@ -299,7 +306,7 @@ TEST_F(Migration, MultiUserModeSkipsTheGroupIdMigrationAndReconciliation) {
   VSAOldDevice::build(*context_, *installer(), user_);
   ASSERT_TRUE(codeSigningPass());
   EXPECT_FALSE(entry(VSAOldDevice::kGrouped));
-  EXPECT_TRUE(info(VSAOldDevice::kGrouped, 2, kVSAGroupContainerIDsKey));
+  EXPECT_TRUE(info(VSAOldDevice::kGrouped, VSAClass::kDataApplication, kVSAGroupContainerIDsKey));
   EXPECT_FALSE(status()->hasMigrationOccurredForType("GroupIdMigration"));
   EXPECT_TRUE(status()->hasMigrationOccurredForType("CodeSigningMigration"));
   EXPECT_TRUE(entry(VSAOldDevice::kLegacy));
@@ -351,7 +358,7 @@ TEST_F(Migration, TheBuildUpgradeMovesLogsBundlesAndWellKnownSystemContainers) {
   EXPECT_TRUE(fs::is_directory(wellKnown->url()));
   EXPECT_FALSE(fs::exists(uuidPath));
   auto found = installer()->createOrLookupContainerWithContainerIdentity(
-      identity("systemgroup.com.tamsk.launcher", 13), {}, &code);
+      identity("systemgroup.com.tamsk.launcher", VSAClass::kSystemGroup), {}, &code);
   ASSERT_TRUE(found);
   EXPECT_EQ(found->url(), wellKnown->url());
   EXPECT_EQ(found->uuid(), wellKnown->uuid());
@@ -360,7 +367,7 @@ TEST_F(Migration, TheBuildUpgradeMovesLogsBundlesAndWellKnownSystemContainers) {
   // A second run with nothing left to move succeeds quietly.
   EXPECT_TRUE(context_->containerMigrator->performSynchronousBuildUpgradeMigration(*s, &error));
   // Without any system container directory the ACL migration is recorded untouched.
-  for (VSAContainerClass c : {12, 13})
+  for (VSAContainerClass c : {VSAClass::kSystemData, VSAClass::kSystemGroup})
     fs::remove_all(
         *context_->globalConfiguration->globalContainerBaseURLWithContentClass(c, false));
   startContext();
@@ -375,10 +382,10 @@ TEST_F(Migration, TheBuildUpgradeMovesOnlyWhatTheInstallationLeftInTheOldBundleL
   auto container = [&](const std::string& id, uid_t owner, const std::string& in) {
     std::string dir = in + "/" + VSAUUID::random().string();
     fs::create_directories(dir);
-    VSAMetadata m(
-        VSAConcreteContainerIdentity::containerIdentityWithUUID(
-            VSAUUID::random(), context_->userIdentityCache->defaultUserIdentity(), id, 1, nullptr),
-        std::nullopt, dir, std::nullopt);
+    VSAMetadata m(VSAConcreteContainerIdentity::containerIdentityWithUUID(
+                      VSAUUID::random(), context_->userIdentityCache->defaultUserIdentity(), id,
+                      VSAClass::kBundleApplication, nullptr),
+                  std::nullopt, dir, std::nullopt);
     EXPECT_TRUE(m.writeMetadataToDiskWithError(*context_->globalConfiguration, nullptr));
     EXPECT_EQ(::chown(dir.c_str(), owner, owner), 0);
     EXPECT_EQ(::chown((dir + "/" + kVSAMetadataFileName).c_str(), owner, owner), 0);
@@ -404,7 +411,7 @@ TEST_F(Migration, TheBuildUpgradeMovesOnlyWhatTheInstallationLeftInTheOldBundleL
   std::string bundles = context_->globalConfiguration->bundleDirectory() + "/Application";
   std::string moved = bundles + "/" + fs::path(genuine).filename().string();
   EXPECT_TRUE(fs::exists(moved + "/" + kVSAMetadataFileName));
-  auto found = lookup("com.example.genuine", 1);
+  auto found = lookup("com.example.genuine", VSAClass::kBundleApplication);
   ASSERT_TRUE(found);
   EXPECT_EQ(found->url(), moved);
   for (const auto& dir : planted) {
@@ -414,7 +421,7 @@ TEST_F(Migration, TheBuildUpgradeMovesOnlyWhatTheInstallationLeftInTheOldBundleL
   }
   for (const char* id :
        {"com.example.victim", "com.example.open", "com.example.mixed", "com.example.linked"})
-    EXPECT_FALSE(lookup(id, 1)) << id;
+    EXPECT_FALSE(lookup(id, VSAClass::kBundleApplication)) << id;
 }
 
 TEST_F(Migration, PerUserMigrationRestoresStructureOnceAndRemovesDeprecatedContainers) {
@@ -428,7 +435,7 @@ TEST_F(Migration, PerUserMigrationRestoresStructureOnceAndRemovesDeprecatedConta
                  root_ + "/etc/vessad/deprecated-containers.plist", 0, nullptr);  // not a list
   VSAValue list = VSAValue::Array{
       VSAValue(VSAValue::Dictionary{{"Identifier", VSAValue("com.example.retired")},
-                                    {"ContainerClass", VSAValue(uint64_t{2})}}),
+                                    {"ContainerClass", VSAValue(VSAClass::kDataApplication)}}),
       VSAValue(VSAValue::Dictionary{{"Identifier", VSAValue(uint64_t{7})}})};  // logged, skipped
   fs::remove_all(app->url() + "/Documents");
   auto run = [&] {
@@ -481,7 +488,7 @@ TEST_F(Migration, AnInterruptedBuildUpgradeEndsLikeAnUninterruptedOneWhenRunAgai
         EXPECT_TRUE(fs::is_directory(wellKnown->url()));
         EXPECT_FALSE(fs::exists(uuidPath));
         auto found = installer()->createOrLookupContainerWithContainerIdentity(
-            identity("systemgroup.com.tamsk.launcher", 13), {}, &code);
+            identity("systemgroup.com.tamsk.launcher", VSAClass::kSystemGroup), {}, &code);
         ASSERT_TRUE(found);
         EXPECT_EQ(found->uuid(), wellKnown->uuid());
       });

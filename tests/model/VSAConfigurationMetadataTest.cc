@@ -103,27 +103,30 @@ TEST_F(Layout, DirectoriesArePlacedOwnedAndRecreated) {
   EXPECT_EQ(st.st_uid, 33u);
   EXPECT_EQ(config_->deathrowDirectory(),
             root_ + "/private/var/root/Library/Caches/com.tamsk.vessad/Dead");
-  auto data = config_->containerDirectoryURLForUserIdentity(personal_, 2, false);
+  auto data =
+      config_->containerDirectoryURLForUserIdentity(personal_, VSAClass::kDataApplication, false);
   EXPECT_EQ(*data, root_ + "/private/var/mobile/Containers/Data/Application");
   lstat(data->c_str(), &st);
   EXPECT_EQ(st.st_uid, 501u);
-  EXPECT_EQ(*config_->containerDirectoryURLForUserIdentity(personal_, 1, false),
+  EXPECT_EQ(*config_->containerDirectoryURLForUserIdentity(personal_, VSAClass::kBundleApplication,
+                                                           false),
             root_ + "/private/var/containers/Bundle/Application");
-  EXPECT_EQ(*config_->containerDirectoryURLForUserIdentity(personal_, 13, true),
+  EXPECT_EQ(*config_->containerDirectoryURLForUserIdentity(personal_, VSAClass::kSystemGroup, true),
             root_ + "/private/var/root/Library/Caches/com.tamsk.vessad/Temp/Shared/SystemGroup");
-  EXPECT_EQ(*config_->containerDirectoryURLForUserIdentity(personal_, 2, true),
-            root_ + "/private/var/mobile/Containers/Temp/Data/Application");
+  EXPECT_EQ(
+      *config_->containerDirectoryURLForUserIdentity(personal_, VSAClass::kDataApplication, true),
+      root_ + "/private/var/mobile/Containers/Temp/Data/Application");
   auto perUser = config_->getPerUserConfigurationForUserIdentity(personal_);
   EXPECT_FALSE(perUser->containerDirectoryURLForContentClass(0, false));
   EXPECT_FALSE(perUser->containerDirectoryURLForContentClass(14, false));
-  EXPECT_FALSE(config_->globalContainerBaseURLWithContentClass(2, false));
+  EXPECT_FALSE(config_->globalContainerBaseURLWithContentClass(VSAClass::kDataApplication, false));
   EXPECT_FALSE(config_->legacyTransientBundleDirectory());
   // The unspecific identity of the same uid shares the personal layout object.
   EXPECT_EQ(config_->getPerUserConfigurationForUserIdentity(cache_->unspecificUserIdentity()),
             perUser);
-  EXPECT_EQ(config_->stagingDirectoryURLForUserIdentity(personal_, 7),
+  EXPECT_EQ(config_->stagingDirectoryURLForUserIdentity(personal_, VSAClass::kAppGroup),
             root_ + "/private/var/mobile/Containers/Staging");
-  EXPECT_EQ(config_->stagingDirectoryURLForUserIdentity(personal_, 12),
+  EXPECT_EQ(config_->stagingDirectoryURLForUserIdentity(personal_, VSAClass::kSystemData),
             config_->stagingDirectory());
   EXPECT_FALSE(config_->migrationFileExistsWithName("marker"));
   std::ofstream(config_->libraryDirectory() + "/marker") << "";
@@ -161,7 +164,7 @@ TEST_F(Layout, EnsuredDirectoriesAreCheckedCheaplyAndRecreatedWhenGone) {
 }
 
 TEST_F(Layout, MetadataRoundTripsAndIsNeverWrittenInPlace) {
-  auto m = makeContainer(2, personal_);
+  auto m = makeContainer(VSAClass::kDataApplication, personal_);
   VSAValue raw = readPlist(m->url());
   EXPECT_EQ(*raw.get("VSAMetadataVersion")->stringValue(), "2");
   EXPECT_TRUE(raw.get("VSAMetadataUserIdentity"));
@@ -173,7 +176,7 @@ TEST_F(Layout, MetadataRoundTripsAndIsNeverWrittenInPlace) {
   EXPECT_EQ(back->info()->get("k")->int64Value(), 1);
   EXPECT_EQ(back->url(), m->url());
   // A bundle container's file never carries a user identity.
-  auto b = makeContainer(1, cache_->defaultUserIdentity());
+  auto b = makeContainer(VSAClass::kBundleApplication, cache_->defaultUserIdentity());
   EXPECT_FALSE(readPlist(b->url()).get("VSAMetadataUserIdentity"));
   auto other = cache_->userIdentityForPersonalPersonaWithUID(502, 502);
   auto bundleBack =
@@ -183,7 +186,7 @@ TEST_F(Layout, MetadataRoundTripsAndIsNeverWrittenInPlace) {
 }
 
 TEST_F(Layout, AFailedMetadataWriteLeavesTheOldFileIntact) {
-  auto m = makeContainer(2, personal_);
+  auto m = makeContainer(VSAClass::kDataApplication, personal_);
   std::vector<uint8_t> before;
   std::ifstream in(m->url() + "/" + kVSAMetadataFileName, std::ios::binary);
   before.assign(std::istreambuf_iterator<char>(in), {});
@@ -197,8 +200,8 @@ TEST_F(Layout, AFailedMetadataWriteLeavesTheOldFileIntact) {
     std::ifstream again(m->url() + "/" + kVSAMetadataFileName, std::ios::binary);
     std::vector<uint8_t> now(std::istreambuf_iterator<char>(again), {});
     EXPECT_EQ(now, before) << VSAFileSystem::opName(op);
-    for (auto& e :
-         fs::directory_iterator(config_->stagingDirectoryURLForUserIdentity(personal_, 2)))
+    for (auto& e : fs::directory_iterator(
+             config_->stagingDirectoryURLForUserIdentity(personal_, VSAClass::kDataApplication)))
       ADD_FAILURE() << "left behind " << e.path();
   }
   VSAResultCode code = 0;
@@ -206,7 +209,7 @@ TEST_F(Layout, AFailedMetadataWriteLeavesTheOldFileIntact) {
 }
 
 TEST_F(Layout, EveryValidationFailureHasItsCodeAndMessage) {
-  auto m = makeContainer(2, personal_);
+  auto m = makeContainer(VSAClass::kDataApplication, personal_);
   VSAResultCode code = 0;
   auto other = cache_->userIdentityForPersonalPersonaWithUID(502, 502);
   struct Case {
@@ -243,7 +246,7 @@ TEST_F(Layout, EveryValidationFailureHasItsCodeAndMessage) {
 
 // Files written before user identities were stored carry only the owner uid.
 TEST_F(Layout, LegacyFilesWithoutAUserIdentity) {
-  auto m = makeContainer(2, personal_);
+  auto m = makeContainer(VSAClass::kDataApplication, personal_);
   VSAValue v = readPlist(m->url());
   v.remove("VSAMetadataUserIdentity");
   v.set("VSAMetadataPersona", VSAValue(499));
@@ -263,8 +266,9 @@ TEST_F(Layout, LegacyFilesWithoutAUserIdentity) {
 }
 
 TEST_F(Layout, ClassPathCheckCatchesADataContainerUnderABundleTree) {
-  auto m = makeContainer(2, personal_);
-  std::string bundleDir = *config_->containerDirectoryURLForUserIdentity(personal_, 1, false);
+  auto m = makeContainer(VSAClass::kDataApplication, personal_);
+  std::string bundleDir = *config_->containerDirectoryURLForUserIdentity(
+      personal_, VSAClass::kBundleApplication, false);
   std::string moved = bundleDir + "/" + m->uuid().string();
   fs::rename(m->url(), moved);
   VSAErrorRef error;

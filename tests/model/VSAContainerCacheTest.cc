@@ -39,7 +39,7 @@ class Cache : public ::testing::Test {
     identities_ = VSAUserIdentityCache::create({personas_, users, 501, 501, true, nullptr});
     notifications_ = std::make_shared<VSANotificationCenter>(root);
     sandbox_ = std::make_shared<VSASandboxService>(root);
-    wellknown_.known = {{"com.wellknown", 12}};
+    wellknown_.known = {{"com.wellknown", VSAClass::kSystemData}};
     cache_ = VSAContainerCache::create(
         {identities_, config_, sandbox_, notifications_,
          std::make_shared<VSATestLocks>(std::make_shared<VSALocks>()), &codeSigning_, &wellknown_});
@@ -84,52 +84,55 @@ class Cache : public ::testing::Test {
 };
 
 TEST_F(Cache, BuildsFromDiskSkippingBadNamesAndWrongClasses) {
-  onDisk(personal_, "com.app", 2);
-  onDisk(personal_, "com.named", 2, "Foo");  // not a UUID name
-  auto misplaced = onDisk(personal_, "com.bundle", 2);
+  onDisk(personal_, "com.app", VSAClass::kDataApplication);
+  onDisk(personal_, "com.named", VSAClass::kDataApplication, "Foo");  // not a UUID name
+  auto misplaced = onDisk(personal_, "com.bundle", VSAClass::kDataApplication);
   // A metadata file that names another class is skipped (class-path check).
   VSAValue v =
       *VSA_dictionaryWithContentsOfURL(misplaced->url() + "/" + kVSAMetadataFileName, 0, nullptr);
-  v.set("VSAMetadataContentClass", VSAValue(1u));
+  v.set("VSAMetadataContentClass", VSAValue(VSAClass::kBundleApplication));
   VSA_writeToURL(v, misplaced->url() + "/" + kVSAMetadataFileName, 0, nullptr);
-  auto all = cache_->allContainersForUserIdentity(personal_, 2, {}, nullptr);
+  auto all =
+      cache_->allContainersForUserIdentity(personal_, VSAClass::kDataApplication, {}, nullptr);
   ASSERT_TRUE(all);
   ASSERT_EQ(all->size(), 1u);
   EXPECT_EQ((*all)[0]->identifier(), "com.app");
   // Well-known names count in Data/System only.
-  onDisk(personal_, "com.wellknown", 12, "com.wellknown");
-  EXPECT_EQ(cache_->allContainersForUserIdentity(personal_, 12, {}, nullptr)->size(), 1u);
-  EXPECT_FALSE(
-      VSAContainerCache::containerURLIsValidForContainerClass("/x/com.wellknown", 13, wellknown_));
+  onDisk(personal_, "com.wellknown", VSAClass::kSystemData, "com.wellknown");
+  EXPECT_EQ(
+      cache_->allContainersForUserIdentity(personal_, VSAClass::kSystemData, {}, nullptr)->size(),
+      1u);
+  EXPECT_FALSE(VSAContainerCache::containerURLIsValidForContainerClass(
+      "/x/com.wellknown", VSAClass::kSystemGroup, wellknown_));
 }
 
 TEST_F(Cache, HostileMetadataFilesCostOnlyTheirOwnContainer) {
-  onDisk(personal_, "com.good", 2);
+  onDisk(personal_, "com.good", VSAClass::kDataApplication);
   auto file = [](const VSAMetadataRef& m) { return m->url() + "/" + kVSAMetadataFileName; };
   // A FIFO: opening it for reading would wait for a writer for ever.
-  auto fifo = onDisk(personal_, "com.fifo", 2);
+  auto fifo = onDisk(personal_, "com.fifo", VSAClass::kDataApplication);
   fs::remove(file(fifo));
   ASSERT_EQ(::mkfifo(file(fifo).c_str(), 0644), 0);
   // A well-formed metadata file padded past the size limit.
-  auto big = onDisk(personal_, "com.big", 2);
+  auto big = onDisk(personal_, "com.big", VSAClass::kDataApplication);
   big->setInfo(VSAValue(VSAValue::Dictionary{{"pad", VSAValue(std::string(100 << 10, 'p'))}}));
   ASSERT_TRUE(big->writeMetadataToDiskWithError(*config_, nullptr));
   // The same metadata as XML text: never what the daemon writes.
-  auto xml = onDisk(personal_, "com.xml", 2);
+  auto xml = onDisk(personal_, "com.xml", VSAClass::kDataApplication);
   VSAValue dict = *VSA_dictionaryWithContentsOfURL(file(xml), 0, nullptr);
   auto text = VSAPlist::serialize(dict, VSAPlist::Format::XML, nullptr);
   ASSERT_TRUE(VSAWriteFileAtomically(file(xml), *text, 0644, nullptr));
   // A symbolic link to a valid metadata file, and a directory in its place.
-  auto link = onDisk(personal_, "com.link", 2);
-  auto elsewhere = onDisk(personal_, "com.elsewhere", 4);
+  auto link = onDisk(personal_, "com.link", VSAClass::kDataApplication);
+  auto elsewhere = onDisk(personal_, "com.elsewhere", VSAClass::kDataPlugin);
   fs::remove(file(link));
   fs::create_symlink(file(elsewhere), file(link));
-  auto dir = onDisk(personal_, "com.dir", 2);
+  auto dir = onDisk(personal_, "com.dir", VSAClass::kDataApplication);
   fs::remove(file(dir));
   fs::create_directory(file(dir));
 
   auto listing = std::async(std::launch::async, [&] {
-    return cache_->allContainersForUserIdentity(personal_, 2, {}, nullptr);
+    return cache_->allContainersForUserIdentity(personal_, VSAClass::kDataApplication, {}, nullptr);
   });
   if (listing.wait_for(std::chrono::seconds(20)) != std::future_status::ready) {
     ADD_FAILURE() << "listing the class blocked on a FIFO";
@@ -152,7 +155,7 @@ TEST_F(Cache, HostileMetadataFilesCostOnlyTheirOwnContainer) {
     EXPECT_EQ(error->resultCode(0), VSAResult::kMetadataUnreadable) << m->identifier();
   }
   // Just under the limit is still read.
-  auto fits = onDisk(personal_, "com.fits", 2);
+  auto fits = onDisk(personal_, "com.fits", VSAClass::kDataApplication);
   fits->setInfo(VSAValue(VSAValue::Dictionary{{"pad", VSAValue(std::string(60 << 10, 'p'))}}));
   ASSERT_TRUE(fits->writeMetadataToDiskWithError(*config_, nullptr));
   EXPECT_TRUE(VSAMetadata::readAndValidateMetadataAtUrl(fits->url(), personal_, true, *config_,
@@ -160,12 +163,13 @@ TEST_F(Cache, HostileMetadataFilesCostOnlyTheirOwnContainer) {
 }
 
 TEST_F(Cache, HugeSparseMetadataFileIsRefusedByItsSize) {
-  onDisk(personal_, "com.good", 2);
-  auto sparse = onDisk(personal_, "com.sparse", 2);
+  onDisk(personal_, "com.good", VSAClass::kDataApplication);
+  auto sparse = onDisk(personal_, "com.sparse", VSAClass::kDataApplication);
   std::string path = sparse->url() + "/" + kVSAMetadataFileName;
   // 64 GiB of holes: reading it whole would exhaust memory at every start.
   ASSERT_EQ(::truncate(path.c_str(), off_t{64} << 30), 0);
-  auto all = cache_->allContainersForUserIdentity(personal_, 2, {}, nullptr);
+  auto all =
+      cache_->allContainersForUserIdentity(personal_, VSAClass::kDataApplication, {}, nullptr);
   ASSERT_TRUE(all);
   ASSERT_EQ(all->size(), 1u);
   EXPECT_EQ((*all)[0]->identifier(), "com.good");
@@ -177,8 +181,8 @@ TEST_F(Cache, HugeSparseMetadataFileIsRefusedByItsSize) {
 }
 
 TEST_F(Cache, VanishedMetadataIsReportedOnceThenNotFound) {
-  auto m = onDisk(personal_, "com.app", 2);
-  auto id = identity(personal_, "com.app", 2);
+  auto m = onDisk(personal_, "com.app", VSAClass::kDataApplication);
+  auto id = identity(personal_, "com.app", VSAClass::kDataApplication);
   VSAErrorRef error;
   ASSERT_TRUE(cache_->containerForContainerIdentity(*id, {}, &error));
   fs::remove(m->url() + "/" + kVSAMetadataFileName);
@@ -189,48 +193,59 @@ TEST_F(Cache, VanishedMetadataIsReportedOnceThenNotFound) {
 }
 
 TEST_F(Cache, KernelLookupAvoidsBuildingTheClassMap) {
-  auto m = onDisk(personal_, "com.app", 2);
-  ASSERT_TRUE(cache_->setSandboxContainerMappingForUserIdentity(personal_, "com.app", 2, m->url()));
-  auto found = cache_->containerForContainerIdentity(*identity(personal_, "com.app", 2),
-                                                     {.allowKernelLookup = true}, nullptr);
+  auto m = onDisk(personal_, "com.app", VSAClass::kDataApplication);
+  ASSERT_TRUE(cache_->setSandboxContainerMappingForUserIdentity(
+      personal_, "com.app", VSAClass::kDataApplication, m->url()));
+  auto found = cache_->containerForContainerIdentity(
+      *identity(personal_, "com.app", VSAClass::kDataApplication), {.allowKernelLookup = true},
+      nullptr);
   ASSERT_TRUE(found);
   EXPECT_EQ(found->url(), m->url());
-  EXPECT_FALSE(cache_->hasClassMap(personal_, 2, false));
+  EXPECT_FALSE(cache_->hasClassMap(personal_, VSAClass::kDataApplication, false));
 }
 
 TEST_F(Cache, SandboxMappingRules) {
-  EXPECT_FALSE(cache_->shouldRegisterSandboxMappingWithUserIdentity(enterprise_, "com.x", 1))
+  EXPECT_FALSE(cache_->shouldRegisterSandboxMappingWithUserIdentity(enterprise_, "com.x",
+                                                                    VSAClass::kBundleApplication))
       << "enterprise bundle mappings are never pushed";
-  EXPECT_TRUE(cache_->shouldRegisterSandboxMappingWithUserIdentity(enterprise_, "group.g", 7));
-  EXPECT_TRUE(cache_->shouldRegisterSandboxMappingWithUserIdentity(enterprise_, "com.work", 2));
-  EXPECT_FALSE(cache_->shouldRegisterSandboxMappingWithUserIdentity(personal_, "com.work", 2));
-  EXPECT_TRUE(cache_->shouldRegisterSandboxMappingWithUserIdentity(personal_, "com.unlisted", 2));
-  EXPECT_FALSE(cache_->setSandboxContainerMappingForUserIdentity(personal_, "com.bundle", 1, "/x"))
+  EXPECT_TRUE(cache_->shouldRegisterSandboxMappingWithUserIdentity(enterprise_, "group.g",
+                                                                   VSAClass::kAppGroup));
+  EXPECT_TRUE(cache_->shouldRegisterSandboxMappingWithUserIdentity(enterprise_, "com.work",
+                                                                   VSAClass::kDataApplication));
+  EXPECT_FALSE(cache_->shouldRegisterSandboxMappingWithUserIdentity(personal_, "com.work",
+                                                                    VSAClass::kDataApplication));
+  EXPECT_TRUE(cache_->shouldRegisterSandboxMappingWithUserIdentity(personal_, "com.unlisted",
+                                                                   VSAClass::kDataApplication));
+  EXPECT_FALSE(cache_->setSandboxContainerMappingForUserIdentity(
+      personal_, "com.bundle", VSAClass::kBundleApplication, "/x"))
       << "bundle classes have no sandbox item type";
 }
 
 TEST_F(Cache, AddRemoveAndInvalidateAnEnterpriseIdentity) {
-  auto m = onDisk(enterprise_, "com.work", 2);
+  auto m = onDisk(enterprise_, "com.work", VSAClass::kDataApplication);
   ASSERT_TRUE(cache_->addContainerMetadata(*m, m->url(), {.updateSandbox = true}, nullptr));
   EXPECT_EQ(sandboxItems(501), 1);
-  ASSERT_TRUE(cache_->allContainersForUserIdentity(enterprise_, 7, {.transient = true}, nullptr));
-  EXPECT_TRUE(cache_->hasClassMap(enterprise_, 2, false));
-  EXPECT_TRUE(cache_->hasClassMap(enterprise_, 7, true));
+  ASSERT_TRUE(cache_->allContainersForUserIdentity(enterprise_, VSAClass::kAppGroup,
+                                                   {.transient = true}, nullptr));
+  EXPECT_TRUE(cache_->hasClassMap(enterprise_, VSAClass::kDataApplication, false));
+  EXPECT_TRUE(cache_->hasClassMap(enterprise_, VSAClass::kAppGroup, true));
   // The enterprise persona goes away: its maps and mappings go, one notification.
   personas_->personas->pop_back();
   identities_->flush();
-  EXPECT_FALSE(cache_->hasClassMap(enterprise_, 2, false));
-  EXPECT_FALSE(cache_->hasClassMap(enterprise_, 7, true));
+  EXPECT_FALSE(cache_->hasClassMap(enterprise_, VSAClass::kDataApplication, false));
+  EXPECT_FALSE(cache_->hasClassMap(enterprise_, VSAClass::kAppGroup, true));
   EXPECT_EQ(sandboxItems(501), 0);
   EXPECT_EQ(notifications_->postedNames(),
             std::vector<std::string>{CONTAINER_NOTIFY_USER_INVALIDATED});
   // Removing from a rebuilt map drops the entry.
-  auto p = onDisk(personal_, "com.app", 2);
-  ASSERT_TRUE(cache_->containerForContainerIdentity(*identity(personal_, "com.app", 2)));
-  ASSERT_TRUE(cache_->removeContainerForUserIdentity(personal_, 2, "com.app", false, nullptr));
+  auto p = onDisk(personal_, "com.app", VSAClass::kDataApplication);
+  ASSERT_TRUE(cache_->containerForContainerIdentity(
+      *identity(personal_, "com.app", VSAClass::kDataApplication)));
+  ASSERT_TRUE(cache_->removeContainerForUserIdentity(personal_, VSAClass::kDataApplication,
+                                                     "com.app", false, nullptr));
   VSAErrorRef error;
-  EXPECT_FALSE(
-      cache_->containerForContainerIdentity(*identity(personal_, "com.app", 2), {}, &error));
+  EXPECT_FALSE(cache_->containerForContainerIdentity(
+      *identity(personal_, "com.app", VSAClass::kDataApplication), {}, &error));
   EXPECT_EQ(error->resultCode(0), 21u) << "the map is not rebuilt from disk once built";
 }
 

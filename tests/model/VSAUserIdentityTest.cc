@@ -63,13 +63,18 @@ TEST_F(UserIdentities, IdentifiersEqualityAndDescriptions) {
   EXPECT_NE(unspecific->shortDescription().find("501/501/501/2/1000"), std::string::npos);
   EXPECT_STREQ(VSAUserIdentity::descriptionForPersonaType(9), "unknown");
   // Bundle and system classes are owned by the platform uids, as uid and gid.
-  EXPECT_EQ(personal->posixUIDForContainerClass(1), CONTAINER_INSTALLATION_UID);
-  EXPECT_EQ(personal->posixGIDForContainerClass(8), CONTAINER_INSTALLATION_UID);
-  EXPECT_EQ(personal->posixGIDForContainerClass(13), CONTAINER_SYSTEM_UID);
-  EXPECT_EQ(personal->posixUIDForContainerClass(2), 501u);
-  for (VSAContainerClass c : {0ull, 2ull, 7ull, 11ull, 14ull, 99ull})
+  EXPECT_EQ(personal->posixUIDForContainerClass(VSAClass::kBundleApplication),
+            CONTAINER_INSTALLATION_UID);
+  EXPECT_EQ(personal->posixGIDForContainerClass(VSAClass::kBundleFramework),
+            CONTAINER_INSTALLATION_UID);
+  EXPECT_EQ(personal->posixGIDForContainerClass(VSAClass::kSystemGroup), CONTAINER_SYSTEM_UID);
+  EXPECT_EQ(personal->posixUIDForContainerClass(VSAClass::kDataApplication), 501u);
+  // Every per-user class needs a user identity, and so does a number that is no class.
+  for (VSAContainerClass c : kVSAPerUserContainerClasses)
     EXPECT_TRUE(VSAUserIdentity::isUserIdentityRequiredForContainerClass(c)) << c;
-  for (VSAContainerClass c : {1ull, 3ull, 5ull, 8ull, 12ull, 13ull})
+  for (VSAContainerClass c : {0ull, 14ull, 99ull})
+    EXPECT_TRUE(VSAUserIdentity::isUserIdentityRequiredForContainerClass(c)) << c;
+  for (VSAContainerClass c : kVSAGlobalContainerClasses)
     EXPECT_FALSE(VSAUserIdentity::isUserIdentityRequiredForContainerClass(c)) << c;
 }
 
@@ -290,8 +295,8 @@ TEST_F(UserIdentities, ContainerIdentityValidationOrderAndEquality) {
     EXPECT_EQ(code, 11u);
   }
   VSAValue number(5);
-  EXPECT_FALSE(
-      VSAContainerIdentity::containerIdentityWithUserIdentity(personal, &number, 2, &code));
+  EXPECT_FALSE(VSAContainerIdentity::containerIdentityWithUserIdentity(
+      personal, &number, VSAClass::kDataApplication, &code));
   EXPECT_EQ(code, 11u);
   EXPECT_FALSE(
       VSAContainerIdentity::containerIdentityWithUserIdentity(personal, nullptr, 0, &code));
@@ -299,29 +304,33 @@ TEST_F(UserIdentities, ContainerIdentityValidationOrderAndEquality) {
   EXPECT_FALSE(VSAContainerIdentity::containerIdentityWithUserIdentity(nullptr, nullptr, 0, &code));
   EXPECT_EQ(code, 11u) << "a missing owner wins";
   code = 1;
-  EXPECT_FALSE(VSAContainerIdentity::containerIdentityWithIdentifier("com.app", 2, *cache, &code));
+  EXPECT_FALSE(VSAContainerIdentity::containerIdentityWithIdentifier(
+      "com.app", VSAClass::kDataApplication, *cache, &code));
   EXPECT_EQ(code, 11u);
-  auto bundle = VSAContainerIdentity::containerIdentityWithIdentifier("com.app", 1, *cache, &code);
+  auto bundle = VSAContainerIdentity::containerIdentityWithIdentifier(
+      "com.app", VSAClass::kBundleApplication, *cache, &code);
   ASSERT_TRUE(bundle);
   EXPECT_TRUE(VSAUserIdentityEqual(bundle->userIdentity(), cache->defaultUserIdentity()));
 
-  auto a = VSAContainerIdentity::containerIdentityWithUserIdentity(personal, &id, 2, &code);
-  auto b = VSAContainerIdentity::containerIdentityWithUserIdentity(unspecific, &id, 2, &code);
+  auto a = VSAContainerIdentity::containerIdentityWithUserIdentity(
+      personal, &id, VSAClass::kDataApplication, &code);
+  auto b = VSAContainerIdentity::containerIdentityWithUserIdentity(
+      unspecific, &id, VSAClass::kDataApplication, &code);
   EXPECT_TRUE(a->isEqual(*b)) << "personal vs unspecific owner of one uid";
   EXPECT_EQ(a->hash(), b->hash());
   VSAUUID u1 = VSAUUID::random(), u2 = VSAUUID::random();
-  auto c1 =
-      VSAConcreteContainerIdentity::containerIdentityWithUUID(u1, personal, "com.app", 2, &code);
-  auto c2 =
-      VSAConcreteContainerIdentity::containerIdentityWithUUID(u2, personal, "com.app", 2, &code);
+  auto c1 = VSAConcreteContainerIdentity::containerIdentityWithUUID(
+      u1, personal, "com.app", VSAClass::kDataApplication, &code);
+  auto c2 = VSAConcreteContainerIdentity::containerIdentityWithUUID(
+      u2, personal, "com.app", VSAClass::kDataApplication, &code);
   EXPECT_FALSE(c1->isEqual(*c2));
   EXPECT_TRUE(a->isEqual(*c1));
   EXPECT_TRUE(a->isEqual(*c2));
   EXPECT_FALSE(c1->isEqual(*a));
   EXPECT_TRUE(c1->isEqual(*c1));
   VSAValue text(u1.string());
-  EXPECT_FALSE(
-      VSAConcreteContainerIdentity::containerIdentityWithUUID(&text, personal, &id, 2, &code));
+  EXPECT_FALSE(VSAConcreteContainerIdentity::containerIdentityWithUUID(
+      &text, personal, &id, VSAClass::kDataApplication, &code));
   EXPECT_EQ(code, 11u) << "a UUID must be a UUID value";
   EXPECT_NE(c1->description().find(u1.string()), std::string::npos);
 }

@@ -59,7 +59,7 @@ class Boot : public VSAContainerTestRoot {
 
 TEST_F(Boot, BackedUpSystemContainersReplaceLiveItemsAndTheBackupGoes) {
   VSAResultCode code;
-  auto live = create(*installer(), "com.example.sys", &code, false, 12);
+  auto live = create(*installer(), "com.example.sys", &code, false, VSAClass::kSystemData);
   ASSERT_TRUE(live) << code;
   put(live->url() + "/kept.txt", "live");
   put(live->url() + "/shared.txt", "live");
@@ -80,7 +80,7 @@ TEST_F(Boot, BackedUpSystemContainersReplaceLiveItemsAndTheBackupGoes) {
   ASSERT_TRUE(metadata) << error;
   EXPECT_EQ(metadata->uuid(), live->uuid());
   auto fresh = installer()->createOrLookupContainerWithContainerIdentity(
-      identity("com.example.fresh", 12), {}, &code);
+      identity("com.example.fresh", VSAClass::kSystemData), {}, &code);
   ASSERT_TRUE(fresh);
   EXPECT_EQ(read(fresh->url() + "/Library/prefs"), "fresh");
   EXPECT_TRUE(logged("Installing system containers"));
@@ -112,20 +112,20 @@ TEST_F(Boot, InternalBuildsKeepARestoredBackupWithoutRestoringItAgain) {
   fs::create_directories(backup + "/com.example.sys");
   put(backup + "/com.example.sys/shared.txt", "backup");
   rebootSetup();
-  auto restored = lookup("com.example.sys", 12);
+  auto restored = lookup("com.example.sys", VSAClass::kSystemData);
   ASSERT_TRUE(restored);
   EXPECT_EQ(read(restored->url() + "/shared.txt"), "backup");
   EXPECT_TRUE(fs::is_directory(library() + "/Data.inprogress"));  // kept for inspection
   // Deleted afterwards, it stays deleted at the next boot.
-  ASSERT_EQ(stage({identity("com.example.sys", 12)}), VSAResult::kSuccess);
+  ASSERT_EQ(stage({identity("com.example.sys", VSAClass::kSystemData)}), VSAResult::kSuccess);
   rebootSetup();
-  EXPECT_FALSE(lookup("com.example.sys", 12));
+  EXPECT_FALSE(lookup("com.example.sys", VSAClass::kSystemData));
   EXPECT_FALSE(logged("Resuming the interrupted restore"));
   // A new backup is restored as ever.
   fs::create_directories(backup + "/com.example.sys");
   put(backup + "/com.example.sys/shared.txt", "newer");
   rebootSetup();
-  restored = lookup("com.example.sys", 12);
+  restored = lookup("com.example.sys", VSAClass::kSystemData);
   ASSERT_TRUE(restored);
   EXPECT_EQ(read(restored->url() + "/shared.txt"), "newer");
 }
@@ -169,7 +169,7 @@ class BackupSwappingFileSystem : public VSAFaultInjectingFileSystem {
 
 TEST_F(Boot, ABackupWhoseParentIsALinkBringsInNothingFromWhereItPoints) {
   VSAResultCode code;
-  auto live = create(*installer(), "com.example.sys", &code, false, 12);
+  auto live = create(*installer(), "com.example.sys", &code, false, VSAClass::kSystemData);
   ASSERT_TRUE(live) << code;
   put(live->url() + "/shared.txt", "live");
   // The user turns the backup's parent into a link to a place holding a
@@ -194,7 +194,7 @@ TEST_F(Boot, ABackupWhoseParentIsALinkBringsInNothingFromWhereItPoints) {
 
 TEST_F(Boot, ABackupSwappedBeforeItIsMovedIsNotRestoredAndRestoredItemsAreRoots) {
   VSAResultCode code;
-  auto live = create(*installer(), "com.example.sys", &code, false, 12);
+  auto live = create(*installer(), "com.example.sys", &code, false, VSAClass::kSystemData);
   ASSERT_TRUE(live) << code;
   put(live->url() + "/shared.txt", "live");
   std::string backup = perUser()->systemContainerBackupDirectory();
@@ -241,13 +241,14 @@ TEST_F(Boot, OnlyEntriesThatAreNotLiveContainersAreCleanedAway) {
   VSAResultCode code;
   auto live = create(*installer(), "com.example.app", &code);
   ASSERT_TRUE(live) << code;
-  std::string dir = classDirectory(2);
+  std::string dir = classDirectory(VSAClass::kDataApplication);
   std::string noMetadata = dir + "/" + VSAUUID::random().string();
   fs::create_directories(noMetadata + "/Documents");
   put(noMetadata + "/Documents/left", "x");
   fs::create_directories(dir + "/not-a-container");
   put(dir + "/not-a-container/file", "x");
-  fs::remove_all(classDirectory(4));  // a class directory that is not there says nothing
+  // A class directory that is not there says nothing.
+  fs::remove_all(classDirectory(VSAClass::kDataPlugin));
 
   rebootCleanup();
   EXPECT_TRUE(fs::is_directory(live->url()));
@@ -297,7 +298,8 @@ TEST_F(Boot, TheOrphanScanLeavesAloneAContainerThatAWipeIsReplacing) {
     locks.releaseLock(kVSATestLockReplace);
     result.wait();
   });
-  if (halfway) keeper()._cleanupOrphanedDataForDirectories({live->url()}, 2);
+  if (halfway)
+    keeper()._cleanupOrphanedDataForDirectories({live->url()}, VSAClass::kDataApplication);
   if (!halfway) locks.releaseLock(kVSATestLockReplace);
   wiper.join();
   ASSERT_TRUE(halfway) << "the wipe never moved the old container aside";
@@ -312,9 +314,11 @@ TEST_F(Boot, TheOrphanScanLeavesAloneAContainerThatAWipeIsReplacing) {
 
 TEST_F(Boot, AnUpgradeRenamesSystemContainersExceptWellKnownAndAnalytics) {
   VSAResultCode code;
-  auto plain = create(*installer(), "com.example.sys", &code, false, 12);
-  auto wellKnown = create(*installer(), "systemgroup.com.tamsk.launcher", &code, false, 13);
-  auto analytics = create(*installer(), kVSAAnalyticsSystemGroupIdentifier, &code, false, 13);
+  auto plain = create(*installer(), "com.example.sys", &code, false, VSAClass::kSystemData);
+  auto wellKnown =
+      create(*installer(), "systemgroup.com.tamsk.launcher", &code, false, VSAClass::kSystemGroup);
+  auto analytics = create(*installer(), kVSAAnalyticsSystemGroupIdentifier, &code, false,
+                          VSAClass::kSystemGroup);
   ASSERT_TRUE(plain && wellKnown && analytics) << code;
   VSAOldDevice::writeSystemVersion(root_, "B1");
   installer()->rebootKeeperSetup();  // records B1
@@ -324,22 +328,24 @@ TEST_F(Boot, AnUpgradeRenamesSystemContainersExceptWellKnownAndAnalytics) {
   auto find = [&](const char* id, VSAContainerClass c) {
     return installer()->createOrLookupContainerWithContainerIdentity(identity(id, c), {}, &code);
   };
-  auto moved = find("com.example.sys", 12);
+  auto moved = find("com.example.sys", VSAClass::kSystemData);
   ASSERT_TRUE(moved);
   EXPECT_NE(moved->url(), plain->url());
   EXPECT_EQ(moved->uuid(), plain->uuid());
-  EXPECT_EQ(find("systemgroup.com.tamsk.launcher", 13)->url(), wellKnown->url());
-  EXPECT_EQ(find(kVSAAnalyticsSystemGroupIdentifier, 13)->url(), analytics->url());
+  EXPECT_EQ(find("systemgroup.com.tamsk.launcher", VSAClass::kSystemGroup)->url(),
+            wellKnown->url());
+  EXPECT_EQ(find(kVSAAnalyticsSystemGroupIdentifier, VSAClass::kSystemGroup)->url(),
+            analytics->url());
   installer()->rebootKeeperSetup();  // same build: nothing moves
-  EXPECT_EQ(find("com.example.sys", 12)->url(), moved->url());
+  EXPECT_EQ(find("com.example.sys", VSAClass::kSystemData)->url(), moved->url());
 }
 
 TEST_F(Boot, AnUpgradeOfADeviceWithoutSystemContainersRecordsTheACLMigration) {
   auto systemBase = [&](VSAContainerClass c) {
     return *context_->globalConfiguration->globalContainerBaseURLWithContentClass(c, false);
   };
-  ASSERT_FALSE(fs::exists(systemBase(12)));
-  ASSERT_FALSE(fs::exists(systemBase(13)));
+  ASSERT_FALSE(fs::exists(systemBase(VSAClass::kSystemData)));
+  ASSERT_FALSE(fs::exists(systemBase(VSAClass::kSystemGroup)));
   VSAOldDevice::writeSystemVersion(root_, "B1");
   installer()->rebootKeeperSetup();
   EXPECT_TRUE(logged("No system containers requiring ACL migration"));
@@ -352,7 +358,7 @@ TEST_F(Boot, AnUpgradeOfADeviceWithoutSystemContainersRecordsTheACLMigration) {
 
 TEST_F(Boot, GroupsAreReconciledAtBootOnlyInMultiUserMode) {
   VSAResultCode code;
-  auto group = create(*installer(), "group.com.example.nobody", &code, false, 7);
+  auto group = create(*installer(), "group.com.example.nobody", &code, false, VSAClass::kAppGroup);
   ASSERT_TRUE(group) << code;
   rebootSetup();
   EXPECT_TRUE(fs::is_directory(group->url()));  // no flags: left alone

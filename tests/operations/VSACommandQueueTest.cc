@@ -5,6 +5,7 @@
 #include <thread>
 #include <vector>
 
+#include "base/VSACommands.h"
 #include "operations/VSACommandQueue.h"
 
 namespace {
@@ -14,7 +15,7 @@ class Recorder : public VSACommand {
   Recorder(std::vector<int>& log, int id, VSAResultCode code = 1,
            std::function<void(VSACommandQueue&)> extra = {})
       : log_(log), id_(id), code_(code), extra_(std::move(extra)) {}
-  uint64_t command() const override { return 3; }
+  VSACommandNumber command() const override { return VSACommands::kStageForDelete; }
   bool fromQueue(VSACommandQueue& queue, VSAResultCode* error) override {
     log_.push_back(id_);
     if (extra_) extra_(queue);

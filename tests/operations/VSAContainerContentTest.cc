@@ -46,8 +46,8 @@ class ContainerContent : public VSAContainerTestRoot {
   // A bundle container with shared content, and its data container.
   std::pair<VSAMetadataRef, VSAMetadataRef> app(const std::string& id) {
     VSAResultCode code;
-    auto bundle = create(*installer(), id, &code, false, 1);
-    auto data = create(*installer(), id, &code, false, 2);
+    auto bundle = create(*installer(), id, &code, false, VSAClass::kBundleApplication);
+    auto data = create(*installer(), id, &code, false, VSAClass::kDataApplication);
     EXPECT_TRUE(bundle && data) << code;
     fs::create_directories(bundle->url() + "/Shared/fonts");
     put(bundle->url() + "/Shared/fonts/a.ttf", "font-a");
@@ -77,7 +77,7 @@ TEST_F(ContainerContent, TheAssetsDirectoryIsMadeOnceRecordedAndOwnedByTheContai
   struct stat st {};
   ASSERT_EQ(::stat(first.path->c_str(), &st), 0);
   EXPECT_EQ(st.st_mode & 07777, 0755u);
-  EXPECT_EQ(st.st_uid, user_->posixUIDForContainerClass(2));
+  EXPECT_EQ(st.st_uid, user_->posixUIDForContainerClass(VSAClass::kDataApplication));
   auto second = assets(*app, "com.example.app", true, true);
   EXPECT_TRUE(second.existed);
   EXPECT_EQ(*second.path, "UserManagedAssets");
@@ -154,7 +154,7 @@ TEST_F(ContainerContent, SharedContentLandsWholeFromTheBundleIntoTheDataContaine
   EXPECT_EQ(read(landed + "/b.ttf"), "font-b");
   struct stat st {};
   ASSERT_EQ(::lstat((landed + "/a.ttf").c_str(), &st), 0);
-  EXPECT_EQ(st.st_uid, user_->posixUIDForContainerClass(2));
+  EXPECT_EQ(st.st_uid, user_->posixUIDForContainerClass(VSAClass::kDataApplication));
   // Staging again replaces the directory whole; a file is replaced by a file.
   put(bundle->url() + "/Shared/fonts/a.ttf", "font-a2");
   fs::remove(bundle->url() + "/Shared/fonts/b.ttf");
@@ -165,7 +165,7 @@ TEST_F(ContainerContent, SharedContentLandsWholeFromTheBundleIntoTheDataContaine
   ASSERT_EQ(stageContent(*c, "com.example.app", "Shared/readme", "Documents/readme"),
             VSAResult::kSuccess);
   EXPECT_EQ(read(data->url() + "/Documents/readme"), "hello");
-  EXPECT_EQ(entries(staging(2)), 0u);
+  EXPECT_EQ(entries(staging(VSAClass::kDataApplication)), 0u);
 
   // Hostile paths on either side; a source that is not there; a failing copy.
   fs::create_symlink("/etc", bundle->url() + "/Shared/out");
@@ -185,7 +185,7 @@ TEST_F(ContainerContent, SharedContentLandsWholeFromTheBundleIntoTheDataContaine
             VSAResult::kSuccess);
   faults_->reset();
   EXPECT_FALSE(fs::exists(data->url() + "/Documents/second"));
-  EXPECT_EQ(entries(staging(2)), 0u);
+  EXPECT_EQ(entries(staging(VSAClass::kDataApplication)), 0u);
   // An app may stage only its own content; an identifier without a bundle is 21.
   EXPECT_EQ(stageContent(*connection("com.example.evil", false, false), "com.example.app",
                          "Shared/readme", "x"),
@@ -239,7 +239,7 @@ TEST_F(ContainerContent, ACrashWhileStagingLeavesTheOldOrTheNewContentNeverAMix)
         EXPECT_EQ(b, "font-b2");
         ++newSeen;
       }
-      EXPECT_EQ(entries(staging(2)), 0u);
+      EXPECT_EQ(entries(staging(VSAClass::kDataApplication)), 0u);
       if (HasFailure()) break;
     }
     std::printf("stage crash sweep (%s): %d points; old %d, new %d, missing %d\n", name, total,

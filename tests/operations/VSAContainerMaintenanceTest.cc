@@ -78,9 +78,10 @@ TEST_F(Maintenance, RegeneratingRenamesTheDirectoryAndKeepsTheIdentity) {
   // A UUID that names no container, and a well-known system container, whose
   // directory carries its name rather than a UUID.
   auto stranger = VSAConcreteContainerIdentity::containerIdentityWithUUID(
-      VSAUUID::random(), user_, "com.example.app", 2, nullptr);
+      VSAUUID::random(), user_, "com.example.app", VSAClass::kDataApplication, nullptr);
   EXPECT_EQ(regenerate(stranger), VSAResult::kContainerNotFound);
-  auto wellKnown = create(*installer(), "systemgroup.com.tamsk.launcher", &code, false, 13);
+  auto wellKnown =
+      create(*installer(), "systemgroup.com.tamsk.launcher", &code, false, VSAClass::kSystemGroup);
   ASSERT_TRUE(wellKnown) << code;
   EXPECT_EQ(regenerate(wellKnown->containerIdentity()), VSAResult::kInvalidArgument);
   EXPECT_TRUE(fs::is_directory(wellKnown->url()));
@@ -94,7 +95,8 @@ TEST_F(Maintenance, RegeneratingRenamesTheDirectoryAndKeepsTheIdentity) {
 TEST_F(Maintenance, RecreatingTheStructureRestoresMissingDirectoriesAndSystemACLs) {
   VSAResultCode code;
   auto app = create(*installer(), "com.example.app", &code);
-  auto system = create(*installer(), "systemgroup.com.example.shared", &code, false, 13);
+  auto system =
+      create(*installer(), "systemgroup.com.example.shared", &code, false, VSAClass::kSystemGroup);
   ASSERT_TRUE(app && system) << code;
   const auto appShape = shapeOf(app->url());
   const auto systemShape = shapeOf(system->url());
@@ -132,7 +134,7 @@ TEST_F(Maintenance, InfoValuesAreWrittenThroughTheMetadataFileAndRemovable) {
   // On disk, so that a new daemon reads it too; and nothing left in staging.
   restart();
   EXPECT_TRUE(info("com.example.app", &code)) << code;
-  EXPECT_EQ(entries(staging(2)), 0u);
+  EXPECT_EQ(entries(staging(VSAClass::kDataApplication)), 0u);
   // Keys must be strings; values must leave a file the daemon can read back.
   EXPECT_FALSE(info("com.example.app", &code, VSAValue(int64_t{1})));
   EXPECT_EQ(code, VSAResult::kOutOfRange);
@@ -154,7 +156,7 @@ TEST_F(Maintenance, InfoValuesAreWrittenThroughTheMetadataFileAndRemovable) {
 
 TEST_F(Maintenance, AMetadataFileNamingAnotherContainerIsOnlyItsOwnReadFailure) {
   VSAResultCode code;
-  auto sys = create(*installer(), "com.example.sys", &code, false, 12);
+  auto sys = create(*installer(), "com.example.sys", &code, false, VSAClass::kSystemData);
   auto app = create(*installer(), "com.example.app", &code);
   ASSERT_TRUE(sys && app) << code;
   auto appIdentity = identity("com.example.app");
@@ -190,8 +192,9 @@ TEST_F(Maintenance, AMetadataFileNamingAnotherContainerIsOnlyItsOwnReadFailure) 
     VSAContainerClass c;
     VSAUUID uuid;
   };
-  const Forgery forgeries[] = {{"com.example.sys", 12, sys->uuid()},        // the system container
-                               {"com.example.app", 2, VSAUUID::random()}};  // another UUID
+  const Forgery forgeries[] = {
+      {"com.example.sys", VSAClass::kSystemData, sys->uuid()},              // the system container
+      {"com.example.app", VSAClass::kDataApplication, VSAUUID::random()}};  // another UUID
   for (const auto& [name, run] : rereads) {
     for (const auto& forgery : forgeries) {
       SCOPED_TRACE(std::string(name) + " of a file claiming " + forgery.id);
@@ -199,7 +202,7 @@ TEST_F(Maintenance, AMetadataFileNamingAnotherContainerIsOnlyItsOwnReadFailure) 
       if (auto result = run()) {
         EXPECT_EQ(*result, VSAResult::kMetadataUnreadable);
       }
-      auto system = lookup("com.example.sys", 12);
+      auto system = lookup("com.example.sys", VSAClass::kSystemData);
       ASSERT_TRUE(system);
       EXPECT_EQ(system->url(), sys->url());
       auto own = lookup("com.example.app");

@@ -9,6 +9,7 @@
 
 #include "VSAContainerTestRoot.h"
 #include "VSATestLog.h"
+#include "base/VSACommands.h"
 #include "base/VSAPlist.h"
 #include "daemon/VSACommandHandlers.h"
 #include "operations/VSAReplaceFile.h"
@@ -27,12 +28,13 @@ class ReplaceAndWipe : public VSAContainerTestRoot {
         url, user_, false, *context_->globalConfiguration, *context_->userIdentityCache, &error);
     return m ? m->uuid().string() : "unreadable";
   }
-  VSAResultCode wipe(VSAClientConnection& c, const std::string& id, VSAContainerClass cls = 2) {
+  VSAResultCode wipe(VSAClientConnection& c, const std::string& id,
+                     VSAContainerClass cls = VSAClass::kDataApplication) {
     VSAResultCode code = VSAResult::kSuccess;
     c.deleteDataContainerContentWithContainerIdentity(identity(id, cls), &code);
     return code;
   }
-  size_t stagedItems() { return entries(staging(2)); }
+  size_t stagedItems() { return entries(staging(VSAClass::kDataApplication)); }
 };
 
 TEST_F(ReplaceAndWipe, ArgumentsThatCannotWorkFailBeforeAnythingMoves) {
@@ -40,16 +42,16 @@ TEST_F(ReplaceAndWipe, ArgumentsThatCannotWorkFailBeforeAnythingMoves) {
   VSAResultCode code;
   auto a = create(*c, "com.example.a", &code);
   auto b = create(*c, "com.example.b", &code);
-  auto bundle = create(*c, "com.example.bundle", &code, false, 1);
+  auto bundle = create(*c, "com.example.bundle", &code, false, VSAClass::kBundleApplication);
   ASSERT_TRUE(a && b && bundle) << code;
   auto other =
       VSAUserIdentity::make(502, 502, root_ + "/private/var/other", "OTHER-PERSONA", 1, 1001);
   ASSERT_TRUE(other && !other->isEqualToUserIdentity(*user_));
   auto plainA = identity("com.example.a");
   auto missing = VSAConcreteContainerIdentity::containerIdentityWithUUID(
-      VSAUUID::random(), user_, "com.example.missing", 2, nullptr);
+      VSAUUID::random(), user_, "com.example.missing", VSAClass::kDataApplication, nullptr);
   auto foreign = VSAConcreteContainerIdentity::containerIdentityWithUUID(
-      b->uuid(), other, "com.example.b", 2, nullptr);
+      b->uuid(), other, "com.example.b", VSAClass::kDataApplication, nullptr);
   struct Case {
     const char* what;
     VSAContainerIdentityRef oldIdentity, newIdentity;
@@ -84,10 +86,13 @@ TEST_F(ReplaceAndWipe, AReplaceRequestWithoutANewUUIDIsRefusedByTheReplaceItself
   auto a = create(*c, "com.example.a", &code);
   auto b = create(*c, "com.example.b", &code);
   ASSERT_TRUE(a && b) << code;
-  VSAValue request = VSAValue::Dictionary{
-      {"Command", VSAValue(uint64_t{2})},           {"OldIdentifier", VSAValue("com.example.a")},
-      {"OldContainerClass", VSAValue(uint64_t{2})}, {"OldContainerUUID", VSAValue(a->uuid())},
-      {"NewIdentifier", VSAValue("com.example.b")}, {"NewContainerClass", VSAValue(uint64_t{2})}};
+  VSAValue request =
+      VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kReplaceContainer)},
+                           {"OldIdentifier", VSAValue("com.example.a")},
+                           {"OldContainerClass", VSAValue(VSAClass::kDataApplication)},
+                           {"OldContainerUUID", VSAValue(a->uuid())},
+                           {"NewIdentifier", VSAValue("com.example.b")},
+                           {"NewContainerClass", VSAValue(VSAClass::kDataApplication)}};
   VSATestLog log;
   ASSERT_TRUE(log.open(root_ + "/test.log"));
   VSAValue reply = VSAValue::dictionary();
@@ -167,7 +172,8 @@ TEST_F(ReplaceAndWipe, AWipeKeepsPathAndUUIDAndEmptiesTheContainer) {
   EXPECT_EQ(uuidOnDisk(after->url()), before->uuid().string());
   EXPECT_EQ(entries(replaceDirectory()), 0u);
   EXPECT_EQ(stagedItems(), 0u);
-  EXPECT_EQ(entries(classDirectory(2, true)), 0u);  // the transient container took the place
+  // The transient container took the place.
+  EXPECT_EQ(entries(classDirectory(VSAClass::kDataApplication, true)), 0u);
   // A new daemon finds the same container from disk.
   restart();
   after = lookup("com.example.app");
@@ -179,28 +185,36 @@ TEST_F(ReplaceAndWipe, AWipeKeepsPathAndUUIDAndEmptiesTheContainer) {
 TEST_F(ReplaceAndWipe, ARestrictedClientWipesOnlyListedPluginData) {
   VSAResultCode code;
   auto c = installer();
-  for (auto [id, cls] : {std::pair<const char*, VSAContainerClass>{"com.example.listed", 4},
-                         {"com.example.unlisted", 4},
-                         {"com.example.listed", 2}}) {
+  for (auto [id, cls] :
+       {std::pair<const char*, VSAContainerClass>{"com.example.listed", VSAClass::kDataPlugin},
+        {"com.example.unlisted", VSAClass::kDataPlugin},
+        {"com.example.listed", VSAClass::kDataApplication}}) {
     auto m = create(*c, id, &code, false, cls);
     ASSERT_TRUE(m) << code;
     put(m->url() + "/Documents/keep", id);
   }
-  ASSERT_TRUE(create(*c, "com.example.bundle", &code, false, 1));
+  ASSERT_TRUE(create(*c, "com.example.bundle", &code, false, VSAClass::kBundleApplication));
   VSAValue list = VSAValue::array();
   list.append("com.example.listed");
   auto restricted = connection("com.example.settings", false, false, std::nullopt, list);
-  EXPECT_EQ(wipe(*restricted, "com.example.unlisted", 4), VSAResult::kNotEntitled);
-  EXPECT_EQ(read(lookup("com.example.unlisted", 4)->url() + "/Documents/keep"),
+  EXPECT_EQ(wipe(*restricted, "com.example.unlisted", VSAClass::kDataPlugin),
+            VSAResult::kNotEntitled);
+  EXPECT_EQ(read(lookup("com.example.unlisted", VSAClass::kDataPlugin)->url() + "/Documents/keep"),
             "com.example.unlisted");
-  EXPECT_EQ(wipe(*restricted, "com.example.listed", 2), VSAResult::kNotEntitled);
-  EXPECT_EQ(read(lookup("com.example.listed", 2)->url() + "/Documents/keep"), "com.example.listed");
-  EXPECT_EQ(wipe(*restricted, "com.example.listed", 4), VSAResult::kSuccess);
-  EXPECT_FALSE(fs::exists(lookup("com.example.listed", 4)->url() + "/Documents/keep"));
+  EXPECT_EQ(wipe(*restricted, "com.example.listed", VSAClass::kDataApplication),
+            VSAResult::kNotEntitled);
+  EXPECT_EQ(
+      read(lookup("com.example.listed", VSAClass::kDataApplication)->url() + "/Documents/keep"),
+      "com.example.listed");
+  EXPECT_EQ(wipe(*restricted, "com.example.listed", VSAClass::kDataPlugin), VSAResult::kSuccess);
+  EXPECT_FALSE(
+      fs::exists(lookup("com.example.listed", VSAClass::kDataPlugin)->url() + "/Documents/keep"));
   // Even an unrestricted client wipes data containers only, and existing ones.
-  EXPECT_EQ(wipe(*c, "com.example.bundle", 1), VSAResult::kInvalidArgument);
-  EXPECT_EQ(wipe(*c, "com.example.never-made", 2), VSAResult::kContainerNotFound);
-  EXPECT_EQ(entries(classDirectory(2, true)), 0u);
+  EXPECT_EQ(wipe(*c, "com.example.bundle", VSAClass::kBundleApplication),
+            VSAResult::kInvalidArgument);
+  EXPECT_EQ(wipe(*c, "com.example.never-made", VSAClass::kDataApplication),
+            VSAResult::kContainerNotFound);
+  EXPECT_EQ(entries(classDirectory(VSAClass::kDataApplication, true)), 0u);
 }
 
 // A crash between a wipe's renames left the old container in staging. The
@@ -212,7 +226,8 @@ TEST_F(ReplaceAndWipe, AnOldContainerThatRecoveryCannotMoveBackWaitsForALaterSta
   ASSERT_TRUE(app) << code;
   put(app->url() + "/Documents/diary", "kept");
   std::string aside = staging() + "/" + VSAUUID::random().string();
-  std::string fresh = classDirectory(2, true) + "/" + VSAUUID::random().string();
+  std::string fresh =
+      classDirectory(VSAClass::kDataApplication, true) + "/" + VSAUUID::random().string();
   ASSERT_TRUE(VSAReplaceFile::_writeToDiskReplaceAt(
       *context_->fileManager, replaceDirectory() + "/" + VSAUUID::random().string() + ".plist",
       app->url(), fresh, aside, app->url(), nullptr));

@@ -12,6 +12,7 @@
 #include <vector>
 
 #include "base/VSABinaryPlist.h"
+#include "base/VSACommands.h"
 #include "platform/VSAFrameCodec.h"
 #include "platform/VSAIPCClient.h"
 #include "platform/VSAIPCListener.h"
@@ -26,7 +27,7 @@ std::vector<uint8_t> frameOf(const VSAValue& v) {
 }
 
 TEST(VSAFrameReader, ReassemblesFramesFromAnySplit) {
-  VSAValue a = VSAValue::Dictionary{{"Command", VSAValue(1u)}};
+  VSAValue a = VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kListContainers)}};
   VSAValue b = VSAValue::Dictionary{{"Identifier", VSAValue(std::string(3000, 'x'))}};
   std::vector<uint8_t> stream = frameOf(a);
   auto fb = frameOf(b);

@@ -6,6 +6,7 @@
 #include <vector>
 
 #include "VSATestReplies.h"
+#include "base/VSACommands.h"
 #include "platform/VSAFrameCodec.h"
 #include "platform/VSAIPCMessage.h"
 
@@ -37,7 +38,7 @@ class ReplyContext : public ::testing::Test {
 };
 
 TEST_F(ReplyContext, KeepsWhatALateReplyNeedsAndReleasesTheRequest) {
-  VSAValue body = VSAValue::Dictionary{{"Command", VSAValue(21u)},
+  VSAValue body = VSAValue::Dictionary{{"Command", VSAValue(VSACommands::kSetDataProtection)},
                                        {"MessageID", VSAValue(9u)},
                                        {"Padding", VSAValue(std::vector<uint8_t>(1 << 20, 0x5a))}};
   auto message = receive(body);

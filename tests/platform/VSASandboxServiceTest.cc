@@ -14,14 +14,17 @@ TEST(VSASandboxService, ContainerTableOutlivesTheService) {
   VSATestTempDir temp("vessa-sandbox");
   {
     VSASandboxService sandbox{VSASystemRoot(temp.path())};
-    ASSERT_EQ(sandbox.setUserStateItem(501, *VSASandboxItemTypeForClass(2), "com.app", 2, 1000,
-                                       std::string("/c/A")),
-              0);
-    ASSERT_EQ(sandbox.setUserStateItem(501, *VSASandboxItemTypeForClass(7), "group.g", 7, 1000,
-                                       std::string("/c/G")),
+    ASSERT_EQ(
+        sandbox.setUserStateItem(501, *VSASandboxItemTypeForClass(VSAClass::kDataApplication),
+                                 "com.app", VSAClass::kDataApplication, 1000, std::string("/c/A")),
+        0);
+    ASSERT_EQ(sandbox.setUserStateItem(501, *VSASandboxItemTypeForClass(VSAClass::kAppGroup),
+                                       "group.g", VSAClass::kAppGroup, 1000, std::string("/c/G")),
               0);
     // Replacing the same identifier and class keeps one item.
-    ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app", 2, 1000, std::string("/c/B")), 0);
+    ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app", VSAClass::kDataApplication, 1000,
+                                       std::string("/c/B")),
+              0);
   }
   VSASandboxService reopened{VSASystemRoot(temp.path())};
   std::vector<VSASandboxItem> items;
@@ -30,23 +33,34 @@ TEST(VSASandboxService, ContainerTableOutlivesTheService) {
     return true;
   });
   ASSERT_EQ(items.size(), 2u);
-  ASSERT_TRUE(reopened.userStateItem(501, "com.app", 2, 1000));
-  EXPECT_EQ(reopened.userStateItem(501, "com.app", 2, 1000)->path, "/c/B");
-  EXPECT_EQ(reopened.userStateItem(501, "group.g", 7, 1000)->path, "/c/G");
-  EXPECT_FALSE(reopened.userStateItem(501, "com.app", 7, 1000)) << "the class is part of the key";
+  ASSERT_TRUE(reopened.userStateItem(501, "com.app", VSAClass::kDataApplication, 1000));
+  EXPECT_EQ(reopened.userStateItem(501, "com.app", VSAClass::kDataApplication, 1000)->path, "/c/B");
+  EXPECT_EQ(reopened.userStateItem(501, "group.g", VSAClass::kAppGroup, 1000)->path, "/c/G");
+  EXPECT_FALSE(reopened.userStateItem(501, "com.app", VSAClass::kAppGroup, 1000))
+      << "the class is part of the key";
   // Two personas of one uid keep their own items of the same identifier and class.
-  ASSERT_EQ(reopened.setUserStateItem(501, 1, "com.app", 2, 1001, std::string("/work/B")), 0);
-  EXPECT_EQ(reopened.userStateItem(501, "com.app", 2, 1000)->path, "/c/B");
-  EXPECT_EQ(reopened.userStateItem(501, "com.app", 2, 1001)->path, "/work/B");
-  ASSERT_EQ(reopened.setUserStateItem(501, 1, "com.app", 2, 1001, std::nullopt), 0);
-  EXPECT_TRUE(reopened.userStateItem(501, "com.app", 2, 1000)) << "the other persona's stays";
-  ASSERT_EQ(reopened.setUserStateItem(501, 1, "com.app", 2, 1000, std::nullopt), 0) << "removal";
+  ASSERT_EQ(reopened.setUserStateItem(501, 1, "com.app", VSAClass::kDataApplication, 1001,
+                                      std::string("/work/B")),
+            0);
+  EXPECT_EQ(reopened.userStateItem(501, "com.app", VSAClass::kDataApplication, 1000)->path, "/c/B");
+  EXPECT_EQ(reopened.userStateItem(501, "com.app", VSAClass::kDataApplication, 1001)->path,
+            "/work/B");
+  ASSERT_EQ(
+      reopened.setUserStateItem(501, 1, "com.app", VSAClass::kDataApplication, 1001, std::nullopt),
+      0);
+  EXPECT_TRUE(reopened.userStateItem(501, "com.app", VSAClass::kDataApplication, 1000))
+      << "the other persona's stays";
+  ASSERT_EQ(
+      reopened.setUserStateItem(501, 1, "com.app", VSAClass::kDataApplication, 1000, std::nullopt),
+      0)
+      << "removal";
   int count = 0;
   reopened.iterateUserStateItems(501, [&](const VSASandboxItem&) { return ++count, true; });
   EXPECT_EQ(count, 1);
   reopened.iterateUserStateItems(502, [&](const VSASandboxItem&) { return ADD_FAILURE(), true; });
-  EXPECT_FALSE(VSASandboxItemTypeForClass(1)) << "bundle containers are not sandbox items";
-  EXPECT_EQ(*VSASandboxItemTypeForClass(13), 9u);
+  EXPECT_FALSE(VSASandboxItemTypeForClass(VSAClass::kBundleApplication))
+      << "bundle containers are not sandbox items";
+  EXPECT_EQ(*VSASandboxItemTypeForClass(VSAClass::kSystemGroup), 9u);
 }
 
 // Launches push the same mappings over and over: only a change (a new path
@@ -55,28 +69,40 @@ TEST(VSASandboxService, OnlyChangesRewriteTheTable) {
   VSATestTempDir temp("vessa-sandbox");
   VSASandboxService sandbox{VSASystemRoot(temp.path())};
   const std::string table = temp.path() + "/run/vessad/sandbox/501.plist";
-  ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app", 2, 1000, std::string("/c/A")), 0);
+  ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app", VSAClass::kDataApplication, 1000,
+                                     std::string("/c/A")),
+            0);
   sandbox.flush();
   ASSERT_TRUE(std::filesystem::exists(table));
   // The file is removed behind the service's back: it comes back only when
   // something changed.
   std::filesystem::remove(table);
-  ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app", 2, 1000, std::string("/c/A")), 0);
-  ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.gone", 2, 1000, std::nullopt), 0);
+  ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app", VSAClass::kDataApplication, 1000,
+                                     std::string("/c/A")),
+            0);
+  ASSERT_EQ(
+      sandbox.setUserStateItem(501, 1, "com.gone", VSAClass::kDataApplication, 1000, std::nullopt),
+      0);
   sandbox.flush();
   EXPECT_FALSE(std::filesystem::exists(table)) << "nothing changed";
-  ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app", 2, 1000, std::string("/c/B")), 0);
+  ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app", VSAClass::kDataApplication, 1000,
+                                     std::string("/c/B")),
+            0);
   sandbox.flush();
   EXPECT_TRUE(std::filesystem::exists(table)) << "a new path";
   std::filesystem::remove(table);
-  ASSERT_EQ(sandbox.setUserStateItem(501, 4, "com.app", 2, 1000, std::string("/c/B")), 0);
+  ASSERT_EQ(sandbox.setUserStateItem(501, 4, "com.app", VSAClass::kDataApplication, 1000,
+                                     std::string("/c/B")),
+            0);
   sandbox.flush();
   EXPECT_TRUE(std::filesystem::exists(table)) << "a new item type";
   std::filesystem::remove(table);
-  ASSERT_EQ(sandbox.setUserStateItem(501, 4, "com.app", 2, 1000, std::nullopt), 0);
+  ASSERT_EQ(
+      sandbox.setUserStateItem(501, 4, "com.app", VSAClass::kDataApplication, 1000, std::nullopt),
+      0);
   sandbox.flush();
   ASSERT_TRUE(std::filesystem::exists(table)) << "a removal";
-  EXPECT_FALSE(sandbox.userStateItem(501, "com.app", 2, 1000));
+  EXPECT_FALSE(sandbox.userStateItem(501, "com.app", VSAClass::kDataApplication, 1000));
 }
 
 // The writer thread persists changes on its own, without a flush or the
@@ -85,12 +111,13 @@ TEST(VSASandboxService, WriterThreadPersistsBurstsWithoutAFlush) {
   VSATestTempDir temp("vessa-sandbox");
   VSASandboxService sandbox{VSASystemRoot(temp.path())};
   for (int i = 0; i < 500; ++i)
-    ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app" + std::to_string(i), 2, 1000,
-                                       "/c/" + std::to_string(i)),
+    ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app" + std::to_string(i),
+                                       VSAClass::kDataApplication, 1000, "/c/" + std::to_string(i)),
               0);
   for (int i = 0; i < 250; ++i)
-    ASSERT_EQ(
-        sandbox.setUserStateItem(501, 1, "com.app" + std::to_string(i), 2, 1000, std::nullopt), 0);
+    ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app" + std::to_string(i),
+                                       VSAClass::kDataApplication, 1000, std::nullopt),
+              0);
   auto countOnDisk = [&] {
     // A second service reads the file afresh (and writes nothing).
     VSASandboxService reader{VSASystemRoot(temp.path())};
@@ -107,7 +134,9 @@ TEST(VSASandboxService, WriterThreadPersistsBurstsWithoutAFlush) {
   EXPECT_EQ(waitFor(250), 250);
   // Only the first change of a burst wakes the writer: a change after that
   // write is the first of the next burst and is written too.
-  ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.late", 2, 1000, std::string("/c/late")), 0);
+  ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.late", VSAClass::kDataApplication, 1000,
+                                     std::string("/c/late")),
+            0);
   EXPECT_EQ(waitFor(251), 251);
 }
 

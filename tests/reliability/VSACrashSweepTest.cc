@@ -70,7 +70,7 @@ class CrashSweep : public VSAContainerTestRoot {
   };
 
   // A container the sweep must never lose.
-  VSAMetadataRef made(const std::string& id, VSAContainerClass c = 2) {
+  VSAMetadataRef made(const std::string& id, VSAContainerClass c = VSAClass::kDataApplication) {
     VSAResultCode code;
     auto m = create(*installer(), id, &code, false, c);
     EXPECT_TRUE(m) << id << ": " << code;
@@ -252,11 +252,13 @@ class CrashSweep : public VSAContainerTestRoot {
 };
 
 TEST_F(CrashSweep, CreationOfDataAndSystemContainers) {
-  for (VSAContainerClass c : {2u, 12u}) {
-    std::string prefix = c == 2 ? "com.example.new." : "com.example.system.";
+  for (VSAContainerClass c : {VSAClass::kDataApplication, VSAClass::kSystemData}) {
+    std::string prefix =
+        c == VSAClass::kDataApplication ? "com.example.new." : "com.example.system.";
     std::map<std::string, std::string> whole;  // what the uninterrupted creation made
     sweep(
-        c == 2 ? "create data container" : "create system container", [](int) {},
+        c == VSAClass::kDataApplication ? "create data container" : "create system container",
+        [](int) {},
         [&](int n) {
           VSAResultCode code;
           create(*installer(), prefix + std::to_string(n), &code, false, c);
@@ -469,7 +471,7 @@ TEST_F(CrashSweep, GroupRemovalAtItsLastReference) {
   sweep(
       "group removal (last reference)",
       [&](int n) {
-        made(at("group.example.", n), 7);
+        made(at("group.example.", n), VSAClass::kAppGroup);
         VSACommandQueue q;
         reg(at("com.example.member.", n),
             VSAValue::Dictionary{{kVSAEntitlementApplicationGroups,
@@ -503,10 +505,10 @@ TEST_F(CrashSweep, BootSetupRestoresBackedUpSystemContainers) {
       },
       [&](int n) {
         // A restore that a crash interrupted is finished at the next boot.
-        auto m = lookup(at("com.example.restored.", n), 12);
+        auto m = lookup(at("com.example.restored.", n), VSAClass::kSystemData);
         ASSERT_TRUE(m);
         EXPECT_EQ(read(m->url() + "/Library/prefs"), "backed up");
-        known_[at("com.example.restored.", n)] = {12, m->uuid()};
+        known_[at("com.example.restored.", n)] = {VSAClass::kSystemData, m->uuid()};
       });
 }
 
@@ -529,7 +531,7 @@ TEST_F(CrashSweep, BootCleanupOfOrphansStagingAndTransientContainers) {
         every.get_future().wait();
         return VSAResult::kSuccess;  // it reports nothing; the checker judges it
       },
-      [&](int) { EXPECT_EQ(entries(classDirectory(2, true)), 0u); });
+      [&](int) { EXPECT_EQ(entries(classDirectory(VSAClass::kDataApplication, true)), 0u); });
 }
 
 }  // namespace
@@ -545,7 +547,8 @@ TEST_F(CrashSweep, FullDiskAndIOErrorsAtEachStepLeaveTheRootInOrder) {
         [&](int n) {
           VSAResultCode code;
           std::string id = at(error == EIO ? "com.example.eio." : "com.example.full.", n);
-          if (auto m = create(*installer(), id, &code)) known_[id] = {2, m->uuid()};
+          if (auto m = create(*installer(), id, &code))
+            known_[id] = {VSAClass::kDataApplication, m->uuid()};
           return code;
         });
     failureSweep(
@@ -603,9 +606,10 @@ TEST_F(CrashSweep, AContainerMadeOnAFreshRootOutlivesAPowerLoss) {
   auto c = installer();
   c->rebootKeeperSetup();
   c->keeperSetup();
-  for (VSAContainerClass cls : {2u, 12u}) {
+  for (VSAContainerClass cls : {VSAClass::kDataApplication, VSAClass::kSystemData}) {
     VSAResultCode code;
-    std::string id = cls == 2 ? "com.example.first" : "com.example.first.system";
+    std::string id =
+        cls == VSAClass::kDataApplication ? "com.example.first" : "com.example.first.system";
     auto m = create(*installer(), id, &code, false, cls);
     ASSERT_TRUE(m) << code;
     known_[id] = {cls, m->uuid()};

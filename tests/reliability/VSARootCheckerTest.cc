@@ -20,7 +20,7 @@ namespace {
 
 class RootChecker : public VSAContainerTestRoot {
  protected:
-  VSAMetadataRef made(const std::string& id, VSAContainerClass c = 2) {
+  VSAMetadataRef made(const std::string& id, VSAContainerClass c = VSAClass::kDataApplication) {
     VSAResultCode code;
     auto m = create(*installer(), id, &code, false, c);
     EXPECT_TRUE(m) << code;
@@ -48,9 +48,9 @@ class RootChecker : public VSAContainerTestRoot {
 
 TEST_F(RootChecker, AKeptRootIsCleanAndCheckingItChangesNothing) {
   made("com.example.app");
-  made("com.example.sys", 12);
-  made("com.example.bundle", 1);
-  made("group.example.shared", 7);
+  made("com.example.sys", VSAClass::kSystemData);
+  made("com.example.bundle", VSAClass::kBundleApplication);
+  made("group.example.shared", VSAClass::kAppGroup);
   context_.reset();  // a root at rest, as after a clean stop
   auto before = tree();
   VSARootChecker checker(root_);
@@ -68,7 +68,7 @@ TEST_F(RootChecker, EachKindOfDamageIsFoundWithItsPath) {
   auto copied = made("com.example.copied");
   auto opened = made("com.example.opened");
   auto given = made("com.example.given");
-  auto sys = made("com.example.sys", 12);
+  auto sys = made("com.example.sys", VSAClass::kSystemData);
   std::string classDir = classDirectory();
   std::string orphan = classDir + "/" + VSAUUID::random().string();
   fs::create_directories(orphan + "/Documents");
@@ -89,7 +89,7 @@ TEST_F(RootChecker, EachKindOfDamageIsFoundWithItsPath) {
   put(updates + "/junk.plist", "not a property list");
   VSADataProtectionUpdate ghost;
   ghost.identifier = "com.example.ghost";
-  ghost.containerClass = 2;
+  ghost.containerClass = VSAClass::kDataApplication;
   ghost.protectionClass = 3;
   ghost.internalID = VSAUUID::random();
   ghost.userIdentity = user_;

@@ -77,7 +77,8 @@ TEST_F(Upcall, ALaunchGetsEveryContainerInOrderAndTheyExist) {
   EXPECT_EQ(*a.success, 1u);
   EXPECT_EQ(*a.home, user_->homeDirectoryURL());
   ASSERT_TRUE(a.dataContainer);
-  EXPECT_EQ(fs::path(*a.dataContainer).parent_path(), fs::path(classDirectory(2)));
+  EXPECT_EQ(fs::path(*a.dataContainer).parent_path(),
+            fs::path(classDirectory(VSAClass::kDataApplication)));
   EXPECT_EQ(*a.temporaryDirectory, *a.dataContainer + "/tmp");
   ASSERT_EQ(a.groups.size(), 2u);
   EXPECT_EQ(a.groups[0].first, "group.example.one");
@@ -112,12 +113,15 @@ TEST_F(Upcall, ClassesHomeAndTheContainerIdentifier) {
   std::string plugin = "com.example.plugin";
   ASSERT_EQ(context_->codeSigningMapping->processCodeSigningInfo(
                 VSAValue::Dictionary{{kVSAEntitlementsKey, VSAValue::dictionary()}}, &plugin,
-                VSAValue::Dictionary{{kVSAOptionDataContainerClass, VSAValue(2u)}}, &q),
+                VSAValue::Dictionary{
+                    {kVSAOptionDataContainerClass, VSAValue(VSAClass::kDataApplication)}},
+                &q),
             1u);
   auto p = app("com.example.plugin");
   p.sandboxType = 1;
   ASSERT_EQ(serve(p, &a), 0);
-  EXPECT_EQ(fs::path(*a.dataContainer).parent_path(), fs::path(classDirectory(4)));
+  EXPECT_EQ(fs::path(*a.dataContainer).parent_path(),
+            fs::path(classDirectory(VSAClass::kDataPlugin)));
   // The container identifier wins over the signing identifier.
   p = app("com.example.signer");
   p.containerID = "com.example.container";
@@ -137,7 +141,7 @@ TEST_F(Upcall, AContainerThatCannotBeMadeClearsTheFlagAndStopsPacking) {
   EXPECT_EQ(*a.success, 0u);
   // Nothing is packed once the flag is down, but the flag itself.
   EXPECT_EQ(order, std::vector<uint16_t>{0});
-  EXPECT_FALSE(fs::exists(classDirectory(7) + "/../escape"));
+  EXPECT_FALSE(fs::exists(classDirectory(VSAClass::kAppGroup) + "/../escape"));
 }
 
 TEST_F(Upcall, TheContainersAreLoggedAndAReplyWhoseCopyFailedCarriesNoMemory) {
