@@ -105,7 +105,8 @@ class VSAContainerTestRoot : public ::testing::Test {
     queue.insertCommand(VSACommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
         context_->stageEnvironment, std::move(identities), true, nullptr));
     VSAResultCode code = VSAResult::kSuccess;
-    queue.executeAllUntilExhaustedOrError(&code);
+    bool ok = queue.executeAllUntilExhaustedOrError(&code);
+    EXPECT_EQ(ok, code == VSAResult::kSuccess) << code;
     return code;
   }
   // What a container is made of: each item below it, with its type, mode,

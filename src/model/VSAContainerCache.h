@@ -61,40 +61,42 @@ class VSAContainerCache : public VSAUserIdentityCacheObserver,
   // Makes the cache and registers it as an observer of the user identity cache.
   static std::shared_ptr<VSAContainerCache> create(Dependencies deps);
 
-  VSAMetadataRef containerForContainerIdentity(const VSAContainerIdentity& identity,
-                                               VSACacheOptions options, VSAErrorRef* error);
-  VSAMetadataRef containerForContainerIdentity(const VSAContainerIdentity& identity) {
+  [[nodiscard]] VSAMetadataRef containerForContainerIdentity(const VSAContainerIdentity& identity,
+                                                             VSACacheOptions options,
+                                                             VSAErrorRef* error);
+  [[nodiscard]] VSAMetadataRef containerForContainerIdentity(const VSAContainerIdentity& identity) {
     return containerForContainerIdentity(identity, {}, nullptr);
   }
   // The entries are the maps' own (read-only, never changed once stored):
   // listing a class of 10,000 containers copies no metadata.
-  std::optional<std::vector<VSAConstMetadataRef>> allContainersForUserIdentity(
+  [[nodiscard]] std::optional<std::vector<VSAConstMetadataRef>> allContainersForUserIdentity(
       const VSAUserIdentityRef& user, VSAContainerClass contentClass, VSACacheOptions options,
       VSAErrorRef* error);
-  bool addContainerMetadata(const VSAMetadata& metadata, const std::string& url,
-                            VSACacheOptions options, VSAErrorRef* error);
-  bool removeContainerForUserIdentity(const VSAUserIdentityRef& user,
-                                      VSAContainerClass contentClass, const std::string& identifier,
-                                      bool transient, VSAErrorRef* error);
+  [[nodiscard]] bool addContainerMetadata(const VSAMetadata& metadata, const std::string& url,
+                                          VSACacheOptions options, VSAErrorRef* error);
+  [[nodiscard]] bool removeContainerForUserIdentity(const VSAUserIdentityRef& user,
+                                                    VSAContainerClass contentClass,
+                                                    const std::string& identifier, bool transient,
+                                                    VSAErrorRef* error);
   void invalidateUserIdentity(const VSAUserIdentityRef& user);
   void userIdentityCacheDidInvalidateUserIdentity(VSAUserIdentityCache& cache,
                                                   const VSAUserIdentityRef& identity) override;
 
-  bool shouldRegisterSandboxMappingWithUserIdentity(const VSAUserIdentityRef& user,
-                                                    const std::string& identifier,
-                                                    VSAContainerClass containerClass);
-  bool setSandboxContainerMappingForUserIdentity(const VSAUserIdentityRef& user,
-                                                 const std::string& identifier,
-                                                 VSAContainerClass containerClass,
-                                                 const std::optional<std::string>& url);
+  [[nodiscard]] bool shouldRegisterSandboxMappingWithUserIdentity(const VSAUserIdentityRef& user,
+                                                                  const std::string& identifier,
+                                                                  VSAContainerClass containerClass);
+  [[nodiscard]] bool setSandboxContainerMappingForUserIdentity(
+      const VSAUserIdentityRef& user, const std::string& identifier,
+      VSAContainerClass containerClass, const std::optional<std::string>& url);
 
-  static bool containerURLIsValidForContainerClass(const std::string& url,
-                                                   VSAContainerClass containerClass,
-                                                   const VSAWellknownContainers& wellknown);
+  [[nodiscard]] static bool containerURLIsValidForContainerClass(
+      const std::string& url, VSAContainerClass containerClass,
+      const VSAWellknownContainers& wellknown);
   static std::string cacheKeyForUserIdentity(const VSAUserIdentityRef& user,
                                              VSAContainerClass containerClass);
   // Whether the class map has been built (tests and diagnostics).
-  bool hasClassMap(const VSAUserIdentityRef& user, VSAContainerClass c, bool transient);
+  [[nodiscard]] bool hasClassMap(const VSAUserIdentityRef& user, VSAContainerClass c,
+                                 bool transient);
   // How many containers each built class map holds, by cache key (the state dump).
   struct ClassMapSize {
     std::string key;  // "[user]-class" or the class alone
@@ -113,9 +115,10 @@ class VSAContainerCache : public VSAUserIdentityCacheObserver,
   ClassMap* _lock_getCache(const VSAUserIdentityRef& user, VSAContainerClass c,
                            VSACacheOptions options, bool build, VSAErrorRef* error,
                            bool* built = nullptr);
-  VSAMetadataRef _lock_metadataFromSandbox(const VSAContainerIdentity& identity);
+  [[nodiscard]] VSAMetadataRef _lock_metadataFromSandbox(const VSAContainerIdentity& identity);
   // The on-disk checks done outside the lock; false (and the entry dropped) when stale.
-  bool checkFound(const VSAMetadata& m, const std::string& key, bool transient, VSAErrorRef* error);
+  [[nodiscard]] bool checkFound(const VSAMetadata& m, const std::string& key, bool transient,
+                                VSAErrorRef* error);
 
   Dependencies deps_;
   std::mutex cacheLock_;

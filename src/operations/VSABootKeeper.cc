@@ -21,8 +21,11 @@ void VSABootKeeper::rebootKeeperSetup(const VSAOperationGrants& grants) {
   if (!services_.deviceProperties->multiUserFlagsTopBitSet()) return;
   VSACommandQueue queue;
   services_.groups.reconcileGroupContainersOfType(kVSAGroupTypeApplication, queue);
-  VSAResultCode ignored = VSAResult::kSuccess;
-  queue.executeAllUntilExhaustedOrError(&ignored);
+  VSAResultCode code = VSAResult::kSuccess;
+  if (!queue.executeAllUntilExhaustedOrError(&code))
+    VSALogIn(VSALogCategory::Startup, kVSALogError, "rebootKeeperSetup",
+             "Failed to remove unreferenced application groups: %llu",
+             static_cast<unsigned long long>(code));
 }
 
 void VSABootKeeper::_regenerateAllSystemContainerPaths(const VSAOperationGrants& grants) {
@@ -200,7 +203,9 @@ void VSABootKeeper::_cleanupOrphanedDataForDirectories(const std::vector<std::st
   // One directory on death row for this batch (entries of one class
   // directory have distinct names); an orphan whose move a crash undoes is
   // found again at the next boot, so the moves are not synced.
-  services_.deathRow->_moveEntriesToDeathRowWithoutSync(orphans);
+  if (!services_.deathRow->_moveEntriesToDeathRowWithoutSync(orphans))
+    VSALogIn(VSALogCategory::Startup, kVSALogError, origin,
+             "Some orphans stay in place until the next boot finds them again");
 }
 
 void VSABootKeeper::_cleanupOprhanedCodeSigningMappingData() {

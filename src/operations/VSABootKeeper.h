@@ -51,7 +51,7 @@ class VSABootKeeper {
  private:
   // Whether `url` is there and is no live container of the class; `valid`
   // tells whether its name is valid for the class.
-  bool _isOrphanedEntry(const std::string& url, VSAContainerClass c, bool* valid);
+  [[nodiscard]] bool _isOrphanedEntry(const std::string& url, VSAContainerClass c, bool* valid);
 
   const VSAOperationServices& services_;
 };

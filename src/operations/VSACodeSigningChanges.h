@@ -18,12 +18,12 @@ class VSACodeSigningChanges {
   virtual ~VSACodeSigningChanges() = default;
 
   // Forgets what is cached of `identifier` and of its plug-ins.
-  virtual bool invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier,
-                                                                    VSAErrorRef* error) = 0;
+  [[nodiscard]] virtual bool invalidateCodeSigningInfoForIdentifierAndItsChildren(
+      const std::string& identifier, VSAErrorRef* error) = 0;
   // Removes the records of `identifier` and its plug-ins; what that frees
   // (group containers) is queued on `commandQueue`.
   virtual void removeCodeSigningDictionariesForIdentifierAndItsChildren(
       const std::string& identifier, VSACommandQueue* commandQueue) = 0;
   // Drops every advance copy of a record.
-  virtual bool removeAllAdvanceCopiesWithError(VSAErrorRef* error) = 0;
+  [[nodiscard]] virtual bool removeAllAdvanceCopiesWithError(VSAErrorRef* error) = 0;
 };

@@ -27,7 +27,7 @@ class VSACommand {
   // The number of the request command whose work this is, used in logs.
   virtual VSACommandNumber command() const = 0;
   // Runs the command; on failure stores a code in `error` and returns false.
-  virtual bool fromQueue(VSACommandQueue& queue, VSAResultCode* executeWithError) = 0;
+  [[nodiscard]] virtual bool fromQueue(VSACommandQueue& queue, VSAResultCode* executeWithError) = 0;
 };
 
 class VSACommandQueue {
@@ -36,10 +36,10 @@ class VSACommandQueue {
 
   void insertCommand(std::shared_ptr<VSACommand> command);
   // Runs the oldest command. Without one the code is 77 and the answer NO.
-  bool executeNextCommandWithError(VSAResultCode* error);
+  [[nodiscard]] bool executeNextCommandWithError(VSAResultCode* error);
   // Runs commands until none is left (YES, cell untouched) or one fails (NO,
   // its code in the cell; later commands are not run).
-  bool executeAllUntilExhaustedOrError(VSAResultCode* error);
+  [[nodiscard]] bool executeAllUntilExhaustedOrError(VSAResultCode* error);
   size_t count() const;
   // A snapshot of the pending commands, oldest first.
   std::vector<std::shared_ptr<VSACommand>> pendingCommands() const;

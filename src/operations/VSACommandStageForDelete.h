@@ -32,19 +32,20 @@ class VSACommandStageForDelete : public VSACommand {
                            bool useLocking, ErrorHandler onError);
 
   VSACommandNumber command() const override { return VSACommands::kStageForDelete; }
-  bool fromQueue(VSACommandQueue& queue, VSAResultCode* executeWithError) override;
+  [[nodiscard]] bool fromQueue(VSACommandQueue& queue, VSAResultCode* executeWithError) override;
 
   const std::vector<VSAContainerIdentityRef>& containerIdentities() const { return identities_; }
-  bool useLocking() const { return useLocking_; }
+  [[nodiscard]] bool useLocking() const { return useLocking_; }
 
  private:
   // The cached container an identity names, or null.
-  VSAMetadataRef find(const VSAContainerIdentity& identity) const;
+  [[nodiscard]] VSAMetadataRef find(const VSAContainerIdentity& identity) const;
   // Whether `container` is transient and a permanent container of its
   // identifier and class exists (logged when so).
-  bool hasPermanentTwin(const VSAMetadata& container) const;
+  [[nodiscard]] bool hasPermanentTwin(const VSAMetadata& container) const;
   // Stages one container; false with `code` set when the loop must stop.
-  bool stage(const VSAContainerIdentity& identity, VSACommandQueue& queue, VSAResultCode* code);
+  [[nodiscard]] bool stage(const VSAContainerIdentity& identity, VSACommandQueue& queue,
+                           VSAResultCode* code);
 
   std::shared_ptr<const VSAStageForDeleteEnvironment> environment_;
   std::vector<VSAContainerIdentityRef> identities_;

@@ -54,29 +54,30 @@ class VSAContainerContent {
   // `existed` tells whether it was there before the call. Without
   // `createIfNecessary` a missing directory is not made: its path is
   // answered with `existed` NO.
-  std::optional<std::string> userManagedAssetsPathWithContainerIdentity(
+  [[nodiscard]] std::optional<std::string> userManagedAssetsPathWithContainerIdentity(
       const VSAContainerIdentityRef& identity, bool isRelative, bool createIfNecessary,
       bool* existed, VSAResultCode* withError);
-  bool deleteUserManagedAssetWithContainerIdentity(const VSAContainerIdentityRef& identity,
-                                                   const std::string& relativePath,
-                                                   VSAResultCode* withError);
+  [[nodiscard]] bool deleteUserManagedAssetWithContainerIdentity(
+      const VSAContainerIdentityRef& identity, const std::string& relativePath,
+      VSAResultCode* withError);
   // Answers the destination's absolute path.
-  std::optional<std::string> stageSharedContentForIdentifier(const std::string& identifier,
-                                                             const VSAUserIdentityRef& userIdentity,
-                                                             const std::string& sourceRelativePath,
-                                                             const std::string& destRelativePath,
-                                                             VSAResultCode* withError);
+  [[nodiscard]] std::optional<std::string> stageSharedContentForIdentifier(
+      const std::string& identifier, const VSAUserIdentityRef& userIdentity,
+      const std::string& sourceRelativePath, const std::string& destRelativePath,
+      VSAResultCode* withError);
 
  private:
-  VSAMetadataRef find(const VSAContainerIdentityRef& identity, VSAResultCode* withError);
+  [[nodiscard]] VSAMetadataRef find(const VSAContainerIdentityRef& identity,
+                                    VSAResultCode* withError);
   // The container again, under its lock: 21 when it is not the one found.
-  VSAMetadataRef recheck(const VSAMetadata& found, VSAResultCode* withError);
-  std::optional<std::string> resolve(const std::string& base, const std::string& relativePath,
-                                     const char* origin, VSAResultCode* withError);
+  [[nodiscard]] VSAMetadataRef recheck(const VSAMetadata& found, VSAResultCode* withError);
+  [[nodiscard]] std::optional<std::string> resolve(const std::string& base,
+                                                   const std::string& relativePath,
+                                                   const char* origin, VSAResultCode* withError);
   std::string assetsDirectory(const VSAMetadata& container) const;
-  bool recordAssetsDirectory(VSAMetadata& container, VSAResultCode* withError);
-  bool copyIntoPlace(const VSAMetadata& data, const std::string& source,
-                     const std::string& destination, VSAResultCode* withError);
+  [[nodiscard]] bool recordAssetsDirectory(VSAMetadata& container, VSAResultCode* withError);
+  [[nodiscard]] bool copyIntoPlace(const VSAMetadata& data, const std::string& source,
+                                   const std::string& destination, VSAResultCode* withError);
 
   const VSAOperationServices& services_;
   const VSAOperationGrants& grants_;

@@ -16,13 +16,16 @@ class VSAContainerDirectories {
  public:
   explicit VSAContainerDirectories(const VSAOperationServices& services) : services_(services) {}
 
-  bool _createTopLevelContainerDirectory(const std::string& url, VSAContainerClass containerClass,
-                                         uid_t owner, gid_t group, VSAErrorRef* error);
+  [[nodiscard]] bool _createTopLevelContainerDirectory(const std::string& url,
+                                                       VSAContainerClass containerClass,
+                                                       uid_t owner, gid_t group,
+                                                       VSAErrorRef* error);
   // `durable`: each directory made is synced into its parent before the
   // call returns, for a live container; one built in staging is synced as a
   // whole before the rename that commits it.
-  bool _createSubDirectories(const std::string& url, const VSAMetadata& containerMetadata,
-                             VSAErrorRef* error, bool durable = false);
+  [[nodiscard]] bool _createSubDirectories(const std::string& url,
+                                           const VSAMetadata& containerMetadata, VSAErrorRef* error,
+                                           bool durable = false);
   // The protection class recorded in the metadata, else the one the
   // identifier's entitlements ask for; 0 for global classes.
   int32_t _dataProtectionClassForContainerMetadata(const VSAMetadata& metadata);

@@ -235,9 +235,14 @@ VSAMetadataRef VSAContainerLookup::createOrLookupContainerWithContainerIdentity(
           error = failure(VSAResult::kTransientRemovalFailed, moveError,
                           VSAFormat("Failed to remove transient container at %@", found->url()));
         } else {
-          if (found)
-            services_.containerCache->removeContainerForUserIdentity(
-                found->userIdentity(), found->containerClass(), found->identifier(), true, nullptr);
+          VSAErrorRef cacheError;
+          if (found && !services_.containerCache->removeContainerForUserIdentity(
+                           found->userIdentity(), found->containerClass(), found->identifier(),
+                           true, &cacheError))
+            // The new container's entry takes the old one's place in the map.
+            VSALog(kVSALogError, kOrigin,
+                   "Failed to drop transient container %@ from the cache: %@", found->url(),
+                   cacheError);
           found = steps.create(&error);
         }
       }

@@ -31,28 +31,28 @@ class VSAContainerLookup {
   // The container named by `identity`, created first when it is missing and
   // `createIfNecessary`. A transient container is always made fresh. Takes
   // the all-identifiers lock unless `useLocking` is false.
-  VSAMetadataRef createOrLookupContainerWithContainerIdentity(
+  [[nodiscard]] VSAMetadataRef createOrLookupContainerWithContainerIdentity(
       const VSAContainerIdentityRef& identity, VSALookupOptions options, VSAResultCode* withError);
   // The client's containers of one class (its own user identity), filtered
   // to what its grants let it see.
-  std::optional<std::vector<VSAConstMetadataRef>> containersWithClass(
+  [[nodiscard]] std::optional<std::vector<VSAConstMetadataRef>> containersWithClass(
       VSAContainerClass containerClass, bool transient, VSAResultCode* withError);
   // A live container's metadata, re-read under its identifier read lock.
-  VSAMetadataRef metadataWithContainerIdentity(const VSAContainerIdentityRef& identity,
-                                               VSAResultCode* withError);
+  [[nodiscard]] VSAMetadataRef metadataWithContainerIdentity(
+      const VSAContainerIdentityRef& identity, VSAResultCode* withError);
 
   // The bytes a container takes on disk (the client's lookup access test
   // first; 21 when it does not exist): the file system's statistics when
   // fast sizing is on and available, else a walk of the tree on its device.
-  std::optional<uint64_t> diskUsageWithContainerIdentity(const VSAContainerIdentityRef& identity,
-                                                         VSAResultCode* withError);
+  [[nodiscard]] std::optional<uint64_t> diskUsageWithContainerIdentity(
+      const VSAContainerIdentityRef& identity, VSAResultCode* withError);
 
   // The cached container an identity names, with its transient flag set: a
   // concrete identity names the live or the transient container whose UUID
   // it carries; a plain one the live container of its identifier. No access
   // test, no lock: for operations that hold the lock they need.
-  static VSAMetadataRef containerForIdentity(VSAContainerCache& cache,
-                                             const VSAContainerIdentity& identity);
+  [[nodiscard]] static VSAMetadataRef containerForIdentity(VSAContainerCache& cache,
+                                                           const VSAContainerIdentity& identity);
 
  private:
   const VSAOperationServices& services_;

@@ -24,31 +24,32 @@ class VSAContainerMaintenance {
  public:
   explicit VSAContainerMaintenance(const VSAOperationServices& services) : services_(services) {}
 
-  bool regenerateDirectoryUUIDWithContainerIdentity(const VSAContainerIdentityRef& identity,
-                                                    VSAResultCode* withError);
-  bool recreateDefaultStructureWithContainerIdentity(const VSAContainerIdentityRef& identity,
-                                                     VSAResultCode* withError);
+  [[nodiscard]] bool regenerateDirectoryUUIDWithContainerIdentity(
+      const VSAContainerIdentityRef& identity, VSAResultCode* withError);
+  [[nodiscard]] bool recreateDefaultStructureWithContainerIdentity(
+      const VSAContainerIdentityRef& identity, VSAResultCode* withError);
   // 38 for a key that is not a string; 24 (not logged as an error) when unset.
-  std::optional<VSAValue> infoValueForKey(const VSAValue* key,
-                                          const VSAContainerIdentityRef& containerIdentity,
-                                          bool useLocking, VSAResultCode* withError);
+  [[nodiscard]] std::optional<VSAValue> infoValueForKey(
+      const VSAValue* key, const VSAContainerIdentityRef& containerIdentity, bool useLocking,
+      VSAResultCode* withError);
   // No value removes the key.
-  bool setInfoValue(const VSAValue* value, const VSAValue* forKey,
-                    const VSAContainerIdentityRef& containerIdentity, bool useLocking,
-                    VSAResultCode* withError);
+  [[nodiscard]] bool setInfoValue(const VSAValue* value, const VSAValue* forKey,
+                                  const VSAContainerIdentityRef& containerIdentity, bool useLocking,
+                                  VSAResultCode* withError);
 
  private:
-  VSAMetadataRef find(const VSAContainerIdentityRef& identity, const char* origin,
-                      VSAResultCode* withError);
+  [[nodiscard]] VSAMetadataRef find(const VSAContainerIdentityRef& identity, const char* origin,
+                                    VSAResultCode* withError);
   // find() under the lock keyed by `key`: 21 if the container found is not the one locked.
-  VSAMetadataRef findLocked(const VSAContainerIdentityRef& identity,
-                            const std::optional<std::string>& key, const char* origin,
-                            VSAResultCode* withError);
+  [[nodiscard]] VSAMetadataRef findLocked(const VSAContainerIdentityRef& identity,
+                                          const std::optional<std::string>& key, const char* origin,
+                                          VSAResultCode* withError);
   // The UUID string that keys the container's identifier lock.
-  std::optional<std::string> lockKey(const VSAContainerIdentityRef& identity, const char* origin,
-                                     VSAResultCode* withError);
+  [[nodiscard]] std::optional<std::string> lockKey(const VSAContainerIdentityRef& identity,
+                                                   const char* origin, VSAResultCode* withError);
   // The container's metadata as its file holds it now.
-  VSAMetadataRef reread(const VSAMetadata& cached, const char* origin, VSAResultCode* withError);
+  [[nodiscard]] VSAMetadataRef reread(const VSAMetadata& cached, const char* origin,
+                                      VSAResultCode* withError);
 
   const VSAOperationServices& services_;
 };

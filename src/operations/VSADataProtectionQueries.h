@@ -20,5 +20,6 @@ class VSADataProtectionQueries {
   virtual int32_t intendedDataProtectionClassBasedOnEntitlementsForIdentifier(
       const std::string& identifier) = 0;
   // Restarts the changes persisted before the last stop.
-  virtual bool restartPendingDataProtectionOperationsWithError(VSAErrorRef* error) = 0;
+  [[nodiscard]] virtual bool restartPendingDataProtectionOperationsWithError(
+      VSAErrorRef* error) = 0;
 };

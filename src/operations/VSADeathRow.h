@@ -42,19 +42,20 @@ class VSADeathRow : public std::enable_shared_from_this<VSADeathRow> {
   const VSAWorkQueue::Ref& _sharedBackgroundQueue() const { return backgroundQueue_; }
 
   // A missing item is success and starts nothing; other failures are 41.
-  bool _moveItemAtURLToDeathRow(const std::string& url, VSADeathRowMoveOptions options,
-                                VSAErrorRef* error);
+  [[nodiscard]] bool _moveItemAtURLToDeathRow(const std::string& url,
+                                              VSADeathRowMoveOptions options, VSAErrorRef* error);
   // Moves the entries of one directory (so their names differ) into one
   // fresh directory, without syncs: for orphans found at boot, whose moves
   // are redone if a crash undoes them. Each failure is logged and the others
   // go on; false when any failed.
-  bool _moveEntriesToDeathRowWithoutSync(const std::vector<std::string>& urls);
+  [[nodiscard]] bool _moveEntriesToDeathRowWithoutSync(const std::vector<std::string>& urls);
   // Returns at once; the completion gets the code of the last failure (1 when none).
   // The queued work keeps this object alive until it has run.
   void deleteContainersOnDeathRowWithCompletion(Completion completion);
   // Removes a tree or, failing that, moves it to /tmp.
-  bool _removeItemOrMoveToTempAtURL(const std::string& url, VSAErrorRef* error,
-                                    const VSAFileManager::RemovalObserver& observer = {});
+  [[nodiscard]] bool _removeItemOrMoveToTempAtURL(
+      const std::string& url, VSAErrorRef* error,
+      const VSAFileManager::RemovalObserver& observer = {});
 
   // What death row moved aside and nothing removes: the entries of the
   // root's /tmp named as death-row entries are (a container's UUID, or
@@ -64,7 +65,7 @@ class VSADeathRow : public std::enable_shared_from_this<VSADeathRow> {
     uint64_t bytes = 0;
   };
   static std::vector<Leftover> leftoversInTemp(const VSAGlobalConfiguration& configuration);
-  static bool isDeathRowEntryName(const std::string& name);
+  [[nodiscard]] static bool isDeathRowEntryName(const std::string& name);
 
  private:
   static std::string temporaryDirectory(const VSAGlobalConfiguration& configuration);

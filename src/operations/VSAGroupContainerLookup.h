@@ -26,12 +26,11 @@ class VSAGroupContainerLookup {
   VSAGroupContainerLookup(const VSAOperationServices& services, VSAOperationGrants& grants)
       : services_(services), grants_(grants) {}
 
-  std::optional<Groups> groupContainersForOwnerIdentifier(const std::string& owner,
-                                                          const VSAUserIdentityRef& userIdentity,
-                                                          VSAContainerClass groupContainerClass,
-                                                          VSAResultCode* withError);
+  [[nodiscard]] std::optional<Groups> groupContainersForOwnerIdentifier(
+      const std::string& owner, const VSAUserIdentityRef& userIdentity,
+      VSAContainerClass groupContainerClass, VSAResultCode* withError);
   // The group identifiers alone, with the same access rule.
-  std::optional<std::vector<std::string>> groupContainerIdentifiersForOwnerIdentifier(
+  [[nodiscard]] std::optional<std::vector<std::string>> groupContainerIdentifiersForOwnerIdentifier(
       const std::string& owner, VSAContainerClass groupContainerClass, VSAResultCode* withError);
 
  private:

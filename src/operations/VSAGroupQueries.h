@@ -25,9 +25,10 @@ class VSAGroupQueries {
   // The group identifiers `owner` is entitled to, for group class 7 or 13;
   // nothing (and the code in `withError`) on failure. With `useLocking` the
   // all-identifiers lock is held for writing meanwhile.
-  virtual std::optional<std::vector<std::string>> groupContainerIdentifiersForOwnerIdentifier(
-      const VSAValue* owner, VSAContainerClass groupContainerClass, bool useLocking,
-      VSAResultCode* withError) = 0;
+  [[nodiscard]] virtual std::optional<std::vector<std::string>>
+  groupContainerIdentifiersForOwnerIdentifier(const VSAValue* owner,
+                                              VSAContainerClass groupContainerClass,
+                                              bool useLocking, VSAResultCode* withError) = 0;
   // Queues the deletion of every group container of `groupType` (0
   // application, 1 system) that no identifier references.
   virtual void reconcileGroupContainersOfType(int groupType, VSACommandQueue& commandQueue) = 0;

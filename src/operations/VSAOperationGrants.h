@@ -40,10 +40,12 @@ class VSAOperationGrants {
 
   // The identifiers the lookup entitlement lists for a class (nothing when
   // the client has none, or for a class outside 1-13).
-  std::optional<std::set<std::string>> lookupForContainerClass(VSAContainerClass c) const;
-  bool isEntitledForLookupWithClass(VSAContainerClass c, const std::string& identifier) const;
+  [[nodiscard]] std::optional<std::set<std::string>> lookupForContainerClass(
+      VSAContainerClass c) const;
+  [[nodiscard]] bool isEntitledForLookupWithClass(VSAContainerClass c,
+                                                  const std::string& identifier) const;
   // Whether `identifier` is listed (plainly, as a string) in the wipe list.
-  bool isEntitledToWipe(const std::string& identifier) const;
+  [[nodiscard]] bool isEntitledToWipe(const std::string& identifier) const;
 
  private:
   mutable std::mutex lookupCacheMutex_;

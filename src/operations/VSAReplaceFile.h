@@ -36,12 +36,10 @@ struct VSAReplaceFileInfo {
 class VSAReplaceFile {
  public:
   // 33 when one of the four is missing, 34 when the file cannot be written.
-  static bool _writeToDiskReplaceAt(VSAFileManager& fileManager, const std::string& url,
-                                    const std::optional<std::string>& old,
-                                    const std::optional<std::string>& withNew,
-                                    const std::optional<std::string>& usingStaging,
-                                    const std::optional<std::string>& toDestination,
-                                    VSAErrorRef* error);
-  static std::optional<VSAReplaceFileInfo> _readAndValidateReplaceFileAtUrl(
+  [[nodiscard]] static bool _writeToDiskReplaceAt(
+      VSAFileManager& fileManager, const std::string& url, const std::optional<std::string>& old,
+      const std::optional<std::string>& withNew, const std::optional<std::string>& usingStaging,
+      const std::optional<std::string>& toDestination, VSAErrorRef* error);
+  [[nodiscard]] static std::optional<VSAReplaceFileInfo> _readAndValidateReplaceFileAtUrl(
       VSAFileManager& fileManager, const std::string& url, VSAErrorRef* error);
 };

@@ -32,19 +32,19 @@ class VSAReplaceOperation {
  public:
   explicit VSAReplaceOperation(const VSAOperationServices& services) : services_(services) {}
 
-  bool replaceContainerIdentity(const VSAContainerIdentityRef& oldIdentity,
-                                const VSAContainerIdentityRef& withContainerIdentity,
-                                bool preserveOldUUID, bool startDeletionThread,
-                                VSAResultCode* withError);
+  [[nodiscard]] bool replaceContainerIdentity(const VSAContainerIdentityRef& oldIdentity,
+                                              const VSAContainerIdentityRef& withContainerIdentity,
+                                              bool preserveOldUUID, bool startDeletionThread,
+                                              VSAResultCode* withError);
   // Puts back every old container that a replace file says was moved aside
   // and not replaced, then discards the replace files.
-  bool _recoverFromReplaceOperationsWithError(VSAErrorRef* error);
+  [[nodiscard]] bool _recoverFromReplaceOperationsWithError(VSAErrorRef* error);
   // The staging directories that the replace files still on disk name: the
   // old containers that a recovery could not yet put back (or did not reach)
   // wait there for the next start and must survive the staging cleanup.
   // Nothing when a replace file or the directory cannot be read: then any
   // staging entry may be one of them.
-  std::optional<std::set<std::string>> stagingURLsAwaitingRecovery();
+  [[nodiscard]] std::optional<std::set<std::string>> stagingURLsAwaitingRecovery();
 
  private:
   const VSAOperationServices& services_;

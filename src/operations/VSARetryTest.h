@@ -32,22 +32,22 @@ class VSARetryTest {
   explicit VSARetryTest(const VSAOperationServices& services,
                         std::function<void(const std::string&)> crash = {});
 
-  bool retryTestWithNumCrashes(uint64_t numCrashes, VSAResultCode* withError);
+  [[nodiscard]] bool retryTestWithNumCrashes(uint64_t numCrashes, VSAResultCode* withError);
   // At start: continues a test a crash interrupted; true when none was pending
   // or it finished now.
-  bool resumeRetryTestIfPending(VSAResultCode* withError);
+  [[nodiscard]] bool resumeRetryTestIfPending(VSAResultCode* withError);
 
   struct Journal {
     uint64_t numRetryCrashes = 0;
     uint64_t crashesLeft = 0;
   };
   // The journal on disk; nothing when there is none (or it is invalid: see `withError`).
-  std::optional<Journal> readJournal(VSAResultCode* withError);
+  [[nodiscard]] std::optional<Journal> readJournal(VSAResultCode* withError);
 
  private:
   std::string journalPath();
-  bool writeJournal(const Journal& journal, VSAResultCode* withError);
-  bool attempt(VSAResultCode* withError);
+  [[nodiscard]] bool writeJournal(const Journal& journal, VSAResultCode* withError);
+  [[nodiscard]] bool attempt(VSAResultCode* withError);
 
   const VSAOperationServices& services_;
   std::function<void(const std::string&)> crash_;

@@ -41,14 +41,14 @@ class VSASystemContainerRestore {
 
  private:
   // The restore directory, made root's with mode 0700; nothing when it cannot be.
-  std::optional<std::string> holdingDirectory();
+  [[nodiscard]] std::optional<std::string> holdingDirectory();
   // Renames `backup` to `inProgress` and accepts it there (or an interrupted
   // restore's `inProgress`); true when it is to be restored.
-  bool moveToInProgress(const std::string& backup, const std::string& inProgress,
-                        const char* moveFailure);
+  [[nodiscard]] bool moveToInProgress(const std::string& backup, const std::string& inProgress,
+                                      const char* moveFailure);
   // Whether the backup now at `inProgress` (shown in logs as `shownAs`) may
   // be restored; gives it to root when so, removes it when not.
-  bool acceptBackup(const std::string& inProgress, const std::string& shownAs);
+  [[nodiscard]] bool acceptBackup(const std::string& inProgress, const std::string& shownAs);
   void installAll(const std::string& inProgress, VSAContainerClass c, const char* listFailure);
   // "<inProgress>.restored", written once every entry of `inProgress` was
   // restored: an in-progress directory beside it is a completed restore

@@ -59,7 +59,8 @@ class Groups : public VSAContainerTestRoot {
   }
   static VSAResultCode run(VSACommandQueue& q) {
     VSAResultCode code = VSAResult::kSuccess;
-    q.executeAllUntilExhaustedOrError(&code);
+    bool ok = q.executeAllUntilExhaustedOrError(&code);
+    EXPECT_EQ(ok, code == VSAResult::kSuccess) << code;
     return code;
   }
   VSAUserIdentityRef work_;

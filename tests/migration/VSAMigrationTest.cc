@@ -35,7 +35,8 @@ class Migration : public VSAContainerTestRoot {
     bool ok = context_->containerMigrator->performDataMigratorMigrationForClientConnection(
         VSAMigrationClient{}, queue, nullptr);
     VSAResultCode code = VSAResult::kSuccess;
-    queue.executeAllUntilExhaustedOrError(&code);
+    bool executed = queue.executeAllUntilExhaustedOrError(&code);
+    EXPECT_EQ(executed, code == VSAResult::kSuccess) << code;
     return ok;
   }
   std::optional<VSACodeSigningEntry> entry(const std::string& id) {

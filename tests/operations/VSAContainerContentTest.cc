@@ -266,12 +266,12 @@ TEST_F(ContainerContent, TheRetryTestCountsItsCrashesAcrossStarts) {
   EXPECT_TRUE(retry.retryTestWithNumCrashes(0, &code));  // nothing to crash for
   EXPECT_FALSE(retry.readJournal(&code));
 
-  EXPECT_THROW(retry.retryTestWithNumCrashes(2, &code), Crashed);
+  EXPECT_THROW((void)retry.retryTestWithNumCrashes(2, &code), Crashed);
   auto journal = retry.readJournal(&code);
   ASSERT_TRUE(journal);
   EXPECT_EQ(journal->numRetryCrashes, 2u);
   EXPECT_EQ(journal->crashesLeft, 1u);  // counted before it crashed
-  EXPECT_THROW(VSARetryTest(services, crash).resumeRetryTestIfPending(&code), Crashed);
+  EXPECT_THROW((void)VSARetryTest(services, crash).resumeRetryTestIfPending(&code), Crashed);
   EXPECT_EQ(retry.readJournal(&code)->crashesLeft, 0u);
   EXPECT_TRUE(VSARetryTest(services, crash).resumeRetryTestIfPending(&code));
   EXPECT_FALSE(retry.readJournal(&code));
