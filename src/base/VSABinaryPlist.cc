@@ -13,9 +13,17 @@ namespace {
 
 // ---- UTF-8 / UTF-16 -------------------------------------------------------
 
+// Eight bytes at a time: paths and identifiers are long and almost always ASCII.
 bool isASCII(const std::string& s) {
-  for (unsigned char c : s)
-    if (c >= 0x80) return false;
+  const char* p = s.data();
+  size_t n = s.size(), i = 0;
+  for (; i + 8 <= n; i += 8) {
+    uint64_t w;
+    std::memcpy(&w, p + i, 8);
+    if (w & 0x8080808080808080ull) return false;
+  }
+  for (; i < n; ++i)
+    if (static_cast<unsigned char>(p[i]) >= 0x80) return false;
   return true;
 }
 
@@ -73,7 +81,7 @@ class Encoder {
     refSize_ = count <= 0xFF ? 1 : count <= 0xFFFF ? 2 : 4;
     // Grown once: markers, counts, references and offsets take at most this
     // much beside the payload (a UTF-16 string at most twice its bytes).
-    out_.reserve(8 + 2 * payloadBytes_ + count * (18 + 2 * refSize_) + 32);
+    out_.reserve(4 + 8 + 2 * payloadBytes_ + count * (18 + 2 * refSize_) + 32);
     out_ = {'b', 'p', 'l', 'i', 's', 't', '0', '0'};
     std::vector<uint64_t> offsets;
     offsets.reserve(count);
@@ -138,6 +146,7 @@ class Encoder {
     }
   }
   void writeBE(uint64_t v, int size) {
+    if (size == 1) return out_.push_back(static_cast<uint8_t>(v));  // most references
     size_t at = out_.size();
     out_.resize(at + static_cast<size_t>(size));
     putBE(out_.data() + at, v, size);

@@ -132,7 +132,7 @@ void VSARelayDispatcher::processRelayEvent(const VSAIPCMessageRef& message) {
     return;
   reply->set(kVSAReplyErrorKey, VSAValue(result));
   VSAErrorRef error;
-  if (!message->sendReply(*reply, &error)) {
+  if (!message->sendReply(std::move(*reply), &error)) {
     VSALogIn(VSALogCategory::Relay, kVSALogError, kOrigin,
              "Failed to send reply for command %llu: %@", command, error);
   }

@@ -16,10 +16,11 @@ std::optional<std::vector<uint8_t>> VSAFrameCodec::encode(const VSAValue& messag
     return std::nullopt;
   }
   uint32_t n = static_cast<uint32_t>(payload->size());
-  std::vector<uint8_t> frame = {static_cast<uint8_t>(n >> 24), static_cast<uint8_t>(n >> 16),
-                                static_cast<uint8_t>(n >> 8), static_cast<uint8_t>(n)};
-  frame.insert(frame.end(), payload->begin(), payload->end());
-  return frame;
+  const uint8_t header[4] = {static_cast<uint8_t>(n >> 24), static_cast<uint8_t>(n >> 16),
+                             static_cast<uint8_t>(n >> 8), static_cast<uint8_t>(n)};
+  // In place: the encoder leaves room, so the header costs no second buffer.
+  payload->insert(payload->begin(), header, header + 4);
+  return payload;
 }
 
 std::optional<VSAValue> VSAFrameCodec::decodePayload(const uint8_t* bytes, size_t length,

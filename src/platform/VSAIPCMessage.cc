@@ -23,10 +23,10 @@ std::optional<VSAValue> VSAIPCMessage::createReply() const {
   return replyContext_->createReply();
 }
 
-bool VSAIPCMessage::sendReply(const VSAValue& reply, VSAErrorRef* error) {
+bool VSAIPCMessage::sendReply(VSAValue reply, VSAErrorRef* error) {
   if (!replyContext_) {
     VSASetError(error, VSA_ERROR(VSAResult::kInvalidArgument, "No reply context for this message"));
     return false;
   }
-  return replyContext_->sendReply(reply, error);
+  return replyContext_->sendReply(std::move(reply), error);
 }

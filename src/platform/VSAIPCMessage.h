@@ -38,7 +38,8 @@ class VSAIPCMessage {
   std::optional<VSAValue> createReply() const;
   // Sends the reply; false (and nothing sent) when a reply was already sent,
   // there is no reply context, or the peer is gone.
-  bool sendReply(const VSAValue& reply, VSAErrorRef* error = nullptr);
+  // Taken by value: a caller done with its reply moves it in, and no copy is made.
+  bool sendReply(VSAValue reply, VSAErrorRef* error = nullptr);
   bool replied() const { return replyContext_ && replyContext_->replied(); }
 
  private:

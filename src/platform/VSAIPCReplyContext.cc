@@ -17,14 +17,13 @@ VSAValue VSAIPCReplyContext::createReply() const {
   return reply;
 }
 
-bool VSAIPCReplyContext::sendReply(const VSAValue& reply, VSAErrorRef* error) {
+bool VSAIPCReplyContext::sendReply(VSAValue reply, VSAErrorRef* error) {
   if (replied_.exchange(true)) {
     VSASetError(error, VSA_ERROR(VSAResult::kInvalidArgument, "This request was already answered"));
     return false;
   }
-  VSAValue out = reply;
-  if (messageID_) out.set(kVSAMessageIDKey, *messageID_);
-  bool ok = connection_->send(out, error);
+  if (messageID_) reply.set(kVSAMessageIDKey, *messageID_);
+  bool ok = connection_->send(reply, error);
   // Answered: the request no longer holds the daemon or counts as in flight.
   transaction_.reset();
   inFlight_.reset();

@@ -35,7 +35,8 @@ class VSAIPCReplyContext {
   VSAValue createReply() const;
   // Sends the reply (with the request's "MessageID"); false (and nothing
   // sent) when a reply was already sent or the peer is gone.
-  bool sendReply(const VSAValue& reply, VSAErrorRef* error = nullptr);
+  // Taken by value: the message ID is added to it in place.
+  bool sendReply(VSAValue reply, VSAErrorRef* error = nullptr);
   bool replied() const { return replied_.load(); }
 
  private:
