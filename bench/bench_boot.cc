@@ -41,7 +41,23 @@ double seconds(Clock::time_point from) {
   return std::chrono::duration<double>(Clock::now() - from).count();
 }
 
-// Containers across four classes, made through the daemon's own creation path.
+// Two personas: the personal one and an enterprise one with its own layout,
+// in which one app of five keeps its per-user containers.
+void writePersonas(const std::string& root) {
+  VSAValue personas = VSAValue::Array{
+      VSAValue::Dictionary{{"PersonaID", VSAValue(1000u)},
+                           {"Kind", VSAValue("personal")},
+                           {"UniqueString", VSAValue("PERSONAL-1000")}},
+      VSAValue::Dictionary{{"PersonaID", VSAValue(1001u)},
+                           {"Kind", VSAValue("enterprise")},
+                           {"UniqueString", VSAValue("WORK-1001")},
+                           {"LayoutPath", VSAValue("/private/var/enterprise/1001")}}};
+  fs::create_directories(root + "/private/var/enterprise/1001");
+  VSA_writeToURL(personas, root + "/etc/vessad/personas.plist", 0, nullptr);
+}
+
+// Containers of ten classes' mix, a fifth of the per-user ones in the
+// enterprise persona, made through the daemon's own creation path.
 std::vector<std::string> populate(const std::string& root, int containers, int orphans) {
   fs::create_directories(root + "/etc");
   fs::create_directories(root + "/private/var/mobile");
@@ -52,12 +68,19 @@ std::vector<std::string> populate(const std::string& root, int containers, int o
   VSA_writeToURL(
       VSAValue::Dictionary{{"BuildVersion", VSAValue("BENCH1")}, {"ReleaseType", VSAValue("User")}},
       root + "/etc/vessad/system-version.plist", 0, nullptr);
+  writePersonas(root);
   VSADaemonContext context{VSASystemRoot(root)};
   VSAMigrationStatus::initForSystemMigration(*context.globalConfiguration,
                                              root + "/etc/vessad/system-version.plist")
       ->writeCurrentBuildInfoToDisk();
   auto connection = VSAClientConnection::sharedClientConnection(context);
   auto user = context.userIdentityCache->defaultUserIdentity();
+  auto work = context.userIdentityCache->userIdentityForPersonaUniqueString(
+      std::string("WORK-1001"), 501, 501);
+  if (!work) {
+    std::fprintf(stderr, "bench_boot: no enterprise persona\n");
+    std::exit(1);
+  }
   using namespace VSAClass;
   const VSAContainerClass classes[] = {kDataApplication,   kDataApplication,   kDataApplication,
                                        kDataPlugin,        kDataPlugin,        kAppGroup,
@@ -66,8 +89,9 @@ std::vector<std::string> populate(const std::string& root, int containers, int o
   std::vector<std::string> classDirectories;
   for (int i = 0; i < containers; ++i) {
     VSAContainerClass c = classes[i % 10];
+    bool enterprise = VSAContainerClassIsPerUser(c) && (i / 10) % 5 == 4;
     auto identity = VSAContainerIdentity::containerIdentityWithUserIdentity(
-        user, "com.bench.app" + std::to_string(i), c, nullptr);
+        enterprise ? work : user, "com.bench.app" + std::to_string(i), c, nullptr);
     VSAResultCode code = VSAResult::kSuccess;
     if (!connection->createOrLookupContainerWithContainerIdentity(
             identity, {.createIfNecessary = true}, &code)) {
@@ -76,9 +100,13 @@ std::vector<std::string> populate(const std::string& root, int containers, int o
     }
   }
   for (VSAContainerClass c : {kBundleApplication, kDataApplication, kDataPlugin, kDataVPNPlugin,
-                              kAppGroup, kDataInternalDaemon})
+                              kAppGroup, kDataInternalDaemon}) {
     classDirectories.push_back(
         *context.globalConfiguration->containerDirectoryURLForUserIdentity(user, c, false));
+    if (VSAContainerClassIsPerUser(c))
+      classDirectories.push_back(
+          *context.globalConfiguration->containerDirectoryURLForUserIdentity(work, c, false));
+  }
   for (int i = 0; i < orphans; ++i) {
     std::string dir = classDirectories[i % classDirectories.size()] + "/" +
                       (i % 4 ? VSAUUID::random().string() : "stray-" + std::to_string(i));

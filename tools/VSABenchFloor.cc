@@ -11,7 +11,8 @@
 
 extern char** environ;
 
-VSABenchFloor::VSABenchFloor(const std::string& program, const std::string& kind) {
+VSABenchFloor::VSABenchFloor(const std::string& program,
+                             const std::vector<std::string>& arguments) {
   std::string dir = "/tmp/vessa-floor-XXXXXX";
   if (!mkdtemp(dir.data())) return;
   directory_ = dir;
@@ -27,10 +28,13 @@ VSABenchFloor::VSABenchFloor(const std::string& program, const std::string& kind
   posix_spawn_file_actions_init(&actions);
   posix_spawn_file_actions_adddup2(&actions, in[0], STDIN_FILENO);
   posix_spawn_file_actions_adddup2(&actions, out[1], STDOUT_FILENO);
-  std::string kindArg = kind;
-  char* argv[] = {const_cast<char*>(program.c_str()), kindArg.data(), socket_.data(), nullptr};
+  std::vector<std::string> words = {program, arguments.at(0), socket_};
+  words.insert(words.end(), arguments.begin() + 1, arguments.end());
+  std::vector<char*> argv;
+  for (std::string& w : words) argv.push_back(w.data());
+  argv.push_back(nullptr);
   pid_t pid = -1;
-  int rc = posix_spawn(&pid, program.c_str(), &actions, nullptr, argv, environ);
+  int rc = posix_spawn(&pid, program.c_str(), &actions, nullptr, argv.data(), environ);
   posix_spawn_file_actions_destroy(&actions);
   close(in[0]);
   close(out[1]);

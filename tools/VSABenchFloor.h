@@ -7,11 +7,13 @@
 #include <sys/types.h>
 
 #include <string>
+#include <vector>
 
 class VSABenchFloor {
  public:
-  // `kind` is "stream" or "seqpacket"; `program` the vessa-floor binary.
-  VSABenchFloor(const std::string& program, const std::string& kind);
+  // `arguments`: "stream" or "seqpacket", then what follows the socket on
+  // vessa-floor's command line; `program` the vessa-floor binary.
+  VSABenchFloor(const std::string& program, const std::vector<std::string>& arguments);
   ~VSABenchFloor();
   VSABenchFloor(const VSABenchFloor&) = delete;
   VSABenchFloor& operator=(const VSABenchFloor&) = delete;

@@ -1,9 +1,17 @@
 // vessa-floor: the least work that could answer a request, as a process of
 // its own, for the benchmarks' floors. It links nothing of vessad.
 //
-//   vessa-floor stream SOCKET      frames (4-byte big-endian length + body)
+//   vessa-floor stream SOCKET [PATH]
+//                                  frames (4-byte big-endian length + body)
 //                                  on a Unix stream socket, each sent back
-//                                  as it came
+//                                  as it came; with PATH, each frame first
+//                                  gets the checks every request of the
+//                                  daemon needs: a look for a connection
+//                                  waiting to be accepted, a look at the
+//                                  peer's executable (it must not have
+//                                  exec'd since it connected) and a look,
+//                                  without following links, at PATH (the
+//                                  container's metadata file is still there)
 //   vessa-floor seqpacket SOCKET   packets on a Unix seqpacket socket, each
 //                                  with one descriptor of memory (a memfd):
 //                                  the packet goes back with a new memfd
@@ -14,9 +22,12 @@
 // It writes "ready" on standard output once it listens, and runs until it is
 // killed or its standard input closes.
 #include <fcntl.h>
+#include <linux/openat2.h>
+#include <poll.h>
 #include <sys/mman.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/un.h>
 #include <unistd.h>
 
@@ -29,6 +40,11 @@
 #include <vector>
 
 namespace {
+
+int gListener = -1;
+const char* gCheckPath = nullptr;  // stream with checks: the path looked at per frame
+
+void serveStream(int fd);
 
 bool readFully(int fd, void* buffer, size_t size) {
   auto* p = static_cast<uint8_t*>(buffer);
@@ -54,8 +70,37 @@ bool writeFully(int fd, const void* buffer, size_t size) {
   return true;
 }
 
+// The per-request checks of the daemon, by the same system calls.
+bool checkRequest(int processDirectory) {
+  int waiting = accept4(gListener, nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK);
+  if (waiting >= 0) std::thread(serveStream, waiting).detach();
+  struct stat st {};
+  if (processDirectory >= 0 && fstatat(processDirectory, "exe", &st, 0) != 0) return false;
+  open_how how{};
+  how.flags = O_PATH | O_NOFOLLOW | O_CLOEXEC;
+  how.resolve = RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS;
+  long found = syscall(SYS_openat2, AT_FDCWD, gCheckPath, &how, sizeof how);
+  if (found < 0) return false;
+  close(static_cast<int>(found));
+  return true;
+}
+
+// The peer's /proc directory, opened once per connection as the daemon does.
+int processDirectoryOf(int fd) {
+  ucred peer{};
+  socklen_t length = sizeof peer;
+  if (getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &peer, &length) != 0) return -1;
+  std::string dir = "/proc/" + std::to_string(peer.pid);
+  return open(dir.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC);
+}
+
 // Frames back as they came: the header, then the body, then one write.
 void serveStream(int fd) {
+  if (gCheckPath) {
+    int flags = fcntl(fd, F_GETFL);
+    fcntl(fd, F_SETFL, flags & ~O_NONBLOCK);
+  }
+  int processDirectory = gCheckPath ? processDirectoryOf(fd) : -1;
   std::vector<uint8_t> frame;
   for (;;) {
     uint8_t header[4];
@@ -65,9 +110,11 @@ void serveStream(int fd) {
     if (length > (1u << 24)) break;
     frame.resize(4 + length);
     std::memcpy(frame.data(), header, 4);
-    if (!readFully(fd, frame.data() + 4, length) || !writeFully(fd, frame.data(), frame.size()))
-      break;
+    if (!readFully(fd, frame.data() + 4, length)) break;
+    if (gCheckPath && !checkRequest(processDirectory)) break;
+    if (!writeFully(fd, frame.data(), frame.size())) break;
   }
+  if (processDirectory >= 0) close(processDirectory);
   close(fd);
 }
 
@@ -127,21 +174,28 @@ void serveSeqpacket(int fd) {
 }
 
 int usage() {
-  std::fprintf(stderr, "usage: vessa-floor stream|seqpacket SOCKET\n");
+  std::fprintf(stderr, "usage: vessa-floor stream SOCKET [PATH] | seqpacket SOCKET\n");
   return 2;
 }
 }  // namespace
 
 int main(int argc, char** argv) {
-  if (argc != 3) return usage();
+  if (argc != 3 && argc != 4) return usage();
   std::string kind = argv[1];
   bool stream = kind == "stream";
   if (!stream && kind != "seqpacket") return usage();
+  if (argc == 4) {
+    if (!stream) return usage();
+    gCheckPath = argv[3];
+  }
   sockaddr_un address{};
   address.sun_family = AF_UNIX;
   if (std::strlen(argv[2]) >= sizeof address.sun_path) return usage();
   std::strcpy(address.sun_path, argv[2]);
-  int listener = socket(AF_UNIX, (stream ? SOCK_STREAM : SOCK_SEQPACKET) | SOCK_CLOEXEC, 0);
+  // Non-blocking, so that a request's look for a waiting connection never waits.
+  int listener =
+      socket(AF_UNIX, (stream ? SOCK_STREAM : SOCK_SEQPACKET) | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
+  gListener = listener;
   unlink(argv[2]);
   if (listener < 0 || bind(listener, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0 ||
       listen(listener, 64) != 0) {
@@ -158,9 +212,14 @@ int main(int argc, char** argv) {
   std::printf("ready\n");
   std::fflush(stdout);
   for (;;) {
+    pollfd ready{listener, POLLIN, 0};
+    if (poll(&ready, 1, -1) < 0 && errno != EINTR) {
+      std::perror("vessa-floor: poll");
+      return 1;
+    }
     int fd = accept4(listener, nullptr, nullptr, SOCK_CLOEXEC);
     if (fd < 0) {
-      if (errno == EINTR || errno == ECONNABORTED) continue;
+      if (errno == EINTR || errno == ECONNABORTED || errno == EAGAIN) continue;
       std::perror("vessa-floor: accept");
       return 1;
     }
