@@ -72,7 +72,7 @@ const VSAValue::Dictionary* VSAValue::dictionaryValue() const {
 VSAValue::Array* VSAValue::mutableArray() { return std::get_if<Array>(&v_); }
 VSAValue::Dictionary* VSAValue::mutableDictionary() { return std::get_if<Dictionary>(&v_); }
 
-const VSAValue* VSAValue::get(const std::string& key) const {
+const VSAValue* VSAValue::get(std::string_view key) const {
   auto d = dictionaryValue();
   if (!d) return nullptr;
   auto it = d->find(key);

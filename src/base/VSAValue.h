@@ -13,6 +13,7 @@
 #include <map>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <variant>
 #include <vector>
 
@@ -30,7 +31,10 @@ class VSAValue {
  public:
   enum class Type { Null, Bool, Int, UInt, Real, String, Data, Date, UUID, Array, Dictionary };
   using Array = std::vector<VSAValue>;
-  using Dictionary = std::map<std::string, VSAValue>;
+  // Transparent comparison: a key given as text or a view is looked up
+  // without building a string (most keys are longer than the short-string
+  // buffer, so each look-up would allocate).
+  using Dictionary = std::map<std::string, VSAValue, std::less<>>;
   using Data = std::vector<uint8_t>;
 
   VSAValue() = default;
@@ -79,7 +83,7 @@ class VSAValue {
   Dictionary* mutableDictionary();
 
   // Dictionary helpers; `get` answers null for a missing key or a non-dictionary.
-  const VSAValue* get(const std::string& key) const;
+  const VSAValue* get(std::string_view key) const;
   void set(const std::string& key, VSAValue value);  // turns a null value into a dictionary
   bool remove(const std::string& key);
   // Array helper; turns a null value into an array.
