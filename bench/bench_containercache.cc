@@ -1,7 +1,13 @@
-// Building one class map of 10,000 containers (metadata validation, the
-// class-path check, directory-name checks) against reading and parsing the
-// same 10,000 metadata files raw. Target: at least 0.3x. Prints the peak
-// resident set size after the build and what it grew by.
+// Building one class map of 10,000 containers (listing the class directory,
+// directory-name checks, metadata validation, the class-path check, the
+// identity and metadata objects, the map) against reading and parsing the
+// same 10,000 metadata files raw, each opened by its path. Target: at least
+// 0.8x. The map's build opens each file relative to the class directory's
+// descriptor; a second raw loop that does the same is reported beside it
+// (not judged), so the share of the ratio that comes from the cheaper open
+// is visible. Prints the peak resident set size after the build and what it
+// grew by.
+#include <fcntl.h>
 #include <sys/resource.h>
 
 #include <cstdio>
@@ -26,6 +32,8 @@ struct Device {
   std::shared_ptr<VSAUserIdentityCache> identities;
   VSAUserIdentityRef user;
   std::vector<std::string> files;
+  std::string classDirectory;
+  std::vector<std::string> relativeFiles;  // the same files, relative to classDirectory
 
   Device() {
     char tmpl[] = "/tmp/vessa-bench-cache-XXXXXX";
@@ -43,6 +51,7 @@ struct Device {
     user = identities->userIdentityForPersonalPersona();
     std::string base =
         *config->containerDirectoryURLForUserIdentity(user, VSAClass::kDataApplication, false);
+    classDirectory = base;
     for (int i = 0; i < kContainers; ++i) {
       VSAUUID uuid = VSAUUID::random();
       std::string dir = base + "/" + uuid.string();
@@ -53,6 +62,7 @@ struct Device {
       VSAMetadata m(identity, std::nullopt, dir, std::nullopt);
       auto bytes = VSAPlist::serialize(m.plist(), VSAPlist::Format::Binary, nullptr);
       files.push_back(dir + "/" + kVSAMetadataFileName);
+      relativeFiles.push_back(uuid.string() + "/" + kVSAMetadataFileName);
       std::ofstream(files.back(), std::ios::binary)
           .write(reinterpret_cast<const char*>(bytes->data()), bytes->size());
     }
@@ -115,6 +125,21 @@ void BM_RawMetadataReads(benchmark::State& state) {
 }
 BENCHMARK(BM_RawMetadataReads)->Unit(benchmark::kMillisecond);
 
+void BM_RawMetadataReadsRelative(benchmark::State& state) {
+  for (auto _ : state) {
+    int dir = ::open(device().classDirectory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    size_t n = 0;
+    std::vector<uint8_t> bytes;
+    for (const auto& f : device().relativeFiles)
+      if (VSAReadRegularFileAt(dir, f, kVSADefaultReadFileLimit, &bytes) == 0 &&
+          VSAPlist::parse(bytes, nullptr))
+        ++n;
+    ::close(dir);
+    benchmark::DoNotOptimize(n);
+  }
+}
+BENCHMARK(BM_RawMetadataReadsRelative)->Unit(benchmark::kMillisecond);
+
 void BM_BuildClassMap(benchmark::State& state) {
   for (auto _ : state) {
     auto cache = device().freshCache();
@@ -144,5 +169,7 @@ int main(int argc, char** argv) {
   }
   return VSARunWithRatios(
       argc, argv,
-      {{"BM_BuildClassMap", "BM_RawMetadataReads", 0.8, "class map of 10,000 containers"}});
+      {{"BM_BuildClassMap", "BM_RawMetadataReads", 0.8, "class map of 10,000 containers"},
+       {"BM_BuildClassMap", "BM_RawMetadataReadsRelative", 0.0,
+        "class map (raw reads relative to the dir)"}});
 }

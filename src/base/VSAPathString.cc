@@ -23,10 +23,15 @@ std::string stringWithFileSystemRepresentation(const char* bytes, size_t length)
 }
 
 std::string VSAPathJoin(std::string_view base, std::string_view component) {
-  std::string out(base);
   while (!component.empty() && component.front() == '/') component.remove_prefix(1);
-  if (out.empty() || out.back() != '/') out += '/';
-  out += component;
+  const bool slash = base.empty() || base.back() != '/';
+  // One allocation of the final size: joins run once per container when a
+  // class directory is read.
+  std::string out;
+  out.reserve(base.size() + (slash ? 1 : 0) + component.size());
+  out.append(base);
+  if (slash) out += '/';
+  out.append(component);
   return out;
 }
 

@@ -422,6 +422,11 @@ int VSAMakeDirectories(const std::string& path, mode_t mode) {
 
 int VSAReadRegularFile(const std::string& path, size_t limit, std::vector<uint8_t>* bytes,
                        struct stat* status) {
+  return VSAReadRegularFileAt(AT_FDCWD, path, limit, bytes, status);
+}
+
+int VSAReadRegularFileAt(int dir, const std::string& path, size_t limit,
+                         std::vector<uint8_t>* bytes, struct stat* status) {
   bytes->clear();
   // O_NONBLOCK: opening a FIFO for reading would otherwise wait for a writer
   // for ever. It changes nothing for the regular files read below.
@@ -429,10 +434,14 @@ int VSAReadRegularFile(const std::string& path, size_t limit, std::vector<uint8_
   // for a link must not make the daemon read from elsewhere.
   struct open_how how {};
   how.flags = O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY;
-  how.resolve = RESOLVE_NO_SYMLINKS;
-  int fd = static_cast<int>(::syscall(SYS_openat2, AT_FDCWD, path.c_str(), &how, sizeof how));
-  if (fd < 0 && errno == ENOSYS)
-    fd = ::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY);
+  how.resolve = RESOLVE_NO_SYMLINKS | (dir == AT_FDCWD ? 0 : RESOLVE_BENEATH);
+  int fd = static_cast<int>(::syscall(SYS_openat2, dir, path.c_str(), &how, sizeof how));
+  if (fd < 0 && errno == ENOSYS) {
+    // Without openat2, "beneath" is kept by refusing what could leave `dir`.
+    if (dir != AT_FDCWD && (path.starts_with('/') || path.find("..") != std::string::npos))
+      return EXDEV;
+    fd = ::openat(dir, path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY);
+  }
   if (fd < 0) return errno;
   struct stat st;
   int rc = 0;

@@ -82,9 +82,9 @@ std::optional<VSAValue> VSA_dictionaryWithContentsOfURL(const std::string& path,
 
 // Writes `bytes` to `path` atomically and durably (temporary file, fsync,
 // rename, fsync of the directory), all through the file's directory opened
-// without following a link on the way (ELOOP if there is one). Without `sync`: neither fsync, and an
-// existing regular file is replaced by swapping the names, which leaves the
-// new data to ordinary writeback instead of flushing it at once.
+// without following a link on the way (ELOOP if there is one). Without `sync`: neither fsync, and
+// an existing regular file is replaced by swapping the names, which leaves the new data to ordinary
+// writeback instead of flushing it at once.
 bool VSAWriteFileAtomically(const std::string& path, const std::vector<uint8_t>& bytes, mode_t mode,
                             VSAErrorRef* error, bool sync = true);
 // mkdir -p: creates `path` and its missing parents (parents 0755, `path`
@@ -104,6 +104,10 @@ int VSAMakeDirectories(const std::string& path, mode_t mode = 0755);
 // fstat of the descriptor that was read.
 int VSAReadRegularFile(const std::string& path, size_t limit, std::vector<uint8_t>* bytes,
                        struct stat* status = nullptr);
+// The same for `path` relative to the open directory `dir` (or AT_FDCWD):
+// with a directory, the path must also resolve beneath it (EXDEV otherwise).
+int VSAReadRegularFileAt(int dir, const std::string& path, size_t limit,
+                         std::vector<uint8_t>* bytes, struct stat* status = nullptr);
 // VSAReadRegularFile with its errno as a POSIX-domain error.
 std::optional<std::vector<uint8_t>> VSAReadFile(const std::string& path, VSAErrorRef* error,
                                                 size_t limit = kVSADefaultReadFileLimit);

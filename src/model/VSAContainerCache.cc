@@ -73,6 +73,15 @@ std::vector<VSAContainerCache::ClassMapSize> VSAContainerCache::classMapSizes() 
   return sizes;
 }
 
+void VSAContainerCache::putEntry(ClassMap& map, VSAConstMetadataRef metadata) {
+  const std::string_view key = metadata->identifier();  // lives as long as `metadata`
+  auto [it, inserted] = map.try_emplace(key, std::move(metadata));
+  if (inserted) return;
+  // The old key views the old entry's identifier: both go together.
+  map.erase(it);
+  map.emplace(key, std::move(metadata));
+}
+
 VSAContainerCache::ClassMap* VSAContainerCache::_lock_getCache(const VSAUserIdentityRef& user,
                                                                VSAContainerClass c,
                                                                VSACacheOptions options, bool build,
@@ -94,21 +103,25 @@ VSAContainerCache::ClassMap* VSAContainerCache::_lock_getCache(const VSAUserIden
                                   transientTag(transient), c));
     return nullptr;
   }
-  auto items = config.fileManager().urlsForItemsInDirectoryAtURL(*dir, error);
+  // Listed and read through one descriptor of the class directory.
+  VSAUniqueFd classDir;
+  auto items = config.fileManager().urlsForItemsInDirectoryAtURL(*dir, &classDir, error);
   if (!items) return nullptr;
   ClassMap map;
   map.reserve(items->size());
-  for (const auto& item : *items) {
+  for (auto& item : *items) {
     if (!containerURLIsValidForContainerClass(item.path, c, *deps_.wellknown)) continue;
     VSAErrorRef readError;
-    auto m = VSAMetadata::readAndValidateMetadataAtUrl(item.path, user, true, config,
-                                                       *deps_.userIdentityCache, &readError);
+    // The path moves into the metadata (the error names the file if it fails).
+    auto m = VSAMetadata::readAndValidateMetadataOfEntry(classDir.get(), std::move(item.path), user,
+                                                         true, config, *deps_.userIdentityCache,
+                                                         &readError);
     // A map without a container that is there would let the next creation
     // make it a second time: a read the system failed fails the rebuild.
     if (!m && VSAMetadata::isTransientReadFailure(readError)) {
       VSASetError(error,
-                  cacheError(VSAResult::kCacheRebuildFailed, "Cache: %@%@: could not read %@: %@",
-                             key, transientTag(transient), item.path, readError));
+                  cacheError(VSAResult::kCacheRebuildFailed, "Cache: %@%@: could not read: %@", key,
+                             transientTag(transient), readError));
       return nullptr;
     }
     if (!m) continue;
@@ -119,7 +132,7 @@ VSAContainerCache::ClassMap* VSAContainerCache::_lock_getCache(const VSAUserIden
       VSALogIn(VSALogCategory::Cache, kVSALogError, kOrigin,
                "Failed to set container mapping during create/lookup operation of %@, %llu",
                m->identifier(), c);
-    map[m->identifier()] = std::move(m);
+    putEntry(map, std::move(m));
   }
   if (built) *built = true;
   return &maps.insert_or_assign(key, std::move(map)).first->second;
@@ -257,10 +270,12 @@ std::optional<std::vector<VSAConstMetadataRef>> VSAContainerCache::allContainers
     entries.reserve(map->size());
     for (const auto& [id, m] : *map) entries.push_back(m);
   }
+  // What this call read from disk is known to be there.
+  if (built) return entries;
   std::vector<VSAConstMetadataRef> out;
   out.reserve(entries.size());
   for (auto& m : entries) {
-    if (!built && !checkFound(*m, key, transient, nullptr)) continue;
+    if (!checkFound(*m, key, transient, nullptr)) continue;
     VSALogIn(VSALogCategory::Cache, kVSALogDebug, kOrigin, "Cache: %@%@: ALL Found Identifier: %@",
              key, transientTag(transient), m->identifier());
     out.push_back(std::move(m));
@@ -292,7 +307,7 @@ bool VSAContainerCache::addContainerMetadata(const VSAMetadata& metadata, const 
   auto stored = std::make_shared<VSAMetadata>(metadata);
   stored->setUrl(url);
   stored->setTransient(transient);
-  (*map)[stored->identifier()] = stored;
+  putEntry(*map, stored);
   VSALogIn(VSALogCategory::Cache, kVSALogNotice, kOrigin, "Cache: %@%@: Added Identifier: %@",
            cacheKeyForUserIdentity(user, c), transientTag(transient), stored->identifier());
   if (updateSandbox && !transient &&
@@ -336,7 +351,7 @@ void VSAContainerCache::invalidateUserIdentity(const VSAUserIdentityRef& user) {
       if (auto it = live_.find(key); it != live_.end()) {
         for (const auto& [id, m] : it->second)
           if (VSASandboxItemTypeForClass(c) &&
-              !setSandboxContainerMappingForUserIdentity(user, id, c, std::nullopt))
+              !setSandboxContainerMappingForUserIdentity(user, m->identifier(), c, std::nullopt))
             VSALogIn(VSALogCategory::Cache, kVSALogError, kOrigin,
                      "Failed to remove container mapping of [%@], class: %llu", id, c);
       }

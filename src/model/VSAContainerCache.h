@@ -107,8 +107,12 @@ class VSAContainerCache : public VSAUserIdentityCacheObserver,
 
  private:
   // Identifier -> metadata. Hashed: a sorted tree of 10,000 entries costs a
-  // cache miss per level on every insertion while the map is built.
-  using ClassMap = std::unordered_map<std::string, VSAConstMetadataRef>;
+  // cache miss per level on every insertion while the map is built. The key
+  // is a view of the entry's own identifier (no second copy of every
+  // identifier): an entry is immutable once stored (a const reference), and
+  // only `putEntry` adds one, erasing the entry it replaces with its key.
+  using ClassMap = std::unordered_map<std::string_view, VSAConstMetadataRef>;
+  static void putEntry(ClassMap& map, VSAConstMetadataRef metadata);
   explicit VSAContainerCache(Dependencies deps) : deps_(std::move(deps)) {}
   // `built` (if given) is set when the map was read from disk by this call.
   // Without `build` only a map that exists is answered.

@@ -1,5 +1,7 @@
 #include "model/VSAMetadata.h"
 
+#include <fcntl.h>
+
 #include <cerrno>
 
 #include "base/VSALog.h"
@@ -132,20 +134,46 @@ bool VSAMetadata::isTransientReadFailure(const VSAErrorRef& error) {
 }
 
 VSAMetadataRef VSAMetadata::readAndValidateMetadataAtUrl(
-    const std::string& containerURL, const VSAUserIdentityRef& forUserIdentity, bool checkClassPath,
+    std::string containerURL, const VSAUserIdentityRef& forUserIdentity, bool checkClassPath,
     VSAGlobalConfiguration& configuration, VSAUserIdentityCache& cache, VSAErrorRef* error) {
-  return readAndValidateMetadataAtFileUrl(VSAPathJoin(containerURL, kVSAMetadataFileName),
-                                          forUserIdentity, checkClassPath, configuration, cache,
-                                          error);
+  std::string file = VSAPathJoin(containerURL, kVSAMetadataFileName);
+  // The container is the file's parent; only a path ending in a slash (or
+  // none) spells it differently from the parent of the joined file.
+  std::string container =
+      containerURL.empty() || containerURL.back() == '/' ? parentOf(file) : std::move(containerURL);
+  return readAndValidate({AT_FDCWD, file}, file, std::move(container), forUserIdentity,
+                         checkClassPath, configuration, cache, error);
+}
+
+VSAMetadataRef VSAMetadata::readAndValidateMetadataOfEntry(
+    int classDirectory, std::string containerURL, const VSAUserIdentityRef& forUserIdentity,
+    bool checkClassPath, VSAGlobalConfiguration& configuration, VSAUserIdentityCache& cache,
+    VSAErrorRef* error) {
+  std::string file = VSAPathJoin(containerURL, kVSAMetadataFileName);
+  std::string relative = VSAPathJoin(VSALastPathComponentView(containerURL), kVSAMetadataFileName);
+  return readAndValidate({classDirectory, relative}, file, std::move(containerURL), forUserIdentity,
+                         checkClassPath, configuration, cache, error);
 }
 
 VSAMetadataRef VSAMetadata::readAndValidateMetadataAtFileUrl(
     const std::string& file, const VSAUserIdentityRef& expected, bool checkClassPath,
     VSAGlobalConfiguration& configuration, VSAUserIdentityCache& cache, VSAErrorRef* error) {
+  return readAndValidate({AT_FDCWD, file}, file, parentOf(file), expected, checkClassPath,
+                         configuration, cache, error);
+}
+
+VSAMetadataRef VSAMetadata::readAndValidate(Source source, const std::string& file,
+                                            std::string container,
+                                            const VSAUserIdentityRef& expected, bool checkClassPath,
+                                            VSAGlobalConfiguration& configuration,
+                                            VSAUserIdentityCache& cache, VSAErrorRef* error) {
   const VSAResultCode bad = VSAResult::kInvalidUpdateFile;  // 29
   std::vector<uint8_t> bytes;
   std::optional<VSAValue> dict;
-  int rc = configuration.fileManager().fileSystem().readFile(file, &bytes, kVSAMetadataFileMaxSize);
+  VSAFileSystem& fs = configuration.fileManager().fileSystem();
+  int rc = source.dir == AT_FDCWD
+               ? fs.readFile(source.path, &bytes, kVSAMetadataFileMaxSize)
+               : fs.readFileAt(source.dir, source.path, &bytes, kVSAMetadataFileMaxSize);
   if (rc == 0) dict = VSAPlist::parse(bytes, nullptr, VSAPlist::Accept::BinaryOnly);
   if (!dict || !dict->isDictionary()) {
     invalid(error, VSAResult::kMetadataUnreadable, "Failed to read metadata at URL %@", file);
@@ -179,18 +207,16 @@ VSAMetadataRef VSAMetadata::readAndValidateMetadataAtFileUrl(
     owner = cache.defaultUserIdentity();
   } else {
     uid_t expectedUID = expected ? expected->posixUIDForContainerClass(c) : 0;
-    if (VSAContainerClassIsPerUser(c)) {
-      const VSAValue* persona = dict->get(kPersonaKey);
-      if (!persona) {
-        dict->set(kPersonaKey, VSAValue(static_cast<uint64_t>(expectedUID)));  // memory only
-      } else if (persona->uint64Value() != static_cast<uint64_t>(expectedUID)) {
-        return invalid(error, bad, "Incorrect UserId: %@, expecting: %u for %@ at %@",
-                       shown(persona), expectedUID, *identifier->stringValue(), file);
-      }
-    }
+    // A per-user file without a persona number is taken to carry the
+    // expected user's; one with another number is refused.
+    const VSAValue* persona = dict->get(kPersonaKey);
+    if (persona && VSAContainerClassIsPerUser(c) &&
+        persona->uint64Value() != static_cast<uint64_t>(expectedUID))
+      return invalid(error, bad, "Incorrect UserId: %@, expecting: %u for %@ at %@", shown(persona),
+                     expectedUID, *identifier->stringValue(), file);
     const VSAValue* stored = dict->get(kUserIdentityKey);
     if (!stored) {
-      uint64_t n = dict->get(kPersonaKey)->uint64Value().value_or(0);
+      uint64_t n = persona ? persona->uint64Value().value_or(0) : expectedUID;
       if (n == 499) n = 0;
       owner =
           cache.userIdentityForPersonalPersonaWithUID(static_cast<uid_t>(n), static_cast<gid_t>(n));
@@ -212,7 +238,6 @@ VSAMetadataRef VSAMetadata::readAndValidateMetadataAtFileUrl(
   if (assets && !assets->isString())
     return invalid(error, bad, "Invalid metadata User Managed Dir Name String: %@ at %@", *assets,
                    file);
-  std::string container = parentOf(file);
   if (checkClassPath) {
     std::string_view classDir = parentView(container);
     std::string_view root = parentView(parentView(classDir));
@@ -221,12 +246,13 @@ VSAMetadataRef VSAMetadata::readAndValidateMetadataAtFileUrl(
                      VSAPathJoin(root, VSAContainerClassPathComponent(c)));
   }
   VSAResultCode code = VSAResult::kSuccess;
-  auto identity = VSAConcreteContainerIdentity::containerIdentityWithUUID(
-      *uuid, owner, *identifier->stringValue(), c, &code);
+  const VSAValue uuidValue(*uuid);
+  auto identity = VSAConcreteContainerIdentity::containerIdentityWithUUID(&uuidValue, owner,
+                                                                          identifier, c, &code);
   if (!identity)
     return invalid(error, bad, "Could not create user identity from %@: %llu", file, code);
   auto metadata = std::make_shared<VSAMetadata>(
-      identity, info ? std::optional<VSAValue>(*info) : std::nullopt, container,
+      identity, info ? std::optional<VSAValue>(*info) : std::nullopt, std::move(container),
       assets ? std::optional<std::string>(*assets->stringValue()) : std::nullopt);
   VSALogIn(VSALogCategory::Metadata, kVSALogDebug, "readAndValidateMetadataAtFileUrl",
            "[%s] Read metadata from [%@]: %@ <= %@", "readAndValidateMetadataAtFileUrl", file,

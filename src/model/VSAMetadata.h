@@ -71,15 +71,23 @@ class VSAMetadata {
   bool writeMetadataToFileURL(const std::string& fileURL, VSAGlobalConfiguration& configuration,
                               VSAErrorRef* error);
 
-  static VSAMetadataRef readAndValidateMetadataAtUrl(const std::string& containerURL,
-                                                     const VSAUserIdentityRef& forUserIdentity,
-                                                     bool checkClassPath,
-                                                     VSAGlobalConfiguration& configuration,
-                                                     VSAUserIdentityCache& cache,
-                                                     VSAErrorRef* error);
+  // `containerURL` is taken by value: the new metadata keeps it as its path.
+  static VSAMetadataRef readAndValidateMetadataAtUrl(
+      std::string containerURL, const VSAUserIdentityRef& forUserIdentity, bool checkClassPath,
+      VSAGlobalConfiguration& configuration, VSAUserIdentityCache& cache, VSAErrorRef* error);
   static VSAMetadataRef readAndValidateMetadataAtFileUrl(
       const std::string& fileURL, const VSAUserIdentityRef& forUserIdentity, bool checkClassPath,
       VSAGlobalConfiguration& configuration, VSAUserIdentityCache& cache, VSAErrorRef* error);
+  // readAndValidateMetadataAtUrl for the container `containerURL`, an entry
+  // of the class directory open at `classDirectory`: its metadata file is
+  // opened relative to that descriptor, beneath it, no link followed (a
+  // class map's build reads thousands and the kernel walks two names each).
+  static VSAMetadataRef readAndValidateMetadataOfEntry(int classDirectory, std::string containerURL,
+                                                       const VSAUserIdentityRef& forUserIdentity,
+                                                       bool checkClassPath,
+                                                       VSAGlobalConfiguration& configuration,
+                                                       VSAUserIdentityCache& cache,
+                                                       VSAErrorRef* error);
 
   // Reads the metadata file of `cached` (a container the cache holds) again,
   // for an operation that puts what it reads into the cache or answers it.
@@ -103,6 +111,20 @@ class VSAMetadata {
   std::string description() const;
 
  private:
+  // Where a reader opens the metadata file: by its path, or by a path
+  // relative to an open directory.
+  struct Source {
+    int dir;                  // AT_FDCWD, or the open directory
+    const std::string& path;  // the path opened (relative to `dir`)
+  };
+  // Every reader ends here: `file` is the metadata file (as logs name it),
+  // `container` the directory holding it (known to the caller, not derived
+  // again).
+  static VSAMetadataRef readAndValidate(Source source, const std::string& file,
+                                        std::string container, const VSAUserIdentityRef& expected,
+                                        bool checkClassPath, VSAGlobalConfiguration& configuration,
+                                        VSAUserIdentityCache& cache, VSAErrorRef* error);
+
   VSAConcreteContainerIdentityRef identity_;
   std::optional<VSAValue> info_;
   std::string url_;

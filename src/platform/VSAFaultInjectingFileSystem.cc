@@ -238,6 +238,12 @@ int VSAFaultInjectingFileSystem::readFile(const std::string& path, std::vector<u
   return inner_->readFile(path, bytes, maxSize);
 }
 
+int VSAFaultInjectingFileSystem::readFileAt(int dir, const std::string& path,
+                                            std::vector<uint8_t>* bytes, size_t maxSize) {
+  if (int e = injected(Op::ReadFile)) return e;
+  return inner_->readFileAt(dir, path, bytes, maxSize);
+}
+
 int VSAFaultInjectingFileSystem::mkdtemp(const std::string& templ, std::string* path) {
   if (int e = injected(Op::Mkdtemp)) return e;
   int rc = inner_->mkdtemp(templ, path);

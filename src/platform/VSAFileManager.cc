@@ -464,7 +464,23 @@ bool VSAFileManager::itemDoesNotExistAtURL(const std::string& path) {
 std::optional<std::vector<VSADirectoryItem>> VSAFileManager::urlsForItemsInDirectoryAtURL(
     const std::string& path, VSAErrorRef* error) {
   std::vector<VSADirectoryEntry> entries;
-  if (int rc = fs_->readDirectory(path, &entries)) {
+  return itemsOfDirectory(path, fs_->readDirectory(path, &entries), entries, error);
+}
+
+std::optional<std::vector<VSADirectoryItem>> VSAFileManager::urlsForItemsInDirectoryAtURL(
+    const std::string& path, VSAUniqueFd* dir, VSAErrorRef* error) {
+  std::vector<VSADirectoryEntry> entries;
+  int fd = -1;
+  int rc = fs_->openDirectory(path, &fd);
+  dir->reset(fd);
+  if (rc == 0) rc = fs_->readDirectoryAt(dir->get(), &entries);
+  return itemsOfDirectory(path, rc, entries, error);
+}
+
+std::optional<std::vector<VSADirectoryItem>> VSAFileManager::itemsOfDirectory(
+    const std::string& path, int rc, const std::vector<VSADirectoryEntry>& entries,
+    VSAErrorRef* error) {
+  if (rc) {
     VSALogIn(VSALogCategory::FS, kVSALogError, kOrigin, "opendir of %s failed: %s", path,
              std::strerror(rc));
     VSASetError(
@@ -476,12 +492,16 @@ std::optional<std::vector<VSADirectoryItem>> VSAFileManager::urlsForItemsInDirec
   // item's files then walks the kernel's inode and dentry tables in order
   // rather than in the directory's hash order (about 5% off a class map
   // build of 10,000 containers).
-  std::sort(
-      entries.begin(), entries.end(),
-      [](const VSADirectoryEntry& a, const VSADirectoryEntry& b) { return a.inode < b.inode; });
+  // The order is sorted as (inode, position) pairs: moving the entries
+  // themselves would move their names.
+  std::vector<std::pair<ino_t, uint32_t>> order;
+  order.reserve(entries.size());
+  for (uint32_t i = 0; i < entries.size(); ++i) order.emplace_back(entries[i].inode, i);
+  std::sort(order.begin(), order.end());
   std::vector<VSADirectoryItem> items;
   items.reserve(entries.size());
-  for (const auto& e : entries) {
+  for (const auto& [inode, i] : order) {
+    const VSADirectoryEntry& e = entries[i];
     if (e.name.empty() || e.name[0] == '.') continue;
     items.push_back({VSAPathJoin(path, e.name), e.type == VSADirectoryEntry::Type::Directory});
   }

@@ -21,6 +21,7 @@
 
 #include "base/VSAError.h"
 #include "platform/VSAFileSystem.h"
+#include "platform/VSAUniqueFd.h"
 #include "platform/VSAUserDatabase.h"
 
 inline constexpr const char* kVSAMetadataFileName = ".com.tamsk.vessa_keeper.metadata.plist";
@@ -140,6 +141,12 @@ class VSAFileManager {
   // Visible entries (names not starting with ".") of one directory.
   std::optional<std::vector<VSADirectoryItem>> urlsForItemsInDirectoryAtURL(const std::string& path,
                                                                             VSAErrorRef* error);
+  // The same, listed through a descriptor of the directory (no link anywhere
+  // in `path`) that comes back in `dir`: the entries can then be opened
+  // relative to it, the kernel walking only what lies below.
+  std::optional<std::vector<VSADirectoryItem>> urlsForItemsInDirectoryAtURL(const std::string& path,
+                                                                            VSAUniqueFd* dir,
+                                                                            VSAErrorRef* error);
   // Walks a tree on one device through directory descriptors, at any depth
   // with a bounded number of descriptors open (VSADirectoryStack);
   // directories are reported before and after their contents. The block
@@ -162,6 +169,10 @@ class VSAFileManager {
   std::string homeDirectoryURLForPOSIXUID(uid_t uid) const;
 
  private:
+  // Visible entries of a listing that gave `rc`, in inode order.
+  std::optional<std::vector<VSADirectoryItem>> itemsOfDirectory(
+      const std::string& path, int rc, const std::vector<VSADirectoryEntry>& entries,
+      VSAErrorRef* error);
   bool checkSource(const std::string& from, const char* fn, bool* missing, VSAErrorRef* error);
   struct MoveOptions {
     bool failIfSourceMissing = true;  // false: a missing source is success

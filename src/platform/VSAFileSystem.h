@@ -145,6 +145,11 @@ class VSAFileSystem {
   // Empty name: `dir` itself.
   virtual int statAt(int dir, const std::string& name, struct stat* st) = 0;
   virtual int readDirectoryAt(int dir, std::vector<VSADirectoryEntry>* entries) = 0;
+  // readFile for `path` relative to `dir`, resolved beneath it (no "..",
+  // no absolute path) with no symbolic link anywhere: the kernel walks only
+  // the components below the open directory.
+  virtual int readFileAt(int dir, const std::string& path, std::vector<uint8_t>* bytes,
+                         size_t maxSize) = 0;
   virtual int mkdirAt(int dir, const std::string& name, mode_t mode) = 0;
   virtual int unlinkAt(int dir, const std::string& name, bool directory) = 0;
   // Renames entry `fromName` of `fromDir` to `toName` of `toDir`, never over

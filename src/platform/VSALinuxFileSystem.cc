@@ -196,6 +196,11 @@ int VSALinuxFileSystem::readFile(const std::string& path, std::vector<uint8_t>* 
   return VSAReadRegularFile(path, maxSize, bytes);
 }
 
+int VSALinuxFileSystem::readFileAt(int dir, const std::string& path, std::vector<uint8_t>* bytes,
+                                   size_t maxSize) {
+  return VSAReadRegularFileAt(dir, path, maxSize, bytes);
+}
+
 int VSALinuxFileSystem::mkdtemp(const std::string& templ, std::string* path) {
   VSAUniqueFd dir;
   std::string name;

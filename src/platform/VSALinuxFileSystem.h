@@ -56,6 +56,8 @@ class VSALinuxFileSystem : public VSAFileSystem {
   int openDirectoryAt(int dir, const std::string& name, int* fd) override;
   int statAt(int dir, const std::string& name, struct stat* st) override;
   int readDirectoryAt(int dir, std::vector<VSADirectoryEntry>* entries) override;
+  int readFileAt(int dir, const std::string& path, std::vector<uint8_t>* bytes,
+                 size_t maxSize) override;
   int mkdirAt(int dir, const std::string& name, mode_t mode) override;
   int unlinkAt(int dir, const std::string& name, bool directory) override;
   int renameAt(int fromDir, const std::string& fromName, int toDir,

@@ -165,6 +165,34 @@ TEST_F(VSAPlistFiles, BoundedReadRefusesWhatIsNotASmallRegularFile) {
   EXPECT_EQ(st.st_size, 100);
 }
 
+TEST_F(VSAPlistFiles, ReadRelativeToADirectoryStaysBeneathItWithoutLinks) {
+  // A tree an app owns: container/file, a link to the container, and a file
+  // outside the directory that is opened.
+  std::string top = VSAPathJoin(dir_, "class");
+  std::filesystem::create_directories(VSAPathJoin(top, "container"));
+  std::ofstream(VSAPathJoin(top, "container/file")) << "inside";
+  std::ofstream(VSAPathJoin(dir_, "outside")) << "outside";
+  ASSERT_EQ(::symlink("container", VSAPathJoin(top, "link").c_str()), 0);
+  ASSERT_EQ(
+      ::symlink(VSAPathJoin(dir_, "outside").c_str(), VSAPathJoin(top, "container/escape").c_str()),
+      0);
+  int dir = ::open(top.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  ASSERT_GE(dir, 0);
+  std::vector<uint8_t> bytes;
+  EXPECT_EQ(VSAReadRegularFileAt(dir, "container/file", 100, &bytes), 0);
+  EXPECT_EQ(std::string(bytes.begin(), bytes.end()), "inside");
+  EXPECT_EQ(VSAReadRegularFileAt(dir, "container/file", 5, &bytes), EFBIG);
+  // Up and out, or from the root: refused, whatever is there.
+  EXPECT_EQ(VSAReadRegularFileAt(dir, "../outside", 100, &bytes), EXDEV);
+  EXPECT_EQ(VSAReadRegularFileAt(dir, "container/../../outside", 100, &bytes), EXDEV);
+  EXPECT_EQ(VSAReadRegularFileAt(dir, VSAPathJoin(dir_, "outside"), 100, &bytes), EXDEV);
+  // A link anywhere on the way, in the middle or at the end: refused.
+  EXPECT_EQ(VSAReadRegularFileAt(dir, "link/file", 100, &bytes), ELOOP);
+  EXPECT_EQ(VSAReadRegularFileAt(dir, "container/escape", 100, &bytes), ELOOP);
+  EXPECT_TRUE(bytes.empty());
+  ::close(dir);
+}
+
 TEST_F(VSAPlistFiles, AFIFOInPlaceOfAPropertyListDoesNotBlock) {
   std::string fifo = VSAPathJoin(dir_, "fifo.plist");
   ASSERT_EQ(::mkfifo(fifo.c_str(), 0644), 0);

@@ -221,6 +221,52 @@ TEST_F(Cache, SandboxMappingRules) {
       << "bundle classes have no sandbox item type";
 }
 
+TEST_F(Cache, AContainerDirectoryThatIsALinkIsNotRead) {
+  // An entry of the class directory that links to a container elsewhere
+  // (another class here): the build reads below the class directory only.
+  onDisk(personal_, "com.app", VSAClass::kDataApplication);
+  auto elsewhere = onDisk(personal_, "com.plugin", VSAClass::kDataPlugin);
+  std::string classDir =
+      *config_->containerDirectoryURLForUserIdentity(personal_, VSAClass::kDataApplication, false);
+  fs::create_directory_symlink(elsewhere->url(), classDir + "/" + VSAUUID::random().string());
+  auto all =
+      cache_->allContainersForUserIdentity(personal_, VSAClass::kDataApplication, {}, nullptr);
+  ASSERT_TRUE(all);
+  ASSERT_EQ(all->size(), 1u);
+  EXPECT_EQ((*all)[0]->identifier(), "com.app");
+}
+
+TEST_F(Cache, AReplacedEntryTakesItsKeyWithIt) {
+  // The map's keys are views of the entries' identifiers: replacing an entry
+  // must not leave a key that views the freed one (AddressSanitizer builds
+  // catch the read; the look-ups below catch a lost or doubled entry).
+  auto first = onDisk(personal_, "com.app", VSAClass::kDataApplication);
+  ASSERT_TRUE(
+      cache_->allContainersForUserIdentity(personal_, VSAClass::kDataApplication, {}, nullptr));
+  for (int round = 0; round < 3; ++round) {
+    auto next = std::make_shared<VSAMetadata>(*first);
+    next->setUuid(VSAUUID::random());
+    std::string url = first->url() + "-" + std::to_string(round);
+    fs::create_directories(url);
+    next->setUrl(url);
+    ASSERT_TRUE(next->writeMetadataToDiskWithError(*config_, nullptr));
+    ASSERT_TRUE(cache_->addContainerMetadata(*next, url, {}, nullptr));
+    next.reset();
+    auto all =
+        cache_->allContainersForUserIdentity(personal_, VSAClass::kDataApplication, {}, nullptr);
+    ASSERT_TRUE(all);
+    ASSERT_EQ(all->size(), 1u);
+    EXPECT_EQ((*all)[0]->url(), url);
+    ASSERT_TRUE(cache_->removeContainerForUserIdentity(personal_, VSAClass::kDataApplication,
+                                                       "com.app", false, nullptr));
+    ASSERT_TRUE(cache_->addContainerMetadata(*first, first->url(), {}, nullptr));
+  }
+  auto found = cache_->containerForContainerIdentity(
+      *identity(personal_, "com.app", VSAClass::kDataApplication));
+  ASSERT_TRUE(found);
+  EXPECT_EQ(found->url(), first->url());
+}
+
 TEST_F(Cache, AddRemoveAndInvalidateAnEnterpriseIdentity) {
   auto m = onDisk(enterprise_, "com.work", VSAClass::kDataApplication);
   ASSERT_TRUE(cache_->addContainerMetadata(*m, m->url(), {.updateSandbox = true}, nullptr));
