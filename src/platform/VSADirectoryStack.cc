@@ -1,5 +1,7 @@
 #include "platform/VSADirectoryStack.h"
 
+#include <algorithm>
+
 #include "base/VSAPathString.h"
 
 VSADirectoryStack::VSADirectoryStack(VSAFileSystem& fs, int base, const std::string& topPath,
@@ -37,6 +39,12 @@ int VSADirectoryStack::enter(const std::string& name, const struct stat* expecte
       if (listError) *listError = rc;
       entries.clear();
     }
+    // Visited in inode order, not the directory's hash order: removals and
+    // status calls then walk the inode table (and the journal's blocks) in
+    // order instead of at random.
+    std::sort(
+        entries.begin(), entries.end(),
+        [](const VSADirectoryEntry& a, const VSADirectoryEntry& b) { return a.inode < b.inode; });
   }
   push(name, std::move(fd), st, std::move(entries));
   return 0;
