@@ -9,6 +9,8 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <cerrno>
+#include <cstring>
 
 #include "base/VSALog.h"
 #include "base/VSAPlist.h"
@@ -71,47 +73,146 @@ std::string VSASandboxService::tablePath(uid_t uid) const {
   return root_.resolve("/run/vessad/sandbox/" + std::to_string(uid) + ".plist");
 }
 
-const VSASandboxService::Table& VSASandboxService::load(uid_t uid) {
-  auto it = tables_.find(uid);
-  if (it != tables_.end()) return it->second;
-  Table items;
-  VSAErrorRef error;
-  if (auto dict = VSA_dictionaryWithContentsOfURL(tablePath(uid), 0, &error)) {
-    const VSAValue* list = dict->get("Items");
-    for (const VSAValue& v : list && list->isArray() ? *list->arrayValue() : VSAValue::Array{}) {
-      const VSAValue *type = v.get("ItemType"), *id = v.get("Identifier"), *cls = v.get("Class"),
-                     *persona = v.get("PersonaID"), *path = v.get("Path");
-      if (!type || !id || !id->isString() || !cls || !path || !path->isString()) continue;
-      VSASandboxItem item{type->uint64Value().value_or(0), *id->stringValue(),
-                          cls->uint64Value().value_or(VSAClass::kUndefined),
-                          static_cast<int32_t>(persona ? persona->int64Value().value_or(0) : 0),
-                          *path->stringValue()};
-      items[{item.identifier, item.containerClass, item.personaID}] = std::move(item);
-    }
-  }
-  return tables_[uid] = std::move(items);
+std::string VSASandboxService::logPath(uid_t uid) const {
+  return root_.resolve("/run/vessad/sandbox/" + std::to_string(uid) + ".log");
 }
 
-int VSASandboxService::write(uid_t uid, const Table& items) {
+namespace {
+// The log is appended to until it outgrows the table it changes (or this).
+constexpr uint64_t kMinimumLogBytes = 64 << 10;
+
+VSAValue::Dictionary itemDictionary(const VSASandboxItem& i) {
+  return VSAValue::Dictionary{{"ItemType", VSAValue(i.itemType)},
+                              {"Identifier", VSAValue(i.identifier)},
+                              {"Class", VSAValue(i.containerClass)},
+                              {"PersonaID", VSAValue(static_cast<int64_t>(i.personaID))},
+                              {"Path", VSAValue(i.path)}};
+}
+
+std::optional<VSASandboxItem> itemOfDictionary(const VSAValue& v, bool needsPath) {
+  const VSAValue *type = v.get("ItemType"), *id = v.get("Identifier"), *cls = v.get("Class"),
+                 *persona = v.get("PersonaID"), *path = v.get("Path");
+  if (!type || !id || !id->isString() || !cls || (path && !path->isString()) ||
+      (needsPath && !path))
+    return std::nullopt;
+  return VSASandboxItem{type->uint64Value().value_or(0), *id->stringValue(),
+                        cls->uint64Value().value_or(VSAClass::kUndefined),
+                        static_cast<int32_t>(persona ? persona->int64Value().value_or(0) : 0),
+                        path ? *path->stringValue() : std::string()};
+}
+}  // namespace
+
+void VSASandboxService::apply(Table& items, const Change& change) {
+  Key key{change.item.identifier, change.item.containerClass, change.item.personaID};
+  if (change.removal)
+    items.erase(key);
+  else
+    items[key] = change.item;
+}
+
+VSASandboxService::UserTable& VSASandboxService::load(uid_t uid) {
+  auto it = tables_.find(uid);
+  if (it != tables_.end()) return it->second;
+  UserTable table;
+  std::vector<uint8_t> bytes;
+  if (VSAReadRegularFile(tablePath(uid), kVSADefaultReadFileLimit, &bytes) == 0) {
+    table.tableBytes = bytes.size();
+    auto dict = VSAPlist::parse(bytes, nullptr);
+    const VSAValue* list = dict ? dict->get("Items") : nullptr;
+    for (const VSAValue& v : list && list->isArray() ? *list->arrayValue() : VSAValue::Array{}) {
+      if (auto item = itemOfDictionary(v, true))
+        table.items[{item->identifier, item->containerClass, item->personaID}] = std::move(*item);
+    }
+    const VSAValue* sequence = dict ? dict->get("Sequence") : nullptr;
+    table.sequence = sequence ? sequence->uint64Value().value_or(0) : 0;
+    // A table that cannot be read is written again at the next change.
+    if (!list) table.rewrite = true;
+  }
+  if (!replayLog(uid, table)) table.rewrite = true;
+  return tables_[uid] = std::move(table);
+}
+
+bool VSASandboxService::replayLog(uid_t uid, UserTable& table) {
+  std::vector<uint8_t> bytes;
+  int rc = VSAReadRegularFile(logPath(uid), kVSADefaultReadFileLimit, &bytes);
+  if (rc == ENOENT) return true;
+  if (rc != 0) return false;
+  size_t at = 0;
+  while (at < bytes.size()) {
+    if (bytes.size() - at < 4) return false;
+    const uint8_t* p = bytes.data() + at;
+    size_t length = size_t{p[0]} << 24 | size_t{p[1]} << 16 | size_t{p[2]} << 8 | p[3];
+    if (length > bytes.size() - at - 4) return false;
+    auto record = VSAPlist::parse(p + 4, length, nullptr);
+    const VSAValue* sequence = record ? record->get("Sequence") : nullptr;
+    auto item = record ? itemOfDictionary(*record, false) : std::nullopt;
+    if (!sequence || !sequence->uint64Value() || !item) return false;
+    at += 4 + length;
+    table.logBytes = at;
+    Change change{*sequence->uint64Value(), std::move(*item), !record->get("Path")};
+    // Changes the table already holds (it was written after them) are skipped.
+    if (change.sequence <= table.sequence) continue;
+    apply(table.items, change);
+    table.sequence = change.sequence;
+  }
+  return true;
+}
+
+int64_t VSASandboxService::writeWhole(uid_t uid, const Table& items, uint64_t sequence) {
   VSAValue::Array list;
   list.reserve(items.size());
-  for (const auto& [key, i] : items)
-    list.push_back(VSAValue::Dictionary{{"ItemType", VSAValue(i.itemType)},
-                                        {"Identifier", VSAValue(i.identifier)},
-                                        {"Class", VSAValue(i.containerClass)},
-                                        {"PersonaID", VSAValue(static_cast<int64_t>(i.personaID))},
-                                        {"Path", VSAValue(i.path)}});
-  std::string dir = root_.resolve("/run/vessad/sandbox");
-  VSAMakeDirectories(dir, 0700);
+  for (const auto& [key, i] : items) list.push_back(itemDictionary(i));
   VSAErrorRef error;
+  auto bytes = VSAPlist::serialize(
+      VSAValue::Dictionary{{"Items", VSAValue(std::move(list))}, {"Sequence", VSAValue(sequence)}},
+      VSAPlist::Format::Binary, &error);
+  VSAMakeDirectories(root_.resolve("/run/vessad/sandbox"), 0700);
   // The table lives as long as the boot, like the kernel's: no flush to disk.
-  if (!VSA_writeToURL(VSAValue::Dictionary{{"Items", VSAValue(std::move(list))}}, tablePath(uid),
-                      kVSAWriteFileWithoutSync, &error)) {
+  if (!bytes || !VSAWriteFileAtomically(tablePath(uid), *bytes, 0644, &error, false)) {
     VSALog(kVSALogError, "VSASandboxService", "Failed to write container table %@: %@",
            tablePath(uid), error);
-    return EIO;
+    return -EIO;
   }
-  return 0;
+  // The table holds every change the log held: the log starts again.
+  if (::unlink(logPath(uid).c_str()) != 0 && errno != ENOENT) {
+    int e = errno;
+    VSALog(kVSALogError, "VSASandboxService", "Failed to empty container table log %@: %s",
+           logPath(uid), std::strerror(e));
+  }
+  return static_cast<int64_t>(bytes->size());
+}
+
+int64_t VSASandboxService::appendToLog(uid_t uid, const std::vector<Change>& changes) {
+  std::vector<uint8_t> out;
+  for (const Change& c : changes) {
+    VSAValue::Dictionary record = itemDictionary(c.item);
+    if (c.removal) record.erase("Path");
+    record["Sequence"] = VSAValue(c.sequence);
+    auto bytes =
+        VSAPlist::serialize(VSAValue(std::move(record)), VSAPlist::Format::Binary, nullptr);
+    if (!bytes) return -EINVAL;
+    uint32_t n = static_cast<uint32_t>(bytes->size());
+    out.insert(out.end(), {static_cast<uint8_t>(n >> 24), static_cast<uint8_t>(n >> 16),
+                           static_cast<uint8_t>(n >> 8), static_cast<uint8_t>(n)});
+    out.insert(out.end(), bytes->begin(), bytes->end());
+  }
+  VSAMakeDirectories(root_.resolve("/run/vessad/sandbox"), 0700);
+  int fd =
+      ::open(logPath(uid).c_str(), O_WRONLY | O_APPEND | O_CREAT | O_NOFOLLOW | O_CLOEXEC, 0644);
+  int rc = fd < 0 ? errno : 0;
+  for (size_t done = 0; rc == 0 && done < out.size();) {
+    ssize_t n = ::write(fd, out.data() + done, out.size() - done);
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) rc = n < 0 ? errno : EIO;
+    if (n > 0) done += static_cast<size_t>(n);
+  }
+  if (fd >= 0) ::close(fd);
+  if (rc != 0) {
+    VSALog(kVSALogError, "VSASandboxService", "Failed to append to container table log %@: %s",
+           logPath(uid), std::strerror(rc));
+    return -rc;
+  }
+  return static_cast<int64_t>(out.size());
 }
 
 void VSASandboxService::writerLoop() {
@@ -133,13 +234,40 @@ void VSASandboxService::writerLoop() {
 std::chrono::steady_clock::duration VSASandboxService::writePending() {
   std::lock_guard writing(writeMutex_);
   auto start = std::chrono::steady_clock::now();
-  std::map<uid_t, Table> pending;
+  std::map<uid_t, Work> pending;
   {
     std::lock_guard lock(mutex_);
-    for (uid_t uid : dirty_) pending[uid] = tables_[uid];
+    for (uid_t uid : dirty_) {
+      UserTable& table = tables_[uid];
+      Work work;
+      work.changes.swap(table.unwritten);
+      work.sequence = table.sequence;
+      // Written whole when the log would outgrow the table, or when this
+      // batch rewrites a good part of it anyway (a boot's first mappings).
+      if (table.rewrite ||
+          table.logBytes > std::max<uint64_t>(kMinimumLogBytes, table.tableBytes) ||
+          work.changes.size() > std::max<size_t>(256, table.items.size() / 4)) {
+        work.whole = table.items;
+        table.rewrite = false;
+      }
+      pending.emplace(uid, std::move(work));
+    }
     dirty_.clear();
   }
-  for (const auto& [uid, items] : pending) write(uid, items);
+  for (const auto& [uid, work] : pending) {
+    int64_t n =
+        work.whole ? writeWhole(uid, *work.whole, work.sequence) : appendToLog(uid, work.changes);
+    std::lock_guard lock(mutex_);
+    UserTable& table = tables_[uid];
+    if (n < 0) {
+      table.rewrite = true;  // the files missed these changes: the next write is whole
+    } else if (work.whole) {
+      table.tableBytes = static_cast<uint64_t>(n);
+      table.logBytes = 0;
+    } else {
+      table.logBytes += static_cast<uint64_t>(n);
+    }
+  }
   return std::chrono::steady_clock::now() - start;
 }
 
@@ -152,20 +280,19 @@ int VSASandboxService::setUserStateItem(uid_t uid, uint64_t itemType, const std:
   bool wake = false;
   {
     std::lock_guard lock(mutex_);
-    load(uid);
-    auto& items = tables_[uid];
-    std::tuple<std::string, VSAContainerClass, int32_t> key{identifier, containerClass, personaID};
-    auto it = items.find(key);
+    UserTable& table = load(uid);
+    auto it = table.items.find(Key{identifier, containerClass, personaID});
     // Launches and look-ups push the same mapping again and again: only a
-    // change makes the table worth rewriting.
-    if (path) {
-      if (it != items.end() && it->second.itemType == itemType && it->second.path == *path)
-        return 0;
-      items[key] = {itemType, identifier, containerClass, personaID, *path};
-    } else {
-      if (it == items.end()) return 0;
-      items.erase(it);
-    }
+    // change is worth writing.
+    if (path && it != table.items.end() && it->second.itemType == itemType &&
+        it->second.path == *path)
+      return 0;
+    if (!path && it == table.items.end()) return 0;
+    Change change{++table.sequence,
+                  {itemType, identifier, containerClass, personaID, path.value_or(std::string())},
+                  !path};
+    apply(table.items, change);
+    table.unwritten.push_back(std::move(change));
     // The writer is woken by the first change only: while it gathers, more
     // changes join the same write without a wake-up (a context switch) each.
     wake = dirty_.empty();
@@ -180,7 +307,7 @@ int VSASandboxService::iterateUserStateItems(
   std::vector<VSASandboxItem> items;
   {
     std::lock_guard lock(mutex_);
-    for (const auto& [key, item] : load(uid)) items.push_back(item);
+    for (const auto& [key, item] : load(uid).items) items.push_back(item);
   }
   for (const auto& i : items)
     if (!block(i)) break;
@@ -192,7 +319,7 @@ std::optional<VSASandboxItem> VSASandboxService::userStateItem(uid_t uid,
                                                                VSAContainerClass containerClass,
                                                                int32_t personaID) {
   std::lock_guard lock(mutex_);
-  const Table& items = load(uid);
+  const Table& items = load(uid).items;
   auto it = items.find({identifier, containerClass, personaID});
   if (it == items.end()) return std::nullopt;
   return it->second;

@@ -2,15 +2,19 @@
 // its file extension tokens.
 //
 // Container table: per uid, the items the sandbox knows (item type,
-// identifier, container class, kernel persona id, path), persisted in
-// `<root>/run/vessad/sandbox/<uid>.plist` so that it outlives a daemon
-// restart as the kernel's table would. Only classes with an item type
+// identifier, container class, kernel persona id, path), persisted under
+// `<root>/run/vessad/sandbox/` so that it outlives a daemon restart as the
+// kernel's table would. Only classes with an item type
 // (VSASandboxItemTypeForClass) may be stored. Changes apply to the table in
-// memory at once (indexed by identifier and class); the files are rewritten
-// by the service's writer thread, which gathers changes for a while before
-// each rewrite: at least 100 ms, and ten times as long as the last rewrite
-// took (at most 2 s), so that rewriting a large table never costs more than
-// a tenth of the daemon's time however fast containers come and go.
+// memory at once (indexed by identifier and class) and are numbered; the
+// service's writer thread, which gathers changes for a while (at least
+// 100 ms, and ten times as long as its last write took, at most 2 s),
+// appends them to `<uid>.log`, so that a change costs its own bytes however
+// large the table is. When the log has grown past the table's own size (and
+// 64 KiB), the table is written whole to `<uid>.plist` with the number of
+// the last change it holds, and the log starts again; reading takes the
+// table and then the log's changes numbered after it (a change the table
+// already holds is skipped, and a record cut short ends the log).
 // Destroying the service, or flush(), writes what is pending.
 //
 // Extension tokens: HMAC-SHA256 over (extension class, path, audit token)
@@ -76,21 +80,50 @@ class VSASandboxService {
                            const std::string& path, const VSAAuditToken& auditToken);
 
  private:
-  using Table = std::map<std::tuple<std::string, VSAContainerClass, int32_t>, VSASandboxItem>;
+  using Key = std::tuple<std::string, VSAContainerClass, int32_t>;
+  using Table = std::map<Key, VSASandboxItem>;
+  // One numbered change: an item stored, or (no path) removed.
+  struct Change {
+    uint64_t sequence = 0;
+    VSASandboxItem item;
+    bool removal = false;
+  };
+  struct UserTable {
+    Table items;
+    uint64_t sequence = 0;          // the number of the last change applied
+    std::vector<Change> unwritten;  // applied here, not yet in the files
+    uint64_t logBytes = 0;          // the log's valid length
+    uint64_t tableBytes = 0;        // the size of the table file last written or read
+    bool rewrite = false;           // the log cannot be appended to: write the table whole
+  };
+  // What the writer takes from a table under the lock and writes outside it.
+  struct Work {
+    std::vector<Change> changes;
+    std::optional<Table> whole;  // set when the table is written whole
+    uint64_t sequence = 0;
+  };
 
   std::string tablePath(uid_t uid) const;
-  const Table& load(uid_t uid);  // caller holds mutex_
+  std::string logPath(uid_t uid) const;
+  UserTable& load(uid_t uid);  // caller holds mutex_
+  static void apply(Table& items, const Change& change);
+  // Replays the log's changes numbered after the table's; false when the
+  // log ended in a record cut short or unreadable (it is then rewritten).
+  bool replayLog(uid_t uid, UserTable& table);
   void writerLoop();
   // Writes the changed tables; answers how long that took.
   std::chrono::steady_clock::duration writePending();
-  int write(uid_t uid, const Table& items);
+  // Appends `changes` to the log (bytes appended, or an errno as negative).
+  int64_t appendToLog(uid_t uid, const std::vector<Change>& changes);
+  // Writes the table whole and empties the log (the table's size, or a negative errno).
+  int64_t writeWhole(uid_t uid, const Table& items, uint64_t sequence);
   bool key(std::string* out);
   std::string mac(const std::string& extensionClass, const std::string& path,
                   const VSAAuditToken& auditToken, const std::string& key) const;
 
   VSASystemRoot root_;
   std::mutex mutex_;
-  std::map<uid_t, Table> tables_;
+  std::map<uid_t, UserTable> tables_;
   std::set<uid_t> dirty_;
   std::condition_variable changed_;
   bool stopping_ = false;

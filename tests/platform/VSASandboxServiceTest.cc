@@ -1,6 +1,7 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <filesystem>
 #include <thread>
@@ -63,20 +64,27 @@ TEST(VSASandboxService, ContainerTableOutlivesTheService) {
   EXPECT_EQ(*VSASandboxItemTypeForClass(VSAClass::kSystemGroup), 9u);
 }
 
+// What the files of a table hold, in bytes (the table and its log).
+uint64_t writtenBytes(const std::string& root, uid_t uid) {
+  uint64_t n = 0;
+  for (const char* suffix : {".plist", ".log"}) {
+    std::string f = root + "/run/vessad/sandbox/" + std::to_string(uid) + suffix;
+    if (std::filesystem::exists(f)) n += std::filesystem::file_size(f);
+  }
+  return n;
+}
+
 // Launches push the same mappings over and over: only a change (a new path
-// or item type, an added or removed item) rewrites the table.
-TEST(VSASandboxService, OnlyChangesRewriteTheTable) {
+// or item type, an added or removed item) is written.
+TEST(VSASandboxService, OnlyChangesAreWritten) {
   VSATestTempDir temp("vessa-sandbox");
   VSASandboxService sandbox{VSASystemRoot(temp.path())};
-  const std::string table = temp.path() + "/run/vessad/sandbox/501.plist";
   ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app", VSAClass::kDataApplication, 1000,
                                      std::string("/c/A")),
             0);
   sandbox.flush();
-  ASSERT_TRUE(std::filesystem::exists(table));
-  // The file is removed behind the service's back: it comes back only when
-  // something changed.
-  std::filesystem::remove(table);
+  uint64_t written = writtenBytes(temp.path(), 501);
+  ASSERT_GT(written, 0u);
   ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app", VSAClass::kDataApplication, 1000,
                                      std::string("/c/A")),
             0);
@@ -84,25 +92,139 @@ TEST(VSASandboxService, OnlyChangesRewriteTheTable) {
       sandbox.setUserStateItem(501, 1, "com.gone", VSAClass::kDataApplication, 1000, std::nullopt),
       0);
   sandbox.flush();
-  EXPECT_FALSE(std::filesystem::exists(table)) << "nothing changed";
+  EXPECT_EQ(writtenBytes(temp.path(), 501), written) << "nothing changed";
   ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app", VSAClass::kDataApplication, 1000,
                                      std::string("/c/B")),
             0);
   sandbox.flush();
-  EXPECT_TRUE(std::filesystem::exists(table)) << "a new path";
-  std::filesystem::remove(table);
+  EXPECT_GT(writtenBytes(temp.path(), 501), written) << "a new path";
+  written = writtenBytes(temp.path(), 501);
   ASSERT_EQ(sandbox.setUserStateItem(501, 4, "com.app", VSAClass::kDataApplication, 1000,
                                      std::string("/c/B")),
             0);
   sandbox.flush();
-  EXPECT_TRUE(std::filesystem::exists(table)) << "a new item type";
-  std::filesystem::remove(table);
+  EXPECT_GT(writtenBytes(temp.path(), 501), written) << "a new item type";
+  written = writtenBytes(temp.path(), 501);
   ASSERT_EQ(
       sandbox.setUserStateItem(501, 4, "com.app", VSAClass::kDataApplication, 1000, std::nullopt),
       0);
   sandbox.flush();
-  ASSERT_TRUE(std::filesystem::exists(table)) << "a removal";
+  EXPECT_GT(writtenBytes(temp.path(), 501), written) << "a removal";
   EXPECT_FALSE(sandbox.userStateItem(501, "com.app", VSAClass::kDataApplication, 1000));
+  VSASandboxService reopened{VSASystemRoot(temp.path())};
+  EXPECT_FALSE(reopened.userStateItem(501, "com.app", VSAClass::kDataApplication, 1000));
+}
+
+// Every item of `uid` as "identifier=path", sorted.
+std::vector<std::string> itemsOf(VSASandboxService& sandbox, uid_t uid) {
+  std::vector<std::string> out;
+  sandbox.iterateUserStateItems(uid, [&](const VSASandboxItem& i) {
+    out.push_back(i.identifier + "=" + i.path);
+    return true;
+  });
+  std::sort(out.begin(), out.end());
+  return out;
+}
+
+// A large table: a change is appended to the log (the table file is not
+// touched); once the log outgrows the table, the table is written whole
+// and the log starts again; a service reading the files afresh sees what
+// the writing one holds at every step.
+TEST(VSASandboxService, ChangesGoToTheLogUntilItOutgrowsTheTable) {
+  VSATestTempDir temp("vessa-sandbox");
+  const std::string table = temp.path() + "/run/vessad/sandbox/501.plist";
+  const std::string log = temp.path() + "/run/vessad/sandbox/501.log";
+  VSASandboxService sandbox{VSASystemRoot(temp.path())};
+  for (int i = 0; i < 2000; ++i)
+    ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app" + std::to_string(i),
+                                       VSAClass::kDataApplication, 1000, "/c/" + std::to_string(i)),
+              0);
+  sandbox.flush();
+  ASSERT_TRUE(std::filesystem::exists(table)) << "a boot's burst is written whole";
+  EXPECT_FALSE(std::filesystem::exists(log));
+  const auto tableBytes = std::filesystem::file_size(table);
+  const auto tableTime = std::filesystem::last_write_time(table);
+  ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app7", VSAClass::kDataApplication, 1000,
+                                     std::string("/moved")),
+            0);
+  ASSERT_EQ(
+      sandbox.setUserStateItem(501, 1, "com.app8", VSAClass::kDataApplication, 1000, std::nullopt),
+      0);
+  sandbox.flush();
+  ASSERT_TRUE(std::filesystem::exists(log));
+  const auto perChange = std::filesystem::file_size(log) / 2;
+  EXPECT_LT(perChange, 500u) << "a change costs its own bytes";
+  EXPECT_EQ(std::filesystem::last_write_time(table), tableTime) << "the table is not rewritten";
+  {
+    VSASandboxService reader{VSASystemRoot(temp.path())};
+    EXPECT_EQ(itemsOf(reader, 501), itemsOf(sandbox, 501));
+  }
+  // Changes one at a time until the log is larger than the table.
+  int changes = 0;
+  uintmax_t lastLogBytes = 0;
+  while (std::filesystem::exists(log) && changes < 100000) {
+    lastLogBytes = std::filesystem::file_size(log);
+    ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app" + std::to_string(changes % 2000),
+                                       VSAClass::kDataApplication, 1000,
+                                       "/round/" + std::to_string(changes)),
+              0);
+    sandbox.flush();
+    ++changes;
+  }
+  EXPECT_FALSE(std::filesystem::exists(log)) << "the log started again";
+  EXPECT_GT(lastLogBytes, tableBytes)
+      << "the table was written whole only after the log had outgrown it";
+  EXPECT_LT(lastLogBytes, tableBytes + 2 * perChange) << "and then at once";
+  VSASandboxService reader{VSASystemRoot(temp.path())};
+  EXPECT_EQ(itemsOf(reader, 501), itemsOf(sandbox, 501));
+  EXPECT_EQ(reader.userStateItem(501, "com.app0", VSAClass::kDataApplication, 1000)->path,
+            "/round/0");
+}
+
+// A daemon can stop at any point of a write: a record cut short ends the
+// log (the changes before it count), and a log left behind by a table that
+// was written whole after it changes nothing (its changes are numbered at
+// or below the table's).
+TEST(VSASandboxService, ACutRecordEndsTheLogAndAnOldLogIsSkipped) {
+  VSATestTempDir temp("vessa-sandbox");
+  const std::string log = temp.path() + "/run/vessad/sandbox/501.log";
+  {
+    VSASandboxService sandbox{VSASystemRoot(temp.path())};
+    for (int i = 0; i < 300; ++i)
+      ASSERT_EQ(
+          sandbox.setUserStateItem(501, 1, "com.app" + std::to_string(i),
+                                   VSAClass::kDataApplication, 1000, "/c/" + std::to_string(i)),
+          0);
+    sandbox.flush();
+    for (const char* path : {"/first", "/second", "/third"}) {
+      ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app1", VSAClass::kDataApplication, 1000,
+                                         std::string(path)),
+                0);
+      sandbox.flush();
+    }
+  }
+  std::filesystem::copy_file(log, log + ".old");
+  std::filesystem::resize_file(log, std::filesystem::file_size(log) - 3);
+  {
+    VSASandboxService reopened{VSASystemRoot(temp.path())};
+    ASSERT_TRUE(reopened.userStateItem(501, "com.app1", VSAClass::kDataApplication, 1000));
+    EXPECT_EQ(reopened.userStateItem(501, "com.app1", VSAClass::kDataApplication, 1000)->path,
+              "/second")
+        << "the cut record is dropped, the ones before it count";
+    // The next change cannot follow a cut record: the table is written whole.
+    ASSERT_EQ(reopened.setUserStateItem(501, 1, "com.app1", VSAClass::kDataApplication, 1000,
+                                        std::string("/fourth")),
+              0);
+    reopened.flush();
+    EXPECT_FALSE(std::filesystem::exists(log));
+  }
+  // The old log comes back beside the newer table (a stop between writing
+  // the table and removing the log): none of its changes is applied again.
+  std::filesystem::rename(log + ".old", log);
+  VSASandboxService again{VSASystemRoot(temp.path())};
+  EXPECT_EQ(again.userStateItem(501, "com.app1", VSAClass::kDataApplication, 1000)->path,
+            "/fourth");
+  EXPECT_EQ(itemsOf(again, 501).size(), 300u);
 }
 
 // The writer thread persists changes on its own, without a flush or the
