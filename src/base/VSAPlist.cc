@@ -437,8 +437,10 @@ int VSAReadRegularFileAt(int dir, const std::string& path, size_t limit,
   how.resolve = RESOLVE_NO_SYMLINKS | (dir == AT_FDCWD ? 0 : RESOLVE_BENEATH);
   int fd = static_cast<int>(::syscall(SYS_openat2, dir, path.c_str(), &how, sizeof how));
   if (fd < 0 && errno == ENOSYS) {
-    // Without openat2, "beneath" is kept by refusing what could leave `dir`.
-    if (dir != AT_FDCWD && (path.starts_with('/') || path.find("..") != std::string::npos))
+    // Without openat2, "beneath" is kept by refusing what could leave `dir`:
+    // an absolute path or a ".." component.
+    if (dir != AT_FDCWD && (path.starts_with('/') || path == ".." || path.starts_with("../") ||
+                            path.ends_with("/..") || path.find("/../") != std::string::npos))
       return EXDEV;
     fd = ::openat(dir, path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC | O_NOCTTY);
   }

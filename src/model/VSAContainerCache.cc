@@ -304,9 +304,10 @@ bool VSAContainerCache::addContainerMetadata(const VSAMetadata& metadata, const 
     VSASetError(error, rebuildError(user, c, transient));
     return false;
   }
-  auto stored = std::make_shared<VSAMetadata>(metadata);
-  stored->setUrl(url);
-  stored->setTransient(transient);
+  auto filled = std::make_shared<VSAMetadata>(metadata);
+  filled->setUrl(url);
+  filled->setTransient(transient);
+  const VSAConstMetadataRef stored = std::move(filled);  // immutable from here: the map keys it
   putEntry(*map, stored);
   VSALogIn(VSALogCategory::Cache, kVSALogNotice, kOrigin, "Cache: %@%@: Added Identifier: %@",
            cacheKeyForUserIdentity(user, c), transientTag(transient), stored->identifier());

@@ -80,6 +80,9 @@ std::string VSASandboxService::logPath(uid_t uid) const {
 namespace {
 // The log is appended to until it outgrows the table it changes (or this).
 constexpr uint64_t kMinimumLogBytes = 64 << 10;
+// What is read of a table or its log: the daemon's own files, below a
+// directory only root reaches; a bound all the same.
+constexpr uint64_t kSandboxFileLimit = uint64_t{1} << 30;
 
 VSAValue::Dictionary itemDictionary(const VSASandboxItem& i) {
   return VSAValue::Dictionary{{"ItemType", VSAValue(i.itemType)},
@@ -110,12 +113,25 @@ void VSASandboxService::apply(Table& items, const Change& change) {
     items[key] = change.item;
 }
 
-VSASandboxService::UserTable& VSASandboxService::load(uid_t uid) {
+VSASandboxService::UserTable* VSASandboxService::load(uid_t uid, int* rc) {
   auto it = tables_.find(uid);
-  if (it != tables_.end()) return it->second;
+  if (it != tables_.end()) return &it->second;
+  // The log is read before the table: a writer that writes the table whole
+  // in between removes the log after the table is in place, so the table
+  // read second holds every change of the log read first.
+  std::vector<uint8_t> log, bytes;
+  int logRead = VSAReadRegularFile(logPath(uid), kSandboxFileLimit, &log);
+  int tableRead = VSAReadRegularFile(tablePath(uid), kSandboxFileLimit, &bytes);
+  for (int read : {logRead, tableRead}) {
+    if (read != 0 && read != ENOENT) {
+      VSALog(kVSALogError, "VSASandboxService", "Failed to read container table of uid %u: %s", uid,
+             std::strerror(read));
+      *rc = read;
+      return nullptr;
+    }
+  }
   UserTable table;
-  std::vector<uint8_t> bytes;
-  if (VSAReadRegularFile(tablePath(uid), kVSADefaultReadFileLimit, &bytes) == 0) {
+  if (tableRead == 0) {
     table.tableBytes = bytes.size();
     auto dict = VSAPlist::parse(bytes, nullptr);
     const VSAValue* list = dict ? dict->get("Items") : nullptr;
@@ -125,18 +141,14 @@ VSASandboxService::UserTable& VSASandboxService::load(uid_t uid) {
     }
     const VSAValue* sequence = dict ? dict->get("Sequence") : nullptr;
     table.sequence = sequence ? sequence->uint64Value().value_or(0) : 0;
-    // A table that cannot be read is written again at the next change.
-    if (!list) table.rewrite = true;
+    // A table that does not parse is written again, whole, at the next write.
+    if (!list || !list->isArray()) table.rewrite = true;
   }
-  if (!replayLog(uid, table)) table.rewrite = true;
-  return tables_[uid] = std::move(table);
+  if (logRead == 0 && !replayLog(log, table)) table.rewrite = true;
+  return &(tables_[uid] = std::move(table));
 }
 
-bool VSASandboxService::replayLog(uid_t uid, UserTable& table) {
-  std::vector<uint8_t> bytes;
-  int rc = VSAReadRegularFile(logPath(uid), kVSADefaultReadFileLimit, &bytes);
-  if (rc == ENOENT) return true;
-  if (rc != 0) return false;
+bool VSASandboxService::replayLog(const std::vector<uint8_t>& bytes, UserTable& table) {
   size_t at = 0;
   while (at < bytes.size()) {
     if (bytes.size() - at < 4) return false;
@@ -173,11 +185,15 @@ int64_t VSASandboxService::writeWhole(uid_t uid, const Table& items, uint64_t se
            tablePath(uid), error);
     return -EIO;
   }
-  // The table holds every change the log held: the log starts again.
-  if (::unlink(logPath(uid).c_str()) != 0 && errno != ENOENT) {
+  // The table holds every change the log held: the log starts again. A log
+  // that stays (with perhaps a record cut short at its end) must not be
+  // appended to: the table is written whole again next time.
+  if (::unlink(logPath(uid).c_str()) != 0 && errno != ENOENT &&
+      ::truncate(logPath(uid).c_str(), 0) != 0) {
     int e = errno;
     VSALog(kVSALogError, "VSASandboxService", "Failed to empty container table log %@: %s",
            logPath(uid), std::strerror(e));
+    return -e;
   }
   return static_cast<int64_t>(bytes->size());
 }
@@ -224,17 +240,21 @@ void VSASandboxService::writerLoop() {
     changed_.wait_for(lock, gatherInterval_, [this] { return stopping_; });
     if (stopping_) return;
     lock.unlock();
-    auto took = writePending();
+    bool failed = false;
+    auto took = writePending(&failed);
     lock.lock();
-    gatherInterval_ = std::clamp<std::chrono::steady_clock::duration>(
-        took * 10, std::chrono::milliseconds(100), std::chrono::seconds(2));
+    gatherInterval_ = failed
+                          ? std::chrono::seconds(2)
+                          : std::clamp<std::chrono::steady_clock::duration>(
+                                took * 10, std::chrono::milliseconds(100), std::chrono::seconds(2));
   }
 }
 
-std::chrono::steady_clock::duration VSASandboxService::writePending() {
+std::chrono::steady_clock::duration VSASandboxService::writePending(bool* failed) {
   std::lock_guard writing(writeMutex_);
   auto start = std::chrono::steady_clock::now();
   std::map<uid_t, Work> pending;
+  bool retry = false;
   {
     std::lock_guard lock(mutex_);
     for (uid_t uid : dirty_) {
@@ -242,10 +262,12 @@ std::chrono::steady_clock::duration VSASandboxService::writePending() {
       Work work;
       work.changes.swap(table.unwritten);
       work.sequence = table.sequence;
-      // Written whole when the log would outgrow the table, or when this
-      // batch rewrites a good part of it anyway (a boot's first mappings).
+      // Written whole when the log would outgrow the table (or come near
+      // what a read takes), or when this batch rewrites a good part of it
+      // anyway (a boot's first mappings).
       if (table.rewrite ||
-          table.logBytes > std::max<uint64_t>(kMinimumLogBytes, table.tableBytes) ||
+          table.logBytes > std::max<uint64_t>(kMinimumLogBytes,
+                                              std::min(table.tableBytes, kSandboxFileLimit / 2)) ||
           work.changes.size() > std::max<size_t>(256, table.items.size() / 4)) {
         work.whole = table.items;
         table.rewrite = false;
@@ -260,7 +282,12 @@ std::chrono::steady_clock::duration VSASandboxService::writePending() {
     std::lock_guard lock(mutex_);
     UserTable& table = tables_[uid];
     if (n < 0) {
-      table.rewrite = true;  // the files missed these changes: the next write is whole
+      // The files missed these changes: the table stays changed, and the
+      // next write is whole.
+      table.rewrite = true;
+      dirty_.insert(uid);
+      if (failed) *failed = true;
+      retry = true;
     } else if (work.whole) {
       table.tableBytes = static_cast<uint64_t>(n);
       table.logBytes = 0;
@@ -268,6 +295,8 @@ std::chrono::steady_clock::duration VSASandboxService::writePending() {
       table.logBytes += static_cast<uint64_t>(n);
     }
   }
+  // A failed table waits for the writer even when a flush failed it.
+  if (retry) changed_.notify_one();
   return std::chrono::steady_clock::now() - start;
 }
 
@@ -280,7 +309,10 @@ int VSASandboxService::setUserStateItem(uid_t uid, uint64_t itemType, const std:
   bool wake = false;
   {
     std::lock_guard lock(mutex_);
-    UserTable& table = load(uid);
+    int rc = 0;
+    UserTable* loaded = load(uid, &rc);
+    if (!loaded) return rc;
+    UserTable& table = *loaded;
     auto it = table.items.find(Key{identifier, containerClass, personaID});
     // Launches and look-ups push the same mapping again and again: only a
     // change is worth writing.
@@ -307,7 +339,10 @@ int VSASandboxService::iterateUserStateItems(
   std::vector<VSASandboxItem> items;
   {
     std::lock_guard lock(mutex_);
-    for (const auto& [key, item] : load(uid).items) items.push_back(item);
+    int rc = 0;
+    const UserTable* table = load(uid, &rc);
+    if (!table) return rc;
+    for (const auto& [key, item] : table->items) items.push_back(item);
   }
   for (const auto& i : items)
     if (!block(i)) break;
@@ -319,7 +354,10 @@ std::optional<VSASandboxItem> VSASandboxService::userStateItem(uid_t uid,
                                                                VSAContainerClass containerClass,
                                                                int32_t personaID) {
   std::lock_guard lock(mutex_);
-  const Table& items = load(uid).items;
+  int rc = 0;
+  const UserTable* table = load(uid, &rc);
+  if (!table) return std::nullopt;
+  const Table& items = table->items;
   auto it = items.find({identifier, containerClass, personaID});
   if (it == items.end()) return std::nullopt;
   return it->second;

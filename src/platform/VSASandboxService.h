@@ -105,14 +105,20 @@ class VSASandboxService {
 
   std::string tablePath(uid_t uid) const;
   std::string logPath(uid_t uid) const;
-  UserTable& load(uid_t uid);  // caller holds mutex_
+  // The table of `uid`, read from its files the first time; null (and
+  // `*rc` an errno) when they could not be read: nothing is cached then, so
+  // the next call reads again rather than start over from an empty table.
+  UserTable* load(uid_t uid, int* rc);  // caller holds mutex_
   static void apply(Table& items, const Change& change);
   // Replays the log's changes numbered after the table's; false when the
-  // log ended in a record cut short or unreadable (it is then rewritten).
-  bool replayLog(uid_t uid, UserTable& table);
+  // log ends in a record cut short or unreadable (the table is then written
+  // whole at the next write, and the log started again).
+  static bool replayLog(const std::vector<uint8_t>& log, UserTable& table);
   void writerLoop();
-  // Writes the changed tables; answers how long that took.
-  std::chrono::steady_clock::duration writePending();
+  // Writes the changed tables; answers how long that took. A table whose
+  // write failed stays changed (written whole next time), and the writer
+  // waits longest before trying again.
+  std::chrono::steady_clock::duration writePending(bool* failed = nullptr);
   // Appends `changes` to the log (bytes appended, or an errno as negative).
   int64_t appendToLog(uid_t uid, const std::vector<Change>& changes);
   // Writes the table whole and empties the log (the table's size, or a negative errno).

@@ -227,6 +227,49 @@ TEST(VSASandboxService, ACutRecordEndsTheLogAndAnOldLogIsSkipped) {
   EXPECT_EQ(itemsOf(again, 501).size(), 300u);
 }
 
+// A table file that cannot be read is not taken for an empty table (whose
+// changes, numbered from zero, a later read would skip), and a write that
+// fails leaves the table changed: the next write puts it whole.
+TEST(VSASandboxService, FilesThatCannotBeReadOrWrittenLoseNothing) {
+  VSATestTempDir temp("vessa-sandbox");
+  const std::string table = temp.path() + "/run/vessad/sandbox/501.plist";
+  const std::string log = temp.path() + "/run/vessad/sandbox/501.log";
+  {
+    VSASandboxService sandbox{VSASystemRoot(temp.path())};
+    for (int i = 0; i < 300; ++i)
+      ASSERT_EQ(
+          sandbox.setUserStateItem(501, 1, "com.app" + std::to_string(i),
+                                   VSAClass::kDataApplication, 1000, "/c/" + std::to_string(i)),
+          0);
+  }
+  ASSERT_TRUE(std::filesystem::exists(table));
+  std::filesystem::rename(table, table + ".kept");
+  std::filesystem::create_directory(table);  // read: not a regular file
+  {
+    VSASandboxService sandbox{VSASystemRoot(temp.path())};
+    EXPECT_FALSE(sandbox.userStateItem(501, "com.app1", VSAClass::kDataApplication, 1000));
+    EXPECT_NE(sandbox.setUserStateItem(501, 1, "com.new", VSAClass::kDataApplication, 1000,
+                                       std::string("/new")),
+              0)
+        << "a change to a table that could not be read is refused";
+    std::filesystem::remove(table);
+    std::filesystem::rename(table + ".kept", table);
+    ASSERT_TRUE(sandbox.userStateItem(501, "com.app1", VSAClass::kDataApplication, 1000))
+        << "read again once it can be";
+    // The log cannot be appended to (a directory in its place).
+    std::filesystem::create_directory(log);
+    ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.new", VSAClass::kDataApplication, 1000,
+                                       std::string("/new")),
+              0);
+    sandbox.flush();
+    std::filesystem::remove(log);
+    sandbox.flush();  // the failed table is still to be written
+  }
+  VSASandboxService reopened{VSASystemRoot(temp.path())};
+  ASSERT_TRUE(reopened.userStateItem(501, "com.new", VSAClass::kDataApplication, 1000));
+  EXPECT_EQ(itemsOf(reopened, 501).size(), 301u);
+}
+
 // The writer thread persists changes on its own, without a flush or the
 // service going away, and a burst of changes ends in one consistent file.
 TEST(VSASandboxService, WriterThreadPersistsBurstsWithoutAFlush) {
