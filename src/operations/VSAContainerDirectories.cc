@@ -30,7 +30,7 @@ bool VSAContainerDirectories::_createTopLevelContainerDirectory(const std::strin
 
 bool VSAContainerDirectories::_createSubDirectories(const std::string& url,
                                                     const VSAMetadata& metadata, VSAErrorRef* error,
-                                                    bool durable) {
+                                                    bool durable, std::vector<std::string>* made) {
   VSAContainerClass c = metadata.containerClass();
   bool system = VSAContainerClassIsSystem(c);
   mode_t mode = system ? 0 : 0755;
@@ -47,6 +47,7 @@ bool VSAContainerDirectories::_createSubDirectories(const std::string& url,
     VSASetError(error, e);
     return false;
   }
+  if (made) *made = *names;
   int32_t protection = _dataProtectionClassForContainerMetadata(metadata);
   VSALog(kVSALogDebug, __func__, "Creating subdirectories for [%llu:%@] at [%@]",
          static_cast<unsigned long long>(c), metadata.identifier(), url);

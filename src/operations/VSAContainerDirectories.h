@@ -7,6 +7,7 @@
 #pragma once
 
 #include <string>
+#include <vector>
 
 #include "base/VSAError.h"
 #include "model/VSAMetadata.h"
@@ -21,11 +22,14 @@ class VSAContainerDirectories {
                                                        uid_t owner, gid_t group,
                                                        VSAErrorRef* error);
   // `durable`: each directory made is synced into its parent before the
-  // call returns, for a live container; one built in staging is synced as a
-  // whole before the rename that commits it.
+  // call returns, for a live container; one built in staging is synced
+  // before the rename that commits it, through the directories that hold
+  // what was made (`names`, if given, receives the sub-directories' names,
+  // relative to `url`).
   [[nodiscard]] bool _createSubDirectories(const std::string& url,
                                            const VSAMetadata& containerMetadata, VSAErrorRef* error,
-                                           bool durable = false);
+                                           bool durable = false,
+                                           std::vector<std::string>* names = nullptr);
   // The protection class recorded in the metadata, else the one the
   // identifier's entitlements ask for; 0 for global classes.
   int32_t _dataProtectionClassForContainerMetadata(const VSAMetadata& metadata);

@@ -145,14 +145,17 @@ struct CreateSteps {
     if (VSAContainerClassIsSystem(c) &&
         !services.fileManager->setTopLevelSystemContainerACLAtURL(staging, error))
       return nullptr;
-    if (!VSAContainerDirectories(services)._createSubDirectories(staging, *metadata, error))
+    std::vector<std::string> subdirectories;
+    if (!VSAContainerDirectories(services)._createSubDirectories(staging, *metadata, error, false,
+                                                                 &subdirectories))
       return nullptr;
     auto base = config.containerDirectoryURLForUserIdentity(identity.userIdentity(), c, transient);
     std::string live = VSAPathJoin(base.value_or(""), liveName(name));
     VSAErrorRef underlying;
     // The rename below commits the container's own entry; the directories
-    // made inside it are durable only once the staged tree has been synced.
-    if (!services.fileManager->syncDirectoriesAtURL(staging, &underlying)) {
+    // made inside it are durable only once the directories holding them
+    // (known: no listing of the tree) have been synced.
+    if (!services.fileManager->syncDirectoriesHoldingAtURL(staging, subdirectories, &underlying)) {
       *error = failure(VSAResult::kStagingMoveFailed, underlying,
                        VSAFormat("Failed to sync staging dir: %@", staging));
       return nullptr;

@@ -87,6 +87,11 @@ class VSAFileManager {
   // synced before the rename that commits it, which makes only the tree's
   // own entry durable.
   bool syncDirectoriesAtURL(const std::string& path, VSAErrorRef* error);
+  // The same when the caller knows what it made: syncs `path` and every
+  // directory below it that holds one of `names` (paths relative to it),
+  // reached one component at a time without following a link; no listing.
+  bool syncDirectoriesHoldingAtURL(const std::string& path, const std::vector<std::string>& names,
+                                   VSAErrorRef* error);
   bool moveItemIfExistsAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
   bool copyItemAtURL(const std::string& from, const std::string& to, VSAErrorRef* error);
   // Writes a whole file atomically and durably: a temporary file beside it

@@ -1,6 +1,8 @@
 // Whole-tree operations of VSAFileManager: walking, syncing, removal, copying,
 // ownership and ACL normalisation, disk usage.
+#include <algorithm>
 #include <cstring>
+#include <set>
 
 #include "base/VSALog.h"
 #include "base/VSAPathString.h"
@@ -139,6 +141,40 @@ bool VSAFileManager::syncDirectoriesAtURL(const std::string& path, VSAErrorRef* 
   if (failed == 0) return true;
   VSASetError(error, VSAFileManagerFail(failed, "syncDirectoriesAtURL", "sync of %@ failed: %s",
                                         failedPath, std::strerror(failed)));
+  return false;
+}
+
+bool VSAFileManager::syncDirectoriesHoldingAtURL(const std::string& path,
+                                                 const std::vector<std::string>& names,
+                                                 VSAErrorRef* error) {
+  // The holders: every proper prefix of a name, each once ("" is `path`).
+  std::set<std::string> holders{""};
+  for (const std::string& name : names)
+    for (size_t slash = name.find('/'); slash != std::string::npos;
+         slash = name.find('/', slash + 1))
+      holders.insert(name.substr(0, slash));
+  int raw = -1;
+  int rc = fs_->openDirectory(path, &raw);
+  VSAUniqueFd top(raw);
+  std::string failedPath = path;
+  for (auto it = holders.begin(); rc == 0 && it != holders.end(); ++it) {
+    failedPath = VSAPathJoin(path, *it);
+    // One component at a time: openDirectoryAt refuses a link as the last.
+    VSAUniqueFd dir;
+    int at = top.get();
+    for (size_t start = 0; rc == 0 && start < it->size();) {
+      size_t end = std::min(it->find('/', start), it->size());
+      raw = -1;
+      rc = fs_->openDirectoryAt(at, it->substr(start, end - start), &raw);
+      dir.reset(raw);
+      at = dir.get();
+      start = end + 1;
+    }
+    if (rc == 0) rc = fs_->syncDirectory(at);
+  }
+  if (rc == 0) return true;
+  VSASetError(error, VSAFileManagerFail(rc, "syncDirectoriesHoldingAtURL", "sync of %@ failed: %s",
+                                        failedPath, std::strerror(rc)));
   return false;
 }
 
