@@ -13,20 +13,31 @@
 
 #include "VSABenchTable.h"
 
+// With --benchmark_repetitions, a benchmark's time is the median of its
+// repetitions (with --benchmark_enable_random_interleaving the candidate's
+// and the baseline's repetitions alternate, so a slow spell of the machine
+// falls on both); without, the one run's.
 class VSARatioReporter : public benchmark::ConsoleReporter {
  public:
   void ReportRuns(const std::vector<Run>& runs) override {
-    for (const Run& r : runs)
-      if (r.run_type == Run::RT_Iteration) times_[r.benchmark_name()] = r.GetAdjustedRealTime();
+    for (const Run& r : runs) {
+      const std::string name = r.run_name.str();
+      if (r.run_type == Run::RT_Aggregate && r.aggregate_name == "median") {
+        medians_[name] = r.GetAdjustedRealTime();
+      } else if (r.run_type == Run::RT_Iteration) {
+        times_[name] = r.GetAdjustedRealTime();
+      }
+    }
     ConsoleReporter::ReportRuns(runs);
   }
   double time(const std::string& name) const {
+    if (auto it = medians_.find(name); it != medians_.end()) return it->second;
     auto it = times_.find(name);
     return it == times_.end() ? 0 : it->second;
   }
 
  private:
-  std::map<std::string, double> times_;
+  std::map<std::string, double> times_, medians_;
 };
 
 struct VSARatio {
