@@ -115,6 +115,14 @@ TEST(VSASandboxService, OnlyChangesAreWritten) {
   EXPECT_FALSE(reopened.userStateItem(501, "com.app", VSAClass::kDataApplication, 1000));
 }
 
+// Stores com.app0 ... com.app<n-1> for uid 501, at /c/0 ... /c/<n-1>.
+void fill(VSASandboxService& sandbox, int n) {
+  for (int i = 0; i < n; ++i)
+    ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app" + std::to_string(i),
+                                       VSAClass::kDataApplication, 1000, "/c/" + std::to_string(i)),
+              0);
+}
+
 // Every item of `uid` as "identifier=path", sorted.
 std::vector<std::string> itemsOf(VSASandboxService& sandbox, uid_t uid) {
   std::vector<std::string> out;
@@ -135,10 +143,7 @@ TEST(VSASandboxService, ChangesGoToTheLogUntilItOutgrowsTheTable) {
   const std::string table = temp.path() + "/run/vessad/sandbox/501.plist";
   const std::string log = temp.path() + "/run/vessad/sandbox/501.log";
   VSASandboxService sandbox{VSASystemRoot(temp.path())};
-  for (int i = 0; i < 2000; ++i)
-    ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app" + std::to_string(i),
-                                       VSAClass::kDataApplication, 1000, "/c/" + std::to_string(i)),
-              0);
+  ASSERT_NO_FATAL_FAILURE(fill(sandbox, 2000));
   sandbox.flush();
   ASSERT_TRUE(std::filesystem::exists(table)) << "a boot's burst is written whole";
   EXPECT_FALSE(std::filesystem::exists(log));
@@ -190,11 +195,7 @@ TEST(VSASandboxService, ACutRecordEndsTheLogAndAnOldLogIsSkipped) {
   const std::string log = temp.path() + "/run/vessad/sandbox/501.log";
   {
     VSASandboxService sandbox{VSASystemRoot(temp.path())};
-    for (int i = 0; i < 300; ++i)
-      ASSERT_EQ(
-          sandbox.setUserStateItem(501, 1, "com.app" + std::to_string(i),
-                                   VSAClass::kDataApplication, 1000, "/c/" + std::to_string(i)),
-          0);
+    ASSERT_NO_FATAL_FAILURE(fill(sandbox, 300));
     sandbox.flush();
     for (const char* path : {"/first", "/second", "/third"}) {
       ASSERT_EQ(sandbox.setUserStateItem(501, 1, "com.app1", VSAClass::kDataApplication, 1000,
@@ -236,11 +237,7 @@ TEST(VSASandboxService, FilesThatCannotBeReadOrWrittenLoseNothing) {
   const std::string log = temp.path() + "/run/vessad/sandbox/501.log";
   {
     VSASandboxService sandbox{VSASystemRoot(temp.path())};
-    for (int i = 0; i < 300; ++i)
-      ASSERT_EQ(
-          sandbox.setUserStateItem(501, 1, "com.app" + std::to_string(i),
-                                   VSAClass::kDataApplication, 1000, "/c/" + std::to_string(i)),
-          0);
+    ASSERT_NO_FATAL_FAILURE(fill(sandbox, 300));
   }
   ASSERT_TRUE(std::filesystem::exists(table));
   std::filesystem::rename(table, table + ".kept");
